@@ -1,0 +1,30 @@
+// The processor seam on the host: nothing is done to the processor; what the
+// loader asked for is recorded and the run goes back to the test.
+#include "boot/machine.h"
+#include "hostfw/internal.h"
+
+namespace nimb {
+
+void MachineDisableInterrupts() {
+  hostfw::State &s = hostfw::Services::Active();
+  if (s.runs.empty())
+    hostfw::Misuse("MachineDisableInterrupts outside Firmware::Run or Call");
+  s.runs.back()->result.interruptsDisabled = true;
+}
+
+void MachineCallGate(UINT64 gate, UINT64 argument, UINT64 target) {
+  hostfw::State &s = hostfw::Services::Active();
+  if (s.runs.empty())
+    hostfw::Misuse("MachineCallGate outside Firmware::Run or Call");
+  hostfw::RunResult &result = s.runs.back()->result;
+  result.gateAddress = gate;
+  result.gateArgument = argument;
+  result.gateTarget = target;
+  hostfw::EndRun(s, hostfw::RunEnd::KernelEntered, EFI_SUCCESS);
+}
+
+void MachineHalt() {
+  hostfw::EndRun(hostfw::Services::Active(), hostfw::RunEnd::Halted, EFI_SUCCESS);
+}
+
+}  // namespace nimb

@@ -1,0 +1,276 @@
+// The platform layer: the program that the firmware starts from
+// \EFI\BOOT\BOOTX64.EFI. It gives the firmware what the loader expects of
+// the machines it was made for, starts the loader, reports how the loader
+// came back and powers the machine off with an exit code that tells it.
+#include <stdarg.h>
+
+#include "config.h"
+#include "console_control.h"
+#include "exitcodes.h"
+#include "firmware.h"
+#include "format.h"
+#include "memory.h"
+#include "serial.h"
+
+namespace nimb::platform {
+
+namespace {
+
+constexpr UINT16 kDebugExitPort = 0xF4;
+constexpr const CHAR16 *kConfigPath = u"\\EFI\\BOOT\\platform.cfg";
+constexpr const char *kConfigName = "platform.cfg";
+constexpr UINTN kFileInfoSize = SIZE_OF_EFI_FILE_INFO + 512 * sizeof(CHAR16);
+constexpr UINT32 kWarmDepth = 8;
+
+PlatformConsole gConsole;
+MemoryMeter gMeter;
+
+// The debug-exit device ends the machine with the code; without one the
+// write goes nowhere and the firmware powers off instead.
+[[noreturn]] void PowerOff(UINT8 code) {
+  SerialPrintf("platform: exit code 0x%x\n", static_cast<UINT64>(code));
+  PortWriteByte(kDebugExitPort, code);
+  gRT->ResetSystem(EfiResetShutdown, EFI_SUCCESS, 0, nullptr);
+  for (;;) {
+    __asm__ volatile("hlt");
+  }
+}
+
+[[noreturn]] void Fail(UINT8 code, const char *format, ...) {
+  SerialPrintf("platform: error: ");
+  va_list arguments;
+  va_start(arguments, format);
+  SerialPrintv(format, arguments);
+  va_end(arguments);
+  SerialPrintf("\n");
+  PowerOff(code);
+}
+
+void *AllocateOrFail(UINTN size, const char *what) {
+  void *buffer = nullptr;
+  const EFI_STATUS status = gBS->AllocatePool(EfiLoaderData, size, &buffer);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no memory for %s (%s)", what, StatusName(status));
+  }
+  return buffer;
+}
+
+CHAR16 *WideCopyOrFail(const char *text, const char *what, UINTN *units) {
+  Utf8ToUcs2(text, nullptr, 0, units);
+  CHAR16 *wide = static_cast<CHAR16 *>(AllocateOrFail((*units + 1) * sizeof(CHAR16), what));
+  Utf8ToUcs2(text, wide, *units + 1, units);
+  return wide;
+}
+
+void ReportConfigIssue(const ConfigIssue &issue, void *) {
+  switch (issue.problem) {
+    case kConfigUnknownKey:
+      SerialPrintf("platform: %s line %u: unknown key '%s' ignored\n", kConfigName, static_cast<UINT64>(issue.line),
+                   issue.key);
+      break;
+    case kConfigNoEquals:
+      SerialPrintf("platform: %s line %u: no '=' in '%s'\n", kConfigName, static_cast<UINT64>(issue.line), issue.key);
+      break;
+    case kConfigBadValue:
+      SerialPrintf("platform: %s line %u: bad value '%s' for '%s'\n", kConfigName, static_cast<UINT64>(issue.line),
+                   issue.value, issue.key);
+      break;
+  }
+}
+
+// Reads the configuration file into `config`; a volume without one leaves
+// the defaults.
+void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
+  ConfigSetDefaults(config);
+  EFI_FILE_PROTOCOL *file = nullptr;
+  EFI_STATUS status = root->Open(root, &file, kConfigPath, EFI_FILE_MODE_READ, 0);
+  if (status == EFI_NOT_FOUND) {
+    SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    return;
+  }
+  if (EFI_ERROR(status)) {
+    Fail(kExitConfigInvalid, "cannot open %s (%s)", kConfigName, StatusName(status));
+  }
+  UINT64 infoBuffer[kFileInfoSize / sizeof(UINT64)];
+  UINTN infoSize = sizeof(infoBuffer);
+  status = file->GetInfo(file, &gEfiFileInfoGuid, &infoSize, infoBuffer);
+  if (EFI_ERROR(status)) {
+    Fail(kExitConfigInvalid, "cannot size %s (%s)", kConfigName, StatusName(status));
+  }
+  UINTN size = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer)->FileSize;
+  char *text = static_cast<char *>(AllocateOrFail(size + 1, kConfigName));
+  status = file->Read(file, &size, text);
+  file->Close(file);
+  if (EFI_ERROR(status)) {
+    Fail(kExitConfigInvalid, "cannot read %s (%s)", kConfigName, StatusName(status));
+  }
+  if (ConfigParse(text, size, config, ReportConfigIssue, nullptr) != 0) {
+    Fail(kExitConfigInvalid, "%s has errors", kConfigName);
+  }
+}
+
+UINTN DevicePathNodeLength(const EFI_DEVICE_PATH_PROTOCOL *node) {
+  return static_cast<UINTN>(node->Length[0]) | (static_cast<UINTN>(node->Length[1]) << 8);
+}
+
+// The device's own path without its end node, then a file path node and an
+// end node.
+EFI_DEVICE_PATH_PROTOCOL *FileDevicePath(EFI_HANDLE device, const CHAR16 *path, UINTN pathUnits) {
+  void *interface = nullptr;
+  EFI_STATUS status = gBS->HandleProtocol(device, &gEfiDevicePathProtocolGuid, &interface);
+  if (EFI_ERROR(status) || interface == nullptr) {
+    Fail(kExitPlatformFailed, "no device path for the boot device (%s)", StatusName(status));
+  }
+  const UINT8 *deviceBytes = static_cast<const UINT8 *>(interface);
+  UINTN deviceSize = 0;
+  for (;;) {
+    const EFI_DEVICE_PATH_PROTOCOL *node = reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(deviceBytes + deviceSize);
+    const UINTN length = DevicePathNodeLength(node);
+    if (node->Type == END_DEVICE_PATH_TYPE || length < sizeof(EFI_DEVICE_PATH_PROTOCOL)) {
+      break;
+    }
+    deviceSize += length;
+  }
+  const UINTN fileNodeSize = sizeof(EFI_DEVICE_PATH_PROTOCOL) + (pathUnits + 1) * sizeof(CHAR16);
+  const UINTN totalSize = deviceSize + fileNodeSize + sizeof(EFI_DEVICE_PATH_PROTOCOL);
+  UINT8 *bytes = static_cast<UINT8 *>(AllocateOrFail(totalSize, "the loader's device path"));
+  gBS->CopyMem(bytes, deviceBytes, deviceSize);
+  const EFI_DEVICE_PATH_PROTOCOL fileHeader = {MEDIA_DEVICE_PATH, MEDIA_FILEPATH_DP,
+                                               {static_cast<UINT8>(fileNodeSize), static_cast<UINT8>(fileNodeSize >> 8)}};
+  gBS->CopyMem(bytes + deviceSize, &fileHeader, sizeof(fileHeader));
+  gBS->CopyMem(bytes + deviceSize + sizeof(fileHeader), path, (pathUnits + 1) * sizeof(CHAR16));
+  const EFI_DEVICE_PATH_PROTOCOL end = {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}};
+  gBS->CopyMem(bytes + deviceSize + fileNodeSize, &end, sizeof(end));
+  return reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(bytes);
+}
+
+// Opens every directory of the volume and reads it to its end, then closes
+// it. The file system driver keeps what it learnt of a closed directory in a
+// cache of its own that it does not give back; filled here, before the first
+// measurement, the cache no longer grows when the loader opens directories,
+// and the loader's run leaves the free memory as it found it.
+UINTN WarmDirectoryCache(EFI_FILE_PROTOCOL *directory, UINT32 depth) {
+  UINTN directories = 1;
+  UINT64 infoBuffer[kFileInfoSize / sizeof(UINT64)];
+  EFI_FILE_INFO *info = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer);
+  for (;;) {
+    UINTN size = sizeof(infoBuffer);
+    if (EFI_ERROR(directory->Read(directory, &size, infoBuffer)) || size == 0) {
+      break;
+    }
+    const bool dot = info->FileName[0] == u'.' &&
+                     (info->FileName[1] == 0 || (info->FileName[1] == u'.' && info->FileName[2] == 0));
+    if ((info->Attribute & EFI_FILE_DIRECTORY) == 0 || dot || depth >= kWarmDepth) {
+      continue;
+    }
+    EFI_FILE_PROTOCOL *child = nullptr;
+    if (!EFI_ERROR(directory->Open(directory, &child, info->FileName, EFI_FILE_MODE_READ, 0))) {
+      directories += WarmDirectoryCache(child, depth + 1);
+      child->Close(child);
+    }
+  }
+  return directories;
+}
+
+UINT64 FreePagesOrFail(const char *when) {
+  UINT64 pages = 0;
+  const EFI_STATUS status = MemoryMeterFreePages(&gMeter, &pages);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot read the memory map %s (%s)", when, StatusName(status));
+  }
+  return pages;
+}
+
+}  // namespace
+
+extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *SystemTable) {
+  gImageHandle = ImageHandle;
+  gST = SystemTable;
+  gBS = SystemTable->BootServices;
+  gRT = SystemTable->RuntimeServices;
+  // The boot manager's watchdog would reset a slow run.
+  gBS->SetWatchdogTimer(0, 0, 0, nullptr);
+  SerialPrintf("\nplatform: started\n");
+
+  void *interface = nullptr;
+  EFI_STATUS status = gBS->HandleProtocol(ImageHandle, &gEfiLoadedImageProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no loaded image (%s)", StatusName(status));
+  }
+  const EFI_HANDLE device = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface)->DeviceHandle;
+  status = gBS->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no file system on the boot device (%s)", StatusName(status));
+  }
+  EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *volume = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(interface);
+  EFI_FILE_PROTOCOL *root = nullptr;
+  status = volume->OpenVolume(volume, &root);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot open the boot volume (%s)", StatusName(status));
+  }
+
+  PlatformConfig config;
+  ReadConfig(root, &config);
+
+  UINTN pathUnits = 0;
+  const CHAR16 *loaderPath = WideCopyOrFail(config.loaderPath, "the loader's path", &pathUnits);
+  EFI_FILE_PROTOCOL *loaderFile = nullptr;
+  status = root->Open(root, &loaderFile, loaderPath, EFI_FILE_MODE_READ, 0);
+  if (EFI_ERROR(status)) {
+    Fail(kExitLoaderMissing, "loader %s not found (%s)", config.loaderPath, StatusName(status));
+  }
+  loaderFile->Close(loaderFile);
+  const UINTN directories = WarmDirectoryCache(root, 0);
+  root->Close(root);
+  EFI_DEVICE_PATH_PROTOCOL *loaderDevicePath = FileDevicePath(device, loaderPath, pathUnits);
+
+  CHAR16 *options = nullptr;
+  UINTN optionUnits = 0;
+  if (config.options != nullptr) {
+    options = WideCopyOrFail(config.options, "the load options", &optionUnits);
+  }
+
+  status = ConsoleControlInstall(&gConsole, config.consoleMode);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
+  }
+  MemoryStockPool();
+  status = MemoryMeterInit(&gMeter);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot size the memory map (%s)", StatusName(status));
+  }
+  SerialPrintf("platform: starting %s, console %s, %u directories\n", config.loaderPath,
+               config.consoleMode == EfiConsoleControlScreenText ? "text" : "graphics", directories);
+
+  const UINT64 pagesBefore = FreePagesOrFail("before the loader");
+  EFI_HANDLE loader = nullptr;
+  status = gBS->LoadImage(FALSE, ImageHandle, loaderDevicePath, nullptr, 0, &loader);
+  if (EFI_ERROR(status)) {
+    Fail(kExitLoadImageFailed, "cannot load %s (%s)", config.loaderPath, StatusName(status));
+  }
+  status = gBS->HandleProtocol(loader, &gEfiLoadedImageProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitLoadImageFailed, "no loaded image for %s (%s)", config.loaderPath, StatusName(status));
+  }
+  EFI_LOADED_IMAGE_PROTOCOL *loaderImage = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface);
+  if (options != nullptr) {
+    loaderImage->LoadOptions = options;
+    loaderImage->LoadOptionsSize = static_cast<UINT32>((optionUnits + 1) * sizeof(CHAR16));
+  }
+  const EFI_STATUS loaderStatus = gBS->StartImage(loader, nullptr, nullptr);
+  const UINT64 pagesAfter = FreePagesOrFail("after the loader");
+
+  SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));
+  const bool changed = pagesAfter != pagesBefore;
+  if (changed) {
+    SerialPrintf("platform: memory changed (before %u pages, after %u pages)\n", pagesBefore, pagesAfter);
+  } else {
+    SerialPrintf("platform: memory same\n");
+  }
+  for (UINT32 second = 0; second < config.holdSeconds; second++) {
+    gBS->Stall(1000000);
+  }
+  PowerOff(ExitCodeForOutcome(loaderStatus, changed));
+}
+
+}  // namespace nimb::platform

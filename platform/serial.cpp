@@ -1,0 +1,45 @@
+#include "serial.h"
+
+#include "format.h"
+
+namespace nimb::platform {
+
+namespace {
+
+// COM1, as the firmware has set it up: its transmit register and its line
+// status register, whose bit 5 tells that the transmit register is empty.
+constexpr UINT16 kSerialData = 0x3F8;
+constexpr UINT16 kSerialLineStatus = 0x3FD;
+constexpr UINT8 kTransmitEmpty = 0x20;
+// A port without a UART reads as 0xFF, which passes the test at once; the
+// bound only keeps a stuck UART from hanging the report.
+constexpr UINT32 kTransmitPolls = 1000000;
+
+void SerialWriteByte(UINT8 byte) {
+  for (UINT32 i = 0; i < kTransmitPolls; i++) {
+    if ((PortReadByte(kSerialLineStatus) & kTransmitEmpty) != 0) {
+      break;
+    }
+  }
+  PortWriteByte(kSerialData, byte);
+}
+
+void SerialOutput(char character, void *) {
+  if (character == '\n') {
+    SerialWriteByte('\r');
+  }
+  SerialWriteByte(static_cast<UINT8>(character));
+}
+
+}  // namespace
+
+void SerialPrintv(const char *format, va_list arguments) { FormatText(SerialOutput, nullptr, format, arguments); }
+
+void SerialPrintf(const char *format, ...) {
+  va_list arguments;
+  va_start(arguments, format);
+  SerialPrintv(format, arguments);
+  va_end(arguments);
+}
+
+}  // namespace nimb::platform

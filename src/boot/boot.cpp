@@ -1,0 +1,88 @@
+#include "boot/boot.h"
+
+#include "boot/gate.h"
+#include "boot/machine.h"
+#include "boot/volume.h"
+#include "config/boot_options.h"
+#include "load/kernel.h"
+#include "memory/tracking.h"
+#include "screen/console.h"
+#include "screen/spinner.h"
+
+namespace nimb {
+
+EFI_SYSTEM_TABLE *gST;
+EFI_BOOT_SERVICES *gBS;
+EFI_RUNTIME_SERVICES *gRT;
+EFI_HANDLE gImageHandle;
+EFI_LOADED_IMAGE_PROTOCOL *gLoadedImage;
+EFI_DEVICE_PATH_PROTOCOL *gBootDevicePath;
+UINT64 gCallGate;
+UINT64 gKernelEntry;
+
+void ExitBoot(EFI_STATUS status) {
+  if (gSpinnerEvent != nullptr) {
+    gBS->CloseEvent(gSpinnerEvent);
+    gSpinnerEvent = nullptr;
+  }
+  RestoreConsoleMode();
+  TrackedFreeAll();
+  gBS->Exit(gImageHandle, status, 0, nullptr);
+  // Exit does not come back to an application; should it, there is nothing
+  // left to return to.
+  MachineHalt();
+}
+
+// The boot sequence, from the firmware's entry to the kernel's. It runs once,
+// top to bottom; every step that cannot go on ends the run through Fatal.
+static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
+  gST = systemTable;
+  gBS = systemTable->BootServices;
+  gRT = systemTable->RuntimeServices;
+  gImageHandle = imageHandle;
+
+  if (EFI_ERROR(InitConsole())) {
+    Fatal("Can not initialize console\n");
+  }
+
+  EFI_STATUS status = CopyCallGate();
+  if (EFI_ERROR(status)) {
+    Fatal("Could not allocate kernel call gate (%x)\n", status);
+  }
+
+  if (EFI_ERROR(gBS->HandleProtocol(gImageHandle, &gEfiLoadedImageProtocolGuid,
+                                    reinterpret_cast<void **>(&gLoadedImage))) ||
+      gLoadedImage == nullptr) {
+    Fatal("Can not retrieve a LoadedImageProtocol handle for ImageHandle\n");
+  }
+
+  if (EFI_ERROR(gBS->HandleProtocol(gLoadedImage->DeviceHandle, &gEfiDevicePathProtocolGuid,
+                                    reinterpret_cast<void **>(&gBootDevicePath))) ||
+      gBootDevicePath == nullptr) {
+    Fatal("Can not find a DevicePath handle for LoadedImage->DeviceHandle\n");
+  }
+
+  CHAR16 *options = CopyLoadOptions(gLoadedImage);
+  BootVolume volume = OpenBootVolume(gLoadedImage->DeviceHandle);
+
+  ProcessBootOptions(volume.loadFile, volume.root, options, &gBootOptions);
+
+  // The first change of the screen, after the options, so that a verbose
+  // boot never shows the logo.
+  if (gBootFlags & kBootVerbose) {
+    SetConsoleMode(kConsoleText);
+  }
+
+  // A plain kernel (there is no kernel cache in this build).
+  if (EFI_ERROR(LoadKernelFile(volume.loadFile, volume.root))) {
+    Fatal("Error loading kernel '%S'\n", gKernelName);
+  }
+
+  Fatal("Kernel entry failed\n");
+}
+
+}  // namespace nimb
+
+extern "C" EFI_STATUS EFIAPI BootEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TABLE *SystemTable) {
+  return nimb::Boot(ImageHandle, SystemTable);
+}

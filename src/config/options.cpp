@@ -1,0 +1,159 @@
+#include "config/options.h"
+
+#include "config/boot_options.h"
+#include "config/plist.h"
+#include "support/strings.h"
+
+namespace nimb {
+
+// Space, tab, carriage return and line feed; nothing else is a blank.
+static BOOLEAN IsBlank(char c) {
+  return c == ' ' || c == '\t' || c == '\r' || c == '\n';
+}
+
+static const char *SkipBlanks(const char *text) {
+  while (IsBlank(*text)) {
+    text++;
+  }
+  return text;
+}
+
+// Case-folded comparison of `length` bytes; strncasecmp counts in 32 bits,
+// so a longer key is compared a piece at a time.
+static BOOLEAN KeyEquals(const char *word, const char *key, UINT64 length) {
+  constexpr UINT64 kPiece = 0x40000000;
+  while (length > 0) {
+    const UINT64 piece = length < kPiece ? length : kPiece;
+    if (strncasecmp(word, key, static_cast<INT32>(piece)) != 0) {
+      return FALSE;
+    }
+    word += piece;
+    key += piece;
+    length -= piece;
+  }
+  return TRUE;
+}
+
+const char *ScanOptionWord(const char *text, const char **start, UINT64 *length) {
+  if (*text == '"') {
+    const char *p = text + 1;
+    while (*p != '\0' && *p != '"') {
+      p++;
+    }
+    *start = text + 1;
+    *length = static_cast<UINT64>(p - (text + 1));
+    // An unclosed quote runs to the terminator, and scanning stops there.
+    return *p == '"' ? p + 1 : p;
+  }
+  const char *p = text;
+  while (*p != '\0' && !IsBlank(*p) && *p != '=') {
+    p++;
+  }
+  *start = text;
+  *length = static_cast<UINT64>(p - text);
+  return p;
+}
+
+// A null text holds no key: a caller whose option string could not be made
+// looks it up like an empty one.
+EFI_STATUS GetOptionValue(const char *text, const char *key, const char **value, UINT64 *length) {
+  EFI_STATUS result = EFI_NOT_FOUND;
+  if (text == nullptr) {
+    return result;
+  }
+  const UINT64 keyLength = strlen(key);
+  const char *cursor = text;
+  while (*cursor != '\0') {
+    cursor = SkipBlanks(cursor);
+    const char *pairKey;
+    UINT64 pairKeyLength;
+    cursor = ScanOptionWord(cursor, &pairKey, &pairKeyLength);
+    const char *pairValue = cursor;
+    UINT64 pairValueLength = 0;
+    if (*cursor != '\0' && !IsBlank(*cursor)) {
+      // The separator, '=' unless the key was quoted, whatever it is.
+      cursor = ScanOptionWord(cursor + 1, &pairValue, &pairValueLength);
+    }
+    if (pairKeyLength == keyLength && KeyEquals(pairKey, key, keyLength)) {
+      // No early stop: the last occurrence of a key wins.
+      *value = pairValue;
+      *length = pairValueLength;
+      result = EFI_SUCCESS;
+    }
+  }
+  return result;
+}
+
+const char *GetConfigValue(const char *key) {
+  const PlistTag *tag = PlistFindKey(gConfigDict, key);
+  return tag != nullptr ? tag->text : nullptr;
+}
+
+// A key whose value in the dictionary isn't a string (a null text) counts
+// as not found.
+EFI_STATUS GetOptionOrConfigValue(const char *text, const char *key, const char **value, UINT64 *length) {
+  if (!EFI_ERROR(GetOptionValue(text, key, value, length))) {
+    return EFI_SUCCESS;
+  }
+  const char *configValue = GetConfigValue(key);
+  if (configValue == nullptr) {
+    return EFI_NOT_FOUND;
+  }
+  *value = configValue;
+  *length = strlen(configValue);
+  return EFI_SUCCESS;
+}
+
+const char *NextOption(const char *text, const char **word, UINT64 *keyLength, UINT64 *wordLength) {
+  const char *start = SkipBlanks(text);
+  const char *equals = nullptr;
+  const char *p = start;
+  while (*p != '\0' && !IsBlank(*p)) {
+    if (*p == '=' && equals == nullptr) {
+      equals = p;
+    }
+    p++;
+  }
+  *word = start;
+  *wordLength = static_cast<UINT64>(p - start);
+  *keyLength = static_cast<UINT64>((equals != nullptr ? equals : p) - start);
+  return p;
+}
+
+// True when the word of the text at `textWord` begins with the `keyLength`
+// bytes of `key`, case kept, and the byte behind them ends the key.
+static BOOLEAN HasKey(const char *textWord, const char *key, UINT64 keyLength) {
+  for (UINT64 i = 0; i < keyLength; i++) {
+    if (textWord[i] == '\0' || textWord[i] != key[i]) {
+      return FALSE;
+    }
+  }
+  const char behind = textWord[keyLength];
+  return TRUE;
+}
+
+char *AppendOption(char *base, char *end, const char *word, UINT64 keyLength, UINT64 wordLength) {
+  if (keyLength != 0) {
+    const char *p = base;
+    while (*p != '\0') {
+      p = SkipBlanks(p);
+      if (*p == '\0') {
+        break;
+      }
+      if (HasKey(p, word, keyLength)) {
+        return end;
+      }
+      while (*p != '\0' && !IsBlank(*p)) {
+        p++;
+      }
+    }
+  }
+  if (base < end) {
+    *end++ = ' ';
+  }
+  memcpy(end, word, wordLength);
+  end[wordLength] = '\0';
+  return end + wordLength;
+}
+
+}  // namespace nimb

@@ -1,0 +1,40 @@
+// The vendor's own firmware protocols and variables. All are optional: a
+// machine without them boots with the defaults.
+#pragma once
+
+#include "efi/efi.h"
+
+// Where the boot loader's NVRAM variables live.
+inline const EFI_GUID gNimbVendorVariableGuid =
+    EFI_GUID_VALUE(0x7C436110, 0xAB2A, 0x4BBB, 0xA8, 0x80, 0xFE, 0x41, 0x99, 0x5C, 0x9F, 0x82);
+
+// Whether the keys held at start are to be read at all. The answer is
+// non-zero when they are to be ignored.
+struct NIMB_BOOT_POLICY_PROTOCOL {
+  void *Reserved[4];
+  EFI_STATUS(EFIAPI *GetKeysIgnored)(NIMB_BOOT_POLICY_PROTOCOL *This, UINT64 *Ignored);
+};
+
+inline const EFI_GUID gNimbBootPolicyProtocolGuid =
+    EFI_GUID_VALUE(0x8FFEEB3A, 0x4C98, 0x4630, 0x80, 0x3F, 0x74, 0x0F, 0x95, 0x67, 0x09, 0x1D);
+
+// The keys held down, as a USB HID keyboard reports them: a modifier mask
+// and up to `*KeyCount` key values of 0x7000 plus the usage.
+struct NIMB_KEY_STATE_PROTOCOL {
+  void *Reserved;
+  EFI_STATUS(EFIAPI *ReadKeyState)
+  (NIMB_KEY_STATE_PROTOCOL *This, UINT16 *Modifiers, UINTN *KeyCount, UINT16 *Keys);
+};
+
+inline const EFI_GUID gNimbKeyStateProtocolGuid =
+    EFI_GUID_VALUE(0x5B213447, 0x6E73, 0x4901, 0xA4, 0xF1, 0xB8, 0x64, 0xF3, 0xB7, 0xA1, 0x72);
+
+constexpr UINT16 kKeyModifierLeftShift = 0x02;
+constexpr UINT16 kKeyModifierRightShift = 0x20;
+constexpr UINT16 kKeyModifierLeftGui = 0x08;
+constexpr UINT16 kKeyModifierRightGui = 0x80;
+constexpr UINT16 kKeyS = 0x7016;
+constexpr UINT16 kKeyV = 0x7019;
+
+static_assert(offsetof(NIMB_BOOT_POLICY_PROTOCOL, GetKeysIgnored) == 0x20, "the fifth entry");
+static_assert(offsetof(NIMB_KEY_STATE_PROTOCOL, ReadKeyState) == 0x08, "the second entry");

@@ -1,0 +1,7 @@
+#include "screen/spinner.h"
+
+namespace nimb {
+
+EFI_EVENT gSpinnerEvent;
+
+}  // namespace nimb

@@ -1,0 +1,282 @@
+// The boot driver: load options, the boot volume and its three directories,
+// the call gate's copy, and every way the sequence ends through Fatal.
+#include "boot/boot.h"
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "boot/gate.h"
+#include "boot/volume.h"
+#include "loader_fixture.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+
+// A directory that goes away with the test.
+class TempDir {
+ public:
+  TempDir() {
+    char pattern[] = "/tmp/nimb-boot-XXXXXX";
+    path_ = mkdtemp(pattern);
+  }
+  ~TempDir() { fs::remove_all(path_); }
+  const std::string &path() const { return path_; }
+  void File(const std::string &name, const std::string &content) {
+    fs::create_directories(fs::path(path_ + "/" + name).parent_path());
+    std::ofstream(path_ + "/" + name) << content;
+  }
+  void Directory(const std::string &name) { fs::create_directories(path_ + "/" + name); }
+
+ private:
+  std::string path_;
+};
+
+class BootTest : public nimbtest::LoaderTest {
+ protected:
+  // A volume from `dir`, made the boot device.
+  EFI_HANDLE BootFrom(const TempDir &dir) {
+    EFI_HANDLE device = fw.AddDirectoryVolume(dir.path());
+    fw.SetBootDevice(device);
+    return device;
+  }
+  hostfw::RunResult Boot() { return fw.Run(BootEntry); }
+  // Reads a small file through the loader's view of a directory.
+  static std::string ReadThrough(EFI_FILE *directory, const char16_t *name) {
+    EFI_FILE *file = nullptr;
+    if (EFI_ERROR(directory->Open(directory, &file, name, EFI_FILE_MODE_READ, 0)))
+      return "";
+    char buffer[64] = {};
+    UINTN size = sizeof(buffer) - 1;
+    file->Read(file, &size, buffer);
+    file->Close(file);
+    return std::string(buffer, size);
+  }
+};
+
+TEST_F(BootTest, LoadOptionsCopy) {
+  struct Row {
+    const char *name;
+    std::vector<uint8_t> bytes;
+    std::u16string expected;
+  };
+  auto wide = [](const std::u16string &text, bool terminated) {
+    std::vector<uint8_t> bytes;
+    for (char16_t unit : text) {
+      bytes.push_back(unit & 0xFF);
+      bytes.push_back(unit >> 8);
+    }
+    if (terminated)
+      bytes.insert(bytes.end(), {0, 0});
+    return bytes;
+  };
+  const Row rows[] = {
+      {"empty", {}, u""},
+      {"only a terminator", wide(u"", true), u""},
+      {"blanks and tabs", wide(u" \t \t", true), u""},
+      {"leading blanks", wide(u"  \t-v foo=1", true), u"-v foo=1"},
+      {"no terminator", wide(u" -v", false), u"-v"},
+      {"leading line feed kept", wide(u"\n -v", true), u"\n -v"},
+      {"carriage return kept", wide(u" \r-x", true), u"\r-x"},
+      {"stops at a zero unit", wide(std::u16string(u"a\0b", 3), true), u"a"},
+      {"odd byte count", {'x', 0, 'y'}, u"x"},
+      {"trailing blanks kept", wide(u"-s  ", false), u"-s  "},
+  };
+  for (const Row &row : rows) {
+    fw.SetLoadOptionsBytes(row.bytes);
+    CHAR16 *copy = nimb::CopyLoadOptions(fw.LoadedImage());
+    ASSERT_NE(copy, nullptr) << row.name;
+    EXPECT_EQ(std::u16string(copy), row.expected) << row.name;
+  }
+  // Null options with a size are no options.
+  fw.LoadedImage()->LoadOptions = nullptr;
+  fw.LoadedImage()->LoadOptionsSize = 8;
+  EXPECT_EQ(std::u16string(nimb::CopyLoadOptions(fw.LoadedImage())), u"");
+}
+
+TEST_F(BootTest, TheThreeBootDirectories) {
+  struct Row {
+    bool r, p, s;
+    const char *root;  // which directory becomes the root
+    std::vector<std::string> closed;
+    bool warning;
+  };
+  const Row rows[] = {
+      {0, 0, 0, "volume", {}, false},
+      {1, 0, 0, "R", {}, false},
+      {0, 1, 0, "P", {}, false},
+      {0, 0, 1, "S", {}, false},
+      {1, 1, 0, "P", {"com.quill.boot.R"}, false},
+      {0, 1, 1, "S", {"com.quill.boot.P"}, false},
+      {1, 0, 1, "R", {"com.quill.boot.S"}, false},
+      {1, 1, 1, "R", {"com.quill.boot.P", "com.quill.boot.S"}, true},
+  };
+  const char kWarning[] = "WARNING: all of R,P,S exist: booting from 'R'\r\n";
+  for (const Row &row : rows) {
+    std::string name = std::string(row.r ? "R" : "-") + (row.p ? "P" : "-") + (row.s ? "S" : "-");
+    hostfw::Firmware local;
+    TempDir dir;
+    dir.File("which", "volume");
+    const bool exists[3] = {row.r, row.p, row.s};
+    for (int i = 0; i < 3; i++) {
+      if (exists[i])
+        dir.File(std::string(nimb::kBootDirectoryNames[i]) + "/which", std::string(1, "RPS"[i]));
+    }
+    EXPECT_EQ(nimb::ChooseBootDirectory(exists),
+              std::string(row.root) == "volume" ? -1 : int(std::string("RPS").find(row.root[0])))
+        << name;
+
+    nimbtest::ResetLoaderState();
+    nimb::gST = local.SystemTable();
+    nimb::gBS = local.BootServices();
+    EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
+    nimb::BootVolume volume = {};
+    hostfw::RunResult result = local.Call([&] { volume = nimb::OpenBootVolume(device); });
+    ASSERT_EQ(result.end, hostfw::RunEnd::Returned) << name;
+    EXPECT_EQ(volume.loadFile, nullptr) << name;
+    ASSERT_NE(volume.root, nullptr) << name;
+    EXPECT_EQ(local.ClosedNames(), row.closed) << name;
+    EXPECT_EQ(ReadThrough(volume.root, u"which"), row.root) << name;
+    EXPECT_EQ(local.ConOutText(), row.warning ? kWarning : "") << name;
+    // The probe, then all three names, whatever the first ones gave.
+    ASSERT_GE(local.OpenedNames().size(), 4u) << name;
+    EXPECT_EQ(local.OpenedNames()[0], "nimb_kernel") << name;
+    EXPECT_EQ(local.OpenedNames()[3], "com.quill.boot.S") << name;
+    nimb::TrackedFreeAll();
+  }
+  nimbtest::ResetLoaderState();
+  Attach();
+}
+
+TEST_F(BootTest, AKernelInTheVolumeRootMeansNoDirectoryIsOpened) {
+  TempDir dir;
+  dir.File("nimb_kernel", "k");
+  for (const char *name : nimb::kBootDirectoryNames)
+    dir.Directory(name);
+  EFI_HANDLE device = BootFrom(dir);
+  nimb::BootVolume volume = {};
+  ASSERT_EQ(fw.Call([&] { volume = nimb::OpenBootVolume(device); }).end, hostfw::RunEnd::Returned);
+  EXPECT_EQ(fw.OpenedNames(), std::vector<std::string>{"nimb_kernel"});
+  EXPECT_EQ(fw.ClosedNames(), std::vector<std::string>{"nimb_kernel"});
+  EXPECT_EQ(fw.ConOutText(), "");
+}
+
+struct NullLoadFile {
+  static EFI_STATUS EFIAPI Load(EFI_LOAD_FILE_PROTOCOL *, EFI_DEVICE_PATH_PROTOCOL *, BOOLEAN, UINTN *,
+                                VOID *) {
+    return EFI_NOT_FOUND;
+  }
+};
+
+TEST_F(BootTest, FileSystemIsPreferredToLoadFile) {
+  static EFI_LOAD_FILE_PROTOCOL loadFile = {NullLoadFile::Load};
+  TempDir dir;
+  EFI_HANDLE both = BootFrom(dir);
+  fw.InstallProtocol(both, gEfiLoadFileProtocolGuid, &loadFile);
+  nimb::BootVolume volume = {};
+  ASSERT_EQ(fw.Call([&] { volume = nimb::OpenBootVolume(both); }).end, hostfw::RunEnd::Returned);
+  EXPECT_NE(volume.root, nullptr);
+  EXPECT_EQ(volume.loadFile, nullptr);
+
+  // A network device: LoadFile only, nothing probed.
+  EFI_HANDLE network = fw.NewHandle();
+  fw.InstallProtocol(network, gEfiLoadFileProtocolGuid, &loadFile);
+  size_t opens = fw.OpenedNames().size();
+  ASSERT_EQ(fw.Call([&] { volume = nimb::OpenBootVolume(network); }).end, hostfw::RunEnd::Returned);
+  EXPECT_EQ(volume.root, nullptr);
+  EXPECT_EQ(volume.loadFile, &loadFile);
+  EXPECT_EQ(fw.OpenedNames().size(), opens);
+}
+
+TEST_F(BootTest, TheCallGateIsCopiedBelow4GiB) {
+  EXPECT_EQ(nimb::CallGateSize(), 0x82u);
+  ASSERT_EQ(nimb::CopyCallGate(), EFI_SUCCESS);
+  EXPECT_LE(nimb::gCallGate + 0x81, 0xFFFFFFFFull);
+  EXPECT_EQ(nimb::gCallGate % EFI_PAGE_SIZE, 0u);
+  EXPECT_EQ(fw.AllocatedPages(), 1u);
+  const auto *copy = reinterpret_cast<const uint8_t *>(nimb::gCallGate);
+  EXPECT_EQ(std::vector<uint8_t>(copy, copy + 0x82), std::vector<uint8_t>(CallGateStart, CallGateEnd));
+  // The address fields are filled in by the gate itself when it runs.
+  EXPECT_EQ(std::vector<uint8_t>(copy + 0x5A, copy + 0x5E), std::vector<uint8_t>(4, 0));
+  EXPECT_EQ(std::vector<uint8_t>(copy + 0x62, copy + 0x6A), std::vector<uint8_t>(8, 0));
+  // The rest of the page is left as the firmware gave it.
+  EXPECT_EQ(copy[0x82], 0xAF);
+  bool code = false;
+  for (const EFI_MEMORY_DESCRIPTOR &d : fw.MemoryMap()) {
+    if (d.PhysicalStart <= nimb::gCallGate &&
+        nimb::gCallGate < d.PhysicalStart + d.NumberOfPages * EFI_PAGE_SIZE) {
+      code = d.Type == EfiLoaderCode;
+    }
+  }
+  EXPECT_TRUE(code);
+}
+
+TEST_F(BootTest, EveryFatalMessageOfTheBootSequence) {
+  static EFI_LOAD_FILE_PROTOCOL loadFile = {NullLoadFile::Load};
+  struct Row {
+    const char *message;
+    std::function<void(hostfw::Firmware &, EFI_HANDLE device)> arrange;
+  };
+  const Row rows[] = {
+      {"Can not initialize console\r\n",
+       [](hostfw::Firmware &f, EFI_HANDLE) { f.SetConsoleControlPresent(false); }},
+      {"Can not initialize console\r\n", [](hostfw::Firmware &f, EFI_HANDLE) { f.FailCall("GetMode"); }},
+      {"Could not allocate kernel call gate (9)\r\n",
+       [](hostfw::Firmware &f, EFI_HANDLE) { f.FailCall("AllocatePages", 1, EFI_OUT_OF_RESOURCES); }},
+      {"Can not retrieve a LoadedImageProtocol handle for ImageHandle\r\n",
+       [](hostfw::Firmware &f, EFI_HANDLE) {
+         f.FailCall("HandleProtocol", 1, EFI_UNSUPPORTED, &gEfiLoadedImageProtocolGuid);
+       }},
+      {"Can not find a DevicePath handle for LoadedImage->DeviceHandle\r\n",
+       [](hostfw::Firmware &f, EFI_HANDLE device) {
+         f.UninstallProtocol(device, gEfiDevicePathProtocolGuid);
+       }},
+      // The tag block is the first pool allocation, the options' copy the second.
+      {"Could not get boot args\r\n", [](hostfw::Firmware &f, EFI_HANDLE) { f.FailCall("AllocatePool", 2); }},
+      {"Can't open booter's root volume\r\n",
+       [](hostfw::Firmware &f, EFI_HANDLE) { f.FailCall("OpenVolume"); }},
+      {"Can't get a FileSystem or LoadFile handle for boot volume\r\n",
+       [](hostfw::Firmware &f, EFI_HANDLE device) {
+         f.UninstallProtocol(device, gEfiSimpleFileSystemProtocolGuid);
+       }},
+      {"Error loading kernel 'nimb_kernel'\r\n", [](hostfw::Firmware &, EFI_HANDLE) {}},
+      {"Error loading kernel 'nimb.tarnix'\r\n",
+       [](hostfw::Firmware &f, EFI_HANDLE device) {
+         f.UninstallProtocol(device, gEfiSimpleFileSystemProtocolGuid);
+         f.InstallProtocol(device, gEfiLoadFileProtocolGuid, &loadFile);
+       }},
+  };
+  for (const Row &row : rows) {
+    for (auto mode : {EfiConsoleControlScreenText, EfiConsoleControlScreenGraphics}) {
+      hostfw::Firmware local;
+      local.SetConsoleMode(mode);
+      TempDir dir;
+      EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
+      local.SetBootDevice(device);
+      local.SetLoadOptions(u"  -v");
+      row.arrange(local, device);
+      nimbtest::ResetLoaderState();
+      hostfw::RunResult result = local.Run(BootEntry);
+      std::string text = local.ConOutText();
+      EXPECT_EQ(result.end, hostfw::RunEnd::Exited) << row.message;
+      EXPECT_EQ(result.status, EFI_ABORTED) << row.message;
+      ASSERT_GE(text.size(), strlen(row.message)) << row.message;
+      EXPECT_EQ(text.substr(text.size() - strlen(row.message)), row.message);
+      EXPECT_EQ(local.ConsoleMode(), mode) << row.message;
+      EXPECT_EQ(local.LivePoolBlocks(), 0u) << row.message;
+      EXPECT_EQ(local.AllocatedPages(), 0u) << row.message;
+      EXPECT_EQ(nimb::gMemoryTags, nullptr) << row.message;
+    }
+  }
+  nimbtest::ResetLoaderState();
+  Attach();
+}
+
+}  // namespace

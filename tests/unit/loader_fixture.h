@@ -1,0 +1,75 @@
+// A hostfw firmware with the loader's program-wide state pointed at it, and
+// put back to the state of a fresh start after each test.
+#pragma once
+
+#include <gtest/gtest.h>
+
+#include <string>
+
+#include "boot/boot.h"
+#include "config/boot_options.h"
+#include "config/plist.h"
+#include "hostfw/hostfw.h"
+#include "memory/tracking.h"
+#include "screen/console.h"
+#include "screen/spinner.h"
+
+namespace nimbtest {
+
+inline void ResetLoaderState() {
+  nimb::gST = nullptr;
+  nimb::gBS = nullptr;
+  nimb::gRT = nullptr;
+  nimb::gImageHandle = nullptr;
+  nimb::gLoadedImage = nullptr;
+  nimb::gBootDevicePath = nullptr;
+  nimb::gCallGate = 0;
+  nimb::gKernelEntry = 0;
+  nimb::gConsoleControl = nullptr;
+  nimb::gConsoleMode = 0;
+  nimb::gInitialConsoleMode = 0;
+  nimb::gSpinnerEvent = nullptr;
+  nimb::gMemoryTags = nullptr;
+  nimb::gFreeMemoryTags = nullptr;
+  nimb::gMemoryTagBlocks = nullptr;
+  nimb::gBootFlags = 0;
+  nimb::gBootOptions = nullptr;
+  nimb::gConfigDict = nullptr;
+  nimb::gKernelName = nullptr;
+  nimb::gKernelDevicePath = nullptr;
+  nimb::gDriverPackageName = nullptr;
+  nimb::gDriverPackagePath = nullptr;
+  nimb::gCustomDriverPackage = 0;
+  nimb::gPlistFreeTags = nullptr;
+  nimb::gPlistSymbols = nullptr;
+}
+
+class LoaderTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    ResetLoaderState();
+    Attach();
+  }
+  void TearDown() override {
+    if (nimb::gBS != nullptr) {
+      nimb::TrackedFreeAll();
+    }
+    ResetLoaderState();
+  }
+  // Points the loader's firmware tables at `fw`, as BootEntry would.
+  void Attach() {
+    nimb::gST = fw.SystemTable();
+    nimb::gBS = fw.BootServices();
+    nimb::gRT = fw.RuntimeServices();
+    nimb::gImageHandle = fw.ImageHandle();
+  }
+  // Everything the loader took from the firmware has been given back.
+  void ExpectNothingHeld() {
+    EXPECT_EQ(fw.LivePoolBlocks(), 0u);
+    EXPECT_EQ(fw.AllocatedPages(), 0u);
+  }
+
+  hostfw::Firmware fw;
+};
+
+}  // namespace nimbtest

@@ -1,0 +1,278 @@
+// Option strings: the quote-aware key lookup, the blank-split word reader and
+// the appending of words without duplicate keys, and the configuration
+// dictionary as second source.
+#include "config/options.h"
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "config/boot_options.h"
+#include "config/plist.h"
+#include "loader_fixture.h"
+
+namespace {
+
+constexpr size_t kNone = static_cast<size_t>(-1);
+
+TEST(OptionsTest, GetOptionValueFindsTheLastPairWithTheKey) {
+  struct Row {
+    const char *text;
+    const char *key;
+    size_t offset;  // where the value starts in `text`; kNone when not found
+    const char *value;
+  };
+  const Row rows[] = {
+      {"", "-v", kNone, ""},
+      {" \t\r\n", "-v", kNone, ""},
+      {"-v", "-v", 2, ""},
+      {"-V", "-v", 2, ""},
+      {"-vx", "-v", kNone, ""},
+      {"-x -v", "-x", 2, ""},
+      {"a=", "a", 2, ""},
+      {"a=\"b c\"", "a", 3, "b c"},
+      {"a=\"b c\" d=1", "d", 10, "1"},
+      {"\"a b\"=c", "a b", 6, "c"},
+      {"\"a\"x=1", "a", 4, ""},  // the byte behind a quoted key is a separator
+      {"a=\"b\"c d=2", "c", 6, ""},
+      {"a=\"b", "a", 3, "b"},
+      {"a=1 a=2", "a", 6, "2"},
+      {"a=1 b a=", "a", 8, ""},
+      {"a=b=c", "a", 2, "b"},
+      {"a=b=c", "", 4, "c"},
+      {"configure=1", "config", kNone, ""},
+      {"config", "configure", kNone, ""},
+      {"KERNEL=x", "Kernel", 7, "x"},
+      {"[=1", "{", 2, "1"},
+      {"a=\"-v b\"", "-v", kNone, ""},
+      {"a\tb\r\nc", "c", 6, ""},
+      {"a\tb\r\nc", "b", 3, ""},
+      {"Kernel=\"my kernel\" rd=*", "Kernel", 8, "my kernel"},
+      {"Kernel=\"my kernel\" rd=*", "rd", 22, "*"},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::string("text \"") + row.text + "\" key \"" + row.key + "\"");
+    const char *value = nullptr;
+    UINT64 length = 12345;
+    const EFI_STATUS status = nimb::GetOptionValue(row.text, row.key, &value, &length);
+    if (row.offset == kNone) {
+      EXPECT_EQ(status, EFI_NOT_FOUND);
+      EXPECT_EQ(value, nullptr);  // outs untouched
+      EXPECT_EQ(length, 12345u);
+      continue;
+    }
+    ASSERT_EQ(status, EFI_SUCCESS);
+    EXPECT_EQ(value, row.text + row.offset);
+    EXPECT_EQ(std::string(value, length), row.value);
+  }
+}
+
+TEST(OptionsTest, GetOptionValueOfANullTextFindsNothing) {
+  const char *value = nullptr;
+  UINT64 length = 0;
+  EXPECT_EQ(nimb::GetOptionValue(nullptr, "-v", &value, &length), EFI_NOT_FOUND);
+}
+
+TEST(OptionsTest, ScanOptionWordStopsAtQuotesBlanksAndEquals) {
+  struct Row {
+    const char *text;
+    const char *word;
+    size_t next;  // offset of the returned pointer
+  };
+  const Row rows[] = {
+      {"", "", 0},      {"abc", "abc", 3},         {"ab=c", "ab", 2},      {"ab c", "ab", 2},
+      {"=c", "", 0},    {"a\"b\" c", "a\"b\"", 4}, {"\"a b\"c", "a b", 5}, {"\"a=b", "a=b", 4},
+      {"\"\"x", "", 2},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::string("text \"") + row.text + "\"");
+    const char *start = nullptr;
+    UINT64 length = 0;
+    const char *next = nimb::ScanOptionWord(row.text, &start, &length);
+    EXPECT_EQ(std::string(start, length), row.word);
+    EXPECT_EQ(next, row.text + row.next);
+  }
+}
+
+struct Word {
+  std::string word;
+  std::string key;
+};
+
+// The words of `text` as the option string is built from a source: NextOption
+// until the terminator.
+std::vector<Word> Words(const char *text) {
+  std::vector<Word> words;
+  while (*text != '\0') {
+    const char *word = nullptr;
+    UINT64 keyLength = 0;
+    UINT64 wordLength = 0;
+    const char *next = nimb::NextOption(text, &word, &keyLength, &wordLength);
+    EXPECT_EQ(next, word + wordLength);
+    words.push_back({std::string(word, wordLength), std::string(word, keyLength)});
+    text = next;
+  }
+  return words;
+}
+
+TEST(OptionsTest, NextOptionSplitsAtBlanksOnlyAndKeysEndAtTheFirstEquals) {
+  struct Row {
+    const char *text;
+    std::vector<Word> words;
+  };
+  const Row rows[] = {
+      {"", {}},
+      {"abc", {{"abc", "abc"}}},
+      {"a=\"b c\"", {{"a=\"b", "a"}, {"c\"", "c\""}}},
+      {"  -v\tfoo=1=2\r\n", {{"-v", "-v"}, {"foo=1=2", "foo"}, {"", ""}}},
+      {"=x", {{"=x", ""}}},
+      {"a ", {{"a", "a"}, {"", ""}}},
+      {" ", {{"", ""}}},
+      {"\"a b\"=c", {{"\"a", "\"a"}, {"b\"=c", "b\""}}},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::string("text \"") + row.text + "\"");
+    const std::vector<Word> words = Words(row.text);
+    ASSERT_EQ(words.size(), row.words.size());
+    for (size_t i = 0; i < words.size(); i++) {
+      EXPECT_EQ(words[i].word, row.words[i].word) << "word " << i;
+      EXPECT_EQ(words[i].key, row.words[i].key) << "word " << i;
+    }
+  }
+}
+
+TEST(OptionsTest, AppendOptionDropsWordsWhoseKeyIsInTheTextAlready) {
+  struct Row {
+    const char *base;
+    std::vector<const char *> sources;  // each split into words with NextOption
+    const char *result;
+  };
+  const Row rows[] = {
+      {"", {"-v"}, "-v"},
+      {"", {" "}, ""},
+      {"", {"a b"}, "a b"},
+      {"-v", {"-v"}, "-v"},
+      {"-v=1", {"-v"}, "-v=1"},
+      {"-v", {"-v=1"}, "-v"},
+      {"-vx", {"-v"}, "-vx -v"},
+      {"-V", {"-v"}, "-V -v"},
+      {"-", {"-v"}, "- -v"},
+      {"a", {"a=2"}, "a"},
+      {"x\t-v\r\n", {"-v"}, "x\t-v\r\n"},
+      {"KERNEL=x", {"Kernel=y"}, "KERNEL=x Kernel=y"},
+      {"a=\"x -v y\"", {"-v"}, "a=\"x -v y\""},
+      {"", {"a=\"b c\" a=1"}, "a=\"b c\""},
+      {"", {"a=1 a=2"}, "a=1"},
+      {"=x", {"=x"}, "=x =x"},
+      {"x", {"a b "}, "x a b "},
+      {"-v foo=1", {"foo=2 bar=3 -v", "baz=4 bar=5"}, "-v foo=1 bar=3 baz=4"},
+      {"-X", {"", "", "-x"}, "-X -x"},
+      {"-v -v", {"-s"}, "-v -v -s"},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::string("base \"") + row.base + "\"");
+    std::vector<char> buffer(256, '\x55');
+    std::string base = row.base;
+    std::copy(base.begin(), base.end(), buffer.begin());
+    buffer[base.size()] = '\0';
+    char *end = buffer.data() + base.size();
+    for (const char *source : row.sources) {
+      for (const Word &word : Words(source)) {
+        end = nimb::AppendOption(buffer.data(), end, word.word.c_str(), word.key.size(), word.word.size());
+      }
+    }
+    EXPECT_STREQ(buffer.data(), row.result);
+    EXPECT_EQ(end, buffer.data() + strlen(row.result));
+    // Nothing is written behind the terminator.
+    EXPECT_EQ(end[1], '\x55');
+  }
+}
+
+// The configuration dictionary as second source, parsed from a document as
+// the boot options do.
+class OptionsConfigTest : public nimbtest::LoaderTest {
+ protected:
+  void SetUp() override {
+    LoaderTest::SetUp();
+    ClearPlistState();
+  }
+  void TearDown() override {
+    ClearPlistState();
+    LoaderTest::TearDown();
+  }
+  static void ClearPlistState() {
+    nimb::gConfigDict = nullptr;
+    nimb::gPlistFreeTags = nullptr;
+    nimb::gPlistSymbols = nullptr;
+  }
+  void Parse(const std::string &document) {
+    text_.assign(document.begin(), document.end());
+    text_.push_back('\0');
+    ASSERT_EQ(nimb::PlistParseDocument(text_.data(), &nimb::gConfigDict), EFI_SUCCESS);
+  }
+  std::vector<char> text_;
+};
+
+TEST_F(OptionsConfigTest, TheOptionStringBeatsTheDictionaryKeyByKey) {
+  Parse(
+      "<plist><dict>"
+      "<key>Kernel</key><string>nimb_other</string>"
+      "<key>Kernel Flags</key><string>-v rd=x</string>"
+      "<key>Empty</key><string></string>"
+      "<key>Root UUID</key><integer>5</integer>"
+      "<key>Sub</key><dict><key>Kernel</key><string>nested</string></dict>"
+      "</dict></plist>");
+  struct Row {
+    const char *text;
+    const char *key;
+    const char *value;  // null when not found
+    bool fromOptions;   // the value points into `text`
+  };
+  const Row rows[] = {
+      {"", "Kernel", "nimb_other", false},
+      {"Kernel=a", "Kernel", "a", true},
+      {"kernel=a", "Kernel", "a", true},
+      {"Kernels=a", "Kernel", "nimb_other", false},
+      {"", "kernel", nullptr, false},  // the dictionary's keys match exactly
+      {nullptr, "Kernel", "nimb_other", false},
+      {"", "Kernel Flags", "-v rd=x", false},
+      {"", "Empty", "", false},
+      {"", "Root UUID", nullptr, false},  // not a string
+      {"", "Drvpk Cache", nullptr, false},
+      {"", "Sub", nullptr, false},
+      {"rd", "rd", "", true},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::string("text \"") + (row.text != nullptr ? row.text : "(null)") + "\" key \"" +
+                 row.key + "\"");
+    const char *value = nullptr;
+    UINT64 length = 0;
+    const EFI_STATUS status = nimb::GetOptionOrConfigValue(row.text, row.key, &value, &length);
+    if (row.value == nullptr) {
+      EXPECT_EQ(status, EFI_NOT_FOUND);
+      continue;
+    }
+    ASSERT_EQ(status, EFI_SUCCESS);
+    EXPECT_EQ(std::string(value, length), row.value);
+    if (row.fromOptions) {
+      EXPECT_TRUE(value >= row.text && value <= row.text + strlen(row.text));
+    } else {
+      EXPECT_STREQ(nimb::GetConfigValue(row.key), row.value);
+    }
+  }
+  EXPECT_EQ(nimb::GetConfigValue("Root UUID"), nullptr);
+  EXPECT_EQ(nimb::GetConfigValue("Missing"), nullptr);
+}
+
+TEST_F(OptionsConfigTest, WithoutADictionaryOnlyTheOptionStringCounts) {
+  const char *value = nullptr;
+  UINT64 length = 0;
+  EXPECT_EQ(nimb::GetOptionOrConfigValue("a=1", "Kernel", &value, &length), EFI_NOT_FOUND);
+  EXPECT_EQ(nimb::GetConfigValue("Kernel"), nullptr);
+  ASSERT_EQ(nimb::GetOptionOrConfigValue("Kernel=k", "Kernel", &value, &length), EFI_SUCCESS);
+  EXPECT_EQ(std::string(value, length), "k");
+}
+
+}  // namespace

@@ -1,0 +1,518 @@
+// The property list parser: what the cut text gives, how trees come out for
+// the quirks of the element vocabulary, shared symbols, the tag pool, and
+// that every failure gives back all it took.
+#include "config/plist.h"
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <deque>
+#include <functional>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "loader_fixture.h"
+
+namespace {
+
+using nimb::gPlistFreeTags;
+using nimb::gPlistSymbols;
+using nimb::kPlistFailure;
+using nimb::PlistSymbol;
+using nimb::PlistTag;
+
+constexpr size_t kTagsPerBlock = 4096;
+
+class PlistTest : public nimbtest::LoaderTest {
+ protected:
+  void SetUp() override {
+    LoaderTest::SetUp();
+    gPlistFreeTags = nullptr;
+    gPlistSymbols = nullptr;
+  }
+  void TearDown() override {
+    gPlistFreeTags = nullptr;
+    gPlistSymbols = nullptr;
+    LoaderTest::TearDown();
+  }
+
+  // A writable, zero-terminated copy that lives as long as the test.
+  char *Text(const std::string &text) {
+    texts_.emplace_back(text.begin(), text.end());
+    texts_.back().push_back('\0');
+    return texts_.back().data();
+  }
+
+  PlistTag *Parse(const std::string &text, EFI_STATUS expected = EFI_SUCCESS) {
+    PlistTag *dict = reinterpret_cast<PlistTag *>(1);
+    EXPECT_EQ(nimb::PlistParseDocument(Text(text), &dict), expected) << text;
+    if (expected != EFI_SUCCESS)
+      EXPECT_EQ(dict, nullptr) << text;
+    return dict;
+  }
+
+  // Makes the first block of tags, so that counts of the free list compare.
+  void PrimePool() {
+    nimb::PlistFreeTag(nimb::PlistNewTag());
+    ASSERT_EQ(FreeTags(), kTagsPerBlock);
+  }
+
+  static size_t FreeTags() {
+    size_t n = 0;
+    for (const PlistTag *t = gPlistFreeTags; t != nullptr; t = t->next) {
+      EXPECT_EQ(t->type, 0u);
+      EXPECT_EQ(t->text, nullptr);
+      EXPECT_EQ(t->child, nullptr);
+      n++;
+    }
+    return n;
+  }
+
+  // Symbol texts with their counts, newest first.
+  static std::vector<std::pair<std::string, uint64_t>> Symbols() {
+    std::vector<std::pair<std::string, uint64_t>> list;
+    for (const PlistSymbol *s = gPlistSymbols; s != nullptr; s = s->next)
+      list.emplace_back(s->text, s->refCount);
+    return list;
+  }
+
+  static uint64_t RefCount(const char *text) {
+    for (const PlistSymbol *s = gPlistSymbols; s != nullptr; s = s->next) {
+      if (std::strcmp(s->text, text) == 0)
+        return s->refCount;
+    }
+    return 0;
+  }
+
+  // One tag and everything under it, children in chain order:
+  // dict{K:"v",...}, array[...], a key as name:value, "_" for null.
+  static std::string Describe(const PlistTag *t) {
+    if (t == nullptr)
+      return "_";
+    std::string out;
+    auto list = [&](const char *open, const char *close) {
+      out += open;
+      for (const PlistTag *c = t->child; c != nullptr; c = c->next) {
+        if (c != t->child)
+          out += ",";
+        out += Describe(c);
+      }
+      out += close;
+    };
+    switch (t->type) {
+      case nimb::kPlistDict:
+        list("dict{", "}");
+        break;
+      case nimb::kPlistArray:
+        list("array[", "]");
+        break;
+      case nimb::kPlistKey:
+        out = std::string(t->text ? t->text : "(null)") + ":" + Describe(t->child);
+        break;
+      case nimb::kPlistString:
+        out = "\"" + std::string(t->text ? t->text : "(null)") + "\"";
+        break;
+      case nimb::kPlistInteger:
+        out = "integer";
+        break;
+      case nimb::kPlistData:
+        out = "data";
+        break;
+      case nimb::kPlistDate:
+        out = "date";
+        break;
+      case nimb::kPlistFalse:
+        out = "false";
+        break;
+      case nimb::kPlistTrue:
+        out = "true";
+        break;
+      default:
+        out = "?" + std::to_string(t->type);
+    }
+    bool hasText = t->type == nimb::kPlistKey || t->type == nimb::kPlistString;
+    bool hasChild = t->type == nimb::kPlistKey || t->type == nimb::kPlistDict || t->type == nimb::kPlistArray;
+    if (!hasText && t->text != nullptr)
+      out += "!text";
+    if (!hasChild && t->child != nullptr)
+      out += "!child";
+    return out;
+  }
+
+  std::deque<std::vector<char>> texts_;
+};
+
+TEST_F(PlistTest, NextTagCutsAtTheFirstCloseAfterTheFirstOpen) {
+  struct Row {
+    const char *text;
+    uint64_t offset;
+    const char *name;
+    uint64_t start;
+  };
+  const Row rows[] = {
+      {"ab<key>cd", 7, "key", 2},
+      {"<!-- a > b -->", 8, "!-- a ", 0},
+      {"<plist version=\"1.0\">", 21, "plist version=\"1.0\"", 0},
+      {"x>y<a/>", 7, "a/", 3},
+      {"<>", 2, "", 0},
+      {"no tag at all", kPlistFailure, nullptr, 0},
+      {"x<open", kPlistFailure, nullptr, 0},
+      {"", kPlistFailure, nullptr, 0},
+  };
+  for (const Row &row : rows) {
+    char *text = Text(row.text);
+    char *name = nullptr;
+    uint64_t start = 99;
+    uint64_t offset = nimb::PlistNextTag(text, &name, &start);
+    ASSERT_EQ(offset, row.offset) << row.text;
+    if (offset == kPlistFailure) {
+      EXPECT_STREQ(text, row.text) << "a failed scan cuts nothing";
+      continue;
+    }
+    EXPECT_STREQ(name, row.name) << row.text;
+    EXPECT_EQ(name, text + row.start + 1) << row.text;
+    EXPECT_EQ(start, row.start) << row.text;
+    EXPECT_EQ(text[offset - 1], '\0') << row.text;
+    // The start of the tag is optional.
+    char *again = Text(row.text);
+    EXPECT_EQ(nimb::PlistNextTag(again, &name, nullptr), row.offset) << row.text;
+  }
+}
+
+TEST_F(PlistTest, CutContentEndsAtTheExactClosingName) {
+  struct Row {
+    const char *text;  // what follows the opening tag
+    const char *name;
+    uint64_t offset;
+    const char *content;
+  };
+  const Row rows[] = {
+      {"abc</key>rest", "key", 9, "abc"},
+      {"</string>", "string", 9, ""},
+      {" &amp; </string>", "string", 16, " &amp; "},
+      {"a<b>c</string>", "string", 14, "a<b"},
+      {"a</key>b</string>", "string", 17, "a</key"},
+      {"x</strings></string>", "string", 20, "x</strings"},
+      {"x</ string></string>", "string", 20, "x</ string"},
+      {"1</integer>", "integer", 11, "1"},
+      {"abc", "key", kPlistFailure, nullptr},
+      {"abc</key", "key", kPlistFailure, nullptr},
+      {"abc</Key>", "key", kPlistFailure, nullptr},
+  };
+  for (const Row &row : rows) {
+    char *text = Text(row.text);
+    uint64_t offset = nimb::PlistCutContent(text, row.name);
+    ASSERT_EQ(offset, row.offset) << row.text;
+    if (offset != kPlistFailure)
+      EXPECT_STREQ(text, row.content) << row.text;
+  }
+}
+
+TEST_F(PlistTest, DocumentsAndTheQuirksOfTheVocabulary) {
+  struct Row {
+    const char *text;
+    const char *tree;  // null: EFI_NOT_FOUND
+  };
+  const Row rows[] = {
+      // Children run in reverse file order.
+      {"<dict><key>A</key><string>1</string><key>B</key><string>2</string></dict>", R"(dict{B:"2",A:"1"})"},
+      {"<dict><key>L</key><array><string>x</string><string>y</string></array></dict>",
+       R"(dict{L:array["y","x"]})"},
+      {"<?xml version=\"1.0\"?><!DOCTYPE plist><plist version=\"1.0\"><dict/></plist>", "dict{}"},
+      {"<dict><key>A</key><array/><key>B</key><dict/></dict>", "dict{B:dict{},A:array[]}"},
+      // Booleans only without a blank; anything else outside the vocabulary
+      // leaves the key without a value.
+      {"<dict><key>T</key><true/><key>S</key><true /><key>F</key><false/><key>G</key><false></dict>",
+       "dict{G:_,F:false,S:_,T:true}"},
+      {"<dict><key>N</key><integer>5</integer><key>D</key><data>AAEC</data><key>W</key><date>2001</date></"
+       "dict>",
+       "dict{W:date,D:data,N:integer}"},
+      // A closing tag of an unknown value ends the dictionary early.
+      {"<dict><key>D</key><dict><key>A</key><real>1</real><key>B</key><string>b</string></dict>"
+       "<key>C</key><string>c</string></dict>",
+       R"(dict{B:"b",D:dict{A:_}})"},
+      {"<dict><key>E</key><string/><key>F</key><string>f</string></dict>", R"(dict{F:"f",E:_})"},
+      // Directly in a container, <string/> ends it; the rest falls outward.
+      {"<dict><key>L</key><array><string>x</string><string/><string>y</string></array>"
+       "<key>M</key><string>m</string></dict>",
+       R"(dict{"y",L:array["x"]})"},
+      {"<dict><key>S</key><string>a<b>c</string></dict>", R"(dict{S:"a<b"})"},
+      {"<dict><key>S</key><string>a</key>b</string></dict>", R"(dict{S:"a</key"})"},
+      {"<dict><key> A </key><string>&lt;x&gt;</string><key></key><string></string></dict>",
+       R"(dict{:"", A :"&lt;x&gt;"})"},
+      // Any tag that makes nothing closes a container: a comment, </array>.
+      {"<!-- a > b --><dict><key>K</key><string>v</string></dict>", R"(dict{K:"v"})"},
+      {"<dict><key>A</key><string>1</string><!-- c --><key>B</key><string>2</string></dict>",
+       R"(dict{A:"1"})"},
+      {"<dict><key>A</key><string>1</string></array><key>B</key><string>2</string></dict>", R"(dict{A:"1"})"},
+      // A key at the end takes the closing tag as its value and goes on.
+      {"<plist version=\"1.0\"><dict><key>A</key><string>1</string><key>Z</key></dict>"
+       "<key>B</key><string>2</string></plist>",
+       R"(dict{B:"2",Z:_,A:"1"})"},
+      {"<dict><key>A</key><key>B</key><string>x</string></dict>", R"(dict{A:B:"x"})"},
+      // What stands before the first dictionary is parsed and dropped.
+      {"<string>x</string><array><string>y</string></array><key>k</key><string>v</string>"
+       "<dict version=\"1\"><Dict><dict/>",
+       "dict{}"},
+      {"<plist version=\"1.0\"><string>x</string><array><string>y</string></array></plist>", nullptr},
+      {"<array></array>", nullptr},
+      {"", nullptr},
+      {"plain text", nullptr},
+      {"<dict><key>A</key><string>1</string><key>B</key><str", nullptr},
+      {"<dict><key>A</key><string>1", nullptr},
+      {"<dict><key>K</key><integer>5</dict>", nullptr},
+      {"<dict><key>A</key><string>1</string>", nullptr},
+  };
+  PrimePool();
+  for (const Row &row : rows) {
+    PlistTag *dict = Parse(row.text, row.tree ? EFI_SUCCESS : EFI_NOT_FOUND);
+    if (row.tree != nullptr) {
+      EXPECT_EQ(Describe(dict), row.tree) << row.text;
+      EXPECT_EQ(dict->next, nullptr) << row.text;
+    }
+    nimb::PlistFreeTag(dict);
+    // Whatever was parsed, kept or dropped, is all back.
+    EXPECT_EQ(FreeTags(), kTagsPerBlock) << row.text;
+    EXPECT_TRUE(Symbols().empty()) << row.text;
+  }
+}
+
+TEST_F(PlistTest, FindKeyTakesTheLastInTheFileAndSkipsWhatIsNoKey) {
+  PlistTag *dict = Parse(
+      "<dict><key>A</key><string>1</string><key>B</key><string>2</string><key>A</key><string>3</string>"
+      "<key>N</key><integer>5</integer><key>E</key><string>early</string><key>E</key><string/>"
+      "<string>loose</string><key>a</key><string>lower</string></dict>");
+  ASSERT_NE(dict, nullptr);
+  struct Row {
+    const char *key;
+    const char *value;  // Describe() of the value
+  };
+  const Row rows[] = {
+      {"A", R"("3")"},     {"B", R"("2")"}, {"N", "integer"}, {"E", "_"},  // a key without value hides none
+      {"a", R"("lower")"}, {"loose", "_"},  {"", "_"},        {"AB", "_"}, {"Ab", "_"},
+  };
+  for (const Row &row : rows) {
+    EXPECT_EQ(Describe(nimb::PlistFindKey(dict, row.key)), row.value) << row.key;
+  }
+  EXPECT_EQ(nimb::PlistFindKey(nullptr, "A"), nullptr);
+  EXPECT_EQ(nimb::PlistFindKey(nimb::PlistFindKey(dict, "A"), "A"), nullptr) << "a string is no dictionary";
+}
+
+TEST_F(PlistTest, SymbolsAreSharedAndGoWithTheirLastHolder) {
+  PrimePool();
+  size_t pools = fw.LivePoolBlocks();
+
+  PlistTag *first = Parse("<dict><key>A</key><string>A</string><key>B</key><string>A</string></dict>");
+  PlistTag *second = Parse("<dict><key>A</key><string>x</string></dict>");
+  using List = std::vector<std::pair<std::string, uint64_t>>;
+  EXPECT_EQ(Symbols(), (List{{"x", 1}, {"B", 1}, {"A", 4}}));
+  // One copy: every "A" of both trees is the same pointer.
+  const char *shared = nimb::PlistFindKey(first, "B")->text;
+  EXPECT_EQ(nimb::PlistFindKey(first, "A")->text, shared);
+  EXPECT_EQ(second->child->text, shared);
+  EXPECT_EQ(fw.LivePoolBlocks(), pools + 3);
+
+  nimb::PlistFreeTag(first);
+  EXPECT_EQ(Symbols(), (List{{"x", 1}, {"A", 1}}));
+  EXPECT_EQ(fw.LivePoolBlocks(), pools + 2);
+
+  // A text that was never interned is passed over.
+  PlistTag *stray = nimb::PlistNewTag();
+  stray->type = nimb::kPlistString;
+  stray->text = Text("y");
+  nimb::PlistFreeTag(stray);
+  EXPECT_EQ(Symbols(), (List{{"x", 1}, {"A", 1}}));
+
+  nimb::PlistFreeTag(second);
+  EXPECT_TRUE(Symbols().empty());
+  EXPECT_EQ(fw.LivePoolBlocks(), pools);
+
+  char *a = nimb::PlistInternSymbol("same");
+  EXPECT_EQ(nimb::PlistInternSymbol("same"), a);
+  EXPECT_EQ(RefCount("same"), 2u);
+  EXPECT_NE(nimb::PlistInternSymbol("sam"), a);
+  EXPECT_STREQ(gPlistSymbols->text, "sam") << "newest first";
+}
+
+TEST_F(PlistTest, NoMemoryForASymbolEndsTheBoot) {
+  fw.FailCall("AllocatePool", 1, EFI_OUT_OF_RESOURCES);
+  hostfw::RunResult result = fw.Call([] { nimb::PlistInternSymbol("abc"); });
+  EXPECT_EQ(result.end, hostfw::RunEnd::Exited);
+  EXPECT_EQ(result.status, EFI_ABORTED);
+  EXPECT_EQ(fw.ConOutText(), "NULL symbol!");
+}
+
+TEST_F(PlistTest, TagsComeFromZeroedBlocksInAscendingOrder) {
+  unsigned pools = fw.AllocatePoolCalls();
+  PlistTag *first = nimb::PlistNewTag();
+  ASSERT_NE(first, nullptr);
+  EXPECT_EQ(first->next, nullptr);
+  EXPECT_EQ(gPlistFreeTags, first + 1);
+  EXPECT_EQ(FreeTags(), kTagsPerBlock - 1);
+  EXPECT_EQ(first[kTagsPerBlock - 1].next, nullptr);
+  for (size_t i = 1; i + 1 < kTagsPerBlock; i++)
+    ASSERT_EQ(first[i].next, &first[i + 1]) << i;
+
+  for (size_t i = 1; i < kTagsPerBlock; i++)
+    nimb::PlistNewTag();
+  EXPECT_EQ(gPlistFreeTags, nullptr);
+  unsigned oneBlock = fw.AllocatePoolCalls() - pools;
+  PlistTag *next = nimb::PlistNewTag();
+  ASSERT_NE(next, nullptr);
+  EXPECT_EQ(fw.AllocatePoolCalls() - pools, oneBlock + 1) << "the 4097th tag takes one more block";
+  EXPECT_EQ(FreeTags(), kTagsPerBlock - 1);
+
+  // A freed tag is handed out again before any new block.
+  nimb::PlistFreeTag(first);
+  EXPECT_EQ(nimb::PlistNewTag(), first);
+}
+
+TEST_F(PlistTest, NoBlockOfTagsIsAFailureNotAnEnd) {
+  // Memory tags are made once, so that the next allocation is the block.
+  ASSERT_EQ(nimb::TrackedFree(nimb::TrackedAllocatePool(8)), EFI_SUCCESS);
+  fw.FailCall("AllocatePool", 1, EFI_OUT_OF_RESOURCES);
+  EXPECT_EQ(nimb::PlistNewTag(), nullptr);
+  fw.FailCall("AllocatePool", 1, EFI_OUT_OF_RESOURCES);
+  PlistTag *tag = reinterpret_cast<PlistTag *>(1);
+  EXPECT_EQ(nimb::PlistParseTag(Text("<true/>"), &tag), kPlistFailure);
+  EXPECT_EQ(tag, nullptr);
+  // The next attempt may take a block again.
+  EXPECT_NE(nimb::PlistNewTag(), nullptr);
+}
+
+TEST_F(PlistTest, TwoParsesInARowReuseTheTagsOfTheFirst) {
+  const char *doc = "<dict><key>A</key><array><string>x</string><true/></array><key>B</key><dict/></dict>";
+  PlistTag *first = Parse(doc);
+  std::set<const PlistTag *> used;
+  std::function<void(const PlistTag *)> collect = [&](const PlistTag *t) {
+    for (; t != nullptr; t = t->next) {
+      used.insert(t);
+      collect(t->child);
+    }
+  };
+  collect(first);
+  ASSERT_EQ(used.size(), 7u);
+  nimb::PlistFreeTag(first);
+  EXPECT_EQ(gPlistFreeTags, first) << "the root goes back last, on top";
+
+  const std::set<const PlistTag *> firstTags = used;
+  used.clear();
+  collect(Parse(doc));
+  EXPECT_EQ(used, firstTags);
+  EXPECT_EQ(FreeTags(), kTagsPerBlock - 7);
+}
+
+TEST_F(PlistTest, AFailureAnywhereGivesBackAllItTook) {
+  auto nested = [](const std::string &open, const std::string &close, const std::string &inner, int n) {
+    std::string text;
+    for (int i = 0; i < n; i++)
+      text += open;
+    text += inner;
+    for (int i = 0; i < n; i++)
+      text += close;
+    return text;
+  };
+  struct Row {
+    const char *name;
+    std::string text;
+  };
+  const Row rows[] = {
+      {"cut off deep inside",
+       "<dict><key>A</key><array><dict><key>b</key><string>b</string><key>C</key>"
+       "<array><string>A</string><string>c</string>"},
+      {"text element without its end deep inside",
+       "<dict><key>A</key><array><dict><key>b</key><string>b</string></dict>"
+       "<dict><key>C</key><string>c</dict></array></dict>"},
+      {"integer without its end", "<dict><key>A</key><string>b</string><key>N</key><integer>1</dict>"},
+      {"too deep", "<dict><key>A</key><string>b</string><key>deep</key>" +
+                       nested("<array>", "</array>", "<string>b</string>", 300) + "</dict>"},
+      {"a key chain too deep", "<dict><key>A</key><string>b</string>" +
+                                   nested("<key>A</key>", "", "<string>b</string>", 300) + "</dict>"},
+  };
+  PrimePool();
+  // Another tree holds the same symbols: their counts must come back to 1.
+  PlistTag *held = Parse("<dict><key>A</key><string>b</string></dict>");
+  const auto symbols = Symbols();
+  const size_t freeTags = FreeTags();
+  for (const Row &row : rows) {
+    Parse(row.text, EFI_NOT_FOUND);
+    EXPECT_EQ(FreeTags(), freeTags) << row.name;
+    EXPECT_EQ(Symbols(), symbols) << row.name;
+  }
+  EXPECT_EQ(Describe(held), R"(dict{A:"b"})");
+
+  // Out of tags in the middle: three records left, five needed. The texts
+  // are interned already, so the block is the only allocation.
+  for (size_t n = FreeTags(); n > 3; n--)
+    nimb::PlistNewTag();
+  fw.FailCall("AllocatePool", 1, EFI_OUT_OF_RESOURCES);
+  Parse("<dict><key>A</key><string>b</string><key>b</key><string>A</string></dict>", EFI_NOT_FOUND);
+  EXPECT_EQ(FreeTags(), 3u);
+  EXPECT_EQ(Symbols(), symbols);
+}
+
+TEST_F(PlistTest, NestingIsBoundedAt256OpenContainersAndKeys) {
+  struct Row {
+    const char *open;
+    const char *inner;
+    const char *close;
+    int depth;
+    bool ok;
+  };
+  const Row rows[] = {
+      {"<array>", "<true/>", "</array>", 256, true},
+      {"<array>", "<true/>", "</array>", 257, false},
+      {"<key>k</key>", "<true/>", "", 256, true},
+      {"<key>k</key>", "<true/>", "", 257, false},
+      {"<dict><key>k</key>", "<true/>", "</dict>", 128, true},
+      {"<dict><key>k</key>", "<true/>", "</dict>", 129, false},
+  };
+  PrimePool();
+  for (const Row &row : rows) {
+    std::string text;
+    for (int i = 0; i < row.depth; i++)
+      text += row.open;
+    text += row.inner;
+    for (int i = 0; i < row.depth; i++)
+      text += row.close;
+    std::string what = std::string(row.open) + " x" + std::to_string(row.depth);
+
+    PlistTag *tag = nullptr;
+    uint64_t offset = nimb::PlistParseTag(Text(text), &tag);
+    if (!row.ok) {
+      EXPECT_EQ(offset, kPlistFailure) << what;
+      EXPECT_EQ(tag, nullptr) << what;
+      EXPECT_EQ(FreeTags() % kTagsPerBlock, 0u) << what;
+      EXPECT_TRUE(Symbols().empty()) << what;
+      continue;
+    }
+    EXPECT_EQ(offset, text.size()) << what;
+    // Down the first child to the innermost value.
+    int levels = 0;
+    const PlistTag *t = tag;
+    for (; t != nullptr && t->type != nimb::kPlistTrue; t = t->child)
+      levels++;
+    ASSERT_NE(t, nullptr) << what;
+    EXPECT_EQ(levels, row.open[1] == 'd' ? 2 * row.depth : row.depth) << what;
+    nimb::PlistFreeTag(tag);
+    EXPECT_EQ(FreeTags() % kTagsPerBlock, 0u) << what;
+    EXPECT_TRUE(Symbols().empty()) << what;
+  }
+}
+
+TEST_F(PlistTest, ALongListIsFreedWithoutALongRecursion) {
+  // Enough siblings that a frame per sibling would overrun the stack.
+  const size_t count = 500000;
+  std::string text = "<array>";
+  for (size_t i = 0; i < count; i++)
+    text += "<true/>";
+  text += "</array>";
+  PlistTag *array = nullptr;
+  ASSERT_EQ(nimb::PlistParseTag(Text(text), &array), text.size());
+  nimb::PlistFreeTag(array);
+  size_t blocks = (count + 1 + kTagsPerBlock - 1) / kTagsPerBlock;
+  EXPECT_EQ(FreeTags(), blocks * kTagsPerBlock);
+}
+
+}  // namespace
