@@ -17,10 +17,10 @@ set(CMAKE_CXX_COMPILER_TARGET x86_64-unknown-windows)
 set(CMAKE_ASM_COMPILER_TARGET x86_64-unknown-windows)
 set(CMAKE_TRY_COMPILE_TARGET_TYPE STATIC_LIBRARY)
 
-set(NIMB_EFI_FLAGS "-ffreestanding -fno-builtin -mno-red-zone -fno-stack-protector -fshort-wchar -mno-stack-arg-probe -fno-asynchronous-unwind-tables -mno-sse -mno-mmx -msoft-float -fno-jump-tables")
+set(NIMB_EFI_FLAGS "--target=x86_64-unknown-windows -ffreestanding -fno-builtin -mno-red-zone -fno-stack-protector -fshort-wchar -mno-stack-arg-probe -fno-asynchronous-unwind-tables -mno-sse -mno-mmx -msoft-float -fno-jump-tables")
 set(CMAKE_C_FLAGS_INIT "${NIMB_EFI_FLAGS}")
 set(CMAKE_CXX_FLAGS_INIT "${NIMB_EFI_FLAGS} -fno-exceptions -fno-rtti -fno-threadsafe-statics")
-set(CMAKE_ASM_FLAGS_INIT "")
+set(CMAKE_ASM_FLAGS_INIT "--target=x86_64-unknown-windows")
 
 set(CMAKE_C_LINK_EXECUTABLE
     "<CMAKE_LINKER> /nologo /subsystem:efi_application /nodefaultlib /machine:x64 <LINK_FLAGS> <OBJECTS> <LINK_LIBRARIES> /out:<TARGET>")

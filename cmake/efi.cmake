@@ -3,6 +3,7 @@ add_compile_options(-Wall -Wextra -Werror=return-type -Os -ffunction-sections -f
 include_directories(${CMAKE_SOURCE_DIR}/src)
 
 add_executable(nimbboot ${NIMB_LOADER_SOURCES})
+set_target_properties(nimbboot PROPERTIES SUFFIX .efi)
 target_link_options(nimbboot PRIVATE /entry:BootEntry /opt:ref /opt:icf)
 
 file(GLOB NIMB_PLATFORM_SOURCES CONFIGURE_DEPENDS ${CMAKE_SOURCE_DIR}/platform/*.cpp ${CMAKE_SOURCE_DIR}/platform/*.S)

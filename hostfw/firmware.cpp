@@ -204,10 +204,18 @@ bool RefusedAtRuntime(State &s, const char *name, EFI_STATUS *failure) {
   return TakeFault(s, name, nullptr, failure);
 }
 
-void EndRun(State &s, RunEnd end, EFI_STATUS status) {
+RunFrame &CurrentRun(State &s, const char *what) {
   if (s.runs.empty())
-    Misuse("the loader left the run (end %d) outside Firmware::Run or Call", int(end));
-  RunFrame &frame = *s.runs.back();
+    Misuse("%s was reached outside Firmware::Run or Call: run the code under test in fw.Call", what);
+  return *s.runs.back();
+}
+
+void EndRun(State &s, RunEnd end, EFI_STATUS status) {
+  const char *what = end == RunEnd::Exited          ? "Exit"
+                     : end == RunEnd::Reset         ? "ResetSystem"
+                     : end == RunEnd::KernelEntered ? "the call gate"
+                                                    : "MachineHalt";
+  RunFrame &frame = CurrentRun(s, what);
   frame.result.end = end;
   frame.result.status = status;
   std::longjmp(frame.jump, 1);

@@ -82,6 +82,57 @@ struct ConsoleModeCall {
   EFI_CONSOLE_CONTROL_SCREEN_MODE mode;
 };
 
+// A set of ACPI tables as InstallAcpi builds it: an RSDP, an RSDT and (from
+// revision 2 on) an XSDT listing `otherTables` and then the FACP; the FACP
+// names the FACS, which holds the hardware signature, and the DSDT. All
+// checksums are right, unless a length given here makes them cover what the
+// table does not hold.
+struct AcpiOptions {
+  UINT8 rsdpRevision = 2;  // below 2: the 20-byte RSDP of the first version, without XSDT
+  bool rsdt = true;        // the RSDP names the RSDT (else its field is 0)
+  bool xsdt = true;        // the RSDP names the XSDT (revision 2 and above)
+  UINT32 rsdtLength = 0;   // 0: the true length; else the length the RSDT states
+  UINT32 xsdtLength = 0;   // the same for the XSDT
+  std::vector<std::string> otherTables = {"APIC", "HPET"};  // 4-character signatures ahead of the FACP
+  bool facp = true;                                        // the root tables list the FACP
+  UINT8 facpRevision = 4;
+  UINT32 facpLength = 0;  // 0: 116 bytes up to revision 2, 244 above
+  bool dsdt32 = true;     // the FACP's 32-bit DSDT field is filled
+  bool dsdt64 = true;     // and its 64-bit one (where the FACP is long enough)
+  UINT32 hardwareSignature = 0x4E494D42;
+  // The DSDT's OEM table id: up to 8 characters, padded with blanks.
+  std::string oemTableId = "NIMBHOST";
+  UINT32 oemRevision = 0x00010000;
+  UINT32 dsdtLength = 0;  // 0: the true length
+  std::vector<EFI_GUID> configurationGuids = {gEfiAcpi20TableGuid};
+};
+
+// Where InstallAcpi put the tables; 0 for a table it did not make.
+struct AcpiTables {
+  UINT64 rsdp = 0;
+  UINT64 rsdt = 0;
+  UINT64 xsdt = 0;
+  UINT64 facp = 0;
+  UINT64 facs = 0;
+  UINT64 dsdt = 0;
+};
+
+// A hard-drive device path node.
+struct HardDriveNode {
+  UINT32 partition = 1;
+  UINT64 start = 0;   // first block
+  UINT64 blocks = 0;  // number of blocks
+  UINT8 signature[16] = {};
+  UINT8 format = 2;         // 1: MBR, 2: GUID partition table
+  UINT8 signatureType = 2;  // 0: none, 1: 32-bit MBR signature, 2: GUID
+  UINT16 length = 42;       // the node's length field
+
+  // A partition of a GUID partition table, signed with `guid`.
+  static HardDriveNode Gpt(const EFI_GUID &guid, UINT32 partition = 1);
+  // A partition of an MBR disk whose 32-bit signature is `diskSignature`.
+  static HardDriveNode Mbr(UINT32 diskSignature, UINT32 partition = 1);
+};
+
 class Firmware {
  public:
   Firmware();
@@ -200,6 +251,28 @@ class Firmware {
 
   // --- Configuration tables -----------------------------------------------
   void AddConfigurationTable(const EFI_GUID &guid, void *table);
+
+  // --- Data Hub -------------------------------------------------------------
+  // Logs a record in the Data Hub, which is installed with the first record.
+  // The record has the layout of the vendor's platform records: the standard
+  // header naming `producer`, 16 bytes of the producer's own, the sizes of
+  // name and value, the name in UCS-2 with its NUL unit, then the value.
+  void AddDataHubRecord(const EFI_GUID &producer, const std::u16string &name, const std::vector<uint8_t> &value);
+  // A record whose bytes behind the 72-byte standard header are `data` as
+  // given, sizes and all; the header's RecordSize is always the true size.
+  void AddDataHubRecordData(const EFI_GUID &producer, const std::vector<uint8_t> &data);
+
+  // --- ACPI -------------------------------------------------------------------
+  // Builds a set of ACPI tables in the firmware's ACPI memory (see
+  // AcpiOptions) and enters its RSDP in the configuration table under each
+  // of `options.configurationGuids`, in order. Each call builds a new set.
+  AcpiTables InstallAcpi(const AcpiOptions &options);
+
+  // --- Partitions ---------------------------------------------------------------
+  // Replaces the device path of `handle` (a device of AddBlockDevice or any
+  // handle with a path) by its nodes up to the first hard-drive node,
+  // followed by `nodes` and the end node.
+  void SetHardDrivePath(EFI_HANDLE handle, const std::vector<HardDriveNode> &nodes);
 
   // --- ExitBootServices ---------------------------------------------------
   bool BootServicesExited() const;

@@ -9,6 +9,7 @@
 #include <string>
 #include <vector>
 
+#include "efi/datahub.h"
 #include "hostfw/hostfw.h"
 
 namespace hostfw {
@@ -115,6 +116,16 @@ struct BlockDevice {
   UINT64 size;    // of the view, in bytes
 };
 
+// --- Data Hub -------------------------------------------------------------------
+
+struct DataHub {
+  EFI_DATA_HUB_PROTOCOL protocol;
+  EFI_HANDLE handle = nullptr;
+  // Each record is exactly as long as its RecordSize says; the record at
+  // index i has the monotonic count i + 1.
+  std::vector<std::vector<uint8_t>> records;
+};
+
 // --- Runs -----------------------------------------------------------------------
 
 // One Run or Call in progress: where Exit, ResetSystem and the call gate
@@ -187,6 +198,9 @@ struct Firmware::State {
   std::map<std::string, int64_t> fileTimes;  // by canonical host path
   std::vector<std::unique_ptr<BlockDevice>> blockDevices;
 
+  // The Data Hub, made with its first record (datahub.cpp).
+  std::unique_ptr<DataHub> dataHub;
+
   // Runs and faults.
   std::vector<std::unique_ptr<RunFrame>> runs;
   std::vector<Fault> faults;
@@ -216,6 +230,9 @@ bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *pr
 // The same for the runtime services, which stay callable after ExitBootServices.
 bool RefusedAtRuntime(State &s, const char *name, EFI_STATUS *failure);
 
+// The innermost Run or Call; `what` is what needs one, for the message when
+// there is none (a misuse: the code under test belongs in Firmware::Call).
+RunFrame &CurrentRun(State &s, const char *what);
 // Ends the innermost Run or Call.
 [[noreturn]] void EndRun(State &s, RunEnd end, EFI_STATUS status);
 

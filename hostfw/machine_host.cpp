@@ -5,18 +5,16 @@
 
 namespace nimb {
 
+// Outside a run there is nothing to record it in, and nothing to protect.
 void MachineDisableInterrupts() {
   hostfw::State &s = hostfw::Services::Active();
-  if (s.runs.empty())
-    hostfw::Misuse("MachineDisableInterrupts outside Firmware::Run or Call");
-  s.runs.back()->result.interruptsDisabled = true;
+  if (!s.runs.empty())
+    s.runs.back()->result.interruptsDisabled = true;
 }
 
 void MachineCallGate(UINT64 gate, UINT64 argument, UINT64 target) {
   hostfw::State &s = hostfw::Services::Active();
-  if (s.runs.empty())
-    hostfw::Misuse("MachineCallGate outside Firmware::Run or Call");
-  hostfw::RunResult &result = s.runs.back()->result;
+  hostfw::RunResult &result = hostfw::CurrentRun(s, "the call gate").result;
   result.gateAddress = gate;
   result.gateArgument = argument;
   result.gateTarget = target;

@@ -162,9 +162,7 @@ VOID EFIAPI ResetSystem(EFI_RESET_TYPE ResetType, EFI_STATUS ResetStatus, UINTN,
   EFI_STATUS failure;
   if (RefusedAtRuntime(s, "ResetSystem", &failure))
     return;
-  if (s.runs.empty())
-    Misuse("ResetSystem outside Firmware::Run or Call");
-  s.runs.back()->result.resetType = ResetType;
+  CurrentRun(s, "ResetSystem").result.resetType = ResetType;
   EndRun(s, RunEnd::Reset, ResetStatus);
 }
 

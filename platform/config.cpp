@@ -68,7 +68,9 @@ constexpr ConfigKey kConfigKeys[] = {
 
 // --- lines ---------------------------------------------------------------------
 
-bool IsBlank(char c) { return c == ' ' || c == '\t'; }
+bool IsBlank(char c) {
+  return c == ' ' || c == '\t';
+}
 
 // Drops blanks at both ends of [start, end) and ends the text with a NUL.
 char *Trim(char *start, char *end) {

@@ -8,13 +8,74 @@
 // are reported and ignored; a line without `=` or a value that its key
 // refuses is an error.
 //
+// Keys:
+//   loader=<path>          the loader on this volume; \EFI\BOOT\nimbboot.efi
+//   options=<text>         the loader's load options; none when absent
+//   console=text|graphics  the console mode the loader finds; graphics
+//   hold=<seconds>         wait between the report and the power-off, 0 to
+//                          3600; 0
+//   keys=<key>+<key>...    the keys held down at start, as the key state
+//                          protocol reports them. Modifiers: ctrl, shift,
+//                          alt, gui (left ones; also lctrl, lshift, lalt,
+//                          lgui) and rctrl, rshift, ralt, rgui. Keys: a to z,
+//                          0 to 9, or a keyboard usage in hexadecimal (0x28).
+//                          At most kMaxHeldKeys keys, each once; the order is
+//                          the order of the report. Names are lower-case.
+//                          Empty or absent: nothing held
+//   keys-ignored=0|1       the boot policy's answer: 1 tells the loader not
+//                          to read the held keys; 0
+//   nvram.<name>=<text>    the NVRAM variable <name> under the loader's vendor
+//                          GUID, set to the text's UTF-8 bytes without a
+//                          terminator, non-volatile, boot and runtime access
+//   nvram-hex.<name>=<hex> the same with the bytes in hexadecimal, two digits
+//                          each, blanks allowed between bytes
+//   datahub.<name>=<text>  a Data Hub record of the vendor's platform producer
+//                          named <name>, whose value is the text in UCS-2 with
+//                          a NUL unit behind it
+//   datahub-hex.<name>=<hex>  the same with raw bytes for the value (may be
+//                          empty)
+// NVRAM values may not be empty (an empty variable cannot exist). The text
+// and hexadecimal forms of one name are one variable or one record: the
+// later line wins. Records and variables keep the order of their first line.
+// Without any key there is still a key state protocol (nothing held), a boot
+// policy protocol (answering 0) and a Data Hub (no vendor records).
+//
 // A new key is a field below, a function that checks and stores its value,
-// and a row of the key table in config.cpp.
+// and a row of the key table in config.cpp. Values stay in the file's buffer,
+// which lives as long as the platform layer, so a key that may come on many
+// lines (one per variable or record) keeps a list of pointers.
 #pragma once
 
 #include "efi/efi.h"
 
 namespace nimb::platform {
+
+constexpr UINT32 kMaxHeldKeys = 8;
+constexpr UINT32 kMaxConfigEntries = 32;
+
+// The keyboard as the key state protocol reports it: the modifier mask of a
+// USB HID keyboard report and key values of 0x7000 plus the usage.
+struct HeldKeys {
+  UINT16 modifiers;
+  UINT32 count;
+  UINT16 keys[kMaxHeldKeys];
+};
+
+// One variable or record: the name behind the key's prefix and the value,
+// both in the file's buffer.
+struct ConfigEntry {
+  const char *name;
+  const UINT8 *bytes;
+  UINT32 size;
+  // The value is UTF-8 text (ending in a NUL behind `size` bytes), not bytes
+  // given in hexadecimal.
+  bool text;
+};
+
+struct ConfigEntryList {
+  UINT32 count;
+  ConfigEntry entries[kMaxConfigEntries];
+};
 
 struct PlatformConfig {
   // The loader's path on the platform's own volume.
@@ -26,6 +87,10 @@ struct PlatformConfig {
   EFI_CONSOLE_CONTROL_SCREEN_MODE consoleMode;
   // Seconds to wait between the report and the power-off.
   UINT32 holdSeconds;
+  HeldKeys keys;
+  bool keysIgnored;
+  ConfigEntryList nvram;
+  ConfigEntryList dataHub;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";

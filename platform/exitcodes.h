@@ -24,7 +24,7 @@ constexpr UINT8 kExitLoadImageFailed = 0x22;
 constexpr UINT8 kExitPlatformFailed = 0x23;
 
 constexpr UINT8 ExitCodeForOutcome(EFI_STATUS status, bool memoryChanged) {
-  const UINT8 same = status == EFI_ABORTED ? kExitAbortedSame
+  const UINT8 same = status == EFI_ABORTED   ? kExitAbortedSame
                      : status == EFI_SUCCESS ? kExitSuccessSame
                                              : kExitOtherSame;
   return static_cast<UINT8>(same + (memoryChanged ? 1 : 0));

@@ -20,4 +20,7 @@ struct FILEPATH_DEVICE_PATH {
   CHAR16 PathName[1];
 };
 
+// Room for a file's EFI_FILE_INFO with a name of up to 511 characters.
+constexpr UINTN kFileInfoBufferSize = SIZE_OF_EFI_FILE_INFO + 512 * sizeof(CHAR16);
+
 }  // namespace nimb::platform

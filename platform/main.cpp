@@ -19,8 +19,6 @@ namespace {
 constexpr UINT16 kDebugExitPort = 0xF4;
 constexpr const CHAR16 *kConfigPath = u"\\EFI\\BOOT\\platform.cfg";
 constexpr const char *kConfigName = "platform.cfg";
-constexpr UINTN kFileInfoSize = SIZE_OF_EFI_FILE_INFO + 512 * sizeof(CHAR16);
-constexpr UINT32 kWarmDepth = 8;
 
 PlatformConsole gConsole;
 MemoryMeter gMeter;
@@ -65,15 +63,16 @@ CHAR16 *WideCopyOrFail(const char *text, const char *what, UINTN *units) {
 void ReportConfigIssue(const ConfigIssue &issue, void *) {
   switch (issue.problem) {
     case kConfigUnknownKey:
-      SerialPrintf("platform: %s line %u: unknown key '%s' ignored\n", kConfigName, static_cast<UINT64>(issue.line),
-                   issue.key);
+      SerialPrintf("platform: %s line %u: unknown key '%s' ignored\n", kConfigName,
+                   static_cast<UINT64>(issue.line), issue.key);
       break;
     case kConfigNoEquals:
-      SerialPrintf("platform: %s line %u: no '=' in '%s'\n", kConfigName, static_cast<UINT64>(issue.line), issue.key);
+      SerialPrintf("platform: %s line %u: no '=' in '%s'\n", kConfigName, static_cast<UINT64>(issue.line),
+                   issue.key);
       break;
     case kConfigBadValue:
-      SerialPrintf("platform: %s line %u: bad value '%s' for '%s'\n", kConfigName, static_cast<UINT64>(issue.line),
-                   issue.value, issue.key);
+      SerialPrintf("platform: %s line %u: bad value '%s' for '%s'\n", kConfigName,
+                   static_cast<UINT64>(issue.line), issue.value, issue.key);
       break;
   }
 }
@@ -91,7 +90,7 @@ void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
   if (EFI_ERROR(status)) {
     Fail(kExitConfigInvalid, "cannot open %s (%s)", kConfigName, StatusName(status));
   }
-  UINT64 infoBuffer[kFileInfoSize / sizeof(UINT64)];
+  UINT64 infoBuffer[kFileInfoBufferSize / sizeof(UINT64)];
   UINTN infoSize = sizeof(infoBuffer);
   status = file->GetInfo(file, &gEfiFileInfoGuid, &infoSize, infoBuffer);
   if (EFI_ERROR(status)) {
@@ -124,7 +123,8 @@ EFI_DEVICE_PATH_PROTOCOL *FileDevicePath(EFI_HANDLE device, const CHAR16 *path, 
   const UINT8 *deviceBytes = static_cast<const UINT8 *>(interface);
   UINTN deviceSize = 0;
   for (;;) {
-    const EFI_DEVICE_PATH_PROTOCOL *node = reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(deviceBytes + deviceSize);
+    const EFI_DEVICE_PATH_PROTOCOL *node =
+        reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(deviceBytes + deviceSize);
     const UINTN length = DevicePathNodeLength(node);
     if (node->Type == END_DEVICE_PATH_TYPE || length < sizeof(EFI_DEVICE_PATH_PROTOCOL)) {
       break;
@@ -135,41 +135,15 @@ EFI_DEVICE_PATH_PROTOCOL *FileDevicePath(EFI_HANDLE device, const CHAR16 *path, 
   const UINTN totalSize = deviceSize + fileNodeSize + sizeof(EFI_DEVICE_PATH_PROTOCOL);
   UINT8 *bytes = static_cast<UINT8 *>(AllocateOrFail(totalSize, "the loader's device path"));
   gBS->CopyMem(bytes, deviceBytes, deviceSize);
-  const EFI_DEVICE_PATH_PROTOCOL fileHeader = {MEDIA_DEVICE_PATH, MEDIA_FILEPATH_DP,
-                                               {static_cast<UINT8>(fileNodeSize), static_cast<UINT8>(fileNodeSize >> 8)}};
+  const EFI_DEVICE_PATH_PROTOCOL fileHeader = {
+      MEDIA_DEVICE_PATH,
+      MEDIA_FILEPATH_DP,
+      {static_cast<UINT8>(fileNodeSize), static_cast<UINT8>(fileNodeSize >> 8)}};
   gBS->CopyMem(bytes + deviceSize, &fileHeader, sizeof(fileHeader));
   gBS->CopyMem(bytes + deviceSize + sizeof(fileHeader), path, (pathUnits + 1) * sizeof(CHAR16));
   const EFI_DEVICE_PATH_PROTOCOL end = {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}};
   gBS->CopyMem(bytes + deviceSize + fileNodeSize, &end, sizeof(end));
   return reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(bytes);
-}
-
-// Opens every directory of the volume and reads it to its end, then closes
-// it. The file system driver keeps what it learnt of a closed directory in a
-// cache of its own that it does not give back; filled here, before the first
-// measurement, the cache no longer grows when the loader opens directories,
-// and the loader's run leaves the free memory as it found it.
-UINTN WarmDirectoryCache(EFI_FILE_PROTOCOL *directory, UINT32 depth) {
-  UINTN directories = 1;
-  UINT64 infoBuffer[kFileInfoSize / sizeof(UINT64)];
-  EFI_FILE_INFO *info = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer);
-  for (;;) {
-    UINTN size = sizeof(infoBuffer);
-    if (EFI_ERROR(directory->Read(directory, &size, infoBuffer)) || size == 0) {
-      break;
-    }
-    const bool dot = info->FileName[0] == u'.' &&
-                     (info->FileName[1] == 0 || (info->FileName[1] == u'.' && info->FileName[2] == 0));
-    if ((info->Attribute & EFI_FILE_DIRECTORY) == 0 || dot || depth >= kWarmDepth) {
-      continue;
-    }
-    EFI_FILE_PROTOCOL *child = nullptr;
-    if (!EFI_ERROR(directory->Open(directory, &child, info->FileName, EFI_FILE_MODE_READ, 0))) {
-      directories += WarmDirectoryCache(child, depth + 1);
-      child->Close(child);
-    }
-  }
-  return directories;
 }
 
 UINT64 FreePagesOrFail(const char *when) {
@@ -179,6 +153,80 @@ UINT64 FreePagesOrFail(const char *when) {
     Fail(kExitPlatformFailed, "cannot read the memory map %s (%s)", when, StatusName(status));
   }
   return pages;
+}
+
+// The root of the volume that the platform layer was started from.
+EFI_FILE_PROTOCOL *OpenOwnVolume(EFI_HANDLE *device) {
+  void *interface = nullptr;
+  EFI_STATUS status = gBS->HandleProtocol(gImageHandle, &gEfiLoadedImageProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no loaded image (%s)", StatusName(status));
+  }
+  *device = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface)->DeviceHandle;
+  status = gBS->HandleProtocol(*device, &gEfiSimpleFileSystemProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no file system on the boot device (%s)", StatusName(status));
+  }
+  EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *volume = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(interface);
+  EFI_FILE_PROTOCOL *root = nullptr;
+  status = volume->OpenVolume(volume, &root);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot open the boot volume (%s)", StatusName(status));
+  }
+  return root;
+}
+
+// What StartImage needs of the loader, made ready before any measurement.
+struct LoaderLaunch {
+  EFI_DEVICE_PATH_PROTOCOL *devicePath;
+  CHAR16 *options;  // null: the loader gets none
+  UINT32 optionsSize;
+};
+
+LoaderLaunch PrepareLoader(EFI_FILE_PROTOCOL *root, EFI_HANDLE device, const PlatformConfig &config) {
+  UINTN pathUnits = 0;
+  const CHAR16 *path = WideCopyOrFail(config.loaderPath, "the loader's path", &pathUnits);
+  EFI_FILE_PROTOCOL *file = nullptr;
+  const EFI_STATUS status = root->Open(root, &file, path, EFI_FILE_MODE_READ, 0);
+  if (EFI_ERROR(status)) {
+    Fail(kExitLoaderMissing, "loader %s not found (%s)", config.loaderPath, StatusName(status));
+  }
+  file->Close(file);
+  LoaderLaunch launch = {FileDevicePath(device, path, pathUnits), nullptr, 0};
+  if (config.options != nullptr) {
+    UINTN units = 0;
+    launch.options = WideCopyOrFail(config.options, "the load options", &units);
+    launch.optionsSize = static_cast<UINT32>((units + 1) * sizeof(CHAR16));
+  }
+  return launch;
+}
+
+// The protocols of the machines that the loader was made for, which the
+// firmware lacks.
+void InstallProtocols(const PlatformConfig &config) {
+  const EFI_STATUS status = ConsoleControlInstall(&gConsole, config.consoleMode);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
+  }
+}
+
+EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
+  EFI_HANDLE loader = nullptr;
+  EFI_STATUS status = gBS->LoadImage(FALSE, gImageHandle, launch.devicePath, nullptr, 0, &loader);
+  if (EFI_ERROR(status)) {
+    Fail(kExitLoadImageFailed, "cannot load %s (%s)", config.loaderPath, StatusName(status));
+  }
+  void *interface = nullptr;
+  status = gBS->HandleProtocol(loader, &gEfiLoadedImageProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitLoadImageFailed, "no loaded image for %s (%s)", config.loaderPath, StatusName(status));
+  }
+  if (launch.options != nullptr) {
+    EFI_LOADED_IMAGE_PROTOCOL *image = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface);
+    image->LoadOptions = launch.options;
+    image->LoadOptionsSize = launch.optionsSize;
+  }
+  return gBS->StartImage(loader, nullptr, nullptr);
 }
 
 }  // namespace
@@ -192,50 +240,17 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   gBS->SetWatchdogTimer(0, 0, 0, nullptr);
   SerialPrintf("\nplatform: started\n");
 
-  void *interface = nullptr;
-  EFI_STATUS status = gBS->HandleProtocol(ImageHandle, &gEfiLoadedImageProtocolGuid, &interface);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "no loaded image (%s)", StatusName(status));
-  }
-  const EFI_HANDLE device = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface)->DeviceHandle;
-  status = gBS->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid, &interface);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "no file system on the boot device (%s)", StatusName(status));
-  }
-  EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *volume = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(interface);
-  EFI_FILE_PROTOCOL *root = nullptr;
-  status = volume->OpenVolume(volume, &root);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "cannot open the boot volume (%s)", StatusName(status));
-  }
-
+  // Everything that allocates comes before the first measurement.
+  EFI_HANDLE device = nullptr;
+  EFI_FILE_PROTOCOL *root = OpenOwnVolume(&device);
   PlatformConfig config;
   ReadConfig(root, &config);
-
-  UINTN pathUnits = 0;
-  const CHAR16 *loaderPath = WideCopyOrFail(config.loaderPath, "the loader's path", &pathUnits);
-  EFI_FILE_PROTOCOL *loaderFile = nullptr;
-  status = root->Open(root, &loaderFile, loaderPath, EFI_FILE_MODE_READ, 0);
-  if (EFI_ERROR(status)) {
-    Fail(kExitLoaderMissing, "loader %s not found (%s)", config.loaderPath, StatusName(status));
-  }
-  loaderFile->Close(loaderFile);
-  const UINTN directories = WarmDirectoryCache(root, 0);
+  const LoaderLaunch launch = PrepareLoader(root, device, config);
+  const UINTN directories = MemoryWarmDirectoryCache(root);
   root->Close(root);
-  EFI_DEVICE_PATH_PROTOCOL *loaderDevicePath = FileDevicePath(device, loaderPath, pathUnits);
-
-  CHAR16 *options = nullptr;
-  UINTN optionUnits = 0;
-  if (config.options != nullptr) {
-    options = WideCopyOrFail(config.options, "the load options", &optionUnits);
-  }
-
-  status = ConsoleControlInstall(&gConsole, config.consoleMode);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
-  }
+  InstallProtocols(config);
   MemoryStockPool();
-  status = MemoryMeterInit(&gMeter);
+  const EFI_STATUS status = MemoryMeterInit(&gMeter);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot size the memory map (%s)", StatusName(status));
   }
@@ -243,21 +258,7 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
                config.consoleMode == EfiConsoleControlScreenText ? "text" : "graphics", directories);
 
   const UINT64 pagesBefore = FreePagesOrFail("before the loader");
-  EFI_HANDLE loader = nullptr;
-  status = gBS->LoadImage(FALSE, ImageHandle, loaderDevicePath, nullptr, 0, &loader);
-  if (EFI_ERROR(status)) {
-    Fail(kExitLoadImageFailed, "cannot load %s (%s)", config.loaderPath, StatusName(status));
-  }
-  status = gBS->HandleProtocol(loader, &gEfiLoadedImageProtocolGuid, &interface);
-  if (EFI_ERROR(status)) {
-    Fail(kExitLoadImageFailed, "no loaded image for %s (%s)", config.loaderPath, StatusName(status));
-  }
-  EFI_LOADED_IMAGE_PROTOCOL *loaderImage = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface);
-  if (options != nullptr) {
-    loaderImage->LoadOptions = options;
-    loaderImage->LoadOptionsSize = static_cast<UINT32>((optionUnits + 1) * sizeof(CHAR16));
-  }
-  const EFI_STATUS loaderStatus = gBS->StartImage(loader, nullptr, nullptr);
+  const EFI_STATUS loaderStatus = RunLoader(launch, config);
   const UINT64 pagesAfter = FreePagesOrFail("after the loader");
 
   SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));

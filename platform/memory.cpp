@@ -10,14 +10,46 @@ namespace {
 // measurements may split a region in two.
 constexpr UINTN kSpareDescriptors = 256;
 
-// The pool's stock: for each of these sizes, blocks of that size are taken
-// until kStockPages pages that hold nothing else have been seen; then all are
-// given back but the first block of each page.
+// The pool's stock: blocks of each of these sizes (spread over the pool's
+// size classes, up to the largest that the pool serves from its own pages)
+// are taken until they have spread over more than kStockPages pages, then
+// all are given back but the first block in each page, which keeps that page
+// and the free rest of it in the pool.
 constexpr UINTN kStockSizes[] = {24, 56, 120, 248, 504, 1016, 2000};
 constexpr UINTN kStockPages = 4;
 constexpr UINTN kStockBlocks = 512;
 
+// How deep the directory walk goes.
+constexpr UINT32 kWarmDepth = 8;
+
+UINTN WarmDirectory(EFI_FILE_PROTOCOL *directory, UINT32 depth) {
+  UINTN directories = 1;
+  UINT64 infoBuffer[kFileInfoBufferSize / sizeof(UINT64)];
+  EFI_FILE_INFO *info = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer);
+  for (;;) {
+    UINTN size = sizeof(infoBuffer);
+    if (EFI_ERROR(directory->Read(directory, &size, infoBuffer)) || size == 0) {
+      break;
+    }
+    const bool dot = info->FileName[0] == u'.' &&
+                     (info->FileName[1] == 0 || (info->FileName[1] == u'.' && info->FileName[2] == 0));
+    if ((info->Attribute & EFI_FILE_DIRECTORY) == 0 || dot || depth >= kWarmDepth) {
+      continue;
+    }
+    EFI_FILE_PROTOCOL *child = nullptr;
+    if (!EFI_ERROR(directory->Open(directory, &child, info->FileName, EFI_FILE_MODE_READ, 0))) {
+      directories += WarmDirectory(child, depth + 1);
+      child->Close(child);
+    }
+  }
+  return directories;
+}
+
 }  // namespace
+
+UINTN MemoryWarmDirectoryCache(EFI_FILE_PROTOCOL *root) {
+  return WarmDirectory(root, 0);
+}
 
 void MemoryStockPool() {
   void *blocks[kStockBlocks];

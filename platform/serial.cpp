@@ -33,7 +33,9 @@ void SerialOutput(char character, void *) {
 
 }  // namespace
 
-void SerialPrintv(const char *format, va_list arguments) { FormatText(SerialOutput, nullptr, format, arguments); }
+void SerialPrintv(const char *format, va_list arguments) {
+  FormatText(SerialOutput, nullptr, format, arguments);
+}
 
 void SerialPrintf(const char *format, ...) {
   va_list arguments;

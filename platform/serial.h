@@ -15,7 +15,9 @@ void SerialPrintf(const char *format, ...);
 void SerialPrintv(const char *format, va_list arguments);
 
 // Port I/O for the machine's own devices.
-inline void PortWriteByte(UINT16 port, UINT8 value) { __asm__ volatile("outb %0, %1" : : "a"(value), "Nd"(port)); }
+inline void PortWriteByte(UINT16 port, UINT8 value) {
+  __asm__ volatile("outb %0, %1" : : "a"(value), "Nd"(port));
+}
 
 inline UINT8 PortReadByte(UINT16 port) {
   UINT8 value;

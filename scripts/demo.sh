@@ -7,5 +7,5 @@ cd "$(dirname "$0")/.."
 bash scripts/install-deps.sh
 cmake --preset host
 cmake --build --preset host
-python3 tests/qemu/harness.py --demo --efi-dir build/efi
+python3 -B tests/qemu/harness.py --demo --efi-dir build/efi
 echo "demo: the screenshot is $(pwd)/out/demo-screen.png"

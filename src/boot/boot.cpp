@@ -1,9 +1,11 @@
 #include "boot/boot.h"
 
+#include "boot/bootinfo.h"
 #include "boot/gate.h"
 #include "boot/machine.h"
 #include "boot/volume.h"
 #include "config/boot_options.h"
+#include "devicetree/platform.h"
 #include "load/kernel.h"
 #include "memory/tracking.h"
 #include "screen/console.h"
@@ -45,6 +47,9 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
     Fatal("Can not initialize console\n");
   }
 
+  // The device tree starts here; all later tree work depends on it.
+  InitPlatformDescription();
+
   EFI_STATUS status = CopyCallGate();
   if (EFI_ERROR(status)) {
     Fatal("Could not allocate kernel call gate (%x)\n", status);
@@ -77,6 +82,12 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
   if (EFI_ERROR(LoadKernelFile(volume.loadFile, volume.root))) {
     Fatal("Error loading kernel '%S'\n", gKernelName);
   }
+
+  // The record goes to the top of the kernel region, which exists only now.
+  InitBootInfo(gLoadedImage, gBootOptions);
+
+  // This build has no final hand-off yet: without it boot services cannot be
+  // left, so the gate is never called.
 
   Fatal("Kernel entry failed\n");
 }

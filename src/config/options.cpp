@@ -129,7 +129,7 @@ static BOOLEAN HasKey(const char *textWord, const char *key, UINT64 keyLength) {
     }
   }
   const char behind = textWord[keyLength];
-  return TRUE;
+  return behind == '\0' || behind == '=' || IsBlank(behind);
 }
 
 char *AppendOption(char *base, char *end, const char *word, UINT64 keyLength, UINT64 wordLength) {

@@ -313,9 +313,12 @@ PlistTag *PlistNewTag() {
     if (block == nullptr) {
       return nullptr;
     }
-    bzero(block, kPlistTagBlockSize);
-    for (UINTN i = 0; i + 1 < kPlistTagsPerBlock; i++) {
-      block[i].next = &block[i + 1];
+    // Cleared field by field in the same pass that links the records.
+    for (UINTN i = 0; i < kPlistTagsPerBlock; i++) {
+      block[i].type = 0;
+      block[i].text = nullptr;
+      block[i].child = nullptr;
+      block[i].next = i + 1 < kPlistTagsPerBlock ? &block[i + 1] : nullptr;
     }
     gPlistFreeTags = block;
   }

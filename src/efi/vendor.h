@@ -38,3 +38,26 @@ constexpr UINT16 kKeyV = 0x7019;
 
 static_assert(offsetof(NIMB_BOOT_POLICY_PROTOCOL, GetKeysIgnored) == 0x20, "the fifth entry");
 static_assert(offsetof(NIMB_KEY_STATE_PROTOCOL, ReadKeyState) == 0x08, "the second entry");
+
+// The answers of a network boot's servers: the DHCP answer (first entry)
+// and the boot-service discovery answer (second entry). A size of 0 and a
+// null buffer ask for the size.
+struct NIMB_NET_BOOT_INFO_PROTOCOL {
+  EFI_STATUS(EFIAPI *GetDhcpResponse)(NIMB_NET_BOOT_INFO_PROTOCOL *This, UINTN *BufferSize, VOID *Buffer);
+  EFI_STATUS(EFIAPI *GetBsdpResponse)(NIMB_NET_BOOT_INFO_PROTOCOL *This, UINTN *BufferSize, VOID *Buffer);
+};
+
+inline const EFI_GUID gNimbNetBootInfoProtocolGuid =
+    EFI_GUID_VALUE(0x78EE99FB, 0x6A5E, 0x4186, 0x97, 0xDE, 0xCD, 0x0A, 0xBA, 0x34, 0x5A, 0x74);
+
+// The firmware's blob of device properties for the kernel (fifth entry).
+struct NIMB_DEVICE_PROPERTIES_PROTOCOL {
+  void *Reserved[4];
+  EFI_STATUS(EFIAPI *GetProperties)(NIMB_DEVICE_PROPERTIES_PROTOCOL *This, VOID *Buffer, UINT32 *BufferSize);
+};
+
+inline const EFI_GUID gNimbDevicePropertiesProtocolGuid =
+    EFI_GUID_VALUE(0x91BD12FE, 0xF6C3, 0x44FB, 0xA5, 0xB7, 0x51, 0x22, 0xAB, 0x30, 0x3A, 0xE0);
+
+static_assert(offsetof(NIMB_NET_BOOT_INFO_PROTOCOL, GetBsdpResponse) == 0x08, "the second entry");
+static_assert(offsetof(NIMB_DEVICE_PROPERTIES_PROTOCOL, GetProperties) == 0x20, "the fifth entry");

@@ -10,7 +10,7 @@ namespace nimb {
 static constexpr UINT32 kAdlerModulus = 65521;
 // Bytes summed between two reductions. With both sums below the modulus at
 // the start of a chunk, 5000 bytes of 0xFF leave s2 below 2^32.
-static constexpr UINT64 kAdlerChunk = 50000;
+static constexpr UINT64 kAdlerChunk = 5000;
 
 UINT32 Adler32(const void *data, UINT64 length) {
   const UINT8 *bytes = static_cast<const UINT8 *>(data);

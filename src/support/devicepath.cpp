@@ -26,7 +26,7 @@ static const EFI_DEVICE_PATH_PROTOCOL *CheckNode(const EFI_DEVICE_PATH_PROTOCOL 
     return node;
   }
   const UINTN length = DevicePathNodeLength(node);
-  if (length > remaining) {
+  if (length < kDevicePathNodeHeadSize || length > remaining) {
     return nullptr;
   }
   return node;

@@ -58,32 +58,116 @@ TEST(PlatformConfig, ParsesLinesKeysAndValues) {
        12,
        0,
        {}},
-      {"value keeps inner blanks and later '='", "options= a=b  c \n", kDefault, "a=b  c", kGraphics, 0, 0, {}},
+      {"value keeps inner blanks and later '='",
+       "options= a=b  c \n",
+       kDefault,
+       "a=b  c",
+       kGraphics,
+       0,
+       0,
+       {}},
       {"empty options are options", "options=\n", kDefault, "", kGraphics, 0, 0, {}},
-      {"quotes keep blanks and resolve escapes", "options=\"  \\t-v\\n\\\"q\\\"\\\\ \"\n", kDefault,
-       "  \t-v\n\"q\"\\ ", kGraphics, 0, 0, {}},
+      {"quotes keep blanks and resolve escapes",
+       "options=\"  \\t-v\\n\\\"q\\\"\\\\ \"\n",
+       kDefault,
+       "  \t-v\n\"q\"\\ ",
+       kGraphics,
+       0,
+       0,
+       {}},
       {"later key wins", "hold=1\nhold=2\n", kDefault, nullptr, kGraphics, 2, 0, {}},
-      {"unknown key is reported, not an error", "colour=blue\nhold=1\n", kDefault, nullptr, kGraphics, 1, 0,
+      {"unknown key is reported, not an error",
+       "colour=blue\nhold=1\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       1,
+       0,
        {{kConfigUnknownKey, 1, "colour"}}},
-      {"keys are case-sensitive", "Hold=1\n", kDefault, nullptr, kGraphics, 0, 0, {{kConfigUnknownKey, 1, "Hold"}}},
-      {"line without '='", "hold 3\nconsole=text\n", kDefault, nullptr, kText, 0, 1, {{kConfigNoEquals, 1, "hold 3"}}},
+      {"keys are case-sensitive",
+       "Hold=1\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       0,
+       0,
+       {{kConfigUnknownKey, 1, "Hold"}}},
+      {"line without '='",
+       "hold 3\nconsole=text\n",
+       kDefault,
+       nullptr,
+       kText,
+       0,
+       1,
+       {{kConfigNoEquals, 1, "hold 3"}}},
       {"bad console", "console=vga\n", kDefault, nullptr, kGraphics, 0, 1, {{kConfigBadValue, 1, "console"}}},
-      {"hold not a number", "\nhold=3s\n", kDefault, nullptr, kGraphics, 0, 1, {{kConfigBadValue, 2, "hold"}}},
+      {"hold not a number",
+       "\nhold=3s\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       0,
+       1,
+       {{kConfigBadValue, 2, "hold"}}},
       {"hold negative", "hold=-1\n", kDefault, nullptr, kGraphics, 0, 1, {{kConfigBadValue, 1, "hold"}}},
       {"hold too long", "hold=3601\n", kDefault, nullptr, kGraphics, 0, 1, {{kConfigBadValue, 1, "hold"}}},
       {"hold at its limit", "hold=3600\n", kDefault, nullptr, kGraphics, 3600, 0, {}},
       {"empty loader", "loader=\n", kDefault, nullptr, kGraphics, 0, 1, {{kConfigBadValue, 1, "loader"}}},
-      {"unterminated quote", "options=\"-v\n", kDefault, nullptr, kGraphics, 0, 1, {{kConfigBadValue, 1, "options"}}},
-      {"quote inside quotes", "options=\"a\"b\"\n", kDefault, nullptr, kGraphics, 0, 1,
+      {"unterminated quote",
+       "options=\"-v\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       0,
+       1,
        {{kConfigBadValue, 1, "options"}}},
-      {"escaped closing quote", "options=\"a\\\"\n", kDefault, nullptr, kGraphics, 0, 1,
+      {"quote inside quotes",
+       "options=\"a\"b\"\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       0,
+       1,
        {{kConfigBadValue, 1, "options"}}},
-      {"unknown escape", "options=\"\\q\"\n", kDefault, nullptr, kGraphics, 0, 1, {{kConfigBadValue, 1, "options"}}},
-      {"options beyond UCS-2", "options=\xF0\x9F\x98\x80\n", kDefault, nullptr, kGraphics, 0, 1,
+      {"escaped closing quote",
+       "options=\"a\\\"\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       0,
+       1,
        {{kConfigBadValue, 1, "options"}}},
-      {"errors are counted, parsing goes on", "x\ny\nhold=2\n", kDefault, nullptr, kGraphics, 2, 2,
+      {"unknown escape",
+       "options=\"\\q\"\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       0,
+       1,
+       {{kConfigBadValue, 1, "options"}}},
+      {"options beyond UCS-2",
+       "options=\xF0\x9F\x98\x80\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       0,
+       1,
+       {{kConfigBadValue, 1, "options"}}},
+      {"errors are counted, parsing goes on",
+       "x\ny\nhold=2\n",
+       kDefault,
+       nullptr,
+       kGraphics,
+       2,
+       2,
        {{kConfigNoEquals, 1, "x"}, {kConfigNoEquals, 2, "y"}}},
-      {"NUL ends a line", std::string("hold=1\0junk\nconsole=text", 24), kDefault, nullptr, kText, 1, 1,
+      {"NUL ends a line",
+       std::string("hold=1\0junk\nconsole=text", 24),
+       kDefault,
+       nullptr,
+       kText,
+       1,
+       1,
        {{kConfigNoEquals, 2, "junk"}}},
   };
   for (const ConfigRow &row : rows) {
@@ -150,7 +234,9 @@ TEST(PlatformConfig, ConvertsUtf8ToUcs2) {
 
 // --- report formatting and exit codes --------------------------------------------
 
-void AppendTo(char character, void *context) { static_cast<std::string *>(context)->push_back(character); }
+void AppendTo(char character, void *context) {
+  static_cast<std::string *>(context)->push_back(character);
+}
 
 std::string Formatted(const char *format, ...) {
   std::string text;
@@ -194,9 +280,12 @@ TEST(PlatformExitCodes, TellOutcomesApart) {
     UINT8 code;
   };
   const std::vector<Row> rows = {
-      {EFI_ABORTED, false, kExitAbortedSame}, {EFI_ABORTED, true, kExitAbortedChanged},
-      {EFI_SUCCESS, false, kExitSuccessSame}, {EFI_SUCCESS, true, kExitSuccessChanged},
-      {EFI_NOT_FOUND, false, kExitOtherSame}, {EFI_LOAD_ERROR, true, kExitOtherChanged},
+      {EFI_ABORTED, false, kExitAbortedSame},
+      {EFI_ABORTED, true, kExitAbortedChanged},
+      {EFI_SUCCESS, false, kExitSuccessSame},
+      {EFI_SUCCESS, true, kExitSuccessChanged},
+      {EFI_NOT_FOUND, false, kExitOtherSame},
+      {EFI_LOAD_ERROR, true, kExitOtherChanged},
       {1, false, kExitOtherSame},  // a warning is neither success nor EFI_ABORTED
   };
   for (const Row &row : rows) {
@@ -225,7 +314,7 @@ TEST(PlatformMemory, CountsConventionalPagesByTheFirmwaresStride) {
       {"cut-off tail ignored", 0x30, 0x20},
   };
   const std::vector<std::pair<UINT32, UINT64>> regions = {
-      {EfiConventionalMemory, 100}, {EfiBootServicesData, 7}, {EfiConventionalMemory, 23},
+      {EfiConventionalMemory, 100}, {EfiBootServicesData, 7},   {EfiConventionalMemory, 23},
       {EfiLoaderData, 5},           {EfiConventionalMemory, 1},
   };
   for (const Row &row : rows) {
@@ -268,8 +357,8 @@ EFI_STATUS EFIAPI FakeEnableCursor(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *, BOOLEAN vi
 }
 
 EFI_STATUS EFIAPI FakeBlt(EFI_GRAPHICS_OUTPUT_PROTOCOL *, EFI_GRAPHICS_OUTPUT_BLT_PIXEL *pixel,
-                          EFI_GRAPHICS_OUTPUT_BLT_OPERATION operation, UINTN, UINTN, UINTN x, UINTN y, UINTN width,
-                          UINTN height, UINTN) {
+                          EFI_GRAPHICS_OUTPUT_BLT_OPERATION operation, UINTN, UINTN, UINTN x, UINTN y,
+                          UINTN width, UINTN height, UINTN) {
   const bool black = pixel->Red == 0 && pixel->Green == 0 && pixel->Blue == 0;
   gScreen->calls.push_back("blt " + std::to_string(operation) + (black ? " black " : " colour ") +
                            std::to_string(x) + "," + std::to_string(y) + " " + std::to_string(width) + "x" +
@@ -321,8 +410,9 @@ TEST(PlatformConsole, SwitchesModesOnTheRealConsole) {
     PlatformConsole console;
     ASSERT_EQ(ConsoleControlInit(&console, &firmware.text, &firmware.graphics, row.start), EFI_SUCCESS);
     firmware.screen.calls.clear();
-    EXPECT_EQ(console.protocol.SetMode(&console.protocol, static_cast<EFI_CONSOLE_CONTROL_SCREEN_MODE>(row.wanted)),
-              row.status);
+    EXPECT_EQ(
+        console.protocol.SetMode(&console.protocol, static_cast<EFI_CONSOLE_CONTROL_SCREEN_MODE>(row.wanted)),
+        row.status);
     EXPECT_EQ(firmware.screen.calls, row.calls);
     EFI_CONSOLE_CONTROL_SCREEN_MODE mode = EfiConsoleControlScreenMaxValue;
     BOOLEAN uga = 7;

@@ -279,4 +279,35 @@ TEST_F(BootTest, EveryFatalMessageOfTheBootSequence) {
   Attach();
 }
 
+TEST_F(BootTest, AVerboseBootGoesToTextAndTheFailureRestoresTheScreen) {
+  struct Row {
+    std::u16string options;
+    EFI_CONSOLE_CONTROL_SCREEN_MODE start;
+    std::vector<EFI_CONSOLE_CONTROL_SCREEN_MODE> sets;
+  } rows[] = {
+      {u"-v", EfiConsoleControlScreenGraphics, {EfiConsoleControlScreenText, EfiConsoleControlScreenGraphics}},
+      {u"-v", EfiConsoleControlScreenText, {}},
+      {u"foo=1", EfiConsoleControlScreenGraphics, {}},
+  };
+  for (const Row &row : rows) {
+    hostfw::Firmware local;
+    local.SetConsoleMode(row.start);
+    TempDir dir;
+    local.SetBootDevice(local.AddDirectoryVolume(dir.path()));
+    local.SetLoadOptions(row.options);
+    nimbtest::ResetLoaderState();
+    hostfw::RunResult result = local.Run(BootEntry);
+    EXPECT_EQ(result.status, EFI_ABORTED);
+    std::vector<EFI_CONSOLE_CONTROL_SCREEN_MODE> sets;
+    for (const hostfw::ConsoleModeCall &call : local.ConsoleModeCalls()) {
+      if (call.set) sets.push_back(call.mode);
+    }
+    EXPECT_EQ(sets, row.sets);
+    EXPECT_EQ(local.ConsoleMode(), row.start);
+    EXPECT_EQ(local.LivePoolBlocks(), 0u);
+  }
+  nimbtest::ResetLoaderState();
+  Attach();
+}
+
 }  // namespace

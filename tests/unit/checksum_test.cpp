@@ -105,16 +105,28 @@ TEST(Md5Test, FinalZeroesTheWholeContext) {
   EXPECT_EQ(Hex(digest, 16), "900150983cd24fb0d6963f7d28e17f72");
 }
 
-TEST(Md5Test, TransformIsOneRoundOverABlock) {
-  // The padded block of the empty message, transformed from the initial
-  // state, is the digest of the empty message.
-  UINT32 state[4] = {0x67452301, 0xEFCDAB89, 0x98BADCFE, 0x10325476};
-  UINT8 block[64] = {0x80};
-  nimb::Md5Transform(state, block);
-  UINT8 digest[16];
-  for (int i = 0; i < 16; i++)
-    digest[i] = static_cast<UINT8>(state[i / 4] >> (8 * (i % 4)));
-  EXPECT_EQ(Hex(digest, 16), "d41d8cd98f00b204e9800998ecf8427e");
+TEST(Md5Test, TheBitCountCarriesIntoItsHighWord) {
+  struct Row {
+    UINT32 low;  // bit count before the update
+    UINT32 length;
+    UINT32 expectedLow;
+    UINT32 expectedHigh;
+  };
+  const Row rows[] = {
+      {0xFFFFFFF8, 1, 0, 1},
+      {0xFFFFFF00, 64, 0x100, 1},
+      {0xFFFFFE00, 63, 0xFFFFFFF8, 0},
+  };
+  const std::string data(64, 'x');
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::to_string(row.low) + " + " + std::to_string(row.length) + " bytes");
+    nimb::Md5Context context;
+    nimb::Md5Init(&context);
+    context.count[0] = row.low;
+    nimb::Md5Update(&context, data.data(), row.length);
+    EXPECT_EQ(context.count[0], row.expectedLow);
+    EXPECT_EQ(context.count[1], row.expectedHigh);
+  }
 }
 
 // The checksum as the definition states it, reduced after every byte, in
@@ -137,7 +149,6 @@ TEST(Adler32Test, KnownValuesAreByteReversed) {
   EXPECT_EQ(nimb::Adler32("abc", 3), 0x27014D02u);
   EXPECT_EQ(nimb::Adler32("", 0), 0x01000000u);
   EXPECT_EQ(nimb::Adler32(nullptr, 0), 0x01000000u);
-  EXPECT_EQ(nimb::Adler32("Wikipedia", 9), Reversed(0x11E60398u));
 }
 
 TEST(Adler32Test, LongInputsMatchTheReferenceWhateverTheChunking) {

@@ -97,13 +97,6 @@ TEST(DevicePathTest, WalksVisitEveryNodeAndStopAtTheEndOrAtADamagedNode) {
   }
 }
 
-TEST(DevicePathTest, NullPathsHaveNoNodesAndNoSize) {
-  UINTN remaining = 100;
-  EXPECT_EQ(nimb::DevicePathFirstNode(nullptr, &remaining), nullptr);
-  EXPECT_EQ(nimb::DevicePathSize(nullptr), 0u);
-  EXPECT_EQ(nimb::DevicePathFindNode(nullptr, 100, 3, 11), nullptr);
-}
-
 TEST(DevicePathTest, FirmwarePathsAreBoundedByTheLargestPathSize) {
   // A path with nothing damaged in it but no end within the bound.
   Bytes bytes;
@@ -149,6 +142,8 @@ TEST(DevicePathTest, FindNodeTakesTheFirstMatchInFrontOfTheEnd) {
   }
   const Bytes damaged = Cat({Node(1, 1, 0), Node(3, 11, 10), kEnd});
   EXPECT_EQ(nimb::DevicePathFindNode(AsPath(damaged), damaged.size(), 3, 11), nullptr);
+  EXPECT_EQ(nimb::DevicePathFindNode(nullptr, 100, 3, 11), nullptr);
+  EXPECT_EQ(nimb::DevicePathSize(nullptr), 0u);
 }
 
 class DevicePathFirmwareTest : public nimbtest::LoaderTest {};
@@ -181,17 +176,6 @@ TEST_F(DevicePathFirmwareTest, NoCopyOfANullOrDamagedPathOrWithoutMemory) {
   fw.FailAllocation(1);
   EXPECT_EQ(nimb::AllocateCopyPool(sizeof(text), text), nullptr);
   ExpectNothingHeld();
-}
-
-TEST_F(DevicePathFirmwareTest, AllocateCopyPoolCopiesThroughTheFirmware) {
-  const char text[] = "kernel cache";
-  const unsigned copies = fw.CallCount("CopyMem");
-  void *copy = nimb::AllocateCopyPool(sizeof(text), text);
-  ASSERT_NE(copy, nullptr);
-  EXPECT_EQ(std::memcmp(copy, text, sizeof(text)), 0);
-  EXPECT_EQ(fw.CallCount("CopyMem"), copies + 1);
-  EXPECT_EQ(nimb::gMemoryTags, nullptr);
-  EXPECT_EQ(nimb::gBS->FreePool(copy), EFI_SUCCESS);
 }
 
 TEST_F(DevicePathFirmwareTest, FromHandleGivesTheProtocolOrNull) {

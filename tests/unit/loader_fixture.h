@@ -9,7 +9,10 @@
 #include "boot/boot.h"
 #include "config/boot_options.h"
 #include "config/plist.h"
+#include "devicetree/devicetree.h"
+#include "devicetree/platform.h"
 #include "hostfw/hostfw.h"
+#include "memory/kernel_region.h"
 #include "memory/tracking.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
@@ -42,6 +45,19 @@ inline void ResetLoaderState() {
   nimb::gCustomDriverPackage = 0;
   nimb::gPlistFreeTags = nullptr;
   nimb::gPlistSymbols = nullptr;
+  nimb::gDeviceTreeRoot = nullptr;
+  nimb::gDeviceTreeNodeCount = 0;
+  nimb::gDeviceTreePropertyCount = 0;
+  nimb::gDeviceTreeValueBytes = 0;
+  nimb::gFreeNodes = nullptr;
+  nimb::gNodeBlocks = nullptr;
+  nimb::gFreeProperties = nullptr;
+  nimb::gPropertyBlocks = nullptr;
+  nimb::gKernelRegionTop = 0;
+  nimb::gKernelRegionBase = 0xFFFFFFFF;
+  nimb::gMemoryMapNode = nullptr;
+  for (char &c : nimb::gModelName)
+    c = '\0';
 }
 
 class LoaderTest : public ::testing::Test {

@@ -69,33 +69,6 @@ TEST(OptionsTest, GetOptionValueFindsTheLastPairWithTheKey) {
   }
 }
 
-TEST(OptionsTest, GetOptionValueOfANullTextFindsNothing) {
-  const char *value = nullptr;
-  UINT64 length = 0;
-  EXPECT_EQ(nimb::GetOptionValue(nullptr, "-v", &value, &length), EFI_NOT_FOUND);
-}
-
-TEST(OptionsTest, ScanOptionWordStopsAtQuotesBlanksAndEquals) {
-  struct Row {
-    const char *text;
-    const char *word;
-    size_t next;  // offset of the returned pointer
-  };
-  const Row rows[] = {
-      {"", "", 0},      {"abc", "abc", 3},         {"ab=c", "ab", 2},      {"ab c", "ab", 2},
-      {"=c", "", 0},    {"a\"b\" c", "a\"b\"", 4}, {"\"a b\"c", "a b", 5}, {"\"a=b", "a=b", 4},
-      {"\"\"x", "", 2},
-  };
-  for (const Row &row : rows) {
-    SCOPED_TRACE(std::string("text \"") + row.text + "\"");
-    const char *start = nullptr;
-    UINT64 length = 0;
-    const char *next = nimb::ScanOptionWord(row.text, &start, &length);
-    EXPECT_EQ(std::string(start, length), row.word);
-    EXPECT_EQ(next, row.text + row.next);
-  }
-}
-
 struct Word {
   std::string word;
   std::string key;

@@ -267,10 +267,10 @@ TEST_F(PlistTest, DocumentsAndTheQuirksOfTheVocabulary) {
   PrimePool();
   for (const Row &row : rows) {
     PlistTag *dict = Parse(row.text, row.tree ? EFI_SUCCESS : EFI_NOT_FOUND);
-    if (row.tree != nullptr) {
+    if (row.tree != nullptr)
       EXPECT_EQ(Describe(dict), row.tree) << row.text;
+    if (dict != nullptr)
       EXPECT_EQ(dict->next, nullptr) << row.text;
-    }
     nimb::PlistFreeTag(dict);
     // Whatever was parsed, kept or dropped, is all back.
     EXPECT_EQ(FreeTags(), kTagsPerBlock) << row.text;

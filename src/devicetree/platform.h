@@ -1,0 +1,20 @@
+// What the firmware knows about the machine: the vendor's platform records
+// in /efi/platform, the ACPI fixed description table, the model name.
+#pragma once
+
+#include "efi/efi.h"
+
+namespace nimb {
+
+// The model text: 64 bytes, worked out once.
+extern char gModelName[64];
+
+// Starts the device tree and copies the vendor's Data Hub records into
+// /efi/platform. Always 0.
+EFI_STATUS InitPlatformDescription();
+// The ACPI fixed description table ("FACP"), or null.
+const UINT8 *FindFacp();
+// The short model text; never null, never empty.
+const char *GetModelName();
+
+}  // namespace nimb

@@ -1,0 +1,35 @@
+// The runtime address map: behind ExitBootServices, the firmware's runtime
+// regions are announced at new addresses and copied there, so that the
+// kernel finds the runtime services in memory of its own, with virtual
+// addresses equal to physical ones.
+#pragma once
+
+#include "efi/efi.h"
+
+namespace nimb {
+
+// `value` shifted left by `count` bits, in 64 bits; 0 for a count of 64 or
+// more.
+UINT64 LShiftU64(UINT64 value, UINTN count);
+
+// Walks the memory map from `mapStart` to `mapEnd` by `descriptorSize`.
+// Each descriptor with EFI_MEMORY_RUNTIME (reserved memory apart, which
+// loses the bit) gets the next addresses from *nextVirtual on; *nextVirtual
+// comes back behind the last. The map goes to SetVirtualAddressMap, each
+// runtime code or data region is copied to its new address, and the
+// configuration table's entries and gST follow their regions.
+//
+// Normal boot (`resume` 0): *cursor starts at `mapEnd`, with room behind it
+// for one descriptor per runtime region; a descriptor of the region at its
+// new place is written there, and the old one becomes zeroed conventional
+// memory. Resume: *cursor starts at `mapStart`; the list is compacted in
+// place to the runtime descriptors alone, at their new addresses, and only
+// those are announced. Either way *cursor comes back at the end of the list.
+//
+// Returns 0. If the firmware refuses the map, the run stops here (boot
+// services are gone by then) and the call does not return.
+EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRIPTOR *mapEnd,
+                              EFI_MEMORY_DESCRIPTOR **cursor, UINT64 descriptorSize, UINT32 descriptorVersion,
+                              UINT64 *nextVirtual, BOOLEAN resume);
+
+}  // namespace nimb

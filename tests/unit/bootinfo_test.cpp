@@ -1,0 +1,165 @@
+// The boot record and the first properties of the tree.
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <cstring>
+#include <filesystem>
+#include <functional>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include "boot/bootinfo.h"
+#include "devicetree/devicetree.h"
+#include "loader_fixture.h"
+#include "memory/kernel_region.h"
+#include "support/devicepath.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using namespace nimb;
+
+std::string Dict(const std::string &entries) { return "<plist><dict>" + entries + "</dict></plist>"; }
+
+class BootInfoTest : public nimbtest::LoaderTest {
+ protected:
+  void SetUp() override {
+    LoaderTest::SetUp();
+    char pattern[] = "/tmp/nimb-info-XXXXXX";
+    dir_ = mkdtemp(pattern);
+    device_ = fw.AddDirectoryVolume(dir_);
+    fw.SetBootDevice(device_);
+    gLoadedImage = fw.LoadedImage();
+    gBootDevicePath = fw.DevicePathOf(device_);
+    ASSERT_NE(DeviceTreeInit(), nullptr);
+    // As if a kernel lay at 0x200000..0x205000.
+    gKernelRegionBase = 0x200000;
+    gKernelRegionTop = 0x205000;
+    gKernelName = u"a\\b";
+  }
+  void TearDown() override {
+    LoaderTest::TearDown();
+    fs::remove_all(dir_);
+  }
+  // Parses a configuration dictionary into gConfigDict.
+  void Config(const std::string &entries) {
+    text_ = Dict(entries);
+    ASSERT_EQ(PlistParseDocument(text_.data(), &gConfigDict), EFI_SUCCESS);
+  }
+  hostfw::RunResult Init(const char *options) {
+    return fw.Call([&] { EXPECT_EQ(InitBootInfo(gLoadedImage, options), EFI_SUCCESS); });
+  }
+  static std::string Property(const char *path, const char *name, bool *present = nullptr) {
+    DeviceTreeNode *node = DeviceTreeFindNode(path, 0);
+    DeviceTreeProperty *property = node != nullptr ? DeviceTreeFindProperty(node, name) : nullptr;
+    if (present != nullptr) *present = property != nullptr;
+    if (property == nullptr) return "";
+    return std::string(static_cast<const char *>(property->value), property->length);
+  }
+
+  std::string dir_;
+  std::string text_;
+  EFI_HANDLE device_ = nullptr;
+};
+
+TEST_F(BootInfoTest, TheRecordSitsAtTheTopOfTheKernelRegion) {
+  ASSERT_EQ(Init("").end, hostfw::RunEnd::Returned);
+  ASSERT_NE(bootArgs, nullptr);
+  EXPECT_EQ(reinterpret_cast<UINT64>(bootArgs), 0x205000u);
+  EXPECT_EQ(gKernelRegionTop, 0x206000u);
+  EXPECT_EQ(bootArgs->revision, 4);
+  EXPECT_EQ(bootArgs->version, 1);
+  EXPECT_EQ(bootArgs->firmwareBits, 0x40);
+  // Everything else is zero until its writer has run (the page came with junk).
+  BootArgs expected = {};
+  expected.revision = 4;
+  expected.version = 1;
+  expected.firmwareBits = 0x40;
+  EXPECT_EQ(memcmp(bootArgs, &expected, sizeof(BootArgs)), 0);
+
+  EXPECT_EQ(Property("/", "compatible"), std::string("ACPI", 5));
+  EXPECT_EQ(Property("/", "model"), std::string("ACPI", 5));
+  EXPECT_EQ(Property("/chosen", "boot-file"), std::string("a\\b", 4));
+  std::string path = Property("/chosen", "boot-device-path");
+  EXPECT_EQ(path.size(), DevicePathSize(gBootDevicePath));
+  EXPECT_EQ(memcmp(path.data(), gBootDevicePath, path.size()), 0);
+  EXPECT_NE(gMemoryMapNode, nullptr);
+  EXPECT_EQ(gMemoryMapNode, DeviceTreeFindNode("/chosen/memory-map", 0));
+  EXPECT_EQ(gMemoryMapNode->properties->next, nullptr);  // only its name
+}
+
+TEST_F(BootInfoTest, RootIdentity) {
+  struct Row {
+    const char *name;
+    const char *options;
+    const char *config;  // entries of the configuration dictionary, or null
+    bool present;
+    std::string value;
+    const char *printed;
+  } rows[] = {
+      {"rd", "rd", "<key>Root UUID</key><string>X</string>", false, "", ""},
+      {"rd=x", "-v rd=x", nullptr, false, "", ""},
+      {"RD=x", "RD=x", nullptr, false, "", ""},
+      {"configuration text as it stands", "", "<key>Root UUID</key><string>not a uuid</string>", true,
+       std::string("not a uuid", 11), "\r\nroot device uuid is 'not a uuid'\r\n"},
+      {"empty configuration text", "", "<key>Root UUID</key><string></string>", true, std::string(1, '\0'),
+       "\r\nroot device uuid is ''\r\n"},
+      {"a volume without identity", "", nullptr, false, "", "(no root UUID found for boot device)\r\n"},
+      {"a non-string value", "", "<key>Root UUID</key><integer>1</integer>", false, "",
+       "(no root UUID found for boot device)\r\n"},
+  };
+  for (const Row &row : rows) {
+    TearDown();
+    SetUp();
+    if (row.config != nullptr) Config(row.config);
+    ASSERT_EQ(Init(row.options).end, hostfw::RunEnd::Returned) << row.name;
+    bool present = false;
+    EXPECT_EQ(Property("/chosen", "boot-uuid", &present), row.value) << row.name;
+    EXPECT_EQ(present, row.present) << row.name;
+    EXPECT_EQ(fw.ConOutText(), row.printed) << row.name;
+  }
+}
+
+TEST_F(BootInfoTest, AVolumeWithAPartitionGuidGivesItsText) {
+  // A GUID partition: type 4/1, format 2, signature type 2.
+  std::vector<uint8_t> path = {4, 1, 42, 0};
+  path.resize(42, 0);
+  path[4] = 1;  // partition number
+  const uint8_t signature[16] = {0x78, 0x56, 0x34, 0x12, 0xBC, 0x9A, 0xF0, 0xDE,
+                                 0x01, 0x23, 0x45, 0x67, 0x89, 0xAB, 0xCD, 0xEF};
+  memcpy(&path[24], signature, 16);
+  path[40] = 2;
+  path[41] = 2;
+  path.insert(path.end(), {0x7F, 0xFF, 4, 0});
+  EFI_HANDLE disk = fw.NewHandle();
+  fw.SetDevicePath(disk, path);
+  fw.LoadedImage()->DeviceHandle = disk;
+  ASSERT_EQ(Init("").end, hostfw::RunEnd::Returned);
+  EXPECT_EQ(Property("/chosen", "boot-uuid"), std::string("12345678-9ABC-DEF0-0123-456789ABCDEF", 37));
+}
+
+TEST_F(BootInfoTest, FatalConditions) {
+  struct Row {
+    const char *message;
+    std::function<void(hostfw::Firmware &)> arrange;
+  } rows[] = {
+      {"Couldn't allocate bootArgs\r\n", [](hostfw::Firmware &f) { f.FailCall("AllocatePages"); }},
+      {"Couldn't create root node", [](hostfw::Firmware &) { DeviceTreeFree(); }},
+      {"allocate kernel name", [](hostfw::Firmware &) { gKernelName = nullptr; }},
+  };
+  for (const Row &row : rows) {
+    TearDown();
+    SetUp();
+    row.arrange(fw);
+    hostfw::RunResult result = Init("rd");
+    EXPECT_EQ(result.end, hostfw::RunEnd::Exited) << row.message;
+    EXPECT_EQ(result.status, EFI_ABORTED) << row.message;
+    std::string text = fw.ConOutText();
+    ASSERT_GE(text.size(), strlen(row.message));
+    EXPECT_EQ(text.substr(text.size() - strlen(row.message)), row.message);
+    Attach();
+  }
+}
+
+}  // namespace

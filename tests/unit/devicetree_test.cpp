@@ -1,0 +1,459 @@
+// The device tree: pooled records, path lookup, and the flattened bytes.
+#include "devicetree/devicetree.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstring>
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "loader_fixture.h"
+
+namespace {
+
+using nimb::DeviceTreeAddChild;
+using nimb::DeviceTreeAddProperty;
+using nimb::DeviceTreeFindNode;
+using nimb::DeviceTreeFindProperty;
+using nimb::DeviceTreeNode;
+using nimb::DeviceTreeProperty;
+using Bytes = std::vector<uint8_t>;
+
+// --- the expected flattened form, built from the format ---------------------
+
+void Put32(Bytes &out, uint32_t value) {
+  for (int i = 0; i < 4; i++)
+    out.push_back(static_cast<uint8_t>(value >> (8 * i)));
+}
+
+Bytes Text(const std::string &text) {
+  Bytes bytes(text.begin(), text.end());
+  bytes.push_back(0);
+  return bytes;
+}
+
+// A property image; value bytes past `value` (or all, for an empty one) are
+// zero.
+Bytes PropertyImage(const std::string &name, uint32_t length, const Bytes &value = {}) {
+  Bytes out(32, 0);
+  std::memcpy(out.data(), name.data(), std::min<size_t>(name.size(), 31));
+  Put32(out, length);
+  Bytes body((length + 3) & ~3u, 0);
+  std::copy(value.begin(), value.end(), body.begin());
+  out.insert(out.end(), body.begin(), body.end());
+  return out;
+}
+
+Bytes Property(const std::string &name, const Bytes &value) {
+  return PropertyImage(name, static_cast<uint32_t>(value.size()), value);
+}
+
+Bytes NameProperty(const std::string &name) {
+  return Property("name", Text(name));
+}
+
+Bytes NodeImage(const std::vector<Bytes> &properties, const std::vector<Bytes> &children) {
+  Bytes out;
+  Put32(out, static_cast<uint32_t>(properties.size()));
+  Put32(out, static_cast<uint32_t>(children.size()));
+  for (const Bytes &p : properties)
+    out.insert(out.end(), p.begin(), p.end());
+  for (const Bytes &c : children)
+    out.insert(out.end(), c.begin(), c.end());
+  return out;
+}
+
+template <typename Record>
+size_t Length(const Record *list) {
+  size_t n = 0;
+  for (; list != nullptr; list = list->next)
+    n++;
+  return n;
+}
+
+class DeviceTreeTest : public nimbtest::LoaderTest {
+ protected:
+  void SetUp() override {
+    LoaderTest::SetUp();
+    root = nimb::DeviceTreeInit();
+    ASSERT_NE(root, nullptr);
+  }
+
+  // The two-pass use: the size first, then the image into a caller's buffer
+  // whose bytes are not zero, with guard bytes behind it.
+  Bytes Flatten() {
+    UINT64 size = 0;
+    nimb::DeviceTreeFlatten(nullptr, &size);
+    Bytes area(size + 16, 0xEE);
+    UINT64 address = reinterpret_cast<UINTN>(area.data());
+    UINT64 written = 0;
+    nimb::DeviceTreeFlatten(&address, &written);
+    EXPECT_EQ(written, size);
+    EXPECT_EQ(address, reinterpret_cast<UINTN>(area.data()));
+    EXPECT_EQ(Bytes(area.begin() + size, area.end()), Bytes(16, 0xEE)) << "written past the size";
+    area.resize(size);
+    return area;
+  }
+
+  std::string NameOf(DeviceTreeNode *node) {
+    DeviceTreeProperty *name = DeviceTreeFindProperty(node, "name");
+    return name == nullptr ? "(no name)" : static_cast<const char *>(name->value);
+  }
+
+  DeviceTreeNode *root = nullptr;
+};
+
+TEST_F(DeviceTreeTest, OnlyTheRootFlattensTo48Bytes) {
+  const Bytes expected = {
+      1,   0,   0,   0,   0, 0, 0, 0,                                      // 1 property, 0 children
+      'n', 'a', 'm', 'e', 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0,  // name field
+      0,   0,   0,   0,   0, 0, 0, 0, 0, 0, 0, 0,                          //
+      2,   0,   0,   0,                                                    // length 2
+      '/', 0,   0,   0,                                                    // "/", NUL, padding
+  };
+  EXPECT_EQ(Flatten(), expected);
+}
+
+TEST_F(DeviceTreeTest, PropertyImagesTakeTheirPaddedLength) {
+  static const char kAcpi[] = "ACPI";
+  static const uint8_t kEight[] = {1, 2, 3, 4, 5, 6, 7, 8};
+  struct Row {
+    const char *name;
+    uint64_t length;
+    const void *value;
+    uint8_t copy;
+    size_t imageSize;
+  };
+  const Row rows[] = {
+      {"five", 5, kAcpi, 0, 44},   {"eight", 8, kEight, 0, 44},
+      {"empty", 0, kAcpi, 0, 36},  {"null-twelve", 12, nullptr, 0, 48},
+      {"copied", 5, kAcpi, 1, 44}, {"low-32-bits", 0x100000003ull, kAcpi, 0, 40},
+  };
+  for (const Row &row : rows) {
+    root = nimb::DeviceTreeInit();
+    uint32_t length = static_cast<uint32_t>(row.length);
+    ASSERT_NE(DeviceTreeAddProperty(root, row.name, row.length, row.value, row.copy), nullptr) << row.name;
+    Bytes value;
+    if (row.value != nullptr)
+      value.assign(static_cast<const uint8_t *>(row.value), static_cast<const uint8_t *>(row.value) + length);
+    Bytes image = PropertyImage(row.name, length, value);
+    EXPECT_EQ(image.size(), row.imageSize) << row.name;
+    EXPECT_EQ(Flatten(), NodeImage({NameProperty("/"), image}, {})) << row.name;
+  }
+}
+
+TEST_F(DeviceTreeTest, ACopyIsTakenAtTheCallAndAKeptValueIsReadAtTheFlattening) {
+  char copied[] = "old";
+  char kept[] = "old";
+  DeviceTreeAddProperty(root, "copied", 4, copied, 1);
+  DeviceTreeAddProperty(root, "kept", 4, kept, 0);
+  std::strcpy(copied, "new");
+  std::strcpy(kept, "new");
+  EXPECT_EQ(
+      Flatten(),
+      NodeImage({NameProperty("/"), Property("copied", Text("old")), Property("kept", Text("new"))}, {}));
+}
+
+TEST_F(DeviceTreeTest, PropertiesKeepTheirOrderAndChildrenComeOutNewestFirst) {
+  for (const char *name : {"pa", "pb", "pc"})
+    DeviceTreeAddProperty(root, name, 2, "x", 0);
+  DeviceTreeNode *a = DeviceTreeFindNode("/a/x", 1);
+  ASSERT_NE(a, nullptr);
+  DeviceTreeAddProperty(a, "leaf", 4, "abc", 0);
+  DeviceTreeAddChild(root, "b");
+  DeviceTreeAddChild(root, "c");
+
+  Bytes x = NodeImage({NameProperty("x"), Property("leaf", Text("abc"))}, {});
+  Bytes expected = NodeImage(
+      {NameProperty("/"), Property("pa", Text("x")), Property("pb", Text("x")), Property("pc", Text("x"))},
+      {NodeImage({NameProperty("c")}, {}), NodeImage({NameProperty("b")}, {}),
+       NodeImage({NameProperty("a")}, {x})});
+  EXPECT_EQ(Flatten(), expected);
+  EXPECT_EQ(expected.size(), 400u);
+}
+
+TEST_F(DeviceTreeTest, FindPropertyReturnsTheFirstOfTwoAndBothAreFlattened) {
+  DeviceTreeProperty *first = DeviceTreeAddProperty(root, "dup", 2, "1", 0);
+  DeviceTreeAddProperty(root, "dup", 2, "2", 0);
+  EXPECT_EQ(DeviceTreeFindProperty(root, "dup"), first);
+  EXPECT_EQ(DeviceTreeFindProperty(root, "du"), nullptr);
+  EXPECT_EQ(DeviceTreeFindProperty(root, "dupe"), nullptr);
+  EXPECT_EQ(Flatten(),
+            NodeImage({NameProperty("/"), Property("dup", Text("1")), Property("dup", Text("2"))}, {}));
+}
+
+// The block heads of a chain, newest first; each must hold its own address.
+template <typename Record, typename Field>
+std::vector<void *> Chain(Record *head, Field Record::*self) {
+  std::vector<void *> heads;
+  for (; head != nullptr; head = head->next) {
+    EXPECT_EQ(static_cast<const void *>(head->*self), head);
+    heads.push_back(head);
+  }
+  return heads;
+}
+
+// The root takes the first node and, with its name, the first property of
+// the first blocks; the records of a block are handed out from the highest
+// down to the one behind the chain head.
+TEST_F(DeviceTreeTest, The102ndPropertyAndThe128thNodeStartNewBlocks) {
+  auto properties = [] { return Chain(nimb::gPropertyBlocks, &DeviceTreeProperty::value); };
+  auto nodes = [] { return Chain(nimb::gNodeBlocks, &DeviceTreeNode::children); };
+  ASSERT_EQ(properties().size(), 1u);
+  ASSERT_EQ(nodes().size(), 1u);
+  auto *firstProperties = static_cast<DeviceTreeProperty *>(properties()[0]);
+  auto *firstNodes = static_cast<DeviceTreeNode *>(nodes()[0]);
+  EXPECT_EQ(root, &firstNodes[127]);
+  EXPECT_EQ(root->properties, &firstProperties[101]);
+
+  struct Row {
+    const char *what;
+    std::function<void *()> add;
+    std::function<std::vector<void *>()> chain;
+    unsigned toFill;  // records left in the first block
+    void *firstBlock;
+    void *lastOfFirst;
+    size_t highestOffset;  // of the first record handed out from a block
+  };
+  // A child brings a "name" property: the property row comes first, to fill
+  // its block with properties alone.
+  const Row rows[] = {
+      {"property", [&] { return DeviceTreeAddProperty(root, "p", 0, nullptr, 0); }, properties, 100,
+       firstProperties, &firstProperties[1], 101 * sizeof(DeviceTreeProperty)},
+      {"node", [&] { return DeviceTreeAddChild(root, "n"); }, nodes, 126, firstNodes, &firstNodes[1],
+       127 * sizeof(DeviceTreeNode)},
+  };
+  for (const Row &row : rows) {
+    void *last = nullptr;
+    for (unsigned i = 0; i < row.toFill; i++)
+      last = row.add();
+    EXPECT_EQ(last, row.lastOfFirst) << row.what;
+    EXPECT_EQ(row.chain().size(), 1u) << row.what;
+    void *next = row.add();
+    std::vector<void *> chain = row.chain();
+    ASSERT_EQ(chain.size(), 2u) << row.what;
+    EXPECT_EQ(chain[1], row.firstBlock) << row.what;
+    EXPECT_EQ(next, static_cast<char *>(chain[0]) + row.highestOffset) << row.what;
+  }
+  EXPECT_EQ(nimb::gDeviceTreeNodeCount, 128u);
+  EXPECT_EQ(nimb::gDeviceTreePropertyCount, 1u + 101u + 127u);
+  EXPECT_EQ(nimb::gDeviceTreeValueBytes, 4u + 127u * 4u);
+  Bytes flat = Flatten();
+  ASSERT_EQ(flat.size(), 8u * 128 + 36u * 229 + 4 * 128);
+  EXPECT_EQ(flat[0], 102u);
+  EXPECT_EQ(flat[4], 127u);
+}
+
+TEST_F(DeviceTreeTest, FindNodeWalksComponentsOfAtMost30Characters) {
+  const std::string thirty(30, 't');
+  const std::string thirtyFive = std::string(30, 'f') + "fffff";
+  struct Row {
+    std::string path;
+    uint8_t create;
+    std::string sameAs;  // a path naming the expected node; empty: null
+    unsigned added;      // nodes made by the call
+  };
+  const Row rows[] = {
+      {"/a/b", 1, "/a/b", 2},
+      {"/a/b", 1, "/a/b", 0},
+      {"//a///b/", 0, "/a/b", 0},
+      {"a/b", 0, "/a/b", 0},
+      {"/a/c", 0, "", 0},
+      {"/A/b", 0, "", 0},
+      {"", 1, "/", 0},
+      {"///", 1, "/", 0},
+      {"/" + thirty + "/y", 1, "/" + thirty + "/y", 2},
+      {"/" + thirty, 0, "/" + thirty + "/", 0},
+      {"/" + thirtyFive, 1, "/" + std::string(30, 'f') + "/fffff", 2},
+      {"/" + thirtyFive + "/g", 0, "", 0},
+      {"/" + thirtyFive + "/g", 1, "/" + std::string(30, 'f') + "/fffff/g", 1},
+  };
+  for (const Row &row : rows) {
+    UINT32 before = nimb::gDeviceTreeNodeCount;
+    DeviceTreeNode *found = DeviceTreeFindNode(row.path.c_str(), row.create);
+    EXPECT_EQ(nimb::gDeviceTreeNodeCount - before, row.added) << row.path;
+    if (row.sameAs.empty())
+      EXPECT_EQ(found, nullptr) << row.path;
+    else
+      EXPECT_EQ(found, DeviceTreeFindNode(row.sameAs.c_str(), 0)) << row.path;
+  }
+  EXPECT_EQ(DeviceTreeFindNode("/", 0), root);
+  DeviceTreeNode *cut = DeviceTreeFindNode(("/" + thirtyFive).c_str(), 0);
+  EXPECT_EQ(NameOf(cut), "fffff");
+  EXPECT_EQ(NameOf(DeviceTreeFindNode(("/" + thirty).c_str(), 0)), thirty);
+}
+
+TEST_F(DeviceTreeTest, AConfigurationTableNameCannotBeFoundByPath) {
+  const std::string name = "8868E871-E4F1-11D3-BC22-0080C73C8881";
+  ASSERT_EQ(name.size(), 36u);
+  DeviceTreeNode *table = DeviceTreeFindNode("/efi/configuration-table", 1);
+  DeviceTreeNode *child = DeviceTreeAddChild(table, name.c_str());
+  ASSERT_NE(child, nullptr);
+  EXPECT_EQ(NameOf(child), name);
+  const std::string path = "/efi/configuration-table/" + name;
+  EXPECT_EQ(DeviceTreeFindNode(path.c_str(), 0), nullptr);
+  UINT32 before = nimb::gDeviceTreeNodeCount;
+  DeviceTreeNode *made = DeviceTreeFindNode(path.c_str(), 1);
+  EXPECT_NE(made, child);
+  EXPECT_EQ(NameOf(made), name.substr(30));
+  EXPECT_EQ(nimb::gDeviceTreeNodeCount - before, 2u);
+}
+
+TEST_F(DeviceTreeTest, AChildWithoutParentReplacesTheRoot) {
+  DeviceTreeAddChild(root, "old-child");
+  DeviceTreeNode *other = DeviceTreeAddChild(nullptr, "other");
+  ASSERT_NE(other, nullptr);
+  EXPECT_EQ(nimb::gDeviceTreeRoot, other);
+  EXPECT_EQ(other->next, nullptr);
+  EXPECT_EQ(DeviceTreeFindNode("/", 0), other);
+  EXPECT_EQ(DeviceTreeFindNode("/old-child", 0), nullptr);
+}
+
+// Nodes nested deeper than the writer goes are left out: the node at the
+// limit is written without children, and nothing lands past the size.
+TEST_F(DeviceTreeTest, FlatteningStopsAtTheDepthLimit) {
+  std::string path;
+  for (size_t i = 0; i < nimb::kDeviceTreeMaxDepth + 6; i++)
+    path += "/d";
+  ASSERT_NE(DeviceTreeFindNode(path.c_str(), 1), nullptr);
+  Bytes flat = Flatten();
+  const Bytes link = NodeImage({NameProperty("d")}, {});
+  size_t at = 48;
+  for (size_t depth = 1; depth <= nimb::kDeviceTreeMaxDepth; depth++, at += link.size()) {
+    ASSERT_EQ(flat[at], 1u) << depth;
+    ASSERT_EQ(flat[at + 4], depth < nimb::kDeviceTreeMaxDepth ? 1u : 0u) << depth;
+    ASSERT_EQ(Bytes(flat.begin() + at + 8, flat.begin() + at + link.size()), NameProperty("d")) << depth;
+  }
+  EXPECT_EQ(Bytes(flat.begin() + at, flat.end()), Bytes(6 * link.size(), 0));
+}
+
+TEST_F(DeviceTreeTest, ASecondFlattenIntoTheSameBufferGivesTheSameBytes) {
+  DeviceTreeAddProperty(DeviceTreeFindNode("/chosen", 1), "boot-args", 3, "-v", 0);
+  DeviceTreeAddProperty(root, "net-boot", 0, nullptr, 0);
+  UINT64 size = 0;
+  nimb::DeviceTreeFlatten(nullptr, &size);
+  Bytes area(size, 0xEE);
+  UINT64 address = reinterpret_cast<UINTN>(area.data());
+  nimb::DeviceTreeFlatten(&address, &size);
+  const Bytes first = area;
+  std::fill(area.begin(), area.end(), 0x5A);
+  nimb::DeviceTreeFlatten(&address, &size);
+  EXPECT_EQ(area, first);
+  Bytes chosen = NodeImage({NameProperty("chosen"), Property("boot-args", Text("-v"))}, {});
+  EXPECT_EQ(first, NodeImage({NameProperty("/"), PropertyImage("net-boot", 0)}, {chosen}));
+}
+
+TEST_F(DeviceTreeTest, ANameLongerThan31CharactersIsCutInsideItsField) {
+  const std::string longName(40, 'L');
+  DeviceTreeAddProperty(root, longName.c_str(), 4, "abc", 0);
+  const std::string exact(31, 'E');
+  DeviceTreeAddProperty(root, exact.c_str(), 4, "xyz", 0);
+  Bytes flat = Flatten();
+  ASSERT_EQ(flat.size(), 48u + 40 + 40);
+  // Field: 31 characters and a NUL, then the length word stays intact.
+  Bytes field(flat.begin() + 48, flat.begin() + 48 + 32);
+  EXPECT_EQ(std::string(field.begin(), field.end()), std::string(31, 'L') + '\0');
+  EXPECT_EQ(flat, NodeImage({NameProperty("/"), Property(std::string(31, 'L'), Text("abc")),
+                             Property(exact, Text("xyz"))},
+                            {}));
+}
+
+TEST_F(DeviceTreeTest, RefusedAllocationsLeaveTheTreeAndCountersAlone) {
+  // The root, "/n" and 125 children of it: the first node block is used up.
+  auto fillNodeBlock = [&] {
+    DeviceTreeNode *n = DeviceTreeFindNode("/n", 1);
+    for (int i = 0; i < 125; i++)
+      DeviceTreeAddChild(n, "k");
+  };
+  struct Row {
+    const char *what;
+    std::function<void()> prepare;  // runs before the failure is armed
+    unsigned failAt;                // which AllocatePool from then on fails
+    std::function<bool()> call;     // true when the call gave a record
+    bool gives;
+    unsigned nodesAdded;
+    unsigned propertiesAdded;
+  };
+  const Row rows[] = {
+      {"copy of a value", [] {}, 1, [&] { return DeviceTreeAddProperty(root, "v", 4, "abc", 1) != nullptr; },
+       false, 0, 0},
+      {"property block",
+       [&] {
+         for (int i = 0; i < 100; i++)
+           DeviceTreeAddProperty(root, "p", 0, nullptr, 0);
+       },
+       1, [&] { return DeviceTreeAddProperty(root, "v", 4, "abc", 0) != nullptr; }, false, 0, 0},
+      {"node block", [&] { fillNodeBlock(); }, 1, [&] { return DeviceTreeAddChild(root, "c") != nullptr; },
+       false, 0, 0},
+      {"node made by path", [&] { fillNodeBlock(); }, 1,
+       [&] { return DeviceTreeFindNode("/x", 1) != nullptr; }, false, 0, 0},
+      // The node stands, without a name: it compares as "(null)".
+      {"copy of a node's name", [] {}, 1, [&] { return DeviceTreeFindNode("/x", 1) != nullptr; }, true, 1, 0},
+  };
+  for (const Row &row : rows) {
+    nimb::TrackedFreeAll();
+    root = nimb::DeviceTreeInit();
+    row.prepare();
+    const Bytes before = Flatten();
+    UINT32 nodes = nimb::gDeviceTreeNodeCount;
+    UINT32 properties = nimb::gDeviceTreePropertyCount;
+    UINT32 valueBytes = nimb::gDeviceTreeValueBytes;
+    fw.FailCall("AllocatePool", row.failAt);
+    EXPECT_EQ(row.call(), row.gives) << row.what;
+    EXPECT_EQ(nimb::gDeviceTreeNodeCount - nodes, row.nodesAdded) << row.what;
+    EXPECT_EQ(nimb::gDeviceTreePropertyCount - properties, row.propertiesAdded) << row.what;
+    if (row.nodesAdded == 0 && row.propertiesAdded == 0) {
+      EXPECT_EQ(nimb::gDeviceTreeValueBytes, valueBytes) << row.what;
+      EXPECT_EQ(Flatten(), before) << row.what;
+    }
+  }
+  DeviceTreeNode *unnamed = root->children;
+  ASSERT_NE(unnamed, nullptr);
+  EXPECT_EQ(DeviceTreeFindNode("/x", 0), nullptr);
+  EXPECT_EQ(unnamed->properties, nullptr);
+  EXPECT_EQ(DeviceTreeFindNode("/(null)", 0), unnamed);
+}
+
+TEST_F(DeviceTreeTest, ARefusedImageAllocationLeavesTheBufferNull) {
+  UINT64 address = 0;
+  UINT64 size = 0;
+  fw.FailCall("AllocatePool", 1);
+  nimb::DeviceTreeFlatten(&address, &size);
+  EXPECT_EQ(address, 0u);
+  EXPECT_EQ(size, 48u);
+  // Allowed, it allocates the image itself.
+  nimb::DeviceTreeFlatten(&address, nullptr);
+  ASSERT_NE(address, 0u);
+  const uint8_t *image = reinterpret_cast<const uint8_t *>(static_cast<UINTN>(address));
+  EXPECT_EQ(Bytes(image, image + 48), NodeImage({NameProperty("/")}, {}));
+}
+
+TEST_F(DeviceTreeTest, FreeGivesBackEveryBlockAndEmptiesTheTree) {
+  DeviceTreeNode *map = DeviceTreeFindNode("/chosen/memory-map", 1);
+  for (int i = 0; i < 150; i++)
+    DeviceTreeAddProperty(map, "range", 8, "12345678", 1);
+  for (int i = 0; i < 130; i++)
+    DeviceTreeAddChild(root, "n");
+  size_t blocks = Length(nimb::gNodeBlocks) + Length(nimb::gPropertyBlocks);
+  EXPECT_EQ(blocks, 2u + 3u);
+  size_t held = fw.LivePoolBlocks();
+  nimb::DeviceTreeFree();
+  // Blocks only: the copies of names and values stay with the tracking.
+  EXPECT_EQ(held - fw.LivePoolBlocks(), blocks);
+  EXPECT_EQ(DeviceTreeFindNode("/", 0), nullptr);
+  EXPECT_EQ(DeviceTreeFindNode("/chosen", 1), nullptr);
+  EXPECT_EQ(nimb::gDeviceTreeNodeCount + nimb::gDeviceTreePropertyCount + nimb::gDeviceTreeValueBytes, 0u);
+  EXPECT_EQ(nimb::gFreeNodes, nullptr);
+  EXPECT_EQ(nimb::gFreeProperties, nullptr);
+  UINT64 address = 0x1234;
+  UINT64 size = 1;
+  nimb::DeviceTreeFlatten(&address, &size);
+  EXPECT_EQ(address, 0u);
+  EXPECT_EQ(size, 0u);
+  nimb::TrackedFreeAll();
+  ExpectNothingHeld();
+}
+
+}  // namespace

@@ -1,0 +1,200 @@
+// Builders of kernel image bytes for the tests, written out field by field
+// so that they do not share the faults of the code under test: kernel
+// objects with any commands (well-formed or not), fat files in either byte
+// order, and 32-bit ELF executables.
+#pragma once
+
+#include <cstdint>
+#include <cstring>
+#include <string>
+#include <vector>
+
+namespace nimbtest {
+
+using Bytes = std::vector<uint8_t>;
+
+inline void PutLe32(Bytes &bytes, size_t at, uint32_t value) {
+  if (bytes.size() < at + 4)
+    bytes.resize(at + 4);
+  for (int i = 0; i < 4; i++)
+    bytes[at + i] = static_cast<uint8_t>(value >> (8 * i));
+}
+
+inline void PutBe32(Bytes &bytes, size_t at, uint32_t value) {
+  if (bytes.size() < at + 4)
+    bytes.resize(at + 4);
+  for (int i = 0; i < 4; i++)
+    bytes[at + i] = static_cast<uint8_t>(value >> (24 - 8 * i));
+}
+
+inline void PutLe16(Bytes &bytes, size_t at, uint32_t value) {
+  if (bytes.size() < at + 2)
+    bytes.resize(at + 2);
+  bytes[at] = static_cast<uint8_t>(value);
+  bytes[at + 1] = static_cast<uint8_t>(value >> 8);
+}
+
+inline uint32_t GetLe32(const Bytes &bytes, size_t at) {
+  return bytes[at] | bytes[at + 1] << 8 | bytes[at + 2] << 16 | static_cast<uint32_t>(bytes[at + 3]) << 24;
+}
+
+inline Bytes Pattern(size_t size, unsigned seed = 1) {
+  Bytes bytes(size);
+  for (size_t i = 0; i < size; i++)
+    bytes[i] = static_cast<uint8_t>(i * 13 + seed * 101 + (i >> 8));
+  return bytes;
+}
+
+// --- kernel objects -------------------------------------------------------------
+
+// A load command of `length` bytes (at least 8) whose words after the
+// opening are `words`, the rest zero.
+inline Bytes Command(uint32_t type, uint32_t length, const std::vector<uint32_t> &words = {}) {
+  Bytes command(length < 8 ? 8 : length);
+  PutLe32(command, 0, type);
+  PutLe32(command, 4, length);
+  for (size_t i = 0; i < words.size(); i++)
+    PutLe32(command, 8 + 4 * i, words[i]);
+  command.resize(length < 8 ? 8 : length);
+  return command;
+}
+
+// A segment command: name (16 bytes of zero), then its four fields.
+inline Bytes Segment(uint32_t address, uint32_t memorySize, uint32_t fileOffset, uint32_t fileSize,
+                            uint32_t length = 56) {
+  Bytes command = Command(1, 56, {0, 0, 0, 0, address, memorySize, fileOffset, fileSize, 7, 7});
+  PutLe32(command, 4, length);
+  command.resize(length < 8 ? 8 : length);
+  return command;
+}
+
+// A thread command with the entry at byte 56 of its 80.
+inline Bytes Thread(uint32_t entry, uint32_t length = 80) {
+  Bytes command = Command(5, 80, {1, 16});
+  PutLe32(command, 56, entry);
+  // Registers around the entry word, which must not be taken for it.
+  PutLe32(command, 52, 0x11111111);
+  PutLe32(command, 60, 0x22222222);
+  PutLe32(command, 4, length);
+  command.resize(length < 8 ? 8 : length);
+  return command;
+}
+
+// Segment data lies at this offset of the object, behind the commands.
+constexpr uint32_t kObjectDataStart = 0x1000;
+
+struct Object {
+  uint32_t magic = 0xFEEDFACE;
+  std::vector<Bytes> commands;
+  Bytes data;                    // at kObjectDataStart
+  int64_t commandCount = -1;     // -1: the number of commands
+  int64_t commandsSize = -1;     // -1: their total length
+  size_t cutAt = SIZE_MAX;       // the object ends here when smaller
+
+  Bytes Build() const {
+    Bytes out(28);
+    size_t size = 0;
+    for (const Bytes &command : commands) {
+      out.insert(out.end(), command.begin(), command.end());
+      size += command.size();
+    }
+    PutLe32(out, 0, magic);
+    PutLe32(out, 4, 7);
+    PutLe32(out, 8, 3);
+    PutLe32(out, 12, 2);
+    PutLe32(out, 16, static_cast<uint32_t>(commandCount >= 0 ? commandCount : commands.size()));
+    PutLe32(out, 20, static_cast<uint32_t>(commandsSize >= 0 ? commandsSize : size));
+    PutLe32(out, 24, 0);
+    if (!data.empty()) {
+      out.resize(kObjectDataStart);
+      out.insert(out.end(), data.begin(), data.end());
+    }
+    if (out.size() > cutAt)
+      out.resize(cutAt);
+    return out;
+  }
+};
+
+// --- fat files ----------------------------------------------------------------------
+
+struct FatRecord {
+  uint32_t cpuType;
+  uint32_t offset;
+  uint32_t size;
+  uint32_t cpuSubtype = 0x5A5A5A5A;  // not read: must not matter in either order
+  uint32_t alignment = 0xA5A5A5A5;
+};
+
+struct FatContent {
+  uint32_t offset;
+  Bytes bytes;
+};
+
+// A fat file: header, the records, and each content at its offset. With
+// `sliceCount` set, the header claims that many records.
+inline Bytes Fat(bool bigEndian, const std::vector<FatRecord> &records, const std::vector<FatContent> &contents,
+                 int64_t sliceCount = -1) {
+  auto put = bigEndian ? PutBe32 : PutLe32;
+  Bytes out;
+  put(out, 0, 0xCAFEBABE);
+  put(out, 4, static_cast<uint32_t>(sliceCount >= 0 ? sliceCount : records.size()));
+  for (size_t i = 0; i < records.size(); i++) {
+    size_t at = 8 + 20 * i;
+    put(out, at, records[i].cpuType);
+    put(out, at + 4, records[i].cpuSubtype);
+    put(out, at + 8, records[i].offset);
+    put(out, at + 12, records[i].size);
+    put(out, at + 16, records[i].alignment);
+  }
+  for (const FatContent &content : contents) {
+    if (out.size() < content.offset + content.bytes.size())
+      out.resize(content.offset + content.bytes.size());
+    std::memcpy(out.data() + content.offset, content.bytes.data(), content.bytes.size());
+  }
+  return out;
+}
+
+// --- ELF executables ---------------------------------------------------------------
+
+struct ElfSegment {
+  uint32_t type = 1;  // PT_LOAD
+  uint32_t vaddr = 0;
+  uint32_t paddr = 0;
+  Bytes bytes;
+  uint32_t memorySize = 0;
+};
+
+// A 32-bit little-endian x86 executable: ELF header, program headers at
+// byte 52, each segment's bytes at a 4096-byte boundary. The fields can be
+// spoilt afterwards by offset.
+inline Bytes Elf(uint32_t entry, const std::vector<ElfSegment> &segments) {
+  Bytes out(52 + 32 * segments.size());
+  const uint8_t ident[] = {0x7F, 'E', 'L', 'F', 1, 1, 1};
+  std::memcpy(out.data(), ident, sizeof(ident));
+  PutLe16(out, 16, 2);  // ET_EXEC
+  PutLe16(out, 18, 3);  // EM_386
+  PutLe32(out, 20, 1);
+  PutLe32(out, 24, entry);
+  PutLe32(out, 28, 52);
+  PutLe16(out, 40, 52);
+  PutLe16(out, 42, 32);
+  PutLe16(out, 44, static_cast<uint32_t>(segments.size()));
+  for (size_t i = 0; i < segments.size(); i++) {
+    const ElfSegment &segment = segments[i];
+    size_t offset = (out.size() + 0xFFF) & ~size_t{0xFFF};
+    out.resize(offset);
+    out.insert(out.end(), segment.bytes.begin(), segment.bytes.end());
+    size_t at = 52 + 32 * i;
+    PutLe32(out, at, segment.type);
+    PutLe32(out, at + 4, static_cast<uint32_t>(offset));
+    PutLe32(out, at + 8, segment.vaddr);
+    PutLe32(out, at + 12, segment.paddr);
+    PutLe32(out, at + 16, static_cast<uint32_t>(segment.bytes.size()));
+    PutLe32(out, at + 20, segment.memorySize);
+    PutLe32(out, at + 24, 6);
+    PutLe32(out, at + 28, 0x1000);
+  }
+  return out;
+}
+
+}  // namespace nimbtest

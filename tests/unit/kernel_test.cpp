@@ -1,0 +1,558 @@
+// Loading the kernel image: finding the x86 slice of a fat file, placing the
+// segments of a kernel object, refusing objects that lie, and loading the
+// kernel named by the boot options.
+#include "load/kernel.h"
+
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include "hostfw/network.h"
+#include "kernel_images.h"
+#include "kobj/writer.h"
+#include "load/bootfile.h"
+#include "loader_fixture.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using nimb::BootFile;
+using nimbtest::Bytes;
+using nimbtest::Command;
+using nimbtest::Fat;
+using nimbtest::kObjectDataStart;
+using nimbtest::Object;
+using nimbtest::Pattern;
+using nimbtest::Segment;
+using nimbtest::Thread;
+
+constexpr uint64_t kUntouchedEntry = 0x5EED;
+
+// Where a test file comes from: a memory record, a volume file, or a memory
+// record of a fat file (either order) with the kernel as its x86 slice,
+// another processor's slice in front and one more slice behind.
+enum class Source { kMemory, kVolume, kFatLittle, kFatBig };
+const Source kAllSources[] = {Source::kMemory, Source::kVolume, Source::kFatLittle, Source::kFatBig};
+
+const char *Name(Source source) {
+  switch (source) {
+    case Source::kMemory:
+      return "memory";
+    case Source::kVolume:
+      return "volume";
+    case Source::kFatLittle:
+      return "little-endian fat";
+    case Source::kFatBig:
+      return "big-endian fat";
+  }
+  return "?";
+}
+
+// The kernel as the x86 slice at 0x3000, between two other slices.
+Bytes WrapInFat(const Bytes &kernel, bool bigEndian) {
+  uint32_t size = static_cast<uint32_t>(kernel.size());
+  uint32_t behind = (0x3000 + size + 0xFFF) & ~0xFFFu;
+  return Fat(bigEndian, {{18, 0x1000, 0x800}, {7, 0x3000, size}, {12, behind, 0x100}},
+             {{0x1000, Pattern(0x800, 5)}, {0x3000, kernel}, {behind, Pattern(0x100, 6)}});
+}
+
+// Pool blocks from the tracked allocator still held.
+size_t TrackedPoolBlocks() {
+  size_t count = 0;
+  for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
+    count += tag->poolAddress != nullptr;
+  return count;
+}
+
+bool AllZero(uint64_t from, uint64_t to) {
+  for (uint64_t at = from; at < to; at++) {
+    if (*reinterpret_cast<const uint8_t *>(at) != 0)
+      return false;
+  }
+  return true;
+}
+
+class KernelTest : public nimbtest::LoaderTest {
+ protected:
+  void SetUp() override {
+    LoaderTest::SetUp();
+    char pattern[] = "/tmp/nimb-kernel-XXXXXX";
+    dir_ = mkdtemp(pattern);
+    EFI_HANDLE device = fw.AddDirectoryVolume(dir_);
+    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
+    ASSERT_EQ(fw.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
+                                                reinterpret_cast<void **>(&fileSystem)),
+              EFI_SUCCESS);
+    ASSERT_EQ(fileSystem->OpenVolume(fileSystem, &root_), EFI_SUCCESS);
+  }
+  void TearDown() override {
+    root_->Close(root_);
+    LoaderTest::TearDown();
+    fs::remove_all(dir_);
+  }
+
+  void Put(const std::string &name, const Bytes &bytes) {
+    std::ofstream(dir_ + "/" + name, std::ios::binary)
+        .write(reinterpret_cast<const char *>(bytes.data()), bytes.size());
+  }
+
+  // Opens `bytes` as a file of the given kind; the bytes must outlive it.
+  void Open(Source source, const Bytes &bytes, BootFile *file) {
+    if (source == Source::kVolume) {
+      Put("k", bytes);
+      ASSERT_EQ(nimb::BootFileOpen(nullptr, root_, u"k", file), EFI_SUCCESS);
+      return;
+    }
+    *file = BootFile{};
+    static uint8_t empty;
+    file->buffer = bytes.empty() ? &empty : const_cast<uint8_t *>(bytes.data());
+    file->size = bytes.size();
+  }
+
+  // The file as the source holds it.
+  static Bytes Contents(Source source, const Bytes &kernel) {
+    if (source == Source::kFatLittle || source == Source::kFatBig)
+      return WrapInFat(kernel, source == Source::kFatBig);
+    return kernel;
+  }
+
+  // Gives back everything a load took and puts the cursors and the entry
+  // back, so that the next row starts afresh.
+  void Forget() {
+    nimb::TrackedFreeAll();
+    nimb::gKernelRegionBase = 0xFFFFFFFF;
+    nimb::gKernelRegionTop = 0;
+    nimb::gKernelEntry = kUntouchedEntry;
+  }
+
+  // Console output since `mark` (a length of ConOutText).
+  std::string OutputSince(size_t mark) const { return fw.ConOutText().substr(mark); }
+
+  std::string dir_;
+  EFI_FILE *root_ = nullptr;
+};
+
+// --- finding the slice ------------------------------------------------------------
+
+TEST_F(KernelTest, FindSliceInBothOrdersAndFromBothKinds) {
+  const Bytes x86 = Pattern(0x300, 2);
+  const Bytes other = Pattern(0x200, 3);
+  struct Row {
+    std::string name;
+    Bytes file;
+    EFI_STATUS status;
+    uint64_t size;
+    uint64_t offset;
+    uint64_t nextRead;  // where the next read starts on success
+  };
+  std::vector<Row> rows = {
+      {"not fat", x86, EFI_SUCCESS, 0x300, 0, 0},
+      {"empty", {}, EFI_LOAD_ERROR, 0, 0, 0},
+      {"shorter than the fat test", Bytes(x86.begin(), x86.begin() + 7), EFI_LOAD_ERROR, 0, 0, 0},
+  };
+  for (bool big : {false, true}) {
+    std::string order = big ? " (big-endian)" : " (little-endian)";
+    Bytes twoSlices = Fat(big, {{18, 0x1000, 0x200}, {7, 0x2000, 0x300}}, {{0x1000, other}, {0x2000, x86}});
+    // The record behind the first reads as an x86 slice, but the count says
+    // there is only one.
+    Bytes countOfOne = twoSlices;
+    (big ? nimbtest::PutBe32 : nimbtest::PutLe32)(countOfOne, 4, 1);
+    Bytes fatHeaderOnly = Fat(big, {}, {}, 1);
+    fatHeaderOnly.resize(8 + 19);
+    std::vector<Row> fatRows = {
+        {"one x86 slice", Fat(big, {{7, 0x1000, 0x300}}, {{0x1000, x86}}), EFI_SUCCESS, 0x300, 0x1000, 0x1000},
+        {"x86 slice behind another", twoSlices, EFI_SUCCESS, 0x300, 0x2000, 0x2000},
+        {"the first of two x86 slices",
+         Fat(big, {{7, 0x1000, 0x200}, {7, 0x2000, 0x300}}, {{0x1000, other}, {0x2000, x86}}), EFI_SUCCESS,
+         0x200, 0x1000, 0x1000},
+        {"no x86 slice", Fat(big, {{18, 0x1000, 0x200}, {0x1000007, 0x2000, 0x300}}, {{0x2000, x86}}),
+         EFI_LOAD_ERROR, 0, 0, 0},
+        {"the count bounds the records", countOfOne, EFI_LOAD_ERROR, 0, 0, 0},
+        {"x86 slice of size 0", Fat(big, {{7, 0x1000, 0}}, {{0x1000, x86}}), EFI_LOAD_ERROR, 0, 0, 0},
+        {"cut off in the records", Fat(big, {{18, 0x1000, 0x200}}, {}, 3), EFI_LOAD_ERROR, 0, 0, 0},
+        {"cut off in the first record", fatHeaderOnly, EFI_LOAD_ERROR, 0, 0, 0},
+        {"slice running past the end", Fat(big, {{7, 0x1000, 0x301}}, {{0x1000, x86}}), EFI_LOAD_ERROR, 0, 0, 0},
+        {"slice beginning past the end", Fat(big, {{7, 0x9000, 0x10}}, {{0x1000, x86}}), EFI_LOAD_ERROR, 0, 0,
+         0},
+        // Offset 0 means no seek: reading goes on behind the two records.
+        {"x86 slice at offset 0", Fat(big, {{18, 0x1000, 0x200}, {7, 0, 0x300}}, {{0x1000, other}}),
+         EFI_SUCCESS, 0x300, 0, 8 + 2 * 20},
+    };
+    for (Row &row : fatRows) {
+      row.name += order;
+      rows.push_back(row);
+    }
+  }
+  for (const Row &row : rows) {
+    for (Source source : {Source::kMemory, Source::kVolume}) {
+      SCOPED_TRACE(row.name + " from " + Name(source));
+      size_t mark = fw.ConOutText().size();
+      BootFile file;
+      Open(source, row.file, &file);
+      uint64_t size = 0xDEAD;
+      uint64_t offset = 0xDEAD;
+      ASSERT_EQ(nimb::BootFileFindSlice(&file, &size, &offset), row.status);
+      if (row.status == EFI_SUCCESS) {
+        EXPECT_EQ(size, row.size);
+        EXPECT_EQ(offset, row.offset);
+        uint8_t next[4];
+        uint64_t count = sizeof(next);
+        ASSERT_EQ(nimb::BootFileRead(&file, &count, next), EFI_SUCCESS);
+        ASSERT_EQ(count, 4u);
+        EXPECT_EQ(Bytes(next, next + 4), Bytes(row.file.begin() + row.nextRead, row.file.begin() + row.nextRead + 4));
+      } else {
+        EXPECT_EQ(size, 0xDEADu);
+        EXPECT_EQ(offset, 0xDEADu);
+      }
+      // Nothing but the dots of volume reads: a missing slice is silent.
+      EXPECT_EQ(OutputSince(mark).find_first_not_of('.'), std::string::npos) << OutputSince(mark);
+      nimb::BootFileClose(&file);
+    }
+  }
+  // The out arguments may both be absent.
+  BootFile file;
+  Open(Source::kMemory, rows[0].file, &file);
+  EXPECT_EQ(nimb::BootFileFindSlice(&file, nullptr, nullptr), EFI_SUCCESS);
+}
+
+// --- placing segments ---------------------------------------------------------
+
+// What a row expects at one address: these bytes, then zeroes up to `size`.
+struct Placed {
+  uint64_t address;
+  Bytes bytes;
+  uint64_t size;
+};
+
+TEST_F(KernelTest, SegmentsArePlacedAndTheirPagesCleared) {
+  const Bytes data = Pattern(0x3000, 4);
+  auto slice = [&](size_t from, size_t count) { return Bytes(data.begin() + from, data.begin() + from + count); };
+  struct Row {
+    std::string name;
+    Object object;
+    std::vector<Placed> placed;
+    uint64_t entry;
+    uint64_t base;
+    uint64_t top;
+  };
+  const uint32_t d = kObjectDataStart;
+  std::vector<Row> rows = {
+      {"whole pages need no clearing",
+       {0xFEEDFACE, {Segment(0x200000, 0x2000, d, 0x2000), Thread(0x200010)}, data},
+       {{0x200000, slice(0, 0x2000), 0x2000}},
+       0x200010,
+       0x200000,
+       0x202000},
+      {"4097 bytes in memory and 1 in the file take two pages",
+       {0xFEEDFACE, {Segment(0x300000, 4097, d + 5, 1), Thread(0x300000)}, data},
+       {{0x300000, slice(5, 1), 0x2000}},
+       0x300000,
+       0x300000,
+       0x302000},
+      {"addresses above 0x3FFFFFFF keep their low 30 bits",
+       {0xFEEDFACE, {Segment(0xC0400000, 0x1800, d + 0x100, 0x800), Thread(0xC0400123)}, data},
+       {{0x400000, slice(0x100, 0x800), 0x2000}},
+       0x400123,
+       0x400000,
+       0x402000},
+      {"the last thread command counts",
+       {0xFEEDFACE, {Thread(0x100), Segment(0x200000, 0x10, d, 0x10), Thread(0x200004, 96)}, data},
+       {{0x200000, slice(0, 0x10), 0x1000}},
+       0x200004,
+       0x200000,
+       0x201000},
+      {"no thread command: entry 0",
+       {0xFEEDFACE, {Segment(0x200000, 0x10, d, 0x10)}, data},
+       {{0x200000, slice(0, 0x10), 0x1000}},
+       0,
+       0x200000,
+       0x201000},
+      {"a segment without file bytes takes nothing, however large",
+       {0xFEEDFACE, {Segment(0x500000, 0xFFFFF000, 0, 0), Segment(0x200000, 0x10, d, 0x10)}, data},
+       {{0x200000, slice(0, 0x10), 0x1000}},
+       0,
+       0x200000,
+       0x201000},
+      {"segments need not ascend",
+       {0xFEEDFACE, {Segment(0x600000, 0x1000, d, 0x1000), Segment(0x200000, 0x1000, d + 0x1000, 0x1000)}, data},
+       {{0x600000, slice(0, 0x1000), 0x1000}, {0x200000, slice(0x1000, 0x1000), 0x1000}},
+       0,
+       0x200000,
+       0x601000},
+      {"other commands are stepped over",
+       {0xFEEDFACE,
+        {Command(2, 24, {1, 0x200000, 0x100, 1}), Segment(0x200000, 0x100, d, 0x100),
+         Command(0x80000022, 12, {5}), Thread(0x200000)},
+        data},
+       {{0x200000, slice(0, 0x100), 0x1000}},
+       0x200000,
+       0x200000,
+       0x201000},
+      {"data that ends early reads as zeroes",
+       {0xFEEDFACE, {Segment(0x200000, 0x3000, d + 0x2800, 0x2000)}, data},
+       {{0x200000, slice(0x2800, 0x800), 0x3000}},
+       0,
+       0x200000,
+       0x203000},
+      {"data that begins at the very end reads as zeroes",
+       {0xFEEDFACE, {Segment(0x200000, 0x1000, d + 0x3000, 0x1000)}, data},
+       {{0x200000, {}, 0x1000}},
+       0,
+       0x200000,
+       0x201000},
+  };
+  for (const Row &row : rows) {
+    for (Source source : kAllSources) {
+      SCOPED_TRACE(row.name + " from " + Name(source));
+      Forget();
+      Bytes contents = Contents(source, row.object.Build());
+      BootFile file;
+      Open(source, contents, &file);
+      size_t mark = fw.ConOutText().size();
+      ASSERT_EQ(nimb::LoadKernel(&file), EFI_SUCCESS) << OutputSince(mark);
+      nimb::BootFileClose(&file);
+      uint64_t pages = 0;
+      for (const Placed &placed : row.placed) {
+        const uint8_t *memory = reinterpret_cast<const uint8_t *>(placed.address);
+        EXPECT_EQ(Bytes(memory, memory + placed.bytes.size()), placed.bytes);
+        EXPECT_TRUE(AllZero(placed.address + placed.bytes.size(), placed.address + placed.size));
+        pages += placed.size / 4096;
+      }
+      EXPECT_EQ(fw.AllocatedPages(), pages);
+      EXPECT_EQ(nimb::gKernelEntry, row.entry);
+      EXPECT_EQ(nimb::gKernelRegionBase, row.base);
+      EXPECT_EQ(nimb::gKernelRegionTop, row.top);
+      EXPECT_EQ(TrackedPoolBlocks(), 0u) << "the commands buffer is given back";
+    }
+  }
+}
+
+TEST_F(KernelTest, ObjectsThatLieAreRefusedBeforeAnythingIsPlaced) {
+  const Bytes data = Pattern(0x2000, 7);
+  const uint32_t d = kObjectDataStart;
+  const Bytes good = Segment(0x200000, 0x1000, d, 0x1000);
+  struct Row {
+    std::string name;
+    Object object;
+    std::string message;
+  };
+  auto with = [&](std::vector<Bytes> commands, int64_t count = -1, int64_t size = -1) {
+    Object object{0xFEEDFACE, std::move(commands), data, count, size};
+    return object;
+  };
+  Object cutHeader = with({good});
+  cutHeader.cutAt = 27;
+  Object cutCommands = with({good, Thread(0x200000)});
+  cutCommands.data.clear();
+  cutCommands.cutAt = 28 + 56 + 40;
+  Object huge = with({good}, -1, 0x100001);
+  huge.data = Bytes(0x101000);
+  std::vector<Row> rows = {
+      {"bad magic", {0xFEEDFACF, {good}, data}, "Nimb-O file has bad magic number 0xfeedfacf\r\n"},
+      {"header cut off", cutHeader, ""},
+      {"commands cut off", cutCommands, ""},
+      {"commands larger than the slice", with({good}, -1, 0x4000), ""},
+      {"commands above 1 MiB", huge, ""},
+      {"negative command count", with({good}, 0xFFFFFFFF), ""},
+      {"more commands than the commands can hold", with({good, Thread(0)}, 18), ""},
+      {"a count beyond the commands present", with({good, Thread(0)}, 3), ""},
+      {"command length 0", with({good, Command(2, 0), Thread(0)}), ""},
+      {"command length 4", with({good, Command(2, 4), Thread(0)}), ""},
+      {"a command running past the commands", with({good, Command(2, 8), Command(2, 64)}, -1, 56 + 8 + 32), ""},
+      {"a segment command too short for its fields", with({Segment(0x200000, 0x1000, d, 0x1000, 36)}), ""},
+      {"a thread command too short for its entry", with({good, Thread(0x200000, 59)}), ""},
+      {"more file bytes than pages", with({Segment(0x200000, 0x1000, d, 0x1001)}), ""},
+      {"file bytes without memory", with({Segment(0x200000, 0, d, 1)}), ""},
+      {"pages past 4 GiB", with({Segment(0x3FFFF000, 0xC0001001, d, 1)}), ""},
+      {"segment bytes beginning past the slice", with({Segment(0x200000, 0x1000, d + 0x2001, 1)}), ""},
+  };
+  for (const Row &row : rows) {
+    for (Source source : {Source::kMemory, Source::kFatBig}) {
+      SCOPED_TRACE(row.name + " from " + Name(source));
+      Forget();
+      Bytes contents = Contents(source, row.object.Build());
+      BootFile file;
+      Open(source, contents, &file);
+      size_t mark = fw.ConOutText().size();
+      unsigned poolCalls = fw.AllocatePoolCalls();
+      EXPECT_EQ(nimb::LoadKernel(&file), EFI_LOAD_ERROR);
+      EXPECT_EQ(OutputSince(mark), row.message);
+      EXPECT_EQ(fw.AllocatedPages(), 0u);
+      EXPECT_EQ(nimb::gKernelEntry, kUntouchedEntry);
+      EXPECT_EQ(nimb::gKernelRegionBase, 0xFFFFFFFFu);
+      EXPECT_EQ(nimb::gKernelRegionTop, 0u);
+      EXPECT_EQ(TrackedPoolBlocks(), 0u);
+      // A size that is not believed is never asked of the pool.
+      if (row.object.commandsSize > 0x100000)
+        EXPECT_EQ(fw.AllocatePoolCalls(), poolCalls);
+    }
+  }
+}
+
+TEST_F(KernelTest, FirmwareFailuresGiveTheirStatusAndMessage) {
+  const Bytes data = Pattern(0x2000, 8);
+  const uint32_t d = kObjectDataStart;
+  Object object{0xFEEDFACE,
+                {Segment(0x200000, 0x1000, d, 0x1000), Segment(0x300000, 0x1000, d + 0x1000, 0x1000),
+                 Thread(0x200000)},
+                data};
+  struct Row {
+    const char *name;
+    const char *service;
+    unsigned nth;
+    EFI_STATUS status;
+    std::string message;  // what the output holds besides the dots
+    uint64_t pages;       // kept by the segments placed before the failure
+    uint64_t top;
+  };
+  const Row rows[] = {
+      {"fat header read", "Read", 1, EFI_DEVICE_ERROR, "Read error 0x", 0, 0},
+      {"rewind", "SetPosition", 1, EFI_DEVICE_ERROR, "Couldn't set position back to 0.\r\n", 0, 0},
+      {"size", "GetInfo", 1, EFI_DEVICE_ERROR, "Couldn't get file info.\r\n", 0, 0},
+      {"object header read", "Read", 2, EFI_DEVICE_ERROR, "Read error 0x", 0, 0},
+      // The firmware's status is not passed on for the commands.
+      {"commands read", "Read", 3, EFI_LOAD_ERROR, "Read error 0x", 0, 0},
+      {"seek to the second segment", "SetPosition", 3, EFI_DEVICE_ERROR, "Set offset failed\r\n", 2, 0x201000},
+      {"read of the second segment", "Read", 5, EFI_DEVICE_ERROR,
+       "Read error 0x8000000000000007\r\nRead file failed: status 7, buffer size 0x0\r\n", 2, 0x201000},
+      {"pages of the second segment", "AllocatePages", 2, EFI_OUT_OF_RESOURCES,
+       "Error allocating 0x1 pages at 0x300000 alloc type 2\r\n", 1, 0x201000},
+  };
+  Bytes contents = object.Build();
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    Forget();
+    BootFile file;
+    Open(Source::kVolume, contents, &file);
+    fw.FailCall(row.service, row.nth, row.status == EFI_LOAD_ERROR ? EFI_DEVICE_ERROR : row.status);
+    size_t mark = fw.ConOutText().size();
+    EXPECT_EQ(nimb::LoadKernel(&file), row.status);
+    nimb::BootFileClose(&file);
+    std::string output = OutputSince(mark);
+    output.erase(0, output.find_first_not_of('.'));
+    EXPECT_EQ(output.substr(0, row.message.size()), row.message) << output;
+    EXPECT_EQ(nimb::gKernelEntry, kUntouchedEntry);
+    EXPECT_EQ(fw.AllocatedPages(), row.pages);
+    EXPECT_EQ(nimb::gKernelRegionTop, row.top);
+    EXPECT_EQ(TrackedPoolBlocks(), 0u);
+    fw.FailCall(row.service, 1000000, EFI_SUCCESS);  // spend nothing on the next row
+  }
+}
+
+TEST_F(KernelTest, NoPoolForTheCommandsEndsTheBoot) {
+  Bytes contents = Object{0xFEEDFACE, {Thread(0x200000)}, {}}.Build();
+  BootFile file;
+  Open(Source::kMemory, contents, &file);
+  fw.FailAllocation(1);
+  hostfw::RunResult result = fw.Call([&] { nimb::LoadKernel(&file); });
+  EXPECT_EQ(result.end, hostfw::RunEnd::Exited);
+  EXPECT_NE(fw.ConOutText().find("Out of memory in LoadKernel\r\n"), std::string::npos);
+}
+
+// --- the kernel of the boot options ---------------------------------------
+
+TEST_F(KernelTest, LoadKernelFileOpensLoadsAndCloses) {
+  Bytes kernel = Object{0xFEEDFACE, {Segment(0x200000, 0x10, kObjectDataStart, 0x10), Thread(0xC0200004)},
+                        Pattern(0x10)}
+                     .Build();
+  Bytes fat = WrapInFat(kernel, true);
+  Put("nimb_kernel", fat);
+  hostfw::NetworkDevice network(fw);
+  network.PutFile(u"nimb_kernel", fat);
+  network.PutFile(u"net\\k", kernel);
+  Bytes networkPath = network.FilePath(u"net\\k");
+  Bytes volumePath = network.FilePath(u"nimb_kernel");
+
+  struct Row {
+    const char *name;
+    const CHAR16 *kernelName;
+    const Bytes *devicePath;
+    bool overNetwork;
+    EFI_STATUS status;
+    std::string output;  // dots removed
+  };
+  const Row rows[] = {
+      {"by name from the volume", u"nimb_kernel", nullptr, false, EFI_SUCCESS, "Loading 'nimb_kernel'...\r\n"},
+      {"by name over LoadFile", u"nimb_kernel", nullptr, true, EFI_SUCCESS, "Loading 'nimb_kernel'...\r\n"},
+      {"by device path over LoadFile", u"other", &networkPath, true, EFI_SUCCESS, "Loading 'other'...\r\n"},
+      {"a missing file", u"missing", nullptr, false, EFI_NOT_FOUND,
+       "Loading 'missing'...\r\nCould not open file 'missing'\r\n"},
+      // A device path with no LoadFile to fetch it has no source.
+      {"a device path without LoadFile", u"nimb_kernel", &volumePath, false, EFI_INVALID_PARAMETER,
+       "Loading 'nimb_kernel'...\r\n"},
+      // Boot options that could not be settled leave no name.
+      {"no name", nullptr, nullptr, false, EFI_INVALID_PARAMETER, ""},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    Forget();
+    nimb::gKernelName = row.kernelName;
+    nimb::gKernelDevicePath =
+        row.devicePath ? reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(const_cast<uint8_t *>(row.devicePath->data()))
+                       : nullptr;
+    size_t mark = fw.ConOutText().size();
+    EFI_LOAD_FILE_INTERFACE *loadFile = row.overNetwork ? network.Protocol() : nullptr;
+    EXPECT_EQ(nimb::LoadKernelFile(loadFile, row.overNetwork ? nullptr : root_), row.status);
+    std::string output = OutputSince(mark);
+    output.erase(std::remove(output.begin(), output.end(), '.'), output.end());
+    // The dots of the name's own "..." went with the others.
+    std::string expected = row.output;
+    expected.erase(std::remove(expected.begin(), expected.end(), '.'), expected.end());
+    EXPECT_EQ(output, expected);
+    if (row.status == EFI_SUCCESS) {
+      EXPECT_EQ(nimb::gKernelEntry, 0x200004u);
+      EXPECT_EQ(std::memcmp(reinterpret_cast<void *>(0x200000), Pattern(0x10).data(), 0x10), 0);
+    } else {
+      EXPECT_EQ(nimb::gKernelEntry, kUntouchedEntry);
+    }
+    EXPECT_EQ(fw.OpenFiles(), 1u) << "only the root stays open";
+    EXPECT_EQ(TrackedPoolBlocks(), 0u) << "the record's path and buffer are given back";
+  }
+}
+
+// --- from an ELF executable, through the tool's writer, into memory ---------------
+
+TEST_F(KernelTest, ElfExecutableRoundTrip) {
+  const Bytes text = Pattern(0x1234, 9);
+  const Bytes data = Pattern(0x100, 10);
+  // Physical addresses differ from the virtual ones, whose low 30 bits would
+  // land elsewhere: the loader must see the physical ones.
+  Bytes elf = nimbtest::Elf(0xC0200040, {
+                                            {1, 0xC0200000, 0x00200000, text, 0x1234},
+                                            {4, 0, 0, Pattern(8), 8},  // not loaded
+                                            {1, 0xD0000000, 0xC0202000, data, 0x2100},
+                                            {1, 0xD0010000, 0x40205000, {}, 0x1800},
+                                        });
+  kobj::Kernel kernel;
+  ASSERT_EQ(kobj::ReadElf(elf, &kernel), "");
+  Bytes object = kobj::WriteObject(kernel);
+  std::vector<std::pair<std::string, Bytes>> forms = {
+      {"object", object},
+      {"little-endian fat", kobj::WriteFat({{18, 0, Pattern(0x40)}, {7, 3, object}}, kobj::ByteOrder::kLittle)},
+      {"big-endian fat", kobj::WriteFat({{18, 0, Pattern(0x40)}, {7, 3, object}}, kobj::ByteOrder::kBig)},
+  };
+  for (const auto &[name, contents] : forms) {
+    SCOPED_TRACE(name);
+    Forget();
+    BootFile file;
+    Open(Source::kMemory, contents, &file);
+    ASSERT_EQ(nimb::LoadKernel(&file), EFI_SUCCESS) << fw.ConOutText();
+    const uint8_t *memory = reinterpret_cast<const uint8_t *>(0x200000);
+    EXPECT_EQ(Bytes(memory, memory + text.size()), text);
+    EXPECT_TRUE(AllZero(0x200000 + text.size(), 0x202000));
+    memory = reinterpret_cast<const uint8_t *>(0x202000);
+    EXPECT_EQ(Bytes(memory, memory + data.size()), data);
+    EXPECT_TRUE(AllZero(0x202000 + data.size(), 0x205000));
+    EXPECT_TRUE(AllZero(0x205000, 0x207000)) << "the segment of zeroes alone";
+    EXPECT_EQ(fw.AllocatedPages(), 2u + 3u + 2u);
+    EXPECT_EQ(nimb::gKernelEntry, 0x200040u);
+    EXPECT_EQ(nimb::gKernelRegionBase, 0x200000u);
+    EXPECT_EQ(nimb::gKernelRegionTop, 0x207000u);
+  }
+}
+
+}  // namespace

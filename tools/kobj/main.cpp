@@ -1,0 +1,206 @@
+// kobj: turns a 32-bit x86 ELF executable into a kernel object that the
+// loader places at its addresses, alone or wrapped in a fat file.
+#include <cerrno>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <fstream>
+#include <iterator>
+#include <string>
+#include <vector>
+
+#include "kobj/writer.h"
+#include "load/kernel.h"
+
+namespace {
+
+constexpr int kExitInput = 1;  // the input cannot be made into a kernel object
+constexpr int kExitUsage = 2;  // the command line is wrong
+
+const char kUsage[] =
+    "Usage: kobj [options] INPUT.elf -o OUTPUT\n"
+    "\n"
+    "Turns a 32-bit x86 ELF executable (clang --target=i386-unknown-none-elf, ld.lld\n"
+    "--no-pie) into a kernel object: one segment per loadable program header, at its\n"
+    "physical address (p_paddr), and the ELF entry point as the kernel's entry.\n"
+    "Segments must start on 4096-byte boundaries and have pages of their own.\n"
+    "\n"
+    "Options:\n"
+    "  -o, --output FILE         write the result to FILE (required)\n"
+    "      --fat                 wrap the kernel object in a fat file\n"
+    "      --big-endian          fat file with big-endian records (the default; implies --fat)\n"
+    "      --little-endian       fat file with little-endian records (implies --fat)\n"
+    "      --extra-slice TYPE:FILE\n"
+    "                            add the bytes of FILE as a slice of processor type TYPE\n"
+    "                            (decimal or 0x hex) in front of the kernel's slice;\n"
+    "                            may be repeated, slices keep their order (implies --fat)\n"
+    "      --append-slice TYPE:FILE\n"
+    "                            the same, behind the kernel's slice\n"
+    "  -v, --verbose             list the segments and the entry point\n"
+    "  -h, --help                show this text\n"
+    "\n"
+    "Exit status: 0 on success, 1 when the input cannot be made into a kernel object,\n"
+    "2 for a wrong command line.\n";
+
+struct ExtraSlice {
+  uint32_t cpuType;
+  std::string path;
+  bool before;
+};
+
+struct Options {
+  std::string input;
+  std::string output;
+  bool fat = false;
+  bool orderGiven = false;
+  kobj::ByteOrder order = kobj::ByteOrder::kBig;
+  std::vector<ExtraSlice> extras;
+  bool verbose = false;
+};
+
+[[noreturn]] void UsageError(const std::string &message) {
+  std::fprintf(stderr, "kobj: %s\nTry 'kobj --help'.\n", message.c_str());
+  std::exit(kExitUsage);
+}
+
+[[noreturn]] void InputError(const std::string &message) {
+  std::fprintf(stderr, "kobj: %s\n", message.c_str());
+  std::exit(kExitInput);
+}
+
+bool ReadFile(const std::string &path, std::vector<uint8_t> *bytes) {
+  std::ifstream in(path, std::ios::binary);
+  if (!in)
+    return false;
+  bytes->assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+  return !in.bad();
+}
+
+ExtraSlice ParseSlice(const std::string &option, const std::string &value) {
+  size_t colon = value.find(':');
+  if (colon == std::string::npos || colon == 0 || colon + 1 == value.size())
+    UsageError(option + " wants TYPE:FILE, not '" + value + "'");
+  std::string type = value.substr(0, colon);
+  char *end = nullptr;
+  errno = 0;
+  unsigned long long number = std::strtoull(type.c_str(), &end, 0);
+  if (*end != '\0' || errno != 0 || number > UINT32_MAX || type[0] == '-')
+    UsageError(option + ": '" + type + "' is no 32-bit processor type");
+  return {static_cast<uint32_t>(number), value.substr(colon + 1), option == "--extra-slice"};
+}
+
+void SetOrder(Options *options, kobj::ByteOrder order) {
+  if (options->orderGiven && options->order != order)
+    UsageError("--big-endian and --little-endian exclude each other");
+  options->orderGiven = true;
+  options->order = order;
+  options->fat = true;
+}
+
+Options ParseCommandLine(int argc, char **argv) {
+  Options options;
+  bool outputGiven = false;
+  bool optionsEnded = false;
+  for (int i = 1; i < argc; i++) {
+    std::string arg = argv[i];
+    // The value of an option that takes one: the next word, or what follows
+    // '=' in the long form.
+    auto value = [&](const std::string &name) -> std::string {
+      if (arg.size() > name.size() && arg.compare(0, name.size() + 1, name + "=") == 0)
+        return arg.substr(name.size() + 1);
+      if (i + 1 >= argc)
+        UsageError(name + " needs a value");
+      return argv[++i];
+    };
+    auto is = [&](const std::string &name) {
+      return arg == name || (name.size() > 2 && arg.compare(0, name.size() + 1, name + "=") == 0);
+    };
+    if (optionsEnded || arg.empty() || arg[0] != '-' || arg == "-") {
+      if (!options.input.empty())
+        UsageError("one input file only ('" + options.input + "' and '" + arg + "')");
+      options.input = arg;
+    } else if (arg == "--") {
+      optionsEnded = true;
+    } else if (arg == "-h" || arg == "--help") {
+      std::fputs(kUsage, stdout);
+      std::exit(0);
+    } else if (arg == "-o" || is("--output")) {
+      if (outputGiven)
+        UsageError("one output file only");
+      outputGiven = true;
+      options.output = value(arg == "-o" ? "-o" : "--output");
+    } else if (arg == "--fat") {
+      options.fat = true;
+    } else if (arg == "--big-endian") {
+      SetOrder(&options, kobj::ByteOrder::kBig);
+    } else if (arg == "--little-endian") {
+      SetOrder(&options, kobj::ByteOrder::kLittle);
+    } else if (is("--extra-slice") || is("--append-slice")) {
+      std::string name = arg.compare(0, 13, "--extra-slice") == 0 ? "--extra-slice" : "--append-slice";
+      options.extras.push_back(ParseSlice(name, value(name)));
+      options.fat = true;
+    } else if (arg == "-v" || arg == "--verbose") {
+      options.verbose = true;
+    } else {
+      UsageError("unknown option '" + arg + "'");
+    }
+  }
+  if (options.input.empty())
+    UsageError("no input file");
+  if (options.output.empty())
+    UsageError("no output file (-o OUTPUT)");
+  return options;
+}
+
+}  // namespace
+
+int main(int argc, char **argv) {
+  Options options = ParseCommandLine(argc, argv);
+
+  std::vector<uint8_t> elf;
+  if (!ReadFile(options.input, &elf))
+    InputError("cannot read '" + options.input + "': " + std::strerror(errno));
+  kobj::Kernel kernel;
+  std::string problem = kobj::ReadElf(elf, &kernel);
+  if (!problem.empty())
+    InputError(options.input + ": " + problem);
+  if (options.verbose) {
+    for (const kobj::Segment &segment : kernel.segments) {
+      std::fprintf(stderr, "segment at 0x%08x (placed at 0x%08x): 0x%x bytes in memory, 0x%zx in the file\n",
+                   segment.address, segment.address & nimb::kKernelAddressMask, segment.memorySize,
+                   segment.bytes.size());
+    }
+    std::fprintf(stderr, "entry 0x%08x (0x%08x)\n", kernel.entry, kernel.entry & nimb::kKernelAddressMask);
+  }
+
+  std::vector<uint8_t> out = kobj::WriteObject(kernel);
+  if (options.fat) {
+    std::vector<kobj::FatEntry> slices;
+    std::vector<kobj::FatEntry> after;
+    for (const ExtraSlice &extra : options.extras) {
+      kobj::FatEntry entry;
+      entry.cpuType = extra.cpuType;
+      if (!ReadFile(extra.path, &entry.bytes))
+        InputError("cannot read '" + extra.path + "': " + std::strerror(errno));
+      (extra.before ? slices : after).push_back(std::move(entry));
+    }
+    kobj::FatEntry own;
+    own.cpuType = nimb::kCpuTypeX86;
+    own.cpuSubtype = kobj::kCpuSubtypeX86All;
+    own.bytes = std::move(out);
+    slices.push_back(std::move(own));
+    slices.insert(slices.end(), after.begin(), after.end());
+    out = kobj::WriteFat(slices, options.order);
+  }
+  // Offsets in the records are 32-bit words.
+  if (out.size() > UINT32_MAX)
+    InputError("the result would exceed 4 GiB");
+
+  std::ofstream file(options.output, std::ios::binary | std::ios::trunc);
+  file.write(reinterpret_cast<const char *>(out.data()), static_cast<std::streamsize>(out.size()));
+  file.close();
+  if (!file)
+    InputError("cannot write '" + options.output + "'");
+  return 0;
+}
