@@ -60,6 +60,10 @@ endif()
 if(EXISTS ${CMAKE_SOURCE_DIR}/tools/CMakeLists.txt)
   add_subdirectory(tools)
 endif()
+# The reference kernel, after the tools: it is converted with kobj.
+if(EXISTS ${CMAKE_SOURCE_DIR}/tests/guest/CMakeLists.txt)
+  add_subdirectory(tests/guest)
+endif()
 
 # --- benchmarks ------------------------------------------------------------------
 if(NIMB_BENCH AND EXISTS ${CMAKE_SOURCE_DIR}/bench/CMakeLists.txt)

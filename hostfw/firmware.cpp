@@ -142,7 +142,9 @@ void FillBootServices(EFI_BOOT_SERVICES &bs) {
   UpdateTableCrc(&bs.Hdr, sizeof(bs));
 }
 
-bool FaultMatches(const Fault &fault, const char *name, const EFI_GUID *protocol) {
+bool FaultMatches(const Fault &fault, const char *name, const EFI_GUID *protocol, const UINTN *size) {
+  if (fault.hasSize && (size == nullptr || *size != fault.size))
+    return false;
   if (fault.name.empty()) {
     if (std::strcmp(name, "AllocatePool") != 0 && std::strcmp(name, "AllocatePages") != 0)
       return false;
@@ -153,10 +155,11 @@ bool FaultMatches(const Fault &fault, const char *name, const EFI_GUID *protocol
 }
 
 // Counts the call against the pending faults; true when one of them falls due.
-bool TakeFault(State &s, const char *name, const EFI_GUID *protocol, EFI_STATUS *failure) {
+bool TakeFault(State &s, const char *name, const EFI_GUID *protocol, EFI_STATUS *failure,
+               const UINTN *size = nullptr) {
   bool due = false;
   for (Fault &fault : s.faults) {
-    if (!FaultMatches(fault, name, protocol))
+    if (!FaultMatches(fault, name, protocol, size))
       continue;
     if (--fault.remaining == 0 && !due) {
       due = true;
@@ -189,14 +192,14 @@ void Misuse(const char *format, ...) {
   std::abort();
 }
 
-bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *protocol) {
+bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *protocol, const UINTN *size) {
   s.callCounts[name]++;
   if (s.exited) {
     s.violations.push_back(name);
     *failure = EFI_UNSUPPORTED;
     return true;
   }
-  return TakeFault(s, name, protocol, failure);
+  return TakeFault(s, name, protocol, failure, size);
 }
 
 bool RefusedAtRuntime(State &s, const char *name, EFI_STATUS *failure) {
@@ -448,6 +451,15 @@ void Firmware::FailCall(const std::string &name, unsigned nth, EFI_STATUS status
     Misuse("FailCall needs a service name and counts from 1");
   s_->faults.push_back(
       {name, nth, status, protocol != nullptr, protocol != nullptr ? *protocol : EFI_GUID{}});
+}
+
+void Firmware::FailPoolAllocationOfSize(UINTN size, unsigned nth, EFI_STATUS status) {
+  if (nth == 0)
+    Misuse("FailPoolAllocationOfSize counts from 1");
+  Fault fault{"AllocatePool", nth, status, false, {}};
+  fault.hasSize = true;
+  fault.size = size;
+  s_->faults.push_back(fault);
 }
 
 unsigned Firmware::CallCount(const std::string &name) const {

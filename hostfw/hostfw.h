@@ -133,6 +133,39 @@ struct HardDriveNode {
   static HardDriveNode Mbr(UINT32 diskSignature, UINT32 partition = 1);
 };
 
+// An in-memory screen behind UGA Draw and the frame buffer info protocol
+// (AddScreen). Its pixels lie in firmware memory of the arena, so that the
+// frame buffer's address fits 32 bits as on the machines the loader knows.
+struct ScreenOptions {
+  UINT32 width = 1024;
+  UINT32 height = 768;
+  UINT32 depth = 32;  // 32 (blue, green, red, reserved) or 16 (5 bits each, red on top)
+  UINT32 refresh = 60;
+  UINT32 rowBytes = 0;          // 0: width x bytes per pixel; more leaves unused bytes at each row's end
+  bool ugaDraw = true;          // UGA Draw on the ConsoleOutHandle
+  bool frameBufferInfo = true;  // the frame buffer info protocol, on the same handle
+};
+
+// What the frame buffer info protocol's GetInfo reports.
+struct FrameBufferFacts {
+  UINT64 base = 0;
+  UINT32 size = 0;
+  UINT32 rowBytes = 0;
+  UINT32 width = 0;
+  UINT32 height = 0;
+  UINT32 depth = 0;
+};
+
+// A UGA Blt call that reached the screen, whatever its status.
+struct BltCall {
+  EFI_UGA_BLT_OPERATION operation;
+  UINTN sourceX, sourceY, destinationX, destinationY, width, height, delta;
+  EFI_UGA_PIXEL fill;  // a fill's pixel; zero for other operations
+  EFI_STATUS status;
+};
+
+struct Screen;  // graphics.cpp
+
 class Firmware {
  public:
   Firmware();
@@ -274,6 +307,25 @@ class Firmware {
   // followed by `nodes` and the end node.
   void SetHardDrivePath(EFI_HANDLE handle, const std::vector<HardDriveNode> &nodes);
 
+  // --- Screen ---------------------------------------------------------------
+  // Makes an in-memory screen, black, and installs the protocols that
+  // `options` asks for. Blt accepts fills and buffer-to-video copies, and
+  // refuses a rectangle that does not lie on the screen with
+  // EFI_INVALID_PARAMETER. Service names for CallCount and FailCall:
+  // "UgaGetMode", "UgaBlt", "FrameBufferGetInfo". A later call makes a new
+  // screen in place of the old.
+  void AddScreen(const ScreenOptions &options = {});
+  void SetUgaDrawPresent(bool present);
+  void SetFrameBufferInfoPresent(bool present);
+  // The screen's own facts, which GetInfo reports until SetFrameBufferFacts.
+  FrameBufferFacts ScreenFacts() const;
+  void SetFrameBufferFacts(const FrameBufferFacts &facts);
+  // A pixel as it stands in the screen's memory: with 32 bits blue | green
+  // << 8 | red << 16 | reserved << 24, with 16 bits blue | green << 5 | red
+  // << 10.
+  UINT32 ScreenPixel(UINT32 x, UINT32 y) const;
+  const std::vector<BltCall> &BltCalls() const;
+
   // --- ExitBootServices ---------------------------------------------------
   bool BootServicesExited() const;
   // Calls into boot services, the console or any other boot-time protocol
@@ -296,12 +348,15 @@ class Firmware {
   // are counted (and those of the other services that take a protocol GUID).
   void FailCall(const std::string &name, unsigned nth = 1, EFI_STATUS status = EFI_DEVICE_ERROR,
                 const EFI_GUID *protocol = nullptr);
+  // The n-th pool allocation from now of exactly `size` bytes fails.
+  void FailPoolAllocationOfSize(UINTN size, unsigned nth = 1, EFI_STATUS status = EFI_OUT_OF_RESOURCES);
   // How often a service was called since the firmware was made.
   unsigned CallCount(const std::string &name) const;
 
  private:
   struct State;
   std::unique_ptr<State> s_;
+  std::shared_ptr<Screen> screen_;  // null until AddScreen
   friend struct Services;
 };
 

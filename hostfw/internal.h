@@ -143,6 +143,8 @@ struct Fault {
   EFI_STATUS status;
   bool hasProtocol;
   EFI_GUID protocol;
+  bool hasSize = false;  // an allocation of exactly `size` bytes only
+  UINTN size = 0;
 };
 
 // --- The whole state --------------------------------------------------------------
@@ -226,7 +228,8 @@ using State = Services::State;
 // counted; after ExitBootServices it is recorded as a violation and refused;
 // otherwise an injected fault may refuse it. Returns true when the call must
 // fail at once, with `*failure` as its status and no other effect.
-bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *protocol = nullptr);
+bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *protocol = nullptr,
+             const UINTN *size = nullptr);
 // The same for the runtime services, which stay callable after ExitBootServices.
 bool RefusedAtRuntime(State &s, const char *name, EFI_STATUS *failure);
 

@@ -239,7 +239,7 @@ EFI_STATUS EFIAPI GetMemoryMap(UINTN *MemoryMapSize, EFI_MEMORY_DESCRIPTOR *Memo
 EFI_STATUS EFIAPI AllocatePool(EFI_MEMORY_TYPE PoolType, UINTN Size, VOID **Buffer) {
   State &s = Services::Active();
   EFI_STATUS failure;
-  if (Refused(s, "AllocatePool", &failure))
+  if (Refused(s, "AllocatePool", &failure, nullptr, &Size))
     return failure;
   if (!AllocatableType(PoolType) || Buffer == nullptr)
     return EFI_INVALID_PARAMETER;

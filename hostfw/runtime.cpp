@@ -2,6 +2,7 @@
 // the clock. They stay callable after ExitBootServices.
 #include <cstdio>
 #include <cstring>
+#include <type_traits>
 #include <ctime>
 
 #include "hostfw/internal.h"
@@ -154,6 +155,24 @@ EFI_STATUS EFIAPI SetVirtualAddressMap(UINTN MemoryMapSize, UINTN DescriptorSize
     s.virtualMap.push_back(descriptor);
   }
   s.virtualMapSet = true;
+  // As real firmware does, the system table's own pointers are converted to
+  // the new addresses of the regions they point into, so that a copy of the
+  // table made after this call is usable at its new place.
+  EFI_SYSTEM_TABLE &st = s.tables->system;
+  auto convert = [&s](auto *&pointer) {
+    UINT64 address = reinterpret_cast<UINT64>(pointer);
+    for (const EFI_MEMORY_DESCRIPTOR &d : s.virtualMap) {
+      if ((d.Attribute & EFI_MEMORY_RUNTIME) && address >= d.PhysicalStart &&
+          address - d.PhysicalStart < d.NumberOfPages * EFI_PAGE_SIZE) {
+        pointer = reinterpret_cast<std::remove_reference_t<decltype(pointer)>>(address - d.PhysicalStart + d.VirtualStart);
+        return;
+      }
+    }
+  };
+  convert(st.RuntimeServices);
+  convert(st.ConfigurationTable);
+  convert(st.FirmwareVendor);
+  UpdateSystemTableCrc(s);
   return EFI_SUCCESS;
 }
 

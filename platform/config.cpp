@@ -1,5 +1,6 @@
 #include "config.h"
 
+#include "efi/vendor.h"
 #include "support/strings.h"
 
 namespace nimb::platform {
@@ -8,7 +9,11 @@ namespace {
 
 // --- values ------------------------------------------------------------------
 
-bool ApplyLoader(PlatformConfig *config, const char *value) {
+// Each key's function gets the name behind the key's prefix (empty for a key
+// without one) and the value, which it may rewrite in place once it has found
+// it good: a refused value is reported as it was written.
+
+bool ApplyLoader(PlatformConfig *config, const char *, char *value) {
   if (*value == '\0' || !Utf8ToUcs2(value, nullptr, 0, nullptr)) {
     return false;
   }
@@ -16,7 +21,7 @@ bool ApplyLoader(PlatformConfig *config, const char *value) {
   return true;
 }
 
-bool ApplyOptions(PlatformConfig *config, const char *value) {
+bool ApplyOptions(PlatformConfig *config, const char *, char *value) {
   if (!Utf8ToUcs2(value, nullptr, 0, nullptr)) {
     return false;
   }
@@ -24,7 +29,7 @@ bool ApplyOptions(PlatformConfig *config, const char *value) {
   return true;
 }
 
-bool ApplyConsole(PlatformConfig *config, const char *value) {
+bool ApplyConsole(PlatformConfig *config, const char *, char *value) {
   if (strcmp(value, "text") == 0) {
     config->consoleMode = EfiConsoleControlScreenText;
   } else if (strcmp(value, "graphics") == 0) {
@@ -45,7 +50,7 @@ bool ParseDecimal(const char *value, UINT64 limit, UINT64 *number) {
   return *end == '\0' && *number <= limit;
 }
 
-bool ApplyHold(PlatformConfig *config, const char *value) {
+bool ApplyHold(PlatformConfig *config, const char *, char *value) {
   UINT64 seconds = 0;
   if (!ParseDecimal(value, kMaxHoldSeconds, &seconds)) {
     return false;
@@ -54,9 +59,208 @@ bool ApplyHold(PlatformConfig *config, const char *value) {
   return true;
 }
 
+// Held keys.
+
+struct NamedModifier {
+  const char *name;
+  UINT16 bit;
+};
+
+// Bits of the modifier mask, as a USB HID keyboard report has them.
+constexpr NamedModifier kModifiers[] = {
+    {"ctrl", 0x01},
+    {"lctrl", 0x01},
+    {"shift", kKeyModifierLeftShift},
+    {"lshift", kKeyModifierLeftShift},
+    {"alt", 0x04},
+    {"lalt", 0x04},
+    {"gui", kKeyModifierLeftGui},
+    {"lgui", kKeyModifierLeftGui},
+    {"rctrl", 0x10},
+    {"rshift", kKeyModifierRightShift},
+    {"ralt", 0x40},
+    {"rgui", kKeyModifierRightGui},
+};
+
+constexpr UINT16 kKeyboardPage = 0x7000;
+constexpr UINT16 kUsageA = 0x04;
+constexpr UINT16 kUsage1 = 0x1E;  // then 2 to 9, and 0 at 0x27
+constexpr UINT16 kUsage0 = 0x27;
+
+int HexDigit(char c) {
+  if (c >= '0' && c <= '9') {
+    return c - '0';
+  }
+  if (c >= 'a' && c <= 'f') {
+    return c - 'a' + 10;
+  }
+  if (c >= 'A' && c <= 'F') {
+    return c - 'A' + 10;
+  }
+  return -1;
+}
+
+// The key value of a key's name; 0 for none.
+UINT16 KeyValue(const char *name) {
+  if (name[0] >= 'a' && name[0] <= 'z' && name[1] == '\0') {
+    return static_cast<UINT16>(kKeyboardPage + kUsageA + (name[0] - 'a'));
+  }
+  if (name[0] >= '0' && name[0] <= '9' && name[1] == '\0') {
+    return static_cast<UINT16>(kKeyboardPage + (name[0] == '0' ? kUsage0 : kUsage1 + (name[0] - '1')));
+  }
+  if (name[0] != '0' || name[1] != 'x' || name[2] == '\0') {
+    return 0;
+  }
+  UINT32 usage = 0;
+  for (const char *p = name + 2; *p != '\0'; p++) {
+    const int digit = HexDigit(*p);
+    if (digit < 0 || usage > 0xF) {
+      return 0;
+    }
+    usage = usage * 16 + static_cast<UINT32>(digit);
+  }
+  return usage == 0 ? 0 : static_cast<UINT16>(kKeyboardPage + usage);
+}
+
+// Adds one name of a `keys` value to `held`.
+bool AddHeldKey(HeldKeys *held, const char *name) {
+  for (const NamedModifier &modifier : kModifiers) {
+    if (strcmp(name, modifier.name) == 0) {
+      held->modifiers = static_cast<UINT16>(held->modifiers | modifier.bit);
+      return true;
+    }
+  }
+  const UINT16 key = KeyValue(name);
+  if (key == 0 || held->count == kMaxHeldKeys) {
+    return false;
+  }
+  for (UINT32 i = 0; i < held->count; i++) {
+    if (held->keys[i] == key) {
+      return false;
+    }
+  }
+  held->keys[held->count++] = key;
+  return true;
+}
+
+// The longest name of a key or modifier, with its NUL.
+constexpr UINT32 kKeyNameCapacity = 8;
+
+bool ApplyKeys(PlatformConfig *config, const char *, char *value) {
+  HeldKeys held = {};
+  const char *p = value;
+  bool more = *p != '\0';
+  while (more) {
+    char name[kKeyNameCapacity];
+    UINT32 length = 0;
+    for (; *p != '\0' && *p != '+'; p++) {
+      if (length + 1 == kKeyNameCapacity) {
+        return false;
+      }
+      name[length++] = *p;
+    }
+    name[length] = '\0';
+    if (!AddHeldKey(&held, name)) {
+      return false;
+    }
+    more = *p++ == '+';
+  }
+  config->keys = held;
+  return true;
+}
+
+bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
+  UINT64 flag = 0;
+  if (!ParseDecimal(value, 1, &flag) || value[1] != '\0') {
+    return false;
+  }
+  config->keysIgnored = flag != 0;
+  return true;
+}
+
+// Variables and records.
+
+// Pairs of hexadecimal digits, with blanks allowed between pairs: checks
+// `value` and counts its bytes.
+bool HexSize(const char *value, UINT32 *size) {
+  UINT32 count = 0;
+  for (const char *p = value; *p != '\0'; p++) {
+    if (*p == ' ' || *p == '\t') {
+      continue;
+    }
+    if (HexDigit(p[0]) < 0 || HexDigit(p[1]) < 0) {
+      return false;
+    }
+    p++;
+    count++;
+  }
+  *size = count;
+  return true;
+}
+
+// Decodes a value that HexSize has passed into bytes, in place.
+void DecodeHex(char *value) {
+  UINT8 *out = reinterpret_cast<UINT8 *>(value);
+  for (const char *p = value; *p != '\0'; p++) {
+    if (*p != ' ' && *p != '\t') {
+      *out++ = static_cast<UINT8>(HexDigit(p[0]) << 4 | HexDigit(p[1]));
+      p++;
+    }
+  }
+}
+
+// Stores a value under `name`, in the place of an earlier value of the name.
+// Nothing is changed, the value included, unless the whole line is good.
+bool AddEntry(ConfigEntryList *list, const char *name, char *value, bool hex, bool allowEmpty) {
+  if (*name == '\0' || !Utf8ToUcs2(name, nullptr, 0, nullptr)) {
+    return false;
+  }
+  UINT32 size = strlen(value);
+  if (hex ? !HexSize(value, &size) : !Utf8ToUcs2(value, nullptr, 0, nullptr)) {
+    return false;
+  }
+  if (size == 0 && !allowEmpty) {
+    return false;
+  }
+  UINT32 index = 0;
+  while (index < list->count && strcmp(list->entries[index].name, name) != 0) {
+    index++;
+  }
+  if (index == kMaxConfigEntries) {
+    return false;
+  }
+  if (hex) {
+    DecodeHex(value);
+  }
+  if (index == list->count) {
+    list->count++;
+  }
+  list->entries[index] = {name, reinterpret_cast<const UINT8 *>(value), size, !hex};
+  return true;
+}
+
+// An NVRAM variable cannot be empty; a record's value can.
+bool ApplyNvramText(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->nvram, name, value, false, false);
+}
+
+bool ApplyNvramHex(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->nvram, name, value, true, false);
+}
+
+bool ApplyDataHubText(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->dataHub, name, value, false, true);
+}
+
+bool ApplyDataHubHex(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->dataHub, name, value, true, true);
+}
+
+// A key whose name ends in '.' is a prefix: it takes every key that starts
+// with it, and its function gets the rest of the key as the name.
 struct ConfigKey {
   const char *name;
-  bool (*apply)(PlatformConfig *config, const char *value);
+  bool (*apply)(PlatformConfig *config, const char *name, char *value);
 };
 
 constexpr ConfigKey kConfigKeys[] = {
@@ -64,7 +268,23 @@ constexpr ConfigKey kConfigKeys[] = {
     {"options", ApplyOptions},
     {"console", ApplyConsole},
     {"hold", ApplyHold},
+    {"keys", ApplyKeys},
+    {"keys-ignored", ApplyKeysIgnored},
+    {"nvram.", ApplyNvramText},
+    {"nvram-hex.", ApplyNvramHex},
+    {"datahub.", ApplyDataHubText},
+    {"datahub-hex.", ApplyDataHubHex},
 };
+
+// The name that `key` gives to the function of `entry`, or null when the
+// key isn't the entry's.
+const char *MatchKey(const ConfigKey &entry, const char *key) {
+  const UINT32 length = strlen(entry.name);
+  if (entry.name[length - 1] != '.') {
+    return strcmp(key, entry.name) == 0 ? "" : nullptr;
+  }
+  return strncmp(key, entry.name, static_cast<INT32>(length)) == 0 ? key + length : nullptr;
+}
 
 // --- lines ---------------------------------------------------------------------
 
@@ -148,10 +368,11 @@ UINT32 ParseLine(char *start, char *end, UINT32 line, PlatformConfig *config, Co
   char *value = Trim(equals + 1, equals + 1 + strlen(equals + 1));
   char *key = Trim(text, equals);
   for (const ConfigKey &entry : kConfigKeys) {
-    if (strcmp(key, entry.name) != 0) {
+    const char *name = MatchKey(entry, key);
+    if (name == nullptr) {
       continue;
     }
-    if (Unquote(value) && entry.apply(config, value)) {
+    if (Unquote(value) && entry.apply(config, name, value)) {
       return 0;
     }
     report({kConfigBadValue, line, key, value}, context);
@@ -168,6 +389,10 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->options = nullptr;
   config->consoleMode = EfiConsoleControlScreenGraphics;
   config->holdSeconds = 0;
+  config->keys = {};
+  config->keysIgnored = false;
+  config->nvram.count = 0;
+  config->dataHub.count = 0;
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {

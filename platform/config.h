@@ -34,9 +34,10 @@
 //                          a NUL unit behind it
 //   datahub-hex.<name>=<hex>  the same with raw bytes for the value (may be
 //                          empty)
-// NVRAM values may not be empty (an empty variable cannot exist). The text
-// and hexadecimal forms of one name are one variable or one record: the
-// later line wins. Records and variables keep the order of their first line.
+// NVRAM values may not be empty (an empty variable cannot exist). Names and
+// text values are UTF-8 within U+FFFF. The text and hexadecimal forms of one
+// name are one variable or one record: the later line wins. Records and
+// variables keep the order of their first line.
 // Without any key there is still a key state protocol (nothing held), a boot
 // policy protocol (answering 0) and a Data Hub (no vendor records).
 //

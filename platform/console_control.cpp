@@ -69,15 +69,26 @@ EFI_STATUS EFIAPI GetMode(EFI_CONSOLE_CONTROL_PROTOCOL *This, EFI_CONSOLE_CONTRO
   return EFI_SUCCESS;
 }
 
+EFI_STATUS ChangeMode(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode) {
+  if (mode >= EfiConsoleControlScreenMaxValue) {
+    return EFI_INVALID_PARAMETER;
+  }
+  if (mode == console->mode) {
+    return EFI_SUCCESS;
+  }
+  return Enter(console, mode);
+}
+
 EFI_STATUS EFIAPI SetMode(EFI_CONSOLE_CONTROL_PROTOCOL *This, EFI_CONSOLE_CONTROL_SCREEN_MODE Mode) {
-  if (This == nullptr || Mode >= EfiConsoleControlScreenMaxValue) {
+  if (This == nullptr) {
     return EFI_INVALID_PARAMETER;
   }
   PlatformConsole *console = ConsoleOf(This);
-  if (Mode == console->mode) {
-    return EFI_SUCCESS;
+  const EFI_STATUS status = ChangeMode(console, Mode);
+  if (console->onSetMode != nullptr) {
+    console->onSetMode(Mode, status);
   }
-  return Enter(console, Mode);
+  return status;
 }
 
 EFI_STATUS EFIAPI LockStdIn(EFI_CONSOLE_CONTROL_PROTOCOL *, CHAR16 *) {
@@ -94,6 +105,7 @@ EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_P
   console->mode = EfiConsoleControlScreenText;
   console->text = text;
   console->graphics = graphics;
+  console->onSetMode = nullptr;
   return Enter(console, mode);
 }
 

@@ -20,10 +20,14 @@ struct PlatformConsole {
   EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text;
   // Null when the firmware has no graphics output.
   EFI_GRAPHICS_OUTPUT_PROTOCOL *graphics;
+  // Hears of every call of SetMode with the mode asked for and the status
+  // given back; null for none.
+  void (*onSetMode)(EFI_CONSOLE_CONTROL_SCREEN_MODE mode, EFI_STATUS status);
 };
 
 // Fills in the protocol over `text` and `graphics` and puts the screen into
-// `mode`, clearing it even if the mode is already the one set.
+// `mode`, clearing it even if the mode is already the one set. No one hears
+// of SetMode yet.
 EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text,
                               EFI_GRAPHICS_OUTPUT_PROTOCOL *graphics, EFI_CONSOLE_CONTROL_SCREEN_MODE mode);
 

@@ -6,9 +6,12 @@
 
 #include "config.h"
 #include "console_control.h"
+#include "data_hub.h"
+#include "efi/vendor.h"
 #include "exitcodes.h"
 #include "firmware.h"
 #include "format.h"
+#include "key_state.h"
 #include "memory.h"
 #include "serial.h"
 
@@ -21,6 +24,9 @@ constexpr const CHAR16 *kConfigPath = u"\\EFI\\BOOT\\platform.cfg";
 constexpr const char *kConfigName = "platform.cfg";
 
 PlatformConsole gConsole;
+PlatformKeyState gKeyState;
+PlatformBootPolicy gBootPolicy;
+PlatformDataHub gDataHub;
 MemoryMeter gMeter;
 
 // The debug-exit device ends the machine with the code; without one the
@@ -201,12 +207,71 @@ LoaderLaunch PrepareLoader(EFI_FILE_PROTOCOL *root, EFI_HANDLE device, const Pla
   return launch;
 }
 
+// "text" or "graphics"; null for a value beyond the modes.
+const char *ModeName(EFI_CONSOLE_CONTROL_SCREEN_MODE mode) {
+  switch (mode) {
+    case EfiConsoleControlScreenText:
+      return "text";
+    case EfiConsoleControlScreenGraphics:
+      return "graphics";
+    default:
+      return nullptr;
+  }
+}
+
+// Every mode change that the loader asks for shows in the log, on a line of
+// its own between the loader's messages.
+void ReportSetMode(EFI_CONSOLE_CONTROL_SCREEN_MODE mode, EFI_STATUS status) {
+  SerialPrintf("\nplatform: console mode ");
+  if (ModeName(mode) != nullptr) {
+    SerialPrintf("%s", ModeName(mode));
+  } else {
+    SerialPrintf("%u", static_cast<UINT64>(mode));
+  }
+  if (EFI_ERROR(status)) {
+    SerialPrintf(" refused (%s)", StatusName(status));
+  }
+  SerialPrintf("\n");
+}
+
 // The protocols of the machines that the loader was made for, which the
 // firmware lacks.
 void InstallProtocols(const PlatformConfig &config) {
-  const EFI_STATUS status = ConsoleControlInstall(&gConsole, config.consoleMode);
+  EFI_STATUS status = ConsoleControlInstall(&gConsole, config.consoleMode);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
+  }
+  gConsole.onSetMode = ReportSetMode;
+  status = KeyProtocolsInstall(&gKeyState, &gBootPolicy, config);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot install the key protocols (%s)", StatusName(status));
+  }
+  SerialPrintf("platform: keys: modifiers 0x%x, %u keys, ignored %u\n",
+               static_cast<UINT64>(config.keys.modifiers), static_cast<UINT64>(config.keys.count),
+               static_cast<UINT64>(config.keysIgnored ? 1 : 0));
+  status = DataHubInstall(&gDataHub, config.dataHub);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot install the Data Hub (%s)", StatusName(status));
+  }
+  SerialPrintf("platform: data hub: %u platform records\n", static_cast<UINT64>(config.dataHub.count));
+}
+
+// The loader's variables that the configuration sets; the others stay as
+// they are.
+void SetVariables(const ConfigEntryList &variables) {
+  constexpr UINT32 kAttributes =
+      EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
+  for (UINT32 i = 0; i < variables.count; i++) {
+    const ConfigEntry &variable = variables.entries[i];
+    UINTN units = 0;
+    CHAR16 *name = WideCopyOrFail(variable.name, "a variable's name", &units);
+    const EFI_STATUS status =
+        gRT->SetVariable(name, &gNimbVendorVariableGuid, kAttributes, variable.size, variable.bytes);
+    gBS->FreePool(name);
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot set NVRAM variable %s (%s)", variable.name, StatusName(status));
+    }
+    SerialPrintf("platform: nvram %s set, %u bytes\n", variable.name, static_cast<UINT64>(variable.size));
   }
 }
 
@@ -249,13 +314,14 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   const UINTN directories = MemoryWarmDirectoryCache(root);
   root->Close(root);
   InstallProtocols(config);
+  SetVariables(config.nvram);
   MemoryStockPool();
   const EFI_STATUS status = MemoryMeterInit(&gMeter);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot size the memory map (%s)", StatusName(status));
   }
   SerialPrintf("platform: starting %s, console %s, %u directories\n", config.loaderPath,
-               config.consoleMode == EfiConsoleControlScreenText ? "text" : "graphics", directories);
+               ModeName(config.consoleMode), directories);
 
   const UINT64 pagesBefore = FreePagesOrFail("before the loader");
   const EFI_STATUS loaderStatus = RunLoader(launch, config);

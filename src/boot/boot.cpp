@@ -2,12 +2,14 @@
 
 #include "boot/bootinfo.h"
 #include "boot/gate.h"
+#include "boot/handoff.h"
 #include "boot/machine.h"
 #include "boot/volume.h"
 #include "config/boot_options.h"
 #include "devicetree/platform.h"
 #include "load/kernel.h"
 #include "memory/tracking.h"
+#include "screen/bootscreen.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
 
@@ -28,6 +30,7 @@ void ExitBoot(EFI_STATUS status) {
     gSpinnerEvent = nullptr;
   }
   RestoreConsoleMode();
+  DrawFailureScreen();
   TrackedFreeAll();
   gBS->Exit(gImageHandle, status, 0, nullptr);
   // Exit does not come back to an application; should it, there is nothing
@@ -76,6 +79,8 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
   // boot never shows the logo.
   if (gBootFlags & kBootVerbose) {
     SetConsoleMode(kConsoleText);
+  } else {
+    ShowBootScreen();
   }
 
   // A plain kernel (there is no kernel cache in this build).
@@ -86,10 +91,18 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
   // The record goes to the top of the kernel region, which exists only now.
   InitBootInfo(gLoadedImage, gBootOptions);
 
-  // This build has no final hand-off yet: without it boot services cannot be
-  // left, so the gate is never called.
+  if (gSpinnerEvent != nullptr) {
+    StopSpinner();
+  }
 
-  Fatal("Kernel entry failed\n");
+  UINTN mapKey = 0;
+  FinishBootInfo(&mapKey, gBootOptions);
+
+  // Boot services are gone. Nothing but the arguments' loading stands between
+  // the interrupts going off and the call; the gate does not come back (and
+  // with boot services gone there would be no console to say so).
+  MachineDisableInterrupts();
+  MachineCallGate(gCallGate, reinterpret_cast<UINT64>(bootArgs), gKernelEntry);
 }
 
 }  // namespace nimb

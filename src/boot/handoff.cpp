@@ -351,7 +351,8 @@ EFI_STATUS FinishBootInfo(UINTN *mapKey, const char *options) {
   bootArgs->memoryDescriptorSize = static_cast<UINT32>(shape.descriptorSize);
   bootArgs->memoryDescriptorVersion = shape.descriptorVersion;
 
-  UINT8 *mapEnd = map + mapSize;
+  EFI_MEMORY_DESCRIPTOR *mapStart = reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map);
+  EFI_MEMORY_DESCRIPTOR *mapEnd = reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map + mapSize);
   UINT64 runtimeStart = (gKernelRegionTop + EFI_PAGE_SIZE - 1) & ~(EFI_PAGE_SIZE - 1);
   UINT64 nextVirtual = runtimeStart;
   if (EFI_ERROR(gBS->ExitBootServices(gImageHandle, *mapKey))) {
@@ -359,12 +360,12 @@ EFI_STATUS FinishBootInfo(UINTN *mapKey, const char *options) {
   }
 
   // Boot services are gone: no console, no pool, no Fatal from here on.
-  MapRuntimeServices(map, mapEnd, &mapEnd, shape.descriptorSize, shape.descriptorVersion, &nextVirtual, 0);
+  MapRuntimeServices(mapStart, mapEnd, &mapEnd, shape.descriptorSize, shape.descriptorVersion, &nextVirtual, FALSE);
   bootArgs->systemTable = static_cast<UINT32>(reinterpret_cast<UINT64>(gST));
   gBS = nullptr;
   gRT = nullptr;
   if (bootArgs->systemTable == 0) {
-    StopAfterBootServices("Error finding runtimeServicesVirtual\n");
+    StopAfterBootServices("Error finding runtimeServicesVirtual\n", FALSE);
   }
 
   nextVirtual += kRuntimeSparePages * EFI_PAGE_SIZE;

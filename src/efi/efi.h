@@ -530,6 +530,36 @@ struct EFI_GRAPHICS_OUTPUT_PROTOCOL {
 };
 
 // ---------------------------------------------------------------------------
+// UGA Draw: the drawing interface of the console's screen that the loader
+// paints with. A pixel is blue, green, red and a reserved byte; a Delta of 0
+// means rows of Width pixels.
+
+struct EFI_UGA_PIXEL {
+  UINT8 Blue;
+  UINT8 Green;
+  UINT8 Red;
+  UINT8 Reserved;
+};
+
+enum EFI_UGA_BLT_OPERATION : UINT32 {
+  EfiUgaVideoFill,
+  EfiUgaVideoToBltBuffer,
+  EfiUgaBltBufferToVideo,
+  EfiUgaVideoToVideo,
+  EfiUgaBltMax
+};
+
+struct EFI_UGA_DRAW_PROTOCOL {
+  EFI_STATUS(EFIAPI *GetMode)
+  (EFI_UGA_DRAW_PROTOCOL *This, UINT32 *HorizontalResolution, UINT32 *VerticalResolution, UINT32 *ColorDepth,
+   UINT32 *RefreshRate);
+  void *SetMode;
+  EFI_STATUS(EFIAPI *Blt)
+  (EFI_UGA_DRAW_PROTOCOL *This, EFI_UGA_PIXEL *BltBuffer, EFI_UGA_BLT_OPERATION BltOperation, UINTN SourceX,
+   UINTN SourceY, UINTN DestinationX, UINTN DestinationY, UINTN Width, UINTN Height, UINTN Delta);
+};
+
+// ---------------------------------------------------------------------------
 // GUIDs.
 
 #define EFI_GUID_VALUE(a, b, c, d0, d1, d2, d3, d4, d5, d6, d7) \
@@ -557,6 +587,8 @@ inline const EFI_GUID gEfiSimpleTextOutProtocolGuid =
     EFI_GUID_VALUE(0x387477C2, 0x69C7, 0x11D2, 0x8E, 0x39, 0x00, 0xA0, 0xC9, 0x69, 0x72, 0x3B);
 inline const EFI_GUID gEfiGraphicsOutputProtocolGuid =
     EFI_GUID_VALUE(0x9042A9DE, 0x23DC, 0x4A38, 0x96, 0xFB, 0x7A, 0xDE, 0xD0, 0x80, 0x51, 0x6A);
+inline const EFI_GUID gEfiUgaDrawProtocolGuid =
+    EFI_GUID_VALUE(0x982C298B, 0xF4FA, 0x41CB, 0xB8, 0x38, 0x77, 0xAA, 0x68, 0x8F, 0xB8, 0x39);
 inline const EFI_GUID gEfiConsoleControlProtocolGuid =
     EFI_GUID_VALUE(0xF42F7782, 0x012E, 0x4C12, 0x99, 0x56, 0x49, 0xF9, 0x43, 0x04, 0xF7, 0x21);
 inline const EFI_GUID gEfiAcpi20TableGuid =
@@ -620,3 +652,7 @@ static_assert(offsetof(EFI_DISK_IO_PROTOCOL, ReadDisk) == 8);
 static_assert(offsetof(EFI_GRAPHICS_OUTPUT_PROTOCOL, Mode) == 0x18);
 static_assert(offsetof(EFI_GRAPHICS_OUTPUT_PROTOCOL_MODE, FrameBufferBase) == 0x18);
 static_assert(sizeof(EFI_GRAPHICS_OUTPUT_MODE_INFORMATION) == 36);
+static_assert(sizeof(EFI_UGA_PIXEL) == 4);
+static_assert(offsetof(EFI_UGA_PIXEL, Red) == 2);
+static_assert(offsetof(EFI_UGA_DRAW_PROTOCOL, Blt) == 0x10);
+static_assert(sizeof(EFI_UGA_DRAW_PROTOCOL) == 0x18);

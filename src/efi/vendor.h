@@ -61,3 +61,17 @@ inline const EFI_GUID gNimbDevicePropertiesProtocolGuid =
 
 static_assert(offsetof(NIMB_NET_BOOT_INFO_PROTOCOL, GetBsdpResponse) == 0x08, "the second entry");
 static_assert(offsetof(NIMB_DEVICE_PROPERTIES_PROTOCOL, GetProperties) == 0x20, "the fifth entry");
+
+// Where the screen's frame buffer lies and how it is laid out, for code that
+// writes to the screen without UGA Draw (first entry). The size is asked for
+// and not used.
+struct NIMB_FRAME_BUFFER_INFO_PROTOCOL {
+  EFI_STATUS(EFIAPI *GetInfo)
+  (NIMB_FRAME_BUFFER_INFO_PROTOCOL *This, EFI_PHYSICAL_ADDRESS *FrameBufferBase, UINT32 *FrameBufferSize,
+   UINT32 *BytesPerRow, UINT32 *Width, UINT32 *Height, UINT32 *Depth);
+};
+
+inline const EFI_GUID gNimbFrameBufferInfoProtocolGuid =
+    EFI_GUID_VALUE(0xE316E100, 0x0751, 0x4C49, 0x90, 0x56, 0x48, 0x6C, 0x7E, 0x47, 0x29, 0x03);
+
+static_assert(sizeof(NIMB_FRAME_BUFFER_INFO_PROTOCOL) == 0x08, "one entry");

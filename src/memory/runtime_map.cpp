@@ -47,8 +47,10 @@ void CopyDescriptor(const EFI_MEMORY_DESCRIPTOR *from, EFI_MEMORY_DESCRIPTOR *to
   to->Attribute = from->Attribute;
 }
 
+// From `start` up to but not including `start` + `size`; an address below
+// `start` wraps round to a distance far beyond any size.
 bool InRange(UINT64 address, UINT64 start, UINT64 size) {
-  return address >= start && address - start < size;
+  return address - start < size;
 }
 
 // Moves the configuration table's entries and gST that lie in the old place
@@ -102,8 +104,9 @@ EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRI
     listEnd = write;
   }
 
-  EFI_STATUS status = gRT->SetVirtualAddressMap(static_cast<UINTN>(Bytes(listEnd) - Bytes(mapStart)),
-                                                static_cast<UINTN>(descriptorSize), descriptorVersion, mapStart);
+  EFI_STATUS status =
+      gRT->SetVirtualAddressMap(static_cast<UINTN>(Bytes(listEnd) - Bytes(mapStart)),
+                                static_cast<UINTN>(descriptorSize), descriptorVersion, mapStart);
   if (EFI_ERROR(status)) {
     StopAfterBootServices("Error in SetVirtualAddressMap\n", resume);
   }

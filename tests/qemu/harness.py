@@ -29,7 +29,7 @@ import time
 from pathlib import Path
 
 sys.path.insert(0, str(Path(__file__).resolve().parent))
-from scenarios import SCENARIOS  # noqa: E402
+from scenarios import BASE_CONFIG, SCENARIOS  # noqa: E402
 
 REPO = Path(__file__).resolve().parents[2]
 EXIT_CODES_HEADER = REPO / "platform" / "exitcodes.h"
@@ -42,6 +42,7 @@ PARTITION_OFFSET = 1 << 20  # first sector 2048
 # The platform's report, on the serial port.
 REPORT_STATUS = re.compile(r"platform: loader returned 0x([0-9a-f]+) \((\w+)\)")
 REPORT_MEMORY = re.compile(r"platform: memory (same|changed)")
+REPORT_CONSOLE_MODE = re.compile(r"platform: console mode (\S+)")
 
 
 # --- the platform's exit codes -------------------------------------------------------
@@ -122,6 +123,15 @@ def check_log(log, expect=(), forbid=()):
         if text in log:
             problems.append(f"present but forbidden: {text!r}")
     return problems
+
+
+def check_console_modes(log, wanted):
+    """Problems with the console mode changes that the loader asked for
+    against all those `wanted`, in order; None checks nothing."""
+    if wanted is None:
+        return []
+    asked = REPORT_CONSOLE_MODE.findall(log)
+    return [] if asked == list(wanted) else [f"console modes asked for: {asked}, wanted {list(wanted)}"]
 
 
 def check_report(log, outcome, status, memory, exit_name):
@@ -314,6 +324,16 @@ class Result:
     workdir: Path
 
 
+def scenario_config(scenario, override=None):
+    """The keys of the scenario's platform.cfg: the base configuration unless
+    the scenario opts out, then the scenario's own, then `override`; a later
+    value of a key replaces an earlier one in its place."""
+    config = dict(BASE_CONFIG) if scenario.base_config else {}
+    config.update(scenario.config)
+    config.update(override or {})
+    return config
+
+
 def prepare(scenario, efi_dir, workdir, loader=None, config_override=None):
     """Builds the scenario's disk in `workdir`; returns its path."""
     efi_dir = Path(efi_dir)
@@ -324,8 +344,7 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None):
     for path in files.values():
         if not path.is_file():
             raise FileNotFoundError(f"{path} is missing: build the EFI programs first")
-    config = dict(scenario.config)
-    config.update(config_override or {})
+    config = scenario_config(scenario, config_override)
     if config or scenario.config_file:
         files["EFI/BOOT/platform.cfg"] = render_config(config)
     files.update(scenario.files)
@@ -352,6 +371,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None):
     outcome = decode_exit(returncode, read_exit_codes())
     problems = check_report(log, outcome, scenario.status, scenario.memory, scenario.exit)
     problems += check_log(log, scenario.expect, scenario.forbid)
+    problems += check_console_modes(log, scenario.console_modes)
     if returncode is None:
         problems.insert(0, f"timed out after {timeout or scenario.timeout} s")
     return Result(not problems, time.monotonic() - start, outcome, problems, log, workdir)

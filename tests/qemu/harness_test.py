@@ -6,7 +6,7 @@ import unittest
 from pathlib import Path
 
 import harness
-from scenarios import SCENARIOS
+from scenarios import BASE_CONFIG, SCENARIOS, Scenario
 
 ABORTED_SAME = harness.Outcome("AbortedSame", "EFI_ABORTED", "same")
 REPORT = (
@@ -45,6 +45,21 @@ class CheckLog(unittest.TestCase):
         for name, expect, forbid, count in rows:
             with self.subTest(name):
                 self.assertEqual(len(harness.check_log(log, expect, forbid)), count)
+
+    def test_console_mode_rows(self):
+        log = "a\nplatform: console mode text\nb\nplatform: console mode graphics\n"
+        rows = [
+            ("not checked", log, None, 0),
+            ("all, in order", log, ("text", "graphics"), 0),
+            ("one missing", log, ("text",), 1),
+            ("out of order", log, ("graphics", "text"), 1),
+            ("none wanted, none asked", "a\n", (), 0),
+            ("none wanted, some asked", log, (), 1),
+            ("a refused change counts", "platform: console mode 7 refused (EFI_INVALID_PARAMETER)\n", ("7",), 0),
+        ]
+        for name, text, wanted, count in rows:
+            with self.subTest(name):
+                self.assertEqual(len(harness.check_console_modes(text, wanted)), count)
 
     def test_report_rows(self):
         changed = harness.Outcome("AbortedChanged", "EFI_ABORTED", "changed")
@@ -121,6 +136,24 @@ class Config(unittest.TestCase):
                 self.assertEqual(harness.config_value(value), expected)
         self.assertEqual(harness.render_config({"console": "text", "hold": 3}), "console=text\nhold=3\n")
 
+    def test_scenario_config_rows(self):
+        base = dict(BASE_CONFIG)
+        rows = [
+            ("base alone", Scenario("a"), None, base),
+            ("scenario over base, in base's place",
+             Scenario("a", config={"datahub.Model": "X", "keys": "shift"}), None,
+             {**base, "datahub.Model": "X", "keys": "shift"}),
+            ("override last", Scenario("a", config={"hold": 1}), {"hold": 3}, {**base, "hold": 3}),
+            ("without base", Scenario("a", base_config=False, config={"hold": 1}), None, {"hold": 1}),
+            ("without anything", Scenario("a", base_config=False), None, {}),
+        ]  # fmt: skip
+        for name, scenario, override, expected in rows:
+            with self.subTest(name):
+                config = harness.scenario_config(scenario, override)
+                self.assertEqual(config, expected)
+                self.assertEqual(list(config), list(expected))
+        self.assertEqual(BASE_CONFIG, base, "the base configuration was changed")
+
     def test_scenarios_are_well_formed(self):
         codes = {outcome.name for outcome in harness.read_exit_codes().values()}
         for scenario in SCENARIOS.values():
@@ -129,6 +162,8 @@ class Config(unittest.TestCase):
                 self.assertIn(scenario.status, ("EFI_ABORTED", "EFI_SUCCESS", "other"))
                 if scenario.exit is not None:
                     self.assertIn(scenario.exit, codes)
+                for mode in scenario.console_modes or ():
+                    self.assertIn(mode, ("text", "graphics"))
 
 
 if __name__ == "__main__":

@@ -1,5 +1,6 @@
 // Host tests of the platform layer's logic: its configuration file, text
-// conversion, report formatting, exit codes, memory count and console modes.
+// conversion, report formatting, exit codes, memory count, console modes, key
+// protocols and Data Hub.
 #include <gtest/gtest.h>
 
 #include <cstdarg>
@@ -9,12 +10,16 @@
 
 #include "../../platform/config.h"
 #include "../../platform/console_control.h"
+#include "../../platform/data_hub.h"
 #include "../../platform/exitcodes.h"
 #include "../../platform/format.h"
+#include "../../platform/key_state.h"
 #include "../../platform/memory.h"
 
 namespace nimb::platform {
 namespace {
+
+using namespace std::string_literals;
 
 // --- configuration file ------------------------------------------------------------
 
@@ -187,6 +192,218 @@ TEST(PlatformConfig, ParsesLinesKeysAndValues) {
     EXPECT_EQ(config.consoleMode, row.console);
     EXPECT_EQ(config.holdSeconds, row.hold);
     EXPECT_EQ(issues, row.issues);
+  }
+}
+
+// Parses `text` over the defaults; the buffer stays alive with the config.
+struct Parsed {
+  std::vector<char> buffer;
+  PlatformConfig config;
+  UINT32 errors;
+  std::vector<ConfigIssue> issues;  // pointers into `buffer`
+  explicit Parsed(const std::string &text) : buffer(text.begin(), text.end()) {
+    buffer.push_back('\x7f');
+    ConfigSetDefaults(&config);
+    errors = ConfigParse(
+        buffer.data(), text.size(), &config,
+        [](const ConfigIssue &issue, void *context) {
+          static_cast<std::vector<ConfigIssue> *>(context)->push_back(issue);
+        },
+        &issues);
+  }
+};
+
+std::vector<UINT16> KeysOf(const HeldKeys &held) {
+  return std::vector<UINT16>(held.keys, held.keys + held.count);
+}
+
+TEST(PlatformConfig, ParsesHeldKeysAndBootPolicy) {
+  struct Row {
+    const char *name;
+    std::string text;
+    UINT32 errors;
+    UINT16 modifiers;
+    std::vector<UINT16> keys;
+    bool ignored;
+  };
+  const std::vector<Row> rows = {
+      {"nothing held by default", "", 0, 0, {}, false},
+      {"shift alone", "keys=shift", 0, 0x02, {}, false},
+      {"gui and v", "keys=gui+v", 0, 0x08, {0x7019}, false},
+      {"gui and s", "keys=gui+s", 0, 0x08, {0x7016}, false},
+      {"right shift and control", "keys=rshift+ctrl", 0, 0x21, {}, false},
+      {"two keys keep their order", "keys=gui+v+s", 0, 0x08, {0x7019, 0x7016}, false},
+      {"modifiers anywhere", "keys=v+rgui", 0, 0x80, {0x7019}, false},
+      {"every modifier by both names",
+       "keys=ctrl+lshift+alt+lgui+rctrl+rshift+ralt+rgui+lctrl+shift+lalt+gui",
+       0,
+       0xFF,
+       {},
+       false},
+      {"letters, digits and usages",
+       "keys=a+z+1+9+0+0x28+0xE0",
+       0,
+       0,
+       {0x7004, 0x701D, 0x701E, 0x7026, 0x7027, 0x7028, 0x70E0},
+       false},
+      {"as many keys as there is room for",
+       "keys=a+b+c+d+e+f+g+h",
+       0,
+       0,
+       {0x7004, 0x7005, 0x7006, 0x7007, 0x7008, 0x7009, 0x700A, 0x700B},
+       false},
+      {"empty value holds nothing", "keys=gui+v\nkeys=", 0, 0, {}, false},
+      {"later line replaces, not adds", "keys=shift\nkeys=gui+v", 0, 0x08, {0x7019}, false},
+      {"policy ignores keys", "keys-ignored=1", 0, 0, {}, true},
+      {"policy reads keys", "keys-ignored=1\nkeys-ignored=0", 0, 0, {}, false},
+      {"one key too many", "keys=shift\nkeys=a+b+c+d+e+f+g+h+i", 1, 0x02, {}, false},
+      {"a key twice", "keys=gui+v+v", 1, 0, {}, false},
+      {"a modifier twice is still one", "keys=shift+lshift", 0, 0x02, {}, false},
+      {"empty name at the end", "keys=gui+", 1, 0, {}, false},
+      {"empty name at the start", "keys=+v", 1, 0, {}, false},
+      {"upper case", "keys=GUI+V", 1, 0, {}, false},
+      {"unknown name", "keys=cmd+v", 1, 0, {}, false},
+      {"two letters", "keys=ab", 1, 0, {}, false},
+      {"name too long for any key", "keys=leftshift", 1, 0, {}, false},
+      {"usage without digits", "keys=0x", 1, 0, {}, false},
+      {"usage zero", "keys=0x00", 1, 0, {}, false},
+      {"usage beyond a byte", "keys=0x100", 1, 0, {}, false},
+      {"usage not hexadecimal", "keys=0x2g", 1, 0, {}, false},
+      {"blanks inside", "keys=gui + v", 1, 0, {}, false},
+      {"policy of 2", "keys-ignored=2", 1, 0, {}, false},
+      {"policy of 01", "keys-ignored=01", 1, 0, {}, false},
+      {"policy empty", "keys-ignored=", 1, 0, {}, false},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    const Parsed parsed(row.text);
+    EXPECT_EQ(parsed.errors, row.errors);
+    EXPECT_EQ(parsed.config.keys.modifiers, row.modifiers);
+    EXPECT_EQ(KeysOf(parsed.config.keys), row.keys);
+    EXPECT_EQ(parsed.config.keysIgnored, row.ignored);
+  }
+}
+
+// An entry as the test sees it: name, value bytes, text or not.
+struct Entry {
+  std::string name;
+  std::string bytes;
+  bool text;
+  bool operator==(const Entry &other) const {
+    return name == other.name && bytes == other.bytes && text == other.text;
+  }
+};
+
+std::ostream &operator<<(std::ostream &out, const Entry &entry) {
+  out << entry.name << (entry.text ? " text " : " bytes ");
+  for (const unsigned char c : entry.bytes) {
+    out << std::hex << static_cast<int>(c) << ' ';
+  }
+  return out << std::dec;
+}
+
+std::vector<Entry> EntriesOf(const ConfigEntryList &list) {
+  std::vector<Entry> entries;
+  for (UINT32 i = 0; i < list.count; i++) {
+    const ConfigEntry &entry = list.entries[i];
+    entries.push_back(
+        {entry.name, std::string(reinterpret_cast<const char *>(entry.bytes), entry.size), entry.text});
+    if (entry.text) {
+      EXPECT_EQ(entry.bytes[entry.size], 0) << entry.name << ": text without its NUL";
+    }
+  }
+  return entries;
+}
+
+TEST(PlatformConfig, ParsesVariablesAndRecords) {
+  struct Row {
+    const char *name;
+    std::string text;
+    UINT32 errors;
+    std::vector<Entry> nvram;
+    std::vector<Entry> records;
+  };
+  const std::string path("\x02\x01\x0C\x00\x7F\xFF\x04\x00", 8);
+  const std::vector<Row> rows = {
+      {"text variable keeps blanks and '='",
+       "nvram.boot-args=-v  foo=1",
+       0,
+       {{"boot-args", "-v  foo=1", true}},
+       {}},
+      {"hex variable, blanks between bytes",
+       "nvram-hex.efi-boot-file-data=02 01 0C00\t7fff0400",
+       0,
+       {{"efi-boot-file-data", path, false}},
+       {}},
+      {"text record", "datahub.Model=QEMU1,1", 0, {}, {{"Model", "QEMU1,1", true}}},
+      {"quoted record keeps its blanks", "datahub.Model=\" Q \"", 0, {}, {{"Model", " Q ", true}}},
+      {"hex record", "datahub-hex.Bus=00e1F505", 0, {}, {{"Bus", std::string("\x00\xE1\xF5\x05", 4), false}}},
+      {"empty records", "datahub.A=\ndatahub-hex.B=", 0, {}, {{"A", "", true}, {"B", "", false}}},
+      {"same name: later wins in the first place",
+       "nvram.a=1\nnvram.b=2\nnvram-hex.a=ff",
+       0,
+       {{"a", "\xFF", false}, {"b", "2", true}},
+       {}},
+      {"variables and records are apart",
+       "nvram.x=1\ndatahub.x=2",
+       0,
+       {{"x", "1", true}},
+       {{"x", "2", true}}},
+      {"names are case-sensitive", "datahub.m=1\ndatahub.M=2", 0, {}, {{"m", "1", true}, {"M", "2", true}}},
+      {"empty variable", "nvram.a=", 1, {}, {}},
+      {"blanks alone are no bytes", "nvram-hex.a=\"  \"", 1, {}, {}},
+      {"odd number of digits", "nvram-hex.a=abc", 1, {}, {}},
+      {"digits split by a blank", "datahub-hex.a=0 1", 1, {}, {}},
+      {"not hexadecimal", "nvram-hex.a=zz", 1, {}, {}},
+      {"no name", "nvram.=x\ndatahub.=y", 2, {}, {}},
+      {"text beyond UCS-2", "nvram.a=\xF0\x9F\x98\x80", 1, {}, {}},
+      {"name beyond UCS-2", "datahub.\xF0\x9F\x98\x80=x", 1, {}, {}},
+      {"a refused line leaves the earlier value", "nvram.a=1\nnvram-hex.a=1", 1, {{"a", "1", true}}, {}},
+      {"prefix alone is no key", "nvram=1\ndatahub=2", 0, {}, {}},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    const Parsed parsed(row.text);
+    EXPECT_EQ(parsed.errors, row.errors);
+    EXPECT_EQ(EntriesOf(parsed.config.nvram), row.nvram);
+    EXPECT_EQ(EntriesOf(parsed.config.dataHub), row.records);
+  }
+}
+
+TEST(PlatformConfig, ListsHaveRoomForTheirLimit) {
+  std::string text;
+  for (UINT32 i = 0; i < kMaxConfigEntries; i++) {
+    text += "datahub.r" + std::to_string(i) + "=x\n";
+  }
+  // A known name still takes a new value when the list is full; a new one
+  // doesn't fit.
+  const Parsed parsed(text + "datahub.r0=y\ndatahub.extra=z\n");
+  EXPECT_EQ(parsed.errors, 1u);
+  ASSERT_EQ(parsed.config.dataHub.count, kMaxConfigEntries);
+  EXPECT_EQ(EntriesOf(parsed.config.dataHub)[0], (Entry{"r0", "y", true}));
+  ASSERT_EQ(parsed.issues.size(), 1u);
+  EXPECT_EQ(parsed.issues[0].line, kMaxConfigEntries + 2);
+}
+
+TEST(PlatformConfig, ReportsRefusedValuesAsWritten) {
+  struct Row {
+    const char *text;
+    const char *key;
+    const char *value;
+  };
+  const std::vector<Row> rows = {
+      {"keys=gui+v+v", "keys", "gui+v+v"},
+      {"nvram-hex.a=01 0g", "nvram-hex.a", "01 0g"},
+      // Quotes are gone by then: the value is what its key was given.
+      {"datahub-hex.a=\"ab \tc\"", "datahub-hex.a", "ab \tc"},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.text);
+    const Parsed parsed(row.text);
+    ASSERT_EQ(parsed.issues.size(), 1u);
+    EXPECT_EQ(parsed.issues[0].problem, kConfigBadValue);
+    EXPECT_STREQ(parsed.issues[0].key, row.key);
+    EXPECT_STREQ(parsed.issues[0].value, row.value);
   }
 }
 
@@ -457,6 +674,248 @@ TEST(PlatformConsole, StartsCleanAndCopesWithoutGraphics) {
   EXPECT_EQ(stuck.protocol.GetMode(&stuck.protocol, &mode, nullptr, nullptr), EFI_SUCCESS);
   EXPECT_EQ(mode, kGraphics);
   EXPECT_EQ(stuck.protocol.LockStdIn(&stuck.protocol, nullptr), EFI_UNSUPPORTED);
+}
+
+TEST(PlatformConsole, ReportsEverySetModeCall) {
+  struct Call {
+    UINT32 mode;
+    EFI_STATUS status;
+    bool operator==(const Call &other) const { return mode == other.mode && status == other.status; }
+  };
+  static std::vector<Call> calls;
+  Firmware firmware;
+  PlatformConsole console;
+  ASSERT_EQ(ConsoleControlInit(&console, &firmware.text, &firmware.graphics, kGraphics), EFI_SUCCESS);
+  console.onSetMode = [](EFI_CONSOLE_CONTROL_SCREEN_MODE mode, EFI_STATUS status) {
+    calls.push_back({static_cast<UINT32>(mode), status});
+  };
+  calls.clear();
+  firmware.screen.clearStatus = EFI_SUCCESS;
+  const std::vector<Call> asked = {
+      {kText, EFI_SUCCESS},        // a change
+      {kText, EFI_SUCCESS},        // no change, still a call
+      {7, EFI_INVALID_PARAMETER},  // beyond the modes
+      {kGraphics, EFI_SUCCESS},    // back
+  };
+  for (const Call &call : asked) {
+    console.protocol.SetMode(&console.protocol, static_cast<EFI_CONSOLE_CONTROL_SCREEN_MODE>(call.mode));
+  }
+  EXPECT_EQ(calls, asked);
+  // A failed change is reported with its status.
+  calls.clear();
+  firmware.screen.clearStatus = EFI_DEVICE_ERROR;
+  EXPECT_EQ(console.protocol.SetMode(&console.protocol, kText), EFI_DEVICE_ERROR);
+  EXPECT_EQ(calls, (std::vector<Call>{{kText, EFI_DEVICE_ERROR}}));
+}
+
+// --- key protocols ------------------------------------------------------------------------
+
+TEST(PlatformKeys, ReportsHeldKeysWithinTheCallersRoom) {
+  struct Row {
+    const char *name;
+    const char *keys;  // the configuration's value
+    UINTN room;        // the count passed in
+    bool noArray;
+    EFI_STATUS status;
+    UINT16 modifiers;
+    UINTN count;  // the count passed out
+    std::vector<UINT16> written;
+  };
+  const std::vector<Row> rows = {
+      {"nothing held", "", 32, false, EFI_SUCCESS, 0, 0, {}},
+      {"shift alone", "shift", 32, false, EFI_SUCCESS, 0x02, 0, {}},
+      {"gui and v", "gui+v", 32, false, EFI_SUCCESS, 0x08, 1, {0x7019}},
+      {"exactly enough room", "gui+v+s", 2, false, EFI_SUCCESS, 0x08, 2, {0x7019, 0x7016}},
+      {"one short", "gui+v+s", 1, false, EFI_BUFFER_TOO_SMALL, 0x08, 2, {}},
+      {"no room, asking for the count", "rshift+a", 0, true, EFI_BUFFER_TOO_SMALL, 0x20, 1, {}},
+      {"no room and nothing held", "ctrl", 0, true, EFI_SUCCESS, 0x01, 0, {}},
+      {"room but no array", "a", 4, true, EFI_INVALID_PARAMETER, 0, 4, {}},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    const Parsed parsed(std::string("keys=") + row.keys);
+    ASSERT_EQ(parsed.errors, 0u);
+    PlatformKeyState state;
+    KeyStateInit(&state, parsed.config.keys);
+    std::vector<UINT16> keys(row.room + 1, 0xEEEE);
+    UINT16 modifiers = 0xEEEE;
+    UINTN count = row.room;
+    EXPECT_EQ(
+        state.protocol.ReadKeyState(&state.protocol, &modifiers, &count, row.noArray ? nullptr : keys.data()),
+        row.status);
+    if (row.status != EFI_INVALID_PARAMETER) {
+      EXPECT_EQ(modifiers, row.modifiers);
+    }
+    EXPECT_EQ(count, row.count);
+    std::vector<UINT16> expected = row.written;
+    expected.resize(row.room + 1, 0xEEEE);
+    EXPECT_EQ(keys, expected) << "wrote where it should not";
+  }
+  PlatformKeyState state;
+  KeyStateInit(&state, {});
+  UINT16 modifiers = 0;
+  UINTN count = 0;
+  EXPECT_EQ(state.protocol.ReadKeyState(&state.protocol, nullptr, &count, nullptr), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(state.protocol.ReadKeyState(&state.protocol, &modifiers, nullptr, nullptr),
+            EFI_INVALID_PARAMETER);
+}
+
+TEST(PlatformKeys, BootPolicyAnswersAsConfigured) {
+  for (const bool ignored : {false, true}) {
+    SCOPED_TRACE(ignored);
+    PlatformBootPolicy policy;
+    BootPolicyInit(&policy, ignored);
+    UINT64 answer = 0xEEEE;
+    EXPECT_EQ(policy.protocol.GetKeysIgnored(&policy.protocol, &answer), EFI_SUCCESS);
+    EXPECT_EQ(answer, ignored ? 1u : 0u);
+    EXPECT_EQ(policy.protocol.GetKeysIgnored(&policy.protocol, nullptr), EFI_INVALID_PARAMETER);
+  }
+}
+
+// --- Data Hub -------------------------------------------------------------------------------
+
+// A hub built from configuration text, in 8-byte aligned storage.
+struct Hub {
+  Parsed parsed;
+  std::vector<UINT64> storage;
+  PlatformDataHub hub;
+  explicit Hub(const std::string &text) : parsed(text) {
+    EXPECT_EQ(parsed.errors, 0u);
+    const UINTN size = DataHubBuildRecords(parsed.config.dataHub, nullptr, 0);
+    storage.assign(size / 8 + 1, 0xEEEEEEEEEEEEEEEEULL);
+    EXPECT_EQ(DataHubBuildRecords(parsed.config.dataHub, Bytes(), size), size);
+    EXPECT_EQ(storage.back(), 0xEEEEEEEEEEEEEEEEULL) << "wrote past its size";
+    DataHubInit(&hub, Bytes(), size);
+  }
+  UINT8 *Bytes() { return reinterpret_cast<UINT8 *>(storage.data()); }
+  EFI_STATUS Next(UINT64 *count, EFI_DATA_RECORD_HEADER **record, EFI_EVENT *filter = nullptr) {
+    return hub.protocol.GetNextDataRecord(&hub.protocol, count, filter, record);
+  }
+};
+
+// A record as the loader reads it.
+struct Record {
+  bool vendor;
+  std::u16string name;
+  std::string value;
+  bool operator==(const Record &other) const {
+    return vendor == other.vendor && name == other.name && value == other.value;
+  }
+};
+
+std::ostream &operator<<(std::ostream &out, const Record &record) {
+  out << (record.vendor ? "vendor " : "other ") << record.name.size() << " units, value";
+  for (const unsigned char c : record.value) {
+    out << ' ' << std::hex << static_cast<int>(c);
+  }
+  return out << std::dec;
+}
+
+Record Read(const EFI_DATA_RECORD_HEADER *header) {
+  EXPECT_EQ(reinterpret_cast<uintptr_t>(header) % 8, 0u) << "record not aligned";
+  EXPECT_EQ(header->Version, EFI_DATA_RECORD_HEADER_VERSION);
+  EXPECT_EQ(header->HeaderSize, sizeof(EFI_DATA_RECORD_HEADER));
+  EXPECT_EQ(header->DataRecordClass, EFI_DATA_RECORD_CLASS_DATA);
+  const auto *record = reinterpret_cast<const NIMB_PLATFORM_RECORD *>(header);
+  EXPECT_EQ(header->RecordSize, sizeof(NIMB_PLATFORM_RECORD) + record->NameSize + record->ValueSize);
+  EXPECT_EQ(record->NameSize % 2, 0u);
+  const auto *data = reinterpret_cast<const char *>(record + 1);
+  std::u16string name(record->NameSize / 2, u'\0');
+  std::memcpy(name.data(), data, record->NameSize);
+  return {std::memcmp(&header->ProducerName, &gNimbPlatformProducerGuid, sizeof(EFI_GUID)) == 0, name,
+          std::string(data + record->NameSize, record->ValueSize)};
+}
+
+std::string Wide(const std::u16string &text) {
+  return std::string(reinterpret_cast<const char *>(text.data()), text.size() * 2);
+}
+
+TEST(PlatformDataHub, HoldsTheConfiguredRecordsThenOneOfItsOwn) {
+  struct Row {
+    const char *name;
+    std::string text;
+    std::vector<Record> records;  // in the hub's order, the closing one included
+  };
+  const Record closing = {false, u"", ""};
+  const std::vector<Row> rows = {
+      {"no records", "", {closing}},
+      {"text as UCS-2 with its NUL",
+       "datahub.Model=QEMU1,1",
+       {{true, u"Model\0"s, Wide(u"QEMU1,1\0"s)}, closing}},
+      {"bytes as they are, odd sizes keep alignment",
+       "datahub-hex.A=010203\ndatahub.B=\xC3\xA9\ndatahub-hex.C=",
+       {{true, u"A\0"s, "\x01\x02\x03"}, {true, u"B\0"s, Wide(u"\u00E9\0"s)}, {true, u"C\0"s, ""}, closing}},
+      {"empty text is one NUL unit", "datahub.Model=", {{true, u"Model\0"s, Wide(u"\0"s)}, closing}},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    Hub hub(row.text);
+    std::vector<Record> records;
+    std::vector<UINT64> counts;
+    UINT64 count = 0;
+    do {
+      EFI_DATA_RECORD_HEADER *record = nullptr;
+      ASSERT_EQ(hub.Next(&count, &record), EFI_SUCCESS);
+      ASSERT_LT(records.size(), row.records.size()) << "the walk does not end";
+      records.push_back(Read(record));
+      counts.push_back(record->LogMonotonicCount);
+    } while (count != 0);
+    EXPECT_EQ(records, row.records);
+    for (size_t i = 0; i < counts.size(); i++) {
+      EXPECT_EQ(counts[i], i + 1) << "monotonic counts start at 1";
+    }
+  }
+}
+
+TEST(PlatformDataHub, FollowsTheMonotonicCount) {
+  Hub hub("datahub.A=1\ndatahub.B=2\n");  // counts 1, 2 and 3 (the closing record)
+  struct Row {
+    const char *name;
+    UINT64 count;
+    EFI_STATUS status;
+    UINT64 next;
+    UINT64 recordCount;  // of the record returned
+  };
+  const std::vector<Row> rows = {
+      {"0 starts", 0, EFI_SUCCESS, 2, 1},
+      {"the middle", 2, EFI_SUCCESS, 3, 2},
+      {"the last gives 0", 3, EFI_SUCCESS, 0, 3},
+      {"beyond the last", 4, EFI_NOT_FOUND, 4, 0},
+      {"far beyond", ~0ULL, EFI_NOT_FOUND, ~0ULL, 0},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    UINT64 count = row.count;
+    EFI_DATA_RECORD_HEADER *record = nullptr;
+    EXPECT_EQ(hub.Next(&count, &record), row.status);
+    EXPECT_EQ(count, row.next);
+    if (row.status == EFI_SUCCESS) {
+      ASSERT_NE(record, nullptr);
+      EXPECT_EQ(record->LogMonotonicCount, row.recordCount);
+    }
+  }
+  UINT64 count = 0;
+  EFI_DATA_RECORD_HEADER *record = nullptr;
+  EFI_EVENT filter = reinterpret_cast<EFI_EVENT>(1);
+  EXPECT_EQ(hub.Next(&count, &record, &filter), EFI_INVALID_PARAMETER) << "no filter drivers exist";
+  EFI_EVENT none = nullptr;
+  EXPECT_EQ(hub.Next(&count, &record, &none), EFI_SUCCESS);
+  EXPECT_EQ(hub.Next(nullptr, &record), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(hub.Next(&count, nullptr), EFI_INVALID_PARAMETER);
+
+  PlatformDataHub empty;
+  DataHubInit(&empty, nullptr, 0);
+  count = 0;
+  EXPECT_EQ(empty.protocol.GetNextDataRecord(&empty.protocol, &count, nullptr, &record), EFI_NOT_FOUND);
+}
+
+TEST(PlatformDataHub, WritesNothingIntoTooSmallABuffer) {
+  const Parsed parsed("datahub.Model=QEMU1,1\n");
+  const UINTN size = DataHubBuildRecords(parsed.config.dataHub, nullptr, 0);
+  std::vector<UINT64> storage(size / 8, 0xEEEEEEEEEEEEEEEEULL);
+  EXPECT_EQ(DataHubBuildRecords(parsed.config.dataHub, reinterpret_cast<UINT8 *>(storage.data()), size - 1),
+            size);
+  EXPECT_EQ(storage, std::vector<UINT64>(size / 8, 0xEEEEEEEEEEEEEEEEULL));
 }
 
 }  // namespace

@@ -238,8 +238,8 @@ TEST_F(BootTest, EveryFatalMessageOfTheBootSequence) {
        [](hostfw::Firmware &f, EFI_HANDLE device) {
          f.UninstallProtocol(device, gEfiDevicePathProtocolGuid);
        }},
-      // The tag block is the first pool allocation, the options' copy the second.
-      {"Could not get boot args\r\n", [](hostfw::Firmware &f, EFI_HANDLE) { f.FailCall("AllocatePool", 2); }},
+      // The copy of "  -v": two characters and a terminator.
+      {"Could not get boot args\r\n", [](hostfw::Firmware &f, EFI_HANDLE) { f.FailPoolAllocationOfSize(6); }},
       {"Can't open booter's root volume\r\n",
        [](hostfw::Firmware &f, EFI_HANDLE) { f.FailCall("OpenVolume"); }},
       {"Can't get a FileSystem or LoadFile handle for boot volume\r\n",

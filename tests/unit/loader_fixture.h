@@ -7,6 +7,7 @@
 #include <string>
 
 #include "boot/boot.h"
+#include "boot/stop.h"
 #include "config/boot_options.h"
 #include "config/plist.h"
 #include "devicetree/devicetree.h"
@@ -14,6 +15,7 @@
 #include "hostfw/hostfw.h"
 #include "memory/kernel_region.h"
 #include "memory/tracking.h"
+#include "screen/bootscreen.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
 
@@ -28,10 +30,19 @@ inline void ResetLoaderState() {
   nimb::gBootDevicePath = nullptr;
   nimb::gCallGate = 0;
   nimb::gKernelEntry = 0;
+  nimb::gStopMessage = nullptr;
   nimb::gConsoleControl = nullptr;
   nimb::gConsoleMode = 0;
   nimb::gInitialConsoleMode = 0;
   nimb::gSpinnerEvent = nullptr;
+  nimb::gSpinnerPixels = nullptr;
+  nimb::gSpinnerFrame = 0;
+  nimb::gUgaDraw = nullptr;
+  nimb::gScreenWidth = 0;
+  nimb::gScreenHeight = 0;
+  nimb::gScreenDepth = 0;
+  nimb::gFrameBufferBase = 0;
+  nimb::gFrameBufferRowBytes = 0;
   nimb::gMemoryTags = nullptr;
   nimb::gFreeMemoryTags = nullptr;
   nimb::gMemoryTagBlocks = nullptr;

@@ -12,6 +12,7 @@
 
 #include "kobj/writer.h"
 #include "load/kernel.h"
+#include "load/kernel_format.h"
 
 namespace {
 

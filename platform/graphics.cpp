@@ -1,0 +1,123 @@
+#include "graphics.h"
+
+namespace nimb::platform {
+
+namespace {
+
+constexpr UINT32 kDepth = 32;
+constexpr UINT32 kRefreshRate = 60;
+constexpr UINT32 kBytesPerPixel = 4;
+
+static_assert(sizeof(EFI_UGA_PIXEL) == sizeof(EFI_GRAPHICS_OUTPUT_BLT_PIXEL), "the same pixels");
+static_assert(UINT32(EfiUgaVideoFill) == UINT32(EfiBltVideoFill) &&
+                  UINT32(EfiUgaVideoToBltBuffer) == UINT32(EfiBltVideoToBltBuffer) &&
+                  UINT32(EfiUgaBltBufferToVideo) == UINT32(EfiBltBufferToVideo) &&
+                  UINT32(EfiUgaVideoToVideo) == UINT32(EfiBltVideoToVideo),
+              "the same operations by number");
+
+EFI_GRAPHICS_OUTPUT_PROTOCOL *GraphicsOf(EFI_UGA_DRAW_PROTOCOL *protocol) {
+  return reinterpret_cast<PlatformUgaDraw *>(protocol)->graphics;
+}
+
+EFI_STATUS EFIAPI UgaGetMode(EFI_UGA_DRAW_PROTOCOL *This, UINT32 *HorizontalResolution,
+                             UINT32 *VerticalResolution, UINT32 *ColorDepth, UINT32 *RefreshRate) {
+  if (This == nullptr || HorizontalResolution == nullptr || VerticalResolution == nullptr ||
+      ColorDepth == nullptr || RefreshRate == nullptr) {
+    return EFI_INVALID_PARAMETER;
+  }
+  const EFI_GRAPHICS_OUTPUT_MODE_INFORMATION *info = GraphicsOf(This)->Mode->Info;
+  *HorizontalResolution = info->HorizontalResolution;
+  *VerticalResolution = info->VerticalResolution;
+  *ColorDepth = kDepth;
+  *RefreshRate = kRefreshRate;
+  return EFI_SUCCESS;
+}
+
+EFI_STATUS EFIAPI UgaSetMode() {
+  return EFI_UNSUPPORTED;
+}
+
+EFI_STATUS EFIAPI UgaBlt(EFI_UGA_DRAW_PROTOCOL *This, EFI_UGA_PIXEL *BltBuffer,
+                         EFI_UGA_BLT_OPERATION BltOperation, UINTN SourceX, UINTN SourceY, UINTN DestinationX,
+                         UINTN DestinationY, UINTN Width, UINTN Height, UINTN Delta) {
+  if (This == nullptr || BltOperation >= EfiUgaBltMax) {
+    return EFI_INVALID_PARAMETER;
+  }
+  // The graphics output checks the rectangle against the screen.
+  EFI_GRAPHICS_OUTPUT_PROTOCOL *graphics = GraphicsOf(This);
+  return graphics->Blt(graphics, reinterpret_cast<EFI_GRAPHICS_OUTPUT_BLT_PIXEL *>(BltBuffer),
+                       static_cast<EFI_GRAPHICS_OUTPUT_BLT_OPERATION>(BltOperation), SourceX, SourceY,
+                       DestinationX, DestinationY, Width, Height, Delta);
+}
+
+EFI_STATUS EFIAPI FrameBufferGetInfo(NIMB_FRAME_BUFFER_INFO_PROTOCOL *This,
+                                     EFI_PHYSICAL_ADDRESS *FrameBufferBase, UINT32 *FrameBufferSize,
+                                     UINT32 *BytesPerRow, UINT32 *Width, UINT32 *Height, UINT32 *Depth) {
+  if (This == nullptr || FrameBufferBase == nullptr || FrameBufferSize == nullptr || BytesPerRow == nullptr ||
+      Width == nullptr || Height == nullptr || Depth == nullptr) {
+    return EFI_INVALID_PARAMETER;
+  }
+  const EFI_GRAPHICS_OUTPUT_PROTOCOL_MODE *mode =
+      reinterpret_cast<PlatformFrameBufferInfo *>(This)->graphics->Mode;
+  // A screen that can only be drawn with Blt has no frame buffer to tell of.
+  if (mode->Info->PixelFormat == PixelBltOnly) {
+    return EFI_UNSUPPORTED;
+  }
+  *FrameBufferBase = mode->FrameBufferBase;
+  *FrameBufferSize = static_cast<UINT32>(mode->FrameBufferSize);
+  *BytesPerRow = mode->Info->PixelsPerScanLine * kBytesPerPixel;
+  *Width = mode->Info->HorizontalResolution;
+  *Height = mode->Info->VerticalResolution;
+  *Depth = kDepth;
+  return EFI_SUCCESS;
+}
+
+PlatformUgaDraw gUgaDraw;
+PlatformFrameBufferInfo gFrameBufferInfo;
+
+}  // namespace
+
+void GraphicsInit(PlatformUgaDraw *uga, PlatformFrameBufferInfo *frameBuffer,
+                  EFI_GRAPHICS_OUTPUT_PROTOCOL *graphics) {
+  uga->protocol.GetMode = UgaGetMode;
+  uga->protocol.SetMode = reinterpret_cast<void *>(UgaSetMode);
+  uga->protocol.Blt = UgaBlt;
+  uga->graphics = graphics;
+  frameBuffer->protocol.GetInfo = FrameBufferGetInfo;
+  frameBuffer->graphics = graphics;
+}
+
+EFI_STATUS InstallGraphicsProtocols(EFI_SYSTEM_TABLE *st) {
+  EFI_BOOT_SERVICES *bs = st->BootServices;
+  // The console splitter's handle carries the graphics output of all screens.
+  void *graphics = nullptr;
+  if (st->ConsoleOutHandle == nullptr ||
+      EFI_ERROR(bs->HandleProtocol(st->ConsoleOutHandle, &gEfiGraphicsOutputProtocolGuid, &graphics))) {
+    if (EFI_ERROR(bs->LocateProtocol(&gEfiGraphicsOutputProtocolGuid, nullptr, &graphics))) {
+      graphics = nullptr;
+    }
+  }
+  if (graphics == nullptr) {
+    return EFI_UNSUPPORTED;
+  }
+  GraphicsInit(&gUgaDraw, &gFrameBufferInfo, static_cast<EFI_GRAPHICS_OUTPUT_PROTOCOL *>(graphics));
+
+  // The loader looks for UGA Draw on the console's output handle; without
+  // one it goes on a handle of its own, where the loader won't find it.
+  EFI_HANDLE handle = st->ConsoleOutHandle;
+  void *existing = nullptr;
+  if (handle == nullptr || EFI_ERROR(bs->HandleProtocol(handle, &gEfiUgaDrawProtocolGuid, &existing))) {
+    const EFI_STATUS status = bs->InstallProtocolInterface(&handle, &gEfiUgaDrawProtocolGuid,
+                                                           EFI_NATIVE_INTERFACE, &gUgaDraw.protocol);
+    if (EFI_ERROR(status)) {
+      return status;
+    }
+  }
+  if (EFI_ERROR(bs->LocateProtocol(&gNimbFrameBufferInfoProtocolGuid, nullptr, &existing))) {
+    return bs->InstallProtocolInterface(&handle, &gNimbFrameBufferInfoProtocolGuid, EFI_NATIVE_INTERFACE,
+                                        &gFrameBufferInfo.protocol);
+  }
+  return EFI_SUCCESS;
+}
+
+}  // namespace nimb::platform

@@ -1,0 +1,101 @@
+// Any bytes as a kernel image in memory: finding the slice and loading the
+// object must stay inside the file and inside the pages the loader took,
+// and end; whatever it took must all come back.
+#include <cstdint>
+#include <cstdlib>
+#include <vector>
+
+#include "boot/boot.h"
+#include "hostfw/hostfw.h"
+#include "load/bootfile.h"
+#include "load/kernel.h"
+#include "memory/kernel_region.h"
+#include "memory/tracking.h"
+
+namespace {
+
+void Check(bool condition) {
+  if (!condition)
+    std::abort();
+}
+
+// The memory a kernel may take per input. The rest of the arena is declared
+// reserved, so that a segment of a gigabyte is refused at once instead of
+// being filled byte by byte on every run.
+constexpr UINT64 kUsableMemory = 32ull << 20;
+
+hostfw::Firmware &TheFirmware() {
+  static hostfw::Firmware *fw = [] {
+    auto *made = new hostfw::Firmware;
+    // Messages would pile up in the firmware's records over millions of runs.
+    made->SetConOutPresent(false);
+    made->SetStdErrPresent(false);
+    UINT64 cut = hostfw::kArenaBase + kUsableMemory;
+    for (const EFI_MEMORY_DESCRIPTOR &d : made->MemoryMap()) {
+      UINT64 start = d.PhysicalStart;
+      UINT64 end = start + d.NumberOfPages * EFI_PAGE_SIZE;
+      if (d.Type != EfiConventionalMemory || end <= cut)
+        continue;
+      if (start < cut)
+        start = cut;
+      made->AddMemoryRegion(EfiReservedMemoryType, start, (end - start) / EFI_PAGE_SIZE, 0);
+    }
+    return made;
+  }();
+  return *fw;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
+  hostfw::Firmware &fw = TheFirmware();
+  nimb::gST = fw.SystemTable();
+  nimb::gBS = fw.BootServices();
+  nimb::gRT = fw.RuntimeServices();
+  nimb::gImageHandle = fw.ImageHandle();
+  nimb::gMemoryTags = nullptr;
+  nimb::gFreeMemoryTags = nullptr;
+  nimb::gMemoryTagBlocks = nullptr;
+  nimb::gKernelRegionBase = 0xFFFFFFFF;
+  nimb::gKernelRegionTop = 0;
+  nimb::gKernelEntry = 0x5EED;
+  Check(fw.LivePoolBlocks() == 0 && fw.AllocatedPages() == 0);
+
+  // A heap copy of exactly the input, so that a read past its end shows.
+  std::vector<uint8_t> bytes(data, data + size);
+  uint8_t none = 0;
+  nimb::BootFile file = {};
+  file.buffer = size == 0 ? &none : bytes.data();
+  file.size = size;
+
+  UINT64 sliceSize = 0;
+  UINT64 sliceOffset = 0;
+  EFI_STATUS status = nimb::BootFileFindSlice(&file, &sliceSize, &sliceOffset);
+  if (status == EFI_SUCCESS) {
+    Check(sliceSize != 0 && sliceOffset <= size && sliceSize <= size - sliceOffset);
+  } else {
+    Check(status == EFI_LOAD_ERROR);
+  }
+
+  file.position = 0;
+  status = nimb::LoadKernel(&file);
+  if (status == EFI_SUCCESS) {
+    Check(nimb::gKernelEntry <= 0x3FFFFFFF);
+    Check(nimb::gKernelRegionTop <= 0x100000000ull);
+    if (fw.AllocatedPages() != 0)
+      Check(nimb::gKernelRegionBase < nimb::gKernelRegionTop);
+  } else {
+    Check(nimb::gKernelEntry == 0x5EED);
+  }
+
+  // Only the pages of segments are kept; the commands buffer went back.
+  for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
+    Check(tag->poolAddress == nullptr);
+  nimb::TrackedFreeAll();
+  Check(fw.LivePoolBlocks() == 0 && fw.AllocatedPages() == 0);
+  nimb::gST = nullptr;
+  nimb::gBS = nullptr;
+  nimb::gRT = nullptr;
+  nimb::gImageHandle = nullptr;
+  return 0;
+}

@@ -1,0 +1,538 @@
+// The boot screen: the artwork's form, the logo and the spinner on the host
+// firmware's screen, the failure picture, and the video facts for the kernel.
+#include "screen/bootscreen.h"
+
+#include <gtest/gtest.h>
+
+#include <cstring>
+#include <string>
+#include <vector>
+
+#include "boot/bootinfo.h"
+#include "efi/vendor.h"
+#include "loader_fixture.h"
+#include "screen/artwork.h"
+
+namespace {
+
+using nimb::kPictureSize;
+using nimb::kSpinnerSize;
+
+std::vector<UINT8> DecodedLogo() {
+  std::vector<UINT8> logo;
+  for (size_t pair = 0; pair < nimb::kLogoPairs; pair++)
+    logo.insert(logo.end(), nimb::kLogoRuns[2 * pair], nimb::kLogoRuns[2 * pair + 1]);
+  return logo;
+}
+
+const UINT8 *SpinnerFrame(UINT32 frame) {
+  return nimb::kSpinnerStrip + frame * nimb::kSpinnerFramePixels;
+}
+
+// 0xRRGGBB of a colour table entry.
+UINT32 Rgb(UINT8 index) {
+  const UINT8 *entry = &nimb::kBootColorTable[3 * index];
+  return UINT32(entry[0]) << 16 | UINT32(entry[1]) << 8 | entry[2];
+}
+
+constexpr UINT32 kGrey = 0xBFBFBF;
+
+TEST(BootScreenArtwork, LogoRunsExpandToExactlyOnePicture) {
+  size_t total = 0;
+  for (size_t pair = 0; pair < nimb::kLogoPairs; pair++) {
+    EXPECT_NE(nimb::kLogoRuns[2 * pair], 0) << "pair " << pair;
+    total += nimb::kLogoRuns[2 * pair];
+  }
+  EXPECT_EQ(total, nimb::kPictureBytes);
+}
+
+TEST(BootScreenArtwork, EveryPictureHasTheBackgroundInItsCorners) {
+  struct Picture {
+    std::string what;
+    const UINT8 *indexes;
+    UINT32 size;
+  };
+  const std::vector<UINT8> logo = DecodedLogo();
+  std::vector<Picture> pictures = {{"logo", logo.data(), kPictureSize},
+                                   {"failure", nimb::kFailurePicture, kPictureSize}};
+  for (UINT32 frame = 0; frame < nimb::kSpinnerFrames; frame++)
+    pictures.push_back({"spinner frame " + std::to_string(frame), SpinnerFrame(frame), kSpinnerSize});
+  for (const Picture &p : pictures) {
+    const UINT32 last = p.size - 1;
+    for (UINT32 corner : {0u, last, last * p.size, last * p.size + last})
+      EXPECT_EQ(p.indexes[corner], nimb::kBackgroundIndex) << p.what << " at " << corner;
+  }
+}
+
+TEST(BootScreenArtwork, FixedColourTableEntries) {
+  const struct {
+    UINT8 index;
+    UINT32 rgb;
+  } rows[] = {{0, 0xFFFFFF}, {1, kGrey}, {255, 0x000000}};
+  for (const auto &row : rows)
+    EXPECT_EQ(Rgb(row.index), row.rgb) << "index " << int(row.index);
+}
+
+class BootScreenTest : public nimbtest::LoaderTest {
+ protected:
+  void SetUp() override {
+    LoaderTest::SetUp();
+    hostfw::ScreenOptions options;
+    options.width = 800;
+    options.height = 600;
+    fw.AddScreen(options);
+    ASSERT_EQ(nimb::InitConsole(), EFI_SUCCESS);
+    // One tracked block taken and given back leaves a free tag behind, so
+    // that the next pool allocations are the screen's own.
+    nimb::TrackedFree(nimb::TrackedAllocatePool(16));
+  }
+
+  UINT32 Color(UINT32 x, UINT32 y) { return fw.ScreenPixel(x, y) & 0xFFFFFF; }
+
+  // Pixels of the rectangle that do not show `indexes`.
+  int Mismatches(UINT32 x0, UINT32 y0, UINT32 size, const UINT8 *indexes) {
+    int wrong = 0;
+    for (UINT32 y = 0; y < size; y++) {
+      for (UINT32 x = 0; x < size; x++)
+        wrong += Color(x0 + x, y0 + y) != Rgb(indexes[y * size + x]);
+    }
+    return wrong;
+  }
+
+  int NonGrey(UINT32 x0, UINT32 y0, UINT32 size) {
+    const std::vector<UINT8> grey(size * size, nimb::kBackgroundIndex);
+    return Mismatches(x0, y0, size, grey.data());
+  }
+
+  // 800 x 600: the logo at (336, 236), the spinner at (384, 484).
+  static constexpr UINT32 kLogoX = 336, kLogoY = 236, kSpinnerX = 384, kSpinnerY = 484;
+};
+
+TEST_F(BootScreenTest, ExpandIndexedImageTakesBlueGreenRedFromTheTable) {
+  const UINT8 indexes[] = {0, 1, 255, 97, 200};
+  EFI_UGA_PIXEL *pixels = nullptr;
+  ASSERT_EQ(nimb::ExpandIndexedImage(5, 1, indexes, &pixels), EFI_SUCCESS);
+  ASSERT_NE(pixels, nullptr);
+  for (size_t i = 0; i < sizeof(indexes); i++) {
+    const UINT8 *entry = &nimb::kBootColorTable[3 * indexes[i]];
+    EXPECT_EQ(pixels[i].Blue, entry[2]) << i;
+    EXPECT_EQ(pixels[i].Green, entry[1]) << i;
+    EXPECT_EQ(pixels[i].Red, entry[0]) << i;
+  }
+  nimb::TrackedFree(pixels);
+
+  auto *untouched = reinterpret_cast<EFI_UGA_PIXEL *>(0x1234);
+  pixels = untouched;
+  fw.FailAllocation(1);
+  EXPECT_EQ(nimb::ExpandIndexedImage(5, 1, indexes, &pixels), EFI_OUT_OF_RESOURCES);
+  EXPECT_EQ(pixels, untouched);
+}
+
+TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
+  const size_t poolBefore = fw.LivePoolBlocks();
+  nimb::ShowBootScreen();
+
+  // EnterGraphics ran twice, each time asking for UGA Draw and its mode.
+  EXPECT_EQ(fw.CallCount("UgaGetMode"), 2u);
+  EXPECT_EQ(fw.CallCount("HandleProtocol"), 2u);
+  EXPECT_EQ(nimb::gConsoleMode, UINT32(EfiConsoleControlScreenGraphics));
+  EXPECT_NE(nimb::gBootFlags & nimb::kBootGraphics, 0u);
+  EXPECT_EQ(nimb::gScreenWidth, 800u);
+  EXPECT_EQ(nimb::gScreenHeight, 600u);
+  EXPECT_EQ(nimb::gScreenDepth, 32u);
+
+  const std::vector<UINT8> logo = DecodedLogo();
+  EXPECT_EQ(Mismatches(kLogoX, kLogoY, kPictureSize, logo.data()), 0);
+  EXPECT_EQ(Color(kLogoX, kLogoY), kGrey);
+  EXPECT_EQ(Color(kLogoX + 127, kLogoY + 127), kGrey);
+  EXPECT_NE(Color(kLogoX + 64, kLogoY + 64), kGrey) << "the mark stands in the middle";
+  const UINT32 greyPoints[][2] = {{0, 0}, {799, 0}, {0, 599}, {799, 599}, {400, 500}};
+  for (const auto &point : greyPoints)
+    EXPECT_EQ(Color(point[0], point[1]), kGrey) << point[0] << "," << point[1];
+
+  EXPECT_TRUE(fw.Events().empty());
+  EXPECT_EQ(nimb::gSpinnerEvent, nullptr);
+  EXPECT_EQ(fw.LivePoolBlocks(), poolBefore) << "the logo's buffers went back";
+}
+
+TEST_F(BootScreenTest, PicturesStandInTheMiddleAndTheSpinner200Below) {
+  const struct {
+    UINT32 width, height;
+    UINT32 logoX, logoY, spinnerX, spinnerY;
+  } rows[] = {
+      {800, 600, 336, 236, 384, 484},
+      {1024, 768, 448, 320, 496, 568},
+      {1023, 767, 447, 319, 495, 567},
+  };
+  for (const auto &row : rows) {
+    hostfw::ScreenOptions options;
+    options.width = row.width;
+    options.height = row.height;
+    fw.AddScreen(options);
+    nimb::gBootFlags = nimb::kBootNetwork;
+    nimb::DrawBootScreen();
+    const auto &blts = fw.BltCalls();
+    ASSERT_EQ(blts.size(), 3u) << row.width;
+    EXPECT_EQ(blts[0].operation, EfiUgaVideoFill);
+    EXPECT_EQ(blts[0].width, row.width);
+    EXPECT_EQ(blts[0].height, row.height);
+    EXPECT_EQ(blts[0].fill.Red, 191);
+    EXPECT_EQ(blts[0].fill.Green, 191);
+    EXPECT_EQ(blts[0].fill.Blue, 191);
+    EXPECT_EQ(blts[1].operation, EfiUgaBltBufferToVideo);
+    EXPECT_EQ(blts[1].destinationX, row.logoX) << row.width;
+    EXPECT_EQ(blts[1].destinationY, row.logoY) << row.width;
+    EXPECT_EQ(blts[2].destinationX, row.spinnerX) << row.width;
+    EXPECT_EQ(blts[2].destinationY, row.spinnerY) << row.width;
+    for (const auto &blt : blts)
+      EXPECT_EQ(blt.status, EFI_SUCCESS) << row.width;
+    nimb::StopSpinner();
+  }
+}
+
+TEST_F(BootScreenTest, ScreenSmallerThanTheLogoIsLeftToBlt) {
+  hostfw::ScreenOptions options;
+  options.width = 100;
+  options.height = 100;
+  fw.AddScreen(options);
+  nimb::DrawBootScreen();
+  const auto &blts = fw.BltCalls();
+  ASSERT_EQ(blts.size(), 2u);
+  EXPECT_EQ(blts[0].status, EFI_SUCCESS);
+  EXPECT_EQ(blts[1].destinationX, UINTN(0x7FFFFFF2));
+  EXPECT_EQ(blts[1].status, EFI_INVALID_PARAMETER);
+  EXPECT_EQ(Color(50, 50), kGrey);
+}
+
+TEST_F(BootScreenTest, WithoutGraphicsNothingIsDrawn) {
+  struct Row {
+    const char *what;
+    bool textAtStart;
+    bool uga;
+    const char *failCall;
+    EFI_STATUS status;
+    bool graphicsFlag;
+  };
+  const Row rows[] = {
+      {"no UGA Draw", false, false, nullptr, EFI_UNSUPPORTED, false},
+      {"SetMode refused", true, true, "SetMode", EFI_DEVICE_ERROR, false},
+      {"GetMode refused", false, true, "UgaGetMode", EFI_DEVICE_ERROR, true},
+  };
+  for (const Row &row : rows) {
+    nimbtest::ResetLoaderState();
+    Attach();
+    fw.SetUgaDrawPresent(row.uga);
+    fw.SetConsoleMode(row.textAtStart ? EfiConsoleControlScreenText : EfiConsoleControlScreenGraphics);
+    ASSERT_EQ(nimb::InitConsole(), EFI_SUCCESS) << row.what;
+    const size_t blts = fw.BltCalls().size();
+    if (row.failCall != nullptr)
+      fw.FailCall(row.failCall);
+    EXPECT_EQ(nimb::EnterGraphics(), row.status) << row.what;
+    EXPECT_EQ((nimb::gBootFlags & nimb::kBootGraphics) != 0, row.graphicsFlag) << row.what;
+    if (row.failCall != nullptr)
+      fw.FailCall(row.failCall);
+    nimb::gBootFlags = nimb::kBootNetwork;
+    nimb::ShowBootScreen();
+    EXPECT_EQ(fw.BltCalls().size(), blts) << row.what;
+    EXPECT_TRUE(fw.Events().empty()) << row.what;
+  }
+}
+
+TEST_F(BootScreenTest, FailureScreenOnlyInGraphicsModeWithUgaKnown) {
+  const struct {
+    const char *what;
+    bool enterGraphics;
+    UINT32 mode;
+    bool drawn;
+  } rows[] = {
+      {"graphics, UGA known", true, EfiConsoleControlScreenGraphics, true},
+      {"text mode restored", true, EfiConsoleControlScreenText, false},
+      {"graphics, UGA never looked up", false, EfiConsoleControlScreenGraphics, false},
+  };
+  for (const auto &row : rows) {
+    fw.AddScreen({800, 600});
+    nimb::gUgaDraw = nullptr;
+    if (row.enterGraphics)
+      ASSERT_EQ(nimb::EnterGraphics(), EFI_SUCCESS) << row.what;
+    nimb::gConsoleMode = row.mode;
+    const size_t poolBefore = fw.LivePoolBlocks();
+    nimb::DrawFailureScreen();
+    EXPECT_EQ(fw.BltCalls().size(), row.drawn ? 2u : 0u) << row.what;
+    if (row.drawn) {
+      EXPECT_EQ(Mismatches(kLogoX, kLogoY, kPictureSize, nimb::kFailurePicture), 0) << row.what;
+      EXPECT_EQ(Color(0, 0), kGrey) << row.what;
+    }
+    EXPECT_EQ(fw.LivePoolBlocks(), poolBefore) << row.what;
+  }
+}
+
+class SpinnerTest : public BootScreenTest {};
+
+TEST_F(SpinnerTest, NetworkBootTurnsFrameByFrameUntilStopped) {
+  nimb::gBootFlags = nimb::kBootNetwork;
+  nimb::ShowBootScreen();
+  EXPECT_EQ(Mismatches(kSpinnerX, kSpinnerY, kSpinnerSize, SpinnerFrame(0)), 0);
+  ASSERT_EQ(fw.Events().size(), 1u);
+  const hostfw::EventRecord event = fw.Events()[0];
+  EXPECT_EQ(event.event, nimb::gSpinnerEvent);
+  EXPECT_EQ(event.type, 0x80000200u);
+  EXPECT_EQ(event.tpl, EFI_TPL(TPL_NOTIFY));
+  EXPECT_EQ(event.notify, &nimb::SpinnerTick);
+  EXPECT_EQ(event.context, nullptr);
+  EXPECT_EQ(event.timerType, TimerPeriodic);
+  EXPECT_EQ(event.triggerTime, 1000000u);
+
+  // After frame 17 comes frame 0.
+  for (UINT32 tick = 1; tick <= 19; tick++) {
+    fw.FireEvent(event.event);
+    EXPECT_EQ(nimb::gSpinnerFrame, tick % 18) << "tick " << tick;
+    EXPECT_EQ(Mismatches(kSpinnerX, kSpinnerY, kSpinnerSize, SpinnerFrame(tick % 18)), 0) << "tick " << tick;
+  }
+
+  EFI_UGA_PIXEL *frames = nimb::gSpinnerPixels;
+  nimb::StopSpinner();
+  EXPECT_TRUE(fw.Events()[0].closed);
+  EXPECT_EQ(nimb::gSpinnerEvent, nullptr);
+  EXPECT_EQ(nimb::gSpinnerPixels, frames) << "the frames stay allocated";
+  EXPECT_EQ(NonGrey(kSpinnerX, kSpinnerY, kSpinnerSize), 0);
+  const std::vector<UINT8> logo = DecodedLogo();
+  EXPECT_EQ(Mismatches(kLogoX, kLogoY, kPictureSize, logo.data()), 0);
+}
+
+TEST_F(SpinnerTest, WhatIsLeftWhenTheFirmwareRefuses) {
+  struct Row {
+    const char *what;
+    const char *failCall;     // a service refused once
+    unsigned failAllocation;  // or the n-th allocation from the drawing on
+    bool logo;
+    bool frame0;
+    size_t events;
+  };
+  const Row rows[] = {
+      {"CreateEvent refused", "CreateEvent", 0, true, true, 0},
+      {"SetTimer refused", "SetTimer", 0, true, true, 1},
+      {"no pool for the logo's indexes", nullptr, 1, false, true, 1},
+      {"no pool for the logo's pixels", nullptr, 2, false, true, 1},
+      {"no pool for the spinner", nullptr, 3, true, false, 0},
+  };
+  for (const Row &row : rows) {
+    fw.AddScreen({800, 600});
+    nimb::gSpinnerPixels = nullptr;
+    nimb::gBootFlags = nimb::kBootNetwork;
+    ASSERT_EQ(nimb::EnterGraphics(), EFI_SUCCESS);
+    const size_t eventsBefore = fw.Events().size();
+    if (row.failCall != nullptr)
+      fw.FailCall(row.failCall);
+    else
+      fw.FailAllocation(row.failAllocation);
+    nimb::DrawBootScreen();
+    const std::vector<UINT8> logo = DecodedLogo();
+    EXPECT_EQ(Mismatches(kLogoX, kLogoY, kPictureSize, logo.data()) == 0, row.logo) << row.what;
+    EXPECT_EQ(Mismatches(kSpinnerX, kSpinnerY, kSpinnerSize, SpinnerFrame(0)) == 0, row.frame0) << row.what;
+    EXPECT_EQ(NonGrey(kSpinnerX, kSpinnerY, kSpinnerSize) == 0, !row.frame0) << row.what;
+    ASSERT_EQ(fw.Events().size() - eventsBefore, row.events) << row.what;
+    const bool turning = row.events == 1 && !fw.Events().back().closed;
+    EXPECT_EQ(nimb::gSpinnerEvent != nullptr, turning) << row.what;
+    if (nimb::gSpinnerEvent != nullptr)
+      nimb::StopSpinner();
+  }
+}
+
+class VideoInfoTest : public BootScreenTest {
+ protected:
+  static constexpr UINT32 kUnset = 0xA5A5A5A5;
+  static constexpr nimb::VideoInfo kUnsetRecord = {kUnset, kUnset, kUnset, kUnset, kUnset, kUnset};
+};
+
+TEST_F(VideoInfoTest, FrameBufferFactsAreFetchedOnceAndCopied) {
+  struct Row {
+    const char *what;
+    bool present;
+    bool failGetInfo;
+    UINT64 base;  // reported by GetInfo; 0: the screen's own
+    bool record;
+    UINT64 globalBase;  // expected gFrameBufferBase
+    bool written;
+  };
+  const hostfw::FrameBufferFacts own = fw.ScreenFacts();
+  const Row rows[] = {
+      {"the screen's own", true, false, 0, true, own.base, true},
+      {"above 4 GiB", true, false, 0x123456000, true, 0x123456000, true},
+      {"null record", true, false, 0, false, own.base, false},
+      {"no protocol", false, false, 0, true, 0, false},
+      {"GetInfo refused", true, true, 0, true, 0, false},
+  };
+  for (const Row &row : rows) {
+    nimb::gFrameBufferBase = 0;
+    nimb::gFrameBufferRowBytes = nimb::gScreenWidth = nimb::gScreenHeight = nimb::gScreenDepth = 0;
+    fw.SetFrameBufferInfoPresent(row.present);
+    hostfw::FrameBufferFacts facts = own;
+    facts.rowBytes = 4096;
+    if (row.base != 0)
+      facts.base = row.base;
+    fw.SetFrameBufferFacts(facts);
+    if (row.failGetInfo)
+      fw.FailCall("FrameBufferGetInfo");
+    nimb::VideoInfo record = kUnsetRecord;
+    nimb::GetFrameBufferInfo(row.record ? &record : nullptr);
+    EXPECT_EQ(nimb::gFrameBufferBase, row.globalBase) << row.what;
+    if (row.written) {
+      EXPECT_EQ(record.baseAddress, UINT32(row.globalBase)) << row.what;
+      EXPECT_EQ(record.displayMode, kUnset) << row.what;
+      EXPECT_EQ(record.rowBytes, 4096u) << row.what;
+      EXPECT_EQ(record.width, 800u) << row.what;
+      EXPECT_EQ(record.height, 600u) << row.what;
+      EXPECT_EQ(record.depth, 32u) << row.what;
+    } else {
+      EXPECT_EQ(std::memcmp(&record, &kUnsetRecord, sizeof(record)), 0) << row.what;
+    }
+    if (row.globalBase != 0) {
+      EXPECT_EQ(nimb::gFrameBufferRowBytes, 4096u) << row.what;
+      // Known facts are not asked for again.
+      const unsigned asked = fw.CallCount("FrameBufferGetInfo");
+      nimb::GetFrameBufferInfo(&record);
+      EXPECT_EQ(fw.CallCount("FrameBufferGetInfo"), asked) << row.what;
+    }
+  }
+}
+
+TEST_F(VideoInfoTest, FillVideoInfoHandsOverTheFactsTheColourTableAndTheFailurePicture) {
+  struct Row {
+    const char *what;
+    bool frameBuffer;
+    bool graphics;
+    UINT32 mode;
+  };
+  const Row rows[] = {
+      {"graphics boot", true, true, 1},
+      {"text boot with a frame buffer", true, false, 2},
+      {"no frame buffer info", false, true, 1},
+      {"text boot without", false, false, 2},
+  };
+  const hostfw::FrameBufferFacts own = fw.ScreenFacts();
+  for (const Row &row : rows) {
+    ASSERT_NE(nimb::DeviceTreeInit(), nullptr);
+    nimb::gMemoryMapNode = nimb::DeviceTreeFindNode("/chosen/memory-map", 1);
+    nimb::gKernelRegionTop = 0x200000;
+    nimb::gFrameBufferBase = 0;
+    fw.SetFrameBufferInfoPresent(row.frameBuffer);
+    nimb::gBootFlags = row.graphics ? nimb::kBootGraphics : 0;
+    nimb::BootArgs args;
+    std::memset(&args, 0x5A, sizeof(args));
+
+    nimb::FillVideoInfo(&args);
+
+    EXPECT_EQ(args.videoDisplayMode, row.mode) << row.what;
+    EXPECT_EQ(args.videoBaseAddress, row.frameBuffer ? UINT32(own.base) : 0u) << row.what;
+    EXPECT_EQ(args.videoRowBytes, row.frameBuffer ? 3200u : 0u) << row.what;
+    EXPECT_EQ(args.videoWidth, row.frameBuffer ? 800u : 0u) << row.what;
+    EXPECT_EQ(args.videoHeight, row.frameBuffer ? 600u : 0u) << row.what;
+    EXPECT_EQ(args.videoDepth, row.frameBuffer ? 32u : 0u) << row.what;
+
+    const struct {
+      const char *name;
+      UINT32 address, length;
+    } ranges[] = {{"BootCLUT", 0x200000, 768}, {"Pict-FailedBoot", 0x201000, 16416}};
+    for (const auto &range : ranges) {
+      const nimb::DeviceTreeProperty *property =
+          nimb::DeviceTreeFindProperty(nimb::gMemoryMapNode, range.name);
+      ASSERT_NE(property, nullptr) << row.what << " " << range.name;
+      ASSERT_EQ(property->length, 8u);
+      UINT32 value[2];
+      std::memcpy(value, property->value, 8);
+      EXPECT_EQ(value[0], range.address) << range.name;
+      EXPECT_EQ(value[1], range.length) << range.name;
+    }
+    EXPECT_EQ(nimb::gKernelRegionTop, 0x206000u) << row.what;
+    EXPECT_EQ(std::memcmp(reinterpret_cast<void *>(0x200000), nimb::kBootColorTable, 768), 0) << row.what;
+    const auto *picture = reinterpret_cast<const UINT32 *>(0x201000);
+    EXPECT_EQ(picture[0], 128u);
+    EXPECT_EQ(picture[1], 128u);
+    EXPECT_EQ(picture[2], 0u);
+    EXPECT_EQ(std::memcmp(picture + 8, nimb::kFailurePicture, 16384), 0) << row.what;
+    nimb::TrackedFreeAll();
+  }
+}
+
+TEST_F(VideoInfoTest, NoRoomInTheKernelRegionIsFatal) {
+  const struct {
+    unsigned nth;
+    const char *message;
+  } rows[] = {{1, "Could not allocate CLUT"}, {2, "Could not allocate Pict-FailedBoot"}};
+  for (const auto &row : rows) {
+    ASSERT_NE(nimb::DeviceTreeInit(), nullptr);
+    nimb::gMemoryMapNode = nimb::DeviceTreeFindNode("/chosen/memory-map", 1);
+    nimb::gKernelRegionTop = 0x200000;
+    nimb::BootArgs args = {};
+    fw.FailCall("AllocatePages", row.nth);
+    const hostfw::RunResult result = fw.Call([&] { nimb::FillVideoInfo(&args); });
+    EXPECT_EQ(result.end, hostfw::RunEnd::Exited) << row.message;
+    EXPECT_EQ(result.status, EFI_ABORTED) << row.message;
+    const std::string text = fw.ConOutText();
+    const std::string message = row.message;
+    ASSERT_GE(text.size(), message.size());
+    EXPECT_EQ(text.substr(text.size() - message.size()), message);
+  }
+}
+
+// The host firmware's screen, which the tests above read.
+class BootScreenFirmwareScreen : public BootScreenTest {};
+
+TEST_F(BootScreenFirmwareScreen, BltFillsAndCopiesInsideTheScreenOnly) {
+  EFI_UGA_PIXEL buffer[6];
+  for (UINT8 i = 0; i < 6; i++)
+    buffer[i] = {UINT8(i), UINT8(0x10 * i), UINT8(0x20 + i), 0};
+  struct Row {
+    const char *what;
+    EFI_UGA_BLT_OPERATION operation;
+    UINTN sourceX, sourceY, x, y, width, height, delta;
+    EFI_STATUS status;
+  };
+  const Row rows[] = {
+      {"fill", EfiUgaVideoFill, 0, 0, 10, 20, 3, 2, 0, EFI_SUCCESS},
+      {"copy", EfiUgaBltBufferToVideo, 0, 0, 30, 40, 3, 2, 0, EFI_SUCCESS},
+      {"copy with source offset and delta", EfiUgaBltBufferToVideo, 1, 1, 50, 60, 2, 1, 12, EFI_SUCCESS},
+      {"to the last pixel", EfiUgaVideoFill, 0, 0, 797, 598, 3, 2, 0, EFI_SUCCESS},
+      {"one past the right edge", EfiUgaVideoFill, 0, 0, 798, 0, 3, 1, 0, EFI_INVALID_PARAMETER},
+      {"one past the bottom", EfiUgaBltBufferToVideo, 0, 0, 0, 599, 1, 2, 0, EFI_INVALID_PARAMETER},
+      {"wrapping round", EfiUgaVideoFill, 0, 0, ~UINTN(0), 0, 2, 1, 0, EFI_INVALID_PARAMETER},
+      {"empty", EfiUgaVideoFill, 0, 0, 0, 0, 0, 1, 0, EFI_INVALID_PARAMETER},
+      {"unknown operation", EFI_UGA_BLT_OPERATION(7), 0, 0, 0, 0, 1, 1, 0, EFI_INVALID_PARAMETER},
+  };
+  ASSERT_EQ(nimb::EnterGraphics(), EFI_SUCCESS);
+  for (const Row &row : rows) {
+    const size_t before = fw.BltCalls().size();
+    EXPECT_EQ(nimb::gUgaDraw->Blt(nimb::gUgaDraw, buffer, row.operation, row.sourceX, row.sourceY, row.x,
+                                  row.y, row.width, row.height, row.delta),
+              row.status)
+        << row.what;
+    ASSERT_EQ(fw.BltCalls().size(), before + 1) << row.what;
+    EXPECT_EQ(fw.BltCalls().back().status, row.status) << row.what;
+  }
+  auto rgb = [](const EFI_UGA_PIXEL &p) { return UINT32(p.Red) << 16 | UINT32(p.Green) << 8 | p.Blue; };
+  EXPECT_EQ(Color(12, 21), rgb(buffer[0]));
+  EXPECT_EQ(Color(13, 21), 0u) << "a fill stops at its width";
+  EXPECT_EQ(Color(30, 40), rgb(buffer[0]));
+  EXPECT_EQ(Color(32, 41), rgb(buffer[5]));
+  EXPECT_EQ(Color(50, 60), rgb(buffer[4]));  // row 1 of 3 pixels, column 1
+  EXPECT_EQ(Color(51, 60), rgb(buffer[5]));
+  EXPECT_EQ(Color(799, 599), rgb(buffer[0]));
+}
+
+TEST_F(BootScreenFirmwareScreen, SixteenBitScreenKeepsFiveBitsEach) {
+  hostfw::ScreenOptions options;
+  options.width = 64;
+  options.height = 32;
+  options.depth = 16;
+  options.rowBytes = 256;
+  fw.AddScreen(options);
+  ASSERT_EQ(nimb::EnterGraphics(), EFI_SUCCESS);
+  EXPECT_EQ(nimb::gScreenDepth, 16u);
+  EFI_UGA_PIXEL pixel = {0xFF, 0x80, 0x08, 0};
+  ASSERT_EQ(nimb::gUgaDraw->Blt(nimb::gUgaDraw, &pixel, EfiUgaVideoFill, 0, 0, 63, 31, 1, 1, 0), EFI_SUCCESS);
+  EXPECT_EQ(fw.ScreenPixel(63, 31), UINT32(1 << 10 | 16 << 5 | 31));
+  EXPECT_EQ(fw.ScreenFacts().rowBytes, 256u);
+  EXPECT_EQ(fw.ScreenFacts().size, 256u * 32);
+}
+
+}  // namespace

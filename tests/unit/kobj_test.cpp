@@ -1,0 +1,172 @@
+// The kernel object writer of the kobj tool: which ELF files it takes and
+// why it refuses the others, and the bytes of the objects and fat files it
+// writes.
+#include <gtest/gtest.h>
+
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "kernel_images.h"
+#include "kobj/writer.h"
+
+namespace {
+
+using nimbtest::Bytes;
+using nimbtest::ElfSegment;
+using nimbtest::GetLe32;
+using nimbtest::Pattern;
+using nimbtest::PutLe16;
+using nimbtest::PutLe32;
+
+// Program headers start at byte 52, 32 bytes each; paddr is at +12, memory
+// size at +20.
+constexpr size_t kPhdr = 52;
+
+Bytes GoodElf() {
+  return nimbtest::Elf(0x00100010, {{1, 0x00100000, 0x00100000, Pattern(0x20), 0x20},
+                                    {1, 0x00101000, 0x00101000, Pattern(0x10), 0x1800}});
+}
+
+TEST(KobjElfTest, RefusesWhatTheLoaderCouldNotPlace) {
+  struct Row {
+    const char *name;
+    std::function<void(Bytes &)> spoil;
+    std::string error;  // a part of the message
+  };
+  const Row rows[] = {
+      {"not ELF", [](Bytes &e) { e[1] = 'X'; }, "not an ELF file"},
+      {"cut in the header", [](Bytes &e) { e.resize(40); }, "ELF header cut off"},
+      {"64-bit", [](Bytes &e) { e[4] = 2; }, "64-bit"},
+      {"unknown class", [](Bytes &e) { e[4] = 9; }, "unknown ELF class 9"},
+      {"big-endian", [](Bytes &e) { e[5] = 2; }, "not a little-endian"},
+      {"relocatable object", [](Bytes &e) { PutLe16(e, 16, 1); }, "not an executable (ELF type 1)"},
+      {"position-independent", [](Bytes &e) { PutLe16(e, 16, 3); }, "--no-pie"},
+      {"another processor", [](Bytes &e) { PutLe16(e, 18, 62); }, "not a 32-bit x86 program (ELF machine 62)"},
+      {"program headers of another size", [](Bytes &e) { PutLe16(e, 42, 56); }, "of 56 bytes"},
+      {"program headers outside the file", [](Bytes &e) { PutLe32(e, 28, 0xFFFFFF00); }, "outside the file"},
+      {"segment bytes outside the file", [](Bytes &e) { PutLe32(e, kPhdr + 4, 0x10000); }, "outside the file"},
+      {"more file bytes than memory", [](Bytes &e) { PutLe32(e, kPhdr + 20, 0x10); }, "more bytes in the file"},
+      {"no loadable segment", [](Bytes &e) { PutLe32(e, kPhdr, 4), PutLe32(e, kPhdr + 32, 6); },
+       "no loadable segment"},
+      {"only empty loadable segments",
+       [](Bytes &e) {
+         for (size_t at : {kPhdr, kPhdr + 32})
+           PutLe32(e, at + 16, 0), PutLe32(e, at + 20, 0);
+       },
+       "no loadable segment"},
+      {"an address off a page boundary", [](Bytes &e) { PutLe32(e, kPhdr + 32 + 12, 0x00101800); },
+       "not on a 4096-byte boundary"},
+      // 0x40100000 lands on the first segment's page.
+      {"segments sharing a page once placed", [](Bytes &e) { PutLe32(e, kPhdr + 32 + 12, 0x40100000); },
+       "overlap"},
+      {"segments overlapping", [](Bytes &e) { PutLe32(e, kPhdr + 20, 0x1001); }, "overlap"},
+      {"pages past 4 GiB", [](Bytes &e) { PutLe32(e, kPhdr + 32 + 20, 0xFFF00000); }, "past 4 GiB"},
+      {"entry outside the segments", [](Bytes &e) { PutLe32(e, 24, 0x00100020); }, "entry point 0x100020"},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    Bytes elf = GoodElf();
+    row.spoil(elf);
+    kobj::Kernel kernel;
+    kernel.entry = 0x77;
+    std::string error = kobj::ReadElf(elf, &kernel);
+    EXPECT_NE(error.find(row.error), std::string::npos) << error;
+    EXPECT_EQ(kernel.entry, 0x77u) << "nothing is given back on a refusal";
+  }
+}
+
+TEST(KobjElfTest, TakesLoadableSegmentsAtTheirPhysicalAddresses) {
+  Bytes elf = nimbtest::Elf(0xC0100004, {{1, 0xC0100000, 0x00100000, Pattern(0x30), 0x30},
+                                         {6, 0x10, 0x10, Pattern(4), 4},  // not loadable
+                                         {1, 0xC0200000, 0xC0200000, {}, 0},  // empty
+                                         {1, 0xC0300000, 0x00300000, {}, 0x2000}});
+  kobj::Kernel kernel;
+  ASSERT_EQ(kobj::ReadElf(elf, &kernel), "");
+  EXPECT_EQ(kernel.entry, 0xC0100004u);
+  ASSERT_EQ(kernel.segments.size(), 2u);
+  EXPECT_EQ(kernel.segments[0].address, 0x00100000u);
+  EXPECT_EQ(kernel.segments[0].memorySize, 0x30u);
+  EXPECT_EQ(kernel.segments[0].bytes, Pattern(0x30));
+  EXPECT_EQ(kernel.segments[1].address, 0x00300000u);
+  EXPECT_EQ(kernel.segments[1].memorySize, 0x2000u);
+  EXPECT_TRUE(kernel.segments[1].bytes.empty());
+}
+
+TEST(KobjWriterTest, ObjectRecords) {
+  kobj::Kernel kernel;
+  kernel.entry = 0xC0100010;
+  kernel.segments = {{0xC0100000, 0x30, Pattern(0x30)}, {0x00300000, 0x2000, {}}};
+  Bytes out = kobj::WriteObject(kernel);
+  struct Field {
+    const char *name;
+    size_t at;
+    uint32_t value;
+  };
+  const size_t thread = 28 + 2 * 40;
+  const Field fields[] = {
+      {"magic", 0, 0xFEEDFACE},
+      {"cpu type", 4, 7},
+      {"file type", 12, 2},
+      {"command count", 16, 3},
+      {"commands size", 20, 2 * 40 + 80},
+      {"flags", 24, 0},
+      {"first command", 28, 1},
+      {"first length", 32, 40},
+      {"first address", 28 + 24, 0xC0100000},
+      {"first memory size", 28 + 28, 0x30},
+      {"first file size", 28 + 36, 0x30},
+      {"second address", 68 + 24, 0x00300000},
+      {"second memory size", 68 + 28, 0x2000},
+      // A segment of zeroes alone carries one byte, so that the loader takes
+      // and clears its pages.
+      {"second file size", 68 + 36, 1},
+      {"thread command", thread, 5},
+      {"thread length", thread + 4, 80},
+      {"thread flavor", thread + 8, 1},
+      {"register words", thread + 12, 16},
+      {"entry", thread + 56, 0xC0100010},
+  };
+  for (const Field &field : fields)
+    EXPECT_EQ(GetLe32(out, field.at), field.value) << field.name;
+  for (size_t at = thread + 16; at < thread + 80; at += 4) {
+    if (at != thread + 56)
+      EXPECT_EQ(GetLe32(out, at), 0u) << "register word at " << at;
+  }
+  size_t first = GetLe32(out, 28 + 32);
+  size_t second = GetLe32(out, 68 + 32);
+  EXPECT_GE(first, 28u + 160u);
+  EXPECT_EQ(Bytes(out.begin() + first, out.begin() + first + 0x30), Pattern(0x30));
+  ASSERT_EQ(second + 1, out.size());
+  EXPECT_EQ(out[second], 0);
+}
+
+TEST(KobjWriterTest, FatRecordsInBothOrders) {
+  const std::vector<kobj::FatEntry> slices = {{18, 0, Pattern(0x1001)}, {7, 3, Pattern(0x20, 2)}};
+  struct Row {
+    kobj::ByteOrder order;
+    Bytes magic;
+  };
+  const Row rows[] = {{kobj::ByteOrder::kBig, {0xCA, 0xFE, 0xBA, 0xBE}},
+                      {kobj::ByteOrder::kLittle, {0xBE, 0xBA, 0xFE, 0xCA}}};
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.magic[0]);
+    Bytes out = kobj::WriteFat(slices, row.order);
+    auto get = [&](size_t at) {
+      uint32_t value = GetLe32(out, at);
+      return row.order == kobj::ByteOrder::kBig ? __builtin_bswap32(value) : value;
+    };
+    EXPECT_EQ(Bytes(out.begin(), out.begin() + 4), row.magic);
+    EXPECT_EQ(get(4), 2u);
+    const uint32_t expected[2][5] = {{18, 0, 0x1000, 0x1001, 12}, {7, 3, 0x3000, 0x20, 12}};
+    for (size_t i = 0; i < 2; i++) {
+      for (size_t field = 0; field < 5; field++)
+        EXPECT_EQ(get(8 + 20 * i + 4 * field), expected[i][field]) << "slice " << i << " field " << field;
+      uint32_t offset = expected[i][2];
+      EXPECT_EQ(Bytes(out.begin() + offset, out.begin() + offset + expected[i][3]), slices[i].bytes);
+    }
+    EXPECT_EQ(out.size(), 0x3020u);
+  }
+}
+
+}  // namespace

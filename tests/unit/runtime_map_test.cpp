@@ -1,0 +1,334 @@
+// The runtime address map: addresses, the firmware's call, the copy, the
+// pointers that follow their regions, the rewritten map, and the stop when
+// the firmware refuses the map.
+#include "memory/runtime_map.h"
+
+#include <gtest/gtest.h>
+
+#include <cstdio>
+#include <cstring>
+#include <iterator>
+#include <string>
+#include <vector>
+
+#include "boot/stop.h"
+#include "loader_fixture.h"
+
+namespace {
+
+constexpr UINT64 kRt = EFI_MEMORY_RUNTIME;
+constexpr UINT64 kStride = hostfw::kDescriptorSize;
+constexpr UINT8 kDestinationFill = 0x77;
+
+struct Region {
+  UINT32 type;
+  UINT64 physical;
+  UINT64 pages;
+  UINT64 attribute;
+  UINT64 virtualStart;  // as the firmware left it
+  UINT64 expected;      // VirtualStart after the call
+};
+
+bool Moves(const Region &r) {
+  return r.type == EfiRuntimeServicesCode || r.type == EfiRuntimeServicesData;
+}
+bool Announced(const Region &r) {
+  return r.type != EfiReservedMemoryType && (r.attribute & kRt) != 0;
+}
+bool InArena(UINT64 address) {
+  return address >= hostfw::kArenaBase && address < hostfw::kArenaLimit;
+}
+UINT8 *At(UINT64 address) {
+  return reinterpret_cast<UINT8 *>(address);
+}
+UINT8 Fill(size_t index) {
+  return UINT8(0x31 + index);
+}
+bool Filled(UINT64 address, UINT64 pages, UINT8 byte) {
+  for (UINT64 i = 0; i < pages * EFI_PAGE_SIZE; i++) {
+    if (At(address)[i] != byte)
+      return false;
+  }
+  return true;
+}
+
+std::string Describe(UINT32 type, UINT64 physical, UINT64 virtualStart, UINT64 pages, UINT64 attribute) {
+  char text[128];
+  std::snprintf(text, sizeof(text), "type %u at %#llx -> %#llx, %llu pages, %#llx", type,
+                (unsigned long long)physical, (unsigned long long)virtualStart, (unsigned long long)pages,
+                (unsigned long long)attribute);
+  return text;
+}
+std::string Describe(const EFI_MEMORY_DESCRIPTOR &d) {
+  return Describe(d.Type, d.PhysicalStart, d.VirtualStart, d.NumberOfPages, d.Attribute);
+}
+
+// A firmware of its own for one call, and a map of `regions` at the
+// firmware's stride, in a buffer with room for as many descriptors again
+// behind them. Each region in the arena is declared and filled with a byte
+// of its own; the area from `next` on that the announced regions take is
+// declared and filled with kDestinationFill.
+class Scene {
+ public:
+  Scene(const std::vector<Region> &regions, UINT64 next) : regions(regions), next(next) {
+    nimb::gST = fw.SystemTable();
+    nimb::gBS = fw.BootServices();
+    nimb::gRT = fw.RuntimeServices();
+    nimb::gImageHandle = fw.ImageHandle();
+    UINT64 pages = 0;
+    map.assign(2 * regions.size() * kStride, 0xA5);
+    for (size_t i = 0; i < regions.size(); i++) {
+      const Region &r = regions[i];
+      pages += Announced(r) ? r.pages : 0;
+      if (InArena(r.physical)) {
+        fw.AddMemoryRegion(EFI_MEMORY_TYPE(r.type), r.physical, r.pages, r.attribute);
+        std::memset(At(r.physical), Fill(i), r.pages * EFI_PAGE_SIZE);
+      }
+      EFI_MEMORY_DESCRIPTOR d = {r.type, 0, r.physical, r.virtualStart, r.pages, r.attribute};
+      std::memcpy(Descriptor(i), &d, sizeof(d));
+    }
+    if (pages != 0) {
+      fw.AddMemoryRegion(EfiLoaderData, next, pages, 0);
+      std::memset(At(next), kDestinationFill, pages * EFI_PAGE_SIZE);
+    }
+  }
+  ~Scene() { nimbtest::ResetLoaderState(); }
+
+  EFI_MEMORY_DESCRIPTOR *Descriptor(size_t i) {
+    return reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map.data() + i * kStride);
+  }
+  std::vector<std::string> List(size_t from, size_t to) {
+    std::vector<std::string> out;
+    for (size_t i = from; i < to; i++)
+      out.push_back(Describe(*Descriptor(i)));
+    return out;
+  }
+  hostfw::RunResult Map(bool resume) {
+    EXPECT_EQ(fw.BootServices()->ExitBootServices(fw.ImageHandle(), fw.MapKey()), EFI_SUCCESS);
+    nimb::gBS = nullptr;
+    EFI_MEMORY_DESCRIPTOR *start = Descriptor(0);
+    EFI_MEMORY_DESCRIPTOR *end = Descriptor(regions.size());
+    cursor = resume ? start : end;
+    return fw.Call([&] {
+      EXPECT_EQ(nimb::MapRuntimeServices(start, end, &cursor, kStride, EFI_MEMORY_DESCRIPTOR_VERSION, &next,
+                                         resume),
+                0u);
+    });
+  }
+
+  hostfw::Firmware fw;
+  std::vector<Region> regions;
+  UINT64 next;
+  std::vector<UINT8> map;
+  EFI_MEMORY_DESCRIPTOR *cursor = nullptr;
+};
+
+class RuntimeMapTest : public nimbtest::LoaderTest {};
+
+TEST_F(RuntimeMapTest, AddressesCopiesAndTheRewrittenMapInBothModes) {
+  struct Row {
+    const char *what;
+    std::vector<Region> regions;
+    UINT64 nextAfter;
+  };
+  const Row rows[] = {
+      {"runtime regions of 2, 1 and 4 pages",
+       {{EfiRuntimeServicesCode, 0x200000, 2, kRt, 0, 0x100000},
+        {EfiRuntimeServicesData, 0x300000, 1, kRt, 0, 0x102000},
+        {EfiRuntimeServicesCode, 0x400000, 4, kRt | 1, 0, 0x103000}},
+       0x107000},
+      {"reserved memory with the runtime bit",
+       {{EfiReservedMemoryType, 0x500000, 1, kRt | 0xF, 0x5555000, 0x5555000},
+        {EfiRuntimeServicesData, 0x200000, 2, kRt | 0xF, 0, 0x100000}},
+       0x102000},
+      {"memory-mapped I/O with the runtime bit",
+       {{EfiMemoryMappedIO, 0x600000, 2, kRt | 1, 0, 0x100000},
+        {EfiRuntimeServicesData, 0x200000, 1, kRt, 0, 0x102000},
+        {EfiBootServicesData, 0x700000, 4, 0xF, 0, 0}},
+       0x103000},
+      {"no runtime region",
+       {{EfiBootServicesData, 0x200000, 1, 0xF, 0, 0}, {EfiLoaderData, 0x300000, 2, 0xF, 0, 0}},
+       0x100000},
+  };
+  for (const Row &row : rows) {
+    for (bool resume : {false, true}) {
+      SCOPED_TRACE(std::string(row.what) + (resume ? ", resume" : ", normal boot"));
+      Scene scene(row.regions, 0x100000);
+      ASSERT_EQ(scene.Map(resume).end, hostfw::RunEnd::Returned);
+      EXPECT_EQ(scene.next, row.nextAfter);
+
+      // What the firmware was given, and the map as the call leaves it.
+      std::vector<std::string> announced, final, added;
+      size_t n = row.regions.size();
+      for (const Region &r : row.regions) {
+        UINT64 attribute = r.type == EfiReservedMemoryType ? r.attribute & ~kRt : r.attribute;
+        if (resume && !Announced(r))
+          continue;
+        announced.push_back(Describe(r.type, r.physical, r.expected, r.pages, attribute));
+        if (resume) {
+          final.push_back(
+              Describe(r.type, Moves(r) ? r.expected : r.physical, r.expected, r.pages, attribute));
+        } else if (Moves(r)) {
+          final.push_back(Describe(EfiConventionalMemory, r.physical, r.expected, r.pages, attribute & ~kRt));
+          added.push_back(Describe(r.type, r.expected, r.expected, r.pages, attribute));
+        } else {
+          final.push_back(announced.back());
+        }
+      }
+      ASSERT_TRUE(scene.fw.VirtualMapSet());
+      std::vector<std::string> given;
+      for (const EFI_MEMORY_DESCRIPTOR &d : scene.fw.VirtualMap())
+        given.push_back(Describe(d));
+      EXPECT_EQ(given, announced);
+      final.insert(final.end(), added.begin(), added.end());
+      EXPECT_EQ(scene.cursor, scene.Descriptor(final.size()));
+      EXPECT_EQ(scene.List(0, final.size()), final);
+      if (!resume)
+        EXPECT_EQ(final.size(), n + added.size());
+
+      // Only runtime code and data is copied, and only a normal boot clears
+      // the old place.
+      for (size_t i = 0; i < n; i++) {
+        const Region &r = row.regions[i];
+        SCOPED_TRACE(Describe(r.type, r.physical, r.expected, r.pages, r.attribute));
+        if (Moves(r)) {
+          EXPECT_TRUE(Filled(r.expected, r.pages, Fill(i)));
+          EXPECT_TRUE(Filled(r.physical, r.pages, resume ? Fill(i) : 0));
+        } else {
+          EXPECT_TRUE(Filled(r.physical, r.pages, Fill(i)));
+          if (Announced(r))
+            EXPECT_TRUE(Filled(r.expected, r.pages, kDestinationFill));
+        }
+      }
+    }
+  }
+}
+
+TEST_F(RuntimeMapTest, TableEntriesAndTheSystemTableFollowTheirRegion) {
+  // Region A: 2 pages at 0x200000 -> 0x100000; region B: 1 page at 0x300000
+  // -> 0x102000.
+  const std::vector<Region> regions = {{EfiRuntimeServicesData, 0x200000, 2, kRt, 0, 0x100000},
+                                       {EfiRuntimeServicesCode, 0x300000, 1, kRt, 0, 0x102000}};
+  struct Entry {
+    UINT64 before;
+    UINT64 after;
+  };
+  const Entry entries[] = {
+      {0x200000, 0x100000},  // first byte of A
+      {0x201FFF, 0x101FFF},  // last byte of A
+      {0x202000, 0x202000},  // first byte behind A
+      {0x1FFFFF, 0x1FFFFF},  // last byte before A
+      {0x300010, 0x102010},  // inside B
+      {0x301000, 0x301000},  // first byte behind B
+      {0x7000, 0x7000},      // in no region
+  };
+  for (bool resume : {false, true}) {
+    for (bool inside : {false, true}) {
+      SCOPED_TRACE(std::string(resume ? "resume" : "normal boot") + (inside ? ", system table in A" : ""));
+      Scene scene(regions, 0x100000);
+      for (const Entry &e : entries)
+        scene.fw.AddConfigurationTable(gEfiAcpi20TableGuid, At(e.before));
+      EFI_SYSTEM_TABLE *table = scene.fw.SystemTable();
+      EFI_SYSTEM_TABLE copy = *table;
+      if (inside) {
+        table = reinterpret_cast<EFI_SYSTEM_TABLE *>(0x200100);
+        *table = copy;
+        nimb::gST = table;
+      }
+      ASSERT_EQ(scene.Map(resume).end, hostfw::RunEnd::Returned);
+      EFI_SYSTEM_TABLE *expected = inside ? reinterpret_cast<EFI_SYSTEM_TABLE *>(0x100100) : table;
+      EXPECT_EQ(nimb::gST, expected);
+      EXPECT_EQ(std::memcmp(nimb::gST, &copy, sizeof(copy)), 0);
+      // Kept by hostfw outside the map, the entries are fixed in place.
+      for (size_t i = 0; i < std::size(entries); i++) {
+        EXPECT_EQ(copy.ConfigurationTable[i].VendorTable, At(entries[i].after)) << "entry " << i;
+      }
+    }
+  }
+}
+
+TEST_F(RuntimeMapTest, TheFirmwaresOwnMapEndToEnd) {
+  const UINT64 kArea = 0x1000000;
+  for (bool resume : {false, true}) {
+    SCOPED_TRACE(resume ? "resume" : "normal boot");
+    Scene scene({}, kArea);
+    scene.fw.AddMemoryRegion(EfiLoaderData, kArea, 64, 0);
+    EFI_SYSTEM_TABLE *old = scene.fw.SystemTable();
+    const void *vendor = old->FirmwareVendor;
+    scene.fw.AddConfigurationTable(gEfiAcpi20TableGuid, const_cast<void *>(vendor));
+    const EFI_SYSTEM_TABLE before = *old;
+
+    size_t announced = 0, moved = 0;
+    UINT64 pages = 0;
+    for (const EFI_MEMORY_DESCRIPTOR &d : scene.fw.MemoryMap()) {
+      Region r = {d.Type, d.PhysicalStart, d.NumberOfPages, d.Attribute, 0, 0};
+      announced += Announced(r);
+      moved += Moves(r);
+      pages += Announced(r) ? r.pages : 0;
+    }
+    ASSERT_GE(moved, 2u);
+    UINTN size = 0, key = 0, descriptorSize = 0;
+    UINT32 version = 0;
+    ASSERT_EQ(nimb::gBS->GetMemoryMap(&size, nullptr, &key, &descriptorSize, &version), EFI_BUFFER_TOO_SMALL);
+    scene.map.assign(size + moved * descriptorSize, 0);
+    ASSERT_EQ(nimb::gBS->GetMemoryMap(&size, scene.Descriptor(0), &key, &descriptorSize, &version),
+              EFI_SUCCESS);
+    ASSERT_EQ(scene.fw.BootServices()->ExitBootServices(scene.fw.ImageHandle(), key), EFI_SUCCESS);
+    nimb::gBS = nullptr;
+    EFI_MEMORY_DESCRIPTOR *start = scene.Descriptor(0);
+    EFI_MEMORY_DESCRIPTOR *end = scene.Descriptor(size / descriptorSize);
+    EFI_MEMORY_DESCRIPTOR *cursor = resume ? start : end;
+    UINT64 next = kArea;
+    hostfw::RunResult run = scene.fw.Call(
+        [&] { nimb::MapRuntimeServices(start, end, &cursor, descriptorSize, version, &next, resume); });
+
+    ASSERT_EQ(run.end, hostfw::RunEnd::Returned);
+    EXPECT_EQ(next, kArea + pages * EFI_PAGE_SIZE);
+    EXPECT_EQ(scene.fw.VirtualMap().size(), resume ? announced : size / descriptorSize);
+    EXPECT_EQ(cursor, resume ? scene.Descriptor(announced) : scene.Descriptor(size / descriptorSize + moved));
+    // The system table moved into the area, whole.
+    UINT64 at = reinterpret_cast<UINTN>(nimb::gST);
+    EXPECT_GE(at, kArea);
+    EXPECT_LT(at, next);
+    EXPECT_EQ(std::memcmp(nimb::gST, &before, sizeof(before)), 0);
+    UINT64 delta = at - reinterpret_cast<UINTN>(old);
+    if (resume) {
+      // The old place stays, and with it the table the entry was fixed in.
+      EXPECT_EQ(old->Hdr.Signature, EFI_SYSTEM_TABLE_SIGNATURE);
+      EXPECT_EQ(reinterpret_cast<UINTN>(old->ConfigurationTable[old->NumberOfTableEntries - 1].VendorTable),
+                reinterpret_cast<UINTN>(vendor) + delta);
+      for (size_t i = 0; i < announced; i++)
+        EXPECT_EQ(scene.Descriptor(i)->PhysicalStart, scene.Descriptor(i)->VirtualStart) << i;
+    } else {
+      EXPECT_EQ(old->Hdr.Signature, 0u);
+    }
+    EXPECT_TRUE(scene.fw.ViolationsAfterExit().empty());
+  }
+}
+
+TEST_F(RuntimeMapTest, ARefusedMapStopsWithoutBootServices) {
+  struct Row {
+    bool resume;
+    hostfw::RunEnd end;
+  };
+  const Row rows[] = {{false, hostfw::RunEnd::Halted}, {true, hostfw::RunEnd::Reset}};
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.resume ? "resume" : "normal boot");
+    Scene scene({{EfiRuntimeServicesData, 0x200000, 1, kRt, 0, 0x100000}}, 0x100000);
+    EFI_SYSTEM_TABLE *table = nimb::gST;
+    scene.fw.FailCall("SetVirtualAddressMap", 1, EFI_INVALID_PARAMETER);
+    hostfw::RunResult run = scene.Map(row.resume);
+    EXPECT_EQ(run.end, row.end);
+    if (row.end == hostfw::RunEnd::Reset)
+      EXPECT_EQ(run.resetType, EfiResetCold);
+    ASSERT_NE(nimb::gStopMessage, nullptr);
+    EXPECT_STREQ(nimb::gStopMessage, "Error in SetVirtualAddressMap\n");
+    EXPECT_TRUE(scene.fw.ViolationsAfterExit().empty());
+    EXPECT_TRUE(scene.fw.ConOutCalls().empty());
+    EXPECT_EQ(nimb::gST, table);
+    EXPECT_TRUE(Filled(0x100000, 1, kDestinationFill));
+    EXPECT_TRUE(Filled(0x200000, 1, Fill(0)));
+  }
+}
+
+}  // namespace
