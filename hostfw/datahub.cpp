@@ -1,6 +1,7 @@
 // The Data Hub: records logged by the firmware about the machine, walked by
 // monotonic count. As on real firmware, the count handed back with a record
 // is that of the next record, and 0 comes back with the last one.
+#include <algorithm>
 #include <cstring>
 
 #include "hostfw/internal.h"
@@ -70,9 +71,10 @@ void Firmware::AddDataHubRecordData(const EFI_GUID &producer, const std::vector<
   header.LogTime = EfiTimeFromSeconds(0);
   header.LogMonotonicCount = hub.records.size() + kFirstCount;
 
-  std::vector<uint8_t> record(sizeof(header));
+  // Exactly as long as the record, so that a read past it shows.
+  std::vector<uint8_t> record(header.RecordSize);
   std::memcpy(record.data(), &header, sizeof(header));
-  record.insert(record.end(), data.begin(), data.end());
+  std::copy(data.begin(), data.end(), record.begin() + sizeof(header));
   hub.records.push_back(std::move(record));
 }
 

@@ -94,7 +94,7 @@ struct AcpiOptions {
   UINT32 rsdtLength = 0;   // 0: the true length; else the length the RSDT states
   UINT32 xsdtLength = 0;   // the same for the XSDT
   std::vector<std::string> otherTables = {"APIC", "HPET"};  // 4-character signatures ahead of the FACP
-  bool facp = true;                                        // the root tables list the FACP
+  bool facp = true;                                         // the root tables list the FACP
   UINT8 facpRevision = 4;
   UINT32 facpLength = 0;  // 0: 116 bytes up to revision 2, 244 above
   bool dsdt32 = true;     // the FACP's 32-bit DSDT field is filled
@@ -290,7 +290,8 @@ class Firmware {
   // The record has the layout of the vendor's platform records: the standard
   // header naming `producer`, 16 bytes of the producer's own, the sizes of
   // name and value, the name in UCS-2 with its NUL unit, then the value.
-  void AddDataHubRecord(const EFI_GUID &producer, const std::u16string &name, const std::vector<uint8_t> &value);
+  void AddDataHubRecord(const EFI_GUID &producer, const std::u16string &name,
+                        const std::vector<uint8_t> &value);
   // A record whose bytes behind the 72-byte standard header are `data` as
   // given, sizes and all; the header's RecordSize is always the true size.
   void AddDataHubRecordData(const EFI_GUID &producer, const std::vector<uint8_t> &data);

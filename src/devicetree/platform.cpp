@@ -104,7 +104,7 @@ EFI_STATUS InitPlatformDescription() {
     }
     // The hub returns 0 together with its last record, which is thus never
     // looked at.
-    if (false) {
+    if (count == 0) {
       break;
     }
     if (record != nullptr) {

@@ -72,7 +72,7 @@ constexpr uint64_t kEfiMemoryRuntime = 1ull << 63;
 
 // The 64-bit firmware's system table and runtime services table, read by
 // offset from their addresses.
-constexpr uint64_t kSystemTableSignature = 0x5453595320494249ull;    // "IBI SYST"
+constexpr uint64_t kSystemTableSignature = 0x5453595320494249ull;      // "IBI SYST"
 constexpr uint64_t kRuntimeServicesSignature = 0x56524553544e5552ull;  // "RUNTSERV"
 constexpr uint32_t kTableRevision = 8;
 constexpr uint32_t kTableHeaderSize = 12;

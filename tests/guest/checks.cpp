@@ -70,7 +70,8 @@ void CheckEntryState(const EntryState &s) {
   Check("entry-edi", s.edi == s.entryAddress, "edi=0x%x, entry at 0x%x", s.edi, s.entryAddress);
   Check("entry-ecx", s.ecx == kEntryEcx, "ecx=0x%x, wanted 0x%x", s.ecx, kEntryEcx);
   Check("entry-cs", s.cs == kCodeSelector, "cs=0x%x, wanted 0x%x", s.cs, kCodeSelector);
-  bool dataOk = s.ds == kDataSelector && s.es == kDataSelector && s.fs == kDataSelector && s.gs == kDataSelector;
+  bool dataOk =
+      s.ds == kDataSelector && s.es == kDataSelector && s.fs == kDataSelector && s.gs == kDataSelector;
   Check("entry-data-segments", dataOk, "ds=0x%x es=0x%x fs=0x%x gs=0x%x, wanted 0x%x", s.ds, s.es, s.fs, s.gs,
         kDataSelector);
   Check("entry-cr0", (s.cr0 & kCr0Pe) != 0 && (s.cr0 & kCr0Pg) == 0, "cr0=0x%x: PE %s, PG %s", s.cr0,
@@ -88,17 +89,20 @@ void CheckEntryState(const EntryState &s) {
   }
   uint64_t null = Le64(gdt), code = Le64(gdt + 8), data = Le64(gdt + 16);
   Check("entry-gdt", null == 0 && code == kGdtCode && data == kGdtData,
-        "0x00=0x%llx 0x08=0x%llx 0x10=0x%llx, wanted 0, 0x%llx, 0x%llx", static_cast<unsigned long long>(null),
-        static_cast<unsigned long long>(code), static_cast<unsigned long long>(data),
-        static_cast<unsigned long long>(kGdtCode), static_cast<unsigned long long>(kGdtData));
+        "0x00=0x%llx 0x08=0x%llx 0x10=0x%llx, wanted 0, 0x%llx, 0x%llx",
+        static_cast<unsigned long long>(null), static_cast<unsigned long long>(code),
+        static_cast<unsigned long long>(data), static_cast<unsigned long long>(kGdtCode),
+        static_cast<unsigned long long>(kGdtData));
 }
 
 // --- the boot record --------------------------------------------------------------
 
 const BootArgs *CheckBootArgs(uint32_t address) {
   const uint8_t *bytes = GuestMemory(address, sizeof(BootArgs));
-  if (!Check("bootargs-address", bytes != nullptr && address % kPageSize == 0,
-             "0x%x%s", address, bytes == nullptr ? ": unreadable" : address % kPageSize != 0 ? ": not a page" : "")) {
+  if (!Check("bootargs-address", bytes != nullptr && address % kPageSize == 0, "0x%x%s", address,
+             bytes == nullptr           ? ": unreadable"
+             : address % kPageSize != 0 ? ": not a page"
+                                        : "")) {
     if (bytes == nullptr) {
       return nullptr;
     }
@@ -156,12 +160,15 @@ const BootArgs *CheckBootArgs(uint32_t address) {
   }
   Check("bootargs-video", modeOk && videoOk, "mode %u, %ux%u, depth %u, %u bytes a row at 0x%x%s",
         a.videoDisplayMode, a.videoWidth, a.videoHeight, a.videoDepth, a.videoRowBytes, a.videoBaseAddress,
-        !modeOk ? ": mode neither 1 nor 2" : !videoOk ? ": dimensions don't fit the frame buffer" : "");
+        !modeOk    ? ": mode neither 1 nor 2"
+        : !videoOk ? ": dimensions don't fit the frame buffer"
+                   : "");
 
   // The runtime area sits at the top of the kernel region, two spare pages
   // at its end.
   KernelRegion region = KernelRegionOf(a);
-  bool areaOk = a.runtimePageCount >= 2 && region.runtimeStart >= region.base && region.end <= 0x100000000ull &&
+  bool areaOk = a.runtimePageCount >= 2 && region.runtimeStart >= region.base &&
+                region.end <= 0x100000000ull &&
                 region.runtimeStart + static_cast<uint64_t>(a.runtimePageCount) * kPageSize == region.end;
   Check("bootargs-runtime-area", areaOk, "pages 0x%x+0x%x, kernel region 0x%x+0x%x", a.runtimePageStart,
         a.runtimePageCount, a.kernelRegionBase, a.kernelRegionSize);
@@ -186,7 +193,8 @@ void CountNames(void *context, const TreeNode &node) {
 }
 
 // The property as the given text with its NUL.
-bool PropertyIsText(const uint8_t *tree, uint32_t length, const char *path, const char *name, const char *text) {
+bool PropertyIsText(const uint8_t *tree, uint32_t length, const char *path, const char *name,
+                    const char *text) {
   TreeProperty property;
   if (!TreeFindProperty(tree, length, path, name, &property)) {
     return false;
@@ -216,8 +224,8 @@ bool CheckDeviceTree(const BootArgs &args) {
     return false;
   }
   TreeWalkResult walk = TreePrint(tree, length);
-  if (!Check("tree-walk", walk.status == kTreeOk, "%u nodes, %u properties, 0x%x of 0x%x bytes%s%s", walk.nodes,
-             walk.properties, walk.offset, length, walk.status == kTreeOk ? "" : ": ",
+  if (!Check("tree-walk", walk.status == kTreeOk, "%u nodes, %u properties, 0x%x of 0x%x bytes%s%s",
+             walk.nodes, walk.properties, walk.offset, length, walk.status == kTreeOk ? "" : ": ",
              walk.status == kTreeOk ? "" : TreeStatusText(walk.status))) {
     return false;
   }
@@ -240,18 +248,22 @@ bool CheckDeviceTree(const BootArgs &args) {
   for (uint32_t i = 0; same && i < commandLength; i++) {
     same = bootArgs.value[i] == static_cast<uint8_t>(args.commandLine[i]);
   }
-  Check("tree-boot-args", same, "/chosen boot-args %s", !found ? "missing" : same ? "is the command line"
-                                                                        : "differs from the command line");
+  Check("tree-boot-args", same, "/chosen boot-args %s",
+        !found ? "missing"
+        : same ? "is the command line"
+               : "differs from the command line");
 
   // Every boot names its kernel file and its boot device.
   TreeProperty bootFile, devicePath;
-  bool fileOk = TreeFindProperty(tree, length, "/chosen", "boot-file", &bootFile) && bootFile.length >= 2 &&
-                bootFile.value[bootFile.length - 1] == 0 && TextLength(reinterpret_cast<const char *>(bootFile.value),
-                                                                        bootFile.length) == bootFile.length - 1;
+  bool fileOk =
+      TreeFindProperty(tree, length, "/chosen", "boot-file", &bootFile) && bootFile.length >= 2 &&
+      bootFile.value[bootFile.length - 1] == 0 &&
+      TextLength(reinterpret_cast<const char *>(bootFile.value), bootFile.length) == bootFile.length - 1;
   bool pathOk = TreeFindProperty(tree, length, "/chosen", "boot-device-path", &devicePath) &&
                 devicePath.length >= 4 && Le32(devicePath.value + devicePath.length - 4) == kDevicePathEnd;
   Check("tree-chosen", fileOk && pathOk, "boot-file %s, boot-device-path %s",
-        fileOk ? "is a name" : "missing or not a text", pathOk ? "ends in an end node" : "missing or unterminated");
+        fileOk ? "is a name" : "missing or not a text",
+        pathOk ? "ends in an end node" : "missing or unterminated");
 
   bool efiOk = PropertyIsText(tree, length, "/efi", "firmware-abi", "EFI64") &&
                PropertyHasLength(tree, length, "/efi", "firmware-revision", 4) &&
@@ -356,8 +368,8 @@ void CheckMemoryRanges(const BootArgs &args, const KernelRegion &region, Area *a
     }
   }
   if (outside != nullptr) {
-    Check("ranges-inside", false, "%s at 0x%x+0x%x lies outside 0x%llx-0x%llx", outside->name, outside->address,
-          outside->length, static_cast<unsigned long long>(region.base),
+    Check("ranges-inside", false, "%s at 0x%x+0x%x lies outside 0x%llx-0x%llx", outside->name,
+          outside->address, outside->length, static_cast<unsigned long long>(region.base),
           static_cast<unsigned long long>(region.runtimeStart));
   } else {
     Check("ranges-inside", true, "all in 0x%llx-0x%llx", static_cast<unsigned long long>(region.base),
@@ -382,8 +394,9 @@ void CheckMemoryRanges(const BootArgs &args, const KernelRegion &region, Area *a
   uint32_t zero = record != nullptr ? Le32(record + 8) : 0;
   Check("range-failed-boot",
         record != nullptr && width == kFailedBootWidth && height == kFailedBootHeight && zero == 0,
-        "length 0x%x, picture %ux%u, word 0x%x; wanted 0x%x, %ux%u, 0", picture != nullptr ? picture->length : 0,
-        width, height, zero, kFailedBootLength, kFailedBootWidth, kFailedBootHeight);
+        "length 0x%x, picture %ux%u, word 0x%x; wanted 0x%x, %ux%u, 0",
+        picture != nullptr ? picture->length : 0, width, height, zero, kFailedBootLength, kFailedBootWidth,
+        kFailedBootHeight);
 }
 
 // --- where everything lies ---------------------------------------------------------
@@ -418,18 +431,20 @@ void CheckSystemTable(const BootArgs &args, const KernelRegion &region) {
   const uint8_t *table = GuestMemory(args.systemTable, kSystemTableSize);
   uint64_t signature = table != nullptr ? Le64(table) : 0;
   bool inArea = Inside(args.systemTable, kSystemTableSize, region.runtimeStart, region.end);
-  if (!Check("efi-system-table", signature == kSystemTableSignature, "at 0x%x%s: signature 0x%llx, wanted 0x%llx",
-             args.systemTable, inArea ? " (in the runtime area)" : "", static_cast<unsigned long long>(signature),
+  if (!Check("efi-system-table", signature == kSystemTableSignature,
+             "at 0x%x%s: signature 0x%llx, wanted 0x%llx", args.systemTable,
+             inArea ? " (in the runtime area)" : "", static_cast<unsigned long long>(signature),
              static_cast<unsigned long long>(kSystemTableSignature))) {
     return;
   }
   uint64_t runtime = Le64(table + kSystemTableRuntimeServices);
-  Line("efi systemTable=0x%x revision=0x%x runtimeServices=0x%llx bootServices=0x%llx "
-       "numberOfTableEntries=%u configurationTable=0x%llx",
-       args.systemTable, Le32(table + kTableRevision), static_cast<unsigned long long>(runtime),
-       static_cast<unsigned long long>(Le64(table + kSystemTableBootServices)),
-       static_cast<uint32_t>(Le64(table + kSystemTableNumberOfTableEntries)),
-       static_cast<unsigned long long>(Le64(table + kSystemTableConfigurationTable)));
+  Line(
+      "efi systemTable=0x%x revision=0x%x runtimeServices=0x%llx bootServices=0x%llx "
+      "numberOfTableEntries=%u configurationTable=0x%llx",
+      args.systemTable, Le32(table + kTableRevision), static_cast<unsigned long long>(runtime),
+      static_cast<unsigned long long>(Le64(table + kSystemTableBootServices)),
+      static_cast<uint32_t>(Le64(table + kSystemTableNumberOfTableEntries)),
+      static_cast<unsigned long long>(Le64(table + kSystemTableConfigurationTable)));
 
   // A 64-bit pointer, of which a 32-bit kernel can follow only the low half.
   uint32_t address = static_cast<uint32_t>(runtime);
@@ -438,7 +453,9 @@ void CheckSystemTable(const BootArgs &args, const KernelRegion &region) {
   bool servicesInArea = Inside(address, kRuntimeServicesHeaderSize, region.runtimeStart, region.end);
   Check("efi-runtime-services", servicesSignature == kRuntimeServicesSignature,
         "at 0x%llx%s: signature 0x%llx, wanted 0x%llx", static_cast<unsigned long long>(runtime),
-        runtime >> 32 != 0 ? " (above 4 GiB)" : servicesInArea ? " (in the runtime area)" : "",
+        runtime >> 32 != 0 ? " (above 4 GiB)"
+        : servicesInArea   ? " (in the runtime area)"
+                           : "",
         static_cast<unsigned long long>(servicesSignature),
         static_cast<unsigned long long>(kRuntimeServicesSignature));
 }

@@ -52,8 +52,8 @@ SAME_FIELD(systemTable);
 SAME_FIELD(firmwareBits);
 SAME_FIELD(reserved);
 static_assert(sizeof(nimb::BootArgs) == sizeof(g::BootArgs));
-static_assert(nimb::kBootArgsRevision == g::kBootArgsRevision && nimb::kBootArgsVersion == g::kBootArgsVersion &&
-              nimb::kFirmwareBits == g::kFirmwareBits);
+static_assert(nimb::kBootArgsRevision == g::kBootArgsRevision &&
+              nimb::kBootArgsVersion == g::kBootArgsVersion && nimb::kFirmwareBits == g::kFirmwareBits);
 static_assert(offsetof(EFI_SYSTEM_TABLE, RuntimeServices) == g::kSystemTableRuntimeServices);
 static_assert(offsetof(EFI_SYSTEM_TABLE, BootServices) == g::kSystemTableBootServices);
 static_assert(offsetof(EFI_SYSTEM_TABLE, NumberOfTableEntries) == g::kSystemTableNumberOfTableEntries);
@@ -85,7 +85,8 @@ void ReportOutput(char character) {
 }
 
 const uint8_t *GuestMemory(uint32_t address, uint32_t length) {
-  if (address < kMemoryBase || address - kMemoryBase > kMemorySize || length > kMemorySize - (address - kMemoryBase)) {
+  if (address < kMemoryBase || address - kMemoryBase > kMemorySize ||
+      length > kMemorySize - (address - kMemoryBase)) {
     return nullptr;
   }
   return At(address);
@@ -230,7 +231,8 @@ g::TreeWalkResult Walk(const Bytes &tree, std::vector<std::string> *paths = null
       static_cast<std::vector<std::string> *>(context)->push_back(std::string("  ") + property.name);
     };
   }
-  return g::TreeWalk(copy.empty() ? nullptr : copy.data(), static_cast<uint32_t>(copy.size()), visitor, paths);
+  return g::TreeWalk(copy.empty() ? nullptr : copy.data(), static_cast<uint32_t>(copy.size()), visitor,
+                     paths);
 }
 
 Node SmallTree() {
@@ -256,9 +258,9 @@ TEST(GuestTreeWalk, FollowsNodesAndPropertiesInOrder) {
   EXPECT_EQ(result.status, g::kTreeOk);
   EXPECT_EQ(result.nodes, 4u);
   EXPECT_EQ(result.properties, 7u);
-  std::vector<std::string> wanted = {"/",          "  name",  "  compatible", "/efi",   "  name",
-                                     "/efi/platform", "  name", "  value",      "/chosen", "  name",
-                                     "  boot-args"};
+  std::vector<std::string> wanted = {"/",       "  name",        "  compatible", "/efi",
+                                     "  name",  "/efi/platform", "  name",       "  value",
+                                     "/chosen", "  name",        "  boot-args"};
   EXPECT_EQ(seen, wanted);
 }
 
@@ -323,10 +325,13 @@ TEST(GuestTreeWalk, NamesNodesByTheirFirstProperty) {
 
   Bytes tree = Flatten(SmallTree());
   g::TreeProperty found;
-  ASSERT_TRUE(g::TreeFindProperty(tree.data(), static_cast<uint32_t>(tree.size()), "/chosen", "boot-args", &found));
+  ASSERT_TRUE(
+      g::TreeFindProperty(tree.data(), static_cast<uint32_t>(tree.size()), "/chosen", "boot-args", &found));
   EXPECT_EQ(std::string(reinterpret_cast<const char *>(found.value), found.length), std::string("-v\0", 3));
-  EXPECT_FALSE(g::TreeFindProperty(tree.data(), static_cast<uint32_t>(tree.size()), "/", "boot-args", &found));
-  EXPECT_FALSE(g::TreeFindProperty(tree.data(), static_cast<uint32_t>(tree.size()), "/chosen/x", "name", &found));
+  EXPECT_FALSE(
+      g::TreeFindProperty(tree.data(), static_cast<uint32_t>(tree.size()), "/", "boot-args", &found));
+  EXPECT_FALSE(
+      g::TreeFindProperty(tree.data(), static_cast<uint32_t>(tree.size()), "/chosen/x", "name", &found));
 }
 
 // --- what the report looks like ----------------------------------------------------
@@ -407,7 +412,8 @@ TEST(GuestReport, PrintsTheTreeIndented) {
 
   tree.resize(tree.size() - 4);
   printed = Capture([&] { g::TreePrint(tree.data(), static_cast<uint32_t>(tree.size())); });
-  EXPECT_NE(printed.find("kernel: tree error runs past its length at offset 0x"), std::string::npos) << printed;
+  EXPECT_NE(printed.find("kernel: tree error runs past its length at offset 0x"), std::string::npos)
+      << printed;
 }
 
 // --- a whole boot ------------------------------------------------------------------------
@@ -638,7 +644,9 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
       {"descriptor table limit 0x17", [](FakeBoot &b) { b.entry.gdtLimit = 0x17; }, {"entry-gdt"}},
       {"64-bit code descriptor", [](FakeBoot &b) { b.gdt[1] |= 1ull << 53; }, {"entry-gdt"}},
       {"descriptor table unreadable", [](FakeBoot &b) { b.entry.gdtBase = 0x10; }, {"entry-gdt"}},
-      {"BootArgs unreadable", [](FakeBoot &b) { b.entry.eax = b.entry.ebx = 0x900000; }, {"bootargs-address"}},
+      {"BootArgs unreadable",
+       [](FakeBoot &b) { b.entry.eax = b.entry.ebx = 0x900000; },
+       {"bootargs-address"}},
       {"revision 3", [](FakeBoot &b) { b.args.revision = 3; }, {"bootargs-revision"}},
       {"version 2", [](FakeBoot &b) { b.args.version = 2; }, {"bootargs-version"}},
       {"32-bit firmware", [](FakeBoot &b) { b.args.firmwareBits = 0x20; }, {"bootargs-firmware-bits"}},
@@ -646,34 +654,48 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
       {"command line without NUL",
        [](FakeBoot &b) { std::memset(b.args.commandLine, 'a', sizeof(b.args.commandLine)); },
        {"bootargs-command-line", "tree-boot-args"}},
-      {"boot-args differs", [](FakeBoot &b) { *b.tree.Find("/chosen")->Property("boot-args") = Text("-v foo=2"); },
+      {"boot-args differs",
+       [](FakeBoot &b) { *b.tree.Find("/chosen")->Property("boot-args") = Text("-v foo=2"); },
        {"tree-boot-args"}},
-      {"boot-args without NUL", [](FakeBoot &b) { b.tree.Find("/chosen")->Property("boot-args")->pop_back(); },
+      {"boot-args without NUL",
+       [](FakeBoot &b) { b.tree.Find("/chosen")->Property("boot-args")->pop_back(); },
        {"tree-boot-args"}},
       {"display mode 0", [](FakeBoot &b) { b.args.videoDisplayMode = 0; }, {"bootargs-video"}},
       {"no frame buffer, a width", [](FakeBoot &b) { b.args.videoBaseAddress = 0; }, {"bootargs-video"}},
       {"rows too short", [](FakeBoot &b) { b.args.videoRowBytes = 5116; }, {"bootargs-video"}},
-      {"runtime area below the top", [](FakeBoot &b) { b.args.kernelRegionSize += 0x1000; },
+      {"runtime area below the top",
+       [](FakeBoot &b) { b.args.kernelRegionSize += 0x1000; },
        {"bootargs-runtime-area"}},
       {"no spare pages", [](FakeBoot &b) { b.args.runtimePageCount = 1; }, {"bootargs-runtime-area"}},
       {"tree length too long", [](FakeBoot &b) { b.args.deviceTreeLength = 0x1000; }, {"tree-walk"}},
       {"tree length too short", [](FakeBoot &b) { b.args.deviceTreeLength = 0x100; }, {"tree-walk"}},
-      {"tree address unreadable", [](FakeBoot &b) { b.args.deviceTree = 0x10; },
+      {"tree address unreadable",
+       [](FakeBoot &b) { b.args.deviceTree = 0x10; },
        {"tree-walk", "region-layout", "memmap-loader-data"}},
-      {"node without a name", [](FakeBoot &b) { b.tree.Find("/efi/runtime-services")->named = false; },
+      {"node without a name",
+       [](FakeBoot &b) { b.tree.Find("/efi/runtime-services")->named = false; },
        {"tree-names", "tree-efi"}},
       {"root not named /", [](FakeBoot &b) { b.tree.name = "root"; }, {"tree-names"}},
       {"no model", [](FakeBoot &b) { b.tree.Remove("model"); }, {"tree-root"}},
-      {"compatible without NUL", [](FakeBoot &b) { *b.tree.Property("compatible") = Bytes{'A', 'C', 'P', 'I'}; },
+      {"compatible without NUL",
+       [](FakeBoot &b) {
+         *b.tree.Property("compatible") = Bytes{'A', 'C', 'P', 'I'};
+       },
        {"tree-root"}},
       {"no boot-file", [](FakeBoot &b) { b.tree.Find("/chosen")->Remove("boot-file"); }, {"tree-chosen"}},
       {"device path without end node",
-       [](FakeBoot &b) { b.tree.Find("/chosen")->Property("boot-device-path")->resize(6); }, {"tree-chosen"}},
-      {"32-bit firmware ABI", [](FakeBoot &b) { *b.tree.Find("/efi")->Property("firmware-abi") = Text("EFI32"); },
+       [](FakeBoot &b) { b.tree.Find("/chosen")->Property("boot-device-path")->resize(6); },
+       {"tree-chosen"}},
+      {"32-bit firmware ABI",
+       [](FakeBoot &b) { *b.tree.Find("/efi")->Property("firmware-abi") = Text("EFI32"); },
        {"tree-efi"}},
       {"runtime table of 4 bytes",
-       [](FakeBoot &b) { *b.tree.Find("/efi/runtime-services")->Property("table") = Words({1}); }, {"tree-efi"}},
-      {"range of 12 bytes", [](FakeBoot &b) { b.tree.Find("/chosen/memory-map")->Add("Odd", Words({1, 2, 3})); },
+       [](FakeBoot &b) { *b.tree.Find("/efi/runtime-services")->Property("table") = Words({1}); },
+       {"tree-efi"}},
+      {"range of 12 bytes",
+       [](FakeBoot &b) {
+         b.tree.Find("/chosen/memory-map")->Add("Odd", Words({1, 2, 3}));
+       },
        {"ranges-entries"}},
       {"no memory-map node",
        [](FakeBoot &b) {
@@ -682,13 +704,19 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
        },
        {"ranges-entries", "range-boot-clut", "range-failed-boot"}},
       {"range outside the region",
-       [](FakeBoot &b) { b.tree.Find("/chosen/memory-map")->Add("Driver-180000", Words({0x180000, 0x100})); },
+       [](FakeBoot &b) {
+         b.tree.Find("/chosen/memory-map")->Add("Driver-180000", Words({0x180000, 0x100}));
+       },
        {"ranges-inside", "memmap-loader-data"}},
       {"range in the runtime area",
-       [](FakeBoot &b) { b.tree.Find("/chosen/memory-map")->Add("Extra", Words({kRuntimeStart + 0x3000, 0x100})); },
+       [](FakeBoot &b) {
+         b.tree.Find("/chosen/memory-map")->Add("Extra", Words({kRuntimeStart + 0x3000, 0x100}));
+       },
        {"ranges-inside", "memmap-loader-data"}},
       {"driver named for another address",
-       [](FakeBoot &b) { *b.tree.Find("/chosen/memory-map")->Property("Driver-10c000") = Words({kDriver + 0x100, 8}); },
+       [](FakeBoot &b) {
+         *b.tree.Find("/chosen/memory-map")->Property("Driver-10c000") = Words({kDriver + 0x100, 8});
+       },
        {"ranges-names"}},
       {"driver package named for another address",
        [](FakeBoot &b) {
@@ -696,33 +724,52 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
        },
        {"ranges-names"}},
       {"colour table of 0x200 bytes",
-       [](FakeBoot &b) { *b.tree.Find("/chosen/memory-map")->Property("BootCLUT") = Words({kClut, 0x200}); },
+       [](FakeBoot &b) {
+         *b.tree.Find("/chosen/memory-map")->Property("BootCLUT") = Words({kClut, 0x200});
+       },
        {"range-boot-clut"}},
-      {"failure picture 64 wide", [](FakeBoot &b) { b.picture = Words({64, 128, 0}); }, {"range-failed-boot"}},
+      {"failure picture 64 wide",
+       [](FakeBoot &b) {
+         b.picture = Words({64, 128, 0});
+       },
+       {"range-failed-boot"}},
       {"failure picture of 0x4000 bytes",
        [](FakeBoot &b) {
          *b.tree.Find("/chosen/memory-map")->Property("Pict-FailedBoot") = Words({kPicture, 0x4000});
        },
        {"range-failed-boot"}},
       {"two ranges overlap",
-       [](FakeBoot &b) { b.tree.Find("/chosen/memory-map")->Add("Driver-106100", Words({kClut + 0x100, 8})); },
+       [](FakeBoot &b) {
+         b.tree.Find("/chosen/memory-map")->Add("Driver-106100", Words({kClut + 0x100, 8}));
+       },
        {"region-layout"}},
-      {"memory map outside the region", [](FakeBoot &b) { b.args.memoryMap = 0x120000; },
+      {"memory map outside the region",
+       [](FakeBoot &b) { b.args.memoryMap = 0x120000; },
        {"region-layout", "memmap-loader-data"}},
       {"descriptor size 36", [](FakeBoot &b) { b.args.memoryDescriptorSize = 36; }, {"memmap-layout"}},
-      {"map size not whole descriptors", [](FakeBoot &b) { b.args.memoryMapSize = 10 * kStride - 8; },
+      {"map size not whole descriptors",
+       [](FakeBoot &b) { b.args.memoryMapSize = 10 * kStride - 8; },
        {"memmap-layout"}},
-      {"runtime data left in place", [](FakeBoot &b) { b.Type(6).physical = 0x7E000000; }, {"memmap-runtime"}},
+      {"runtime data left in place",
+       [](FakeBoot &b) { b.Type(6).physical = 0x7E000000; },
+       {"memmap-runtime"}},
       {"runtime code in the spare pages",
-       [](FakeBoot &b) { b.Type(5).physical = b.Type(5).virtualStart = kRegionEnd - 0x1000; }, {"memmap-runtime"}},
-      {"runtime descriptors overlap", [](FakeBoot &b) { b.Type(11).virtualStart = 0x111000; }, {"memmap-runtime"}},
-      {"reserved memory keeps the runtime bit", [](FakeBoot &b) { b.Type(0).attribute = kRuntime; },
+       [](FakeBoot &b) { b.Type(5).physical = b.Type(5).virtualStart = kRegionEnd - 0x1000; },
+       {"memmap-runtime"}},
+      {"runtime descriptors overlap",
+       [](FakeBoot &b) { b.Type(11).virtualStart = 0x111000; },
+       {"memmap-runtime"}},
+      {"reserved memory keeps the runtime bit",
+       [](FakeBoot &b) { b.Type(0).attribute = kRuntime; },
        {"memmap-reserved"}},
       {"kernel pages not loader data", [](FakeBoot &b) { b.Type(2).type = 1; }, {"memmap-loader-data"}},
       {"system table signature", [](FakeBoot &b) { b.systemTableSignature ^= 1; }, {"efi-system-table"}},
-      {"runtime services above 4 GiB", [](FakeBoot &b) { b.runtimeServicesPointer |= 1ull << 32; },
+      {"runtime services above 4 GiB",
+       [](FakeBoot &b) { b.runtimeServicesPointer |= 1ull << 32; },
        {"efi-runtime-services"}},
-      {"runtime services signature", [](FakeBoot &b) { b.runtimeServicesSignature = 0; }, {"efi-runtime-services"}},
+      {"runtime services signature",
+       [](FakeBoot &b) { b.runtimeServicesSignature = 0; },
+       {"efi-runtime-services"}},
   };
   for (const Row &row : rows) {
     FakeBoot boot;

@@ -60,8 +60,9 @@ void PrintSummary(const MemoryMap &map) {
   }
   for (uint32_t type = 0; type <= kEfiMemoryTypeCount; type++) {
     if (counts[type] != 0) {
-      Line("memmap type %s count=%u pages=0x%llx", type < kEfiMemoryTypeCount ? MemoryTypeName(type) : "other",
-           counts[type], static_cast<unsigned long long>(pages[type]));
+      Line("memmap type %s count=%u pages=0x%llx",
+           type < kEfiMemoryTypeCount ? MemoryTypeName(type) : "other", counts[type],
+           static_cast<unsigned long long>(pages[type]));
     }
   }
   for (uint32_t i = 0; i < map.count; i++) {
@@ -133,8 +134,8 @@ void CheckReserved(const MemoryMap &map) {
   for (uint32_t i = 0; i < map.count; i++) {
     Descriptor descriptor = DescriptorAt(map, i);
     if (descriptor.type == kEfiReservedMemoryType && (descriptor.attribute & kEfiMemoryRuntime) != 0) {
-      Check("memmap-reserved", false, "descriptor %u: reserved memory at 0x%llx keeps the runtime attribute", i,
-            static_cast<unsigned long long>(descriptor.physicalStart));
+      Check("memmap-reserved", false, "descriptor %u: reserved memory at 0x%llx keeps the runtime attribute",
+            i, static_cast<unsigned long long>(descriptor.physicalStart));
       return;
     }
   }
@@ -176,10 +177,22 @@ void CheckLoaderData(const MemoryMap &map, const Area *areas, uint32_t count) {
 
 const char *MemoryTypeName(uint32_t type) {
   static const char *const kNames[kEfiMemoryTypeCount] = {
-      "EfiReservedMemoryType", "EfiLoaderCode", "EfiLoaderData", "EfiBootServicesCode",
-      "EfiBootServicesData", "EfiRuntimeServicesCode", "EfiRuntimeServicesData", "EfiConventionalMemory",
-      "EfiUnusableMemory", "EfiACPIReclaimMemory", "EfiACPIMemoryNVS", "EfiMemoryMappedIO",
-      "EfiMemoryMappedIOPortSpace", "EfiPalCode", "EfiPersistentMemory", "EfiUnacceptedMemoryType",
+      "EfiReservedMemoryType",
+      "EfiLoaderCode",
+      "EfiLoaderData",
+      "EfiBootServicesCode",
+      "EfiBootServicesData",
+      "EfiRuntimeServicesCode",
+      "EfiRuntimeServicesData",
+      "EfiConventionalMemory",
+      "EfiUnusableMemory",
+      "EfiACPIReclaimMemory",
+      "EfiACPIMemoryNVS",
+      "EfiMemoryMappedIO",
+      "EfiMemoryMappedIOPortSpace",
+      "EfiPalCode",
+      "EfiPersistentMemory",
+      "EfiUnacceptedMemoryType",
   };
   return type < kEfiMemoryTypeCount ? kNames[type] : nullptr;
 }
@@ -193,12 +206,12 @@ void CheckMemoryMap(const BootArgs &args, const KernelRegion &region, const Area
   MemoryMap map = {bytes, sizeOk ? size / stride : 0, stride};
   Line("memmap address=0x%x size=0x%x descriptorSize=%u descriptorVersion=%u descriptors=%u", args.memoryMap,
        size, stride, args.memoryDescriptorVersion, map.count);
-  if (!Check("memmap-layout", bytes != nullptr,
-             "%u descriptors of %u bytes at 0x%x%s", map.count, stride, args.memoryMap,
-             !strideOk  ? ": descriptor size below 40 or not a multiple of 8"
-             : !sizeOk  ? ": size not a whole number of descriptors"
-             : !bytes   ? ": unreadable"
-                        : "")) {
+  if (!Check("memmap-layout", bytes != nullptr, "%u descriptors of %u bytes at 0x%x%s", map.count, stride,
+             args.memoryMap,
+             !strideOk ? ": descriptor size below 40 or not a multiple of 8"
+             : !sizeOk ? ": size not a whole number of descriptors"
+             : !bytes  ? ": unreadable"
+                       : "")) {
     return;
   }
   PrintSummary(map);

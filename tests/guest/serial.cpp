@@ -7,7 +7,7 @@ namespace nimb::guest {
 namespace {
 
 constexpr uint16_t kCom1 = 0x3F8;
-constexpr uint16_t kData = kCom1 + 0;           // transmit; divisor low with DLAB
+constexpr uint16_t kData = kCom1 + 0;             // transmit; divisor low with DLAB
 constexpr uint16_t kInterruptEnable = kCom1 + 1;  // divisor high with DLAB
 constexpr uint16_t kFifoControl = kCom1 + 2;
 constexpr uint16_t kLineControl = kCom1 + 3;

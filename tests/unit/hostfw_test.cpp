@@ -754,15 +754,15 @@ TEST(HostfwExitBootServices, LaterBootTimeCallsAreViolationsRuntimeOnesWork) {
     std::memcpy(&bytes[i * hostfw::kDescriptorSize], &map[i], sizeof(map[i]));
   }
   auto *descriptors = reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(bytes.data());
-  EXPECT_EQ(st->RuntimeServices->SetVirtualAddressMap(bytes.size(), hostfw::kDescriptorSize, 2, descriptors),
-            EFI_INVALID_PARAMETER);
-  EXPECT_EQ(st->RuntimeServices->SetVirtualAddressMap(bytes.size(), hostfw::kDescriptorSize, 1, descriptors),
-            EFI_SUCCESS);
+  // The call converts the system table's own pointers to the new addresses.
+  EFI_RUNTIME_SERVICES *rt = st->RuntimeServices;
+  EXPECT_EQ(rt->SetVirtualAddressMap(bytes.size(), hostfw::kDescriptorSize, 2, descriptors), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(rt->SetVirtualAddressMap(bytes.size(), hostfw::kDescriptorSize, 1, descriptors), EFI_SUCCESS);
+  EXPECT_EQ(reinterpret_cast<UINT64>(st->RuntimeServices), reinterpret_cast<UINT64>(rt) + 0x1000);
   ASSERT_TRUE(fw.VirtualMapSet());
   ASSERT_EQ(fw.VirtualMap().size(), map.size());
   EXPECT_EQ(fw.VirtualMap().back().VirtualStart, map.back().PhysicalStart + 0x1000);
-  EXPECT_EQ(st->RuntimeServices->SetVirtualAddressMap(bytes.size(), hostfw::kDescriptorSize, 1, descriptors),
-            EFI_UNSUPPORTED);
+  EXPECT_EQ(rt->SetVirtualAddressMap(bytes.size(), hostfw::kDescriptorSize, 1, descriptors), EFI_UNSUPPORTED);
   EXPECT_EQ(fw.ViolationsAfterExit().size(), 3u);
 }
 

@@ -61,7 +61,7 @@ inline Bytes Command(uint32_t type, uint32_t length, const std::vector<uint32_t>
 
 // A segment command: name (16 bytes of zero), then its four fields.
 inline Bytes Segment(uint32_t address, uint32_t memorySize, uint32_t fileOffset, uint32_t fileSize,
-                            uint32_t length = 56) {
+                     uint32_t length = 56) {
   Bytes command = Command(1, 56, {0, 0, 0, 0, address, memorySize, fileOffset, fileSize, 7, 7});
   PutLe32(command, 4, length);
   command.resize(length < 8 ? 8 : length);
@@ -86,10 +86,10 @@ constexpr uint32_t kObjectDataStart = 0x1000;
 struct Object {
   uint32_t magic = 0xFEEDFACE;
   std::vector<Bytes> commands;
-  Bytes data;                    // at kObjectDataStart
-  int64_t commandCount = -1;     // -1: the number of commands
-  int64_t commandsSize = -1;     // -1: their total length
-  size_t cutAt = SIZE_MAX;       // the object ends here when smaller
+  Bytes data;                 // at kObjectDataStart
+  int64_t commandCount = -1;  // -1: the number of commands
+  int64_t commandsSize = -1;  // -1: their total length
+  size_t cutAt = SIZE_MAX;    // the object ends here when smaller
 
   Bytes Build() const {
     Bytes out(28);
@@ -132,8 +132,8 @@ struct FatContent {
 
 // A fat file: header, the records, and each content at its offset. With
 // `sliceCount` set, the header claims that many records.
-inline Bytes Fat(bool bigEndian, const std::vector<FatRecord> &records, const std::vector<FatContent> &contents,
-                 int64_t sliceCount = -1) {
+inline Bytes Fat(bool bigEndian, const std::vector<FatRecord> &records,
+                 const std::vector<FatContent> &contents, int64_t sliceCount = -1) {
   auto put = bigEndian ? PutBe32 : PutLe32;
   Bytes out;
   put(out, 0, 0xCAFEBABE);

@@ -166,7 +166,8 @@ TEST_F(KernelTest, FindSliceInBothOrdersAndFromBothKinds) {
     Bytes fatHeaderOnly = Fat(big, {}, {}, 1);
     fatHeaderOnly.resize(8 + 19);
     std::vector<Row> fatRows = {
-        {"one x86 slice", Fat(big, {{7, 0x1000, 0x300}}, {{0x1000, x86}}), EFI_SUCCESS, 0x300, 0x1000, 0x1000},
+        {"one x86 slice", Fat(big, {{7, 0x1000, 0x300}}, {{0x1000, x86}}), EFI_SUCCESS, 0x300, 0x1000,
+         0x1000},
         {"x86 slice behind another", twoSlices, EFI_SUCCESS, 0x300, 0x2000, 0x2000},
         {"the first of two x86 slices",
          Fat(big, {{7, 0x1000, 0x200}, {7, 0x2000, 0x300}}, {{0x1000, other}, {0x2000, x86}}), EFI_SUCCESS,
@@ -177,7 +178,8 @@ TEST_F(KernelTest, FindSliceInBothOrdersAndFromBothKinds) {
         {"x86 slice of size 0", Fat(big, {{7, 0x1000, 0}}, {{0x1000, x86}}), EFI_LOAD_ERROR, 0, 0, 0},
         {"cut off in the records", Fat(big, {{18, 0x1000, 0x200}}, {}, 3), EFI_LOAD_ERROR, 0, 0, 0},
         {"cut off in the first record", fatHeaderOnly, EFI_LOAD_ERROR, 0, 0, 0},
-        {"slice running past the end", Fat(big, {{7, 0x1000, 0x301}}, {{0x1000, x86}}), EFI_LOAD_ERROR, 0, 0, 0},
+        {"slice running past the end", Fat(big, {{7, 0x1000, 0x301}}, {{0x1000, x86}}), EFI_LOAD_ERROR, 0, 0,
+         0},
         {"slice beginning past the end", Fat(big, {{7, 0x9000, 0x10}}, {{0x1000, x86}}), EFI_LOAD_ERROR, 0, 0,
          0},
         // Offset 0 means no seek: reading goes on behind the two records.
@@ -205,7 +207,8 @@ TEST_F(KernelTest, FindSliceInBothOrdersAndFromBothKinds) {
         uint64_t count = sizeof(next);
         ASSERT_EQ(nimb::BootFileRead(&file, &count, next), EFI_SUCCESS);
         ASSERT_EQ(count, 4u);
-        EXPECT_EQ(Bytes(next, next + 4), Bytes(row.file.begin() + row.nextRead, row.file.begin() + row.nextRead + 4));
+        EXPECT_EQ(Bytes(next, next + 4),
+                  Bytes(row.file.begin() + row.nextRead, row.file.begin() + row.nextRead + 4));
       } else {
         EXPECT_EQ(size, 0xDEADu);
         EXPECT_EQ(offset, 0xDEADu);
@@ -232,7 +235,9 @@ struct Placed {
 
 TEST_F(KernelTest, SegmentsArePlacedAndTheirPagesCleared) {
   const Bytes data = Pattern(0x3000, 4);
-  auto slice = [&](size_t from, size_t count) { return Bytes(data.begin() + from, data.begin() + from + count); };
+  auto slice = [&](size_t from, size_t count) {
+    return Bytes(data.begin() + from, data.begin() + from + count);
+  };
   struct Row {
     std::string name;
     Object object;
@@ -280,7 +285,9 @@ TEST_F(KernelTest, SegmentsArePlacedAndTheirPagesCleared) {
        0x200000,
        0x201000},
       {"segments need not ascend",
-       {0xFEEDFACE, {Segment(0x600000, 0x1000, d, 0x1000), Segment(0x200000, 0x1000, d + 0x1000, 0x1000)}, data},
+       {0xFEEDFACE,
+        {Segment(0x600000, 0x1000, d, 0x1000), Segment(0x200000, 0x1000, d + 0x1000, 0x1000)},
+        data},
        {{0x600000, slice(0, 0x1000), 0x1000}, {0x200000, slice(0x1000, 0x1000), 0x1000}},
        0,
        0x200000,
@@ -364,7 +371,8 @@ TEST_F(KernelTest, ObjectsThatLieAreRefusedBeforeAnythingIsPlaced) {
       {"a count beyond the commands present", with({good, Thread(0)}, 3), ""},
       {"command length 0", with({good, Command(2, 0), Thread(0)}), ""},
       {"command length 4", with({good, Command(2, 4), Thread(0)}), ""},
-      {"a command running past the commands", with({good, Command(2, 8), Command(2, 64)}, -1, 56 + 8 + 32), ""},
+      {"a command running past the commands", with({good, Command(2, 8), Command(2, 64)}, -1, 56 + 8 + 32),
+       ""},
       {"a segment command too short for its fields", with({Segment(0x200000, 0x1000, d, 0x1000, 36)}), ""},
       {"a thread command too short for its entry", with({good, Thread(0x200000, 59)}), ""},
       {"more file bytes than pages", with({Segment(0x200000, 0x1000, d, 0x1001)}), ""},
@@ -398,10 +406,10 @@ TEST_F(KernelTest, ObjectsThatLieAreRefusedBeforeAnythingIsPlaced) {
 TEST_F(KernelTest, FirmwareFailuresGiveTheirStatusAndMessage) {
   const Bytes data = Pattern(0x2000, 8);
   const uint32_t d = kObjectDataStart;
-  Object object{0xFEEDFACE,
-                {Segment(0x200000, 0x1000, d, 0x1000), Segment(0x300000, 0x1000, d + 0x1000, 0x1000),
-                 Thread(0x200000)},
-                data};
+  Object object{
+      0xFEEDFACE,
+      {Segment(0x200000, 0x1000, d, 0x1000), Segment(0x300000, 0x1000, d + 0x1000, 0x1000), Thread(0x200000)},
+      data};
   struct Row {
     const char *name;
     const char *service;
@@ -418,7 +426,8 @@ TEST_F(KernelTest, FirmwareFailuresGiveTheirStatusAndMessage) {
       {"object header read", "Read", 2, EFI_DEVICE_ERROR, "Read error 0x", 0, 0},
       // The firmware's status is not passed on for the commands.
       {"commands read", "Read", 3, EFI_LOAD_ERROR, "Read error 0x", 0, 0},
-      {"seek to the second segment", "SetPosition", 3, EFI_DEVICE_ERROR, "Set offset failed\r\n", 2, 0x201000},
+      {"seek to the second segment", "SetPosition", 3, EFI_DEVICE_ERROR, "Set offset failed\r\n", 2,
+       0x201000},
       // A refused read leaves the count as it was asked; both numbers print
       // as 32-bit words.
       {"read of the second segment", "Read", 5, EFI_DEVICE_ERROR,
@@ -459,9 +468,9 @@ TEST_F(KernelTest, NoPoolForTheCommandsEndsTheBoot) {
 // --- the kernel of the boot options ---------------------------------------
 
 TEST_F(KernelTest, LoadKernelFileOpensLoadsAndCloses) {
-  Bytes kernel = Object{0xFEEDFACE, {Segment(0x200000, 0x10, kObjectDataStart, 0x10), Thread(0xC0200004)},
-                        Pattern(0x10)}
-                     .Build();
+  Bytes kernel =
+      Object{0xFEEDFACE, {Segment(0x200000, 0x10, kObjectDataStart, 0x10), Thread(0xC0200004)}, Pattern(0x10)}
+          .Build();
   Bytes fat = WrapInFat(kernel, true);
   Put("nimb_kernel", fat);
   hostfw::NetworkDevice network(fw);
@@ -479,7 +488,8 @@ TEST_F(KernelTest, LoadKernelFileOpensLoadsAndCloses) {
     std::string output;  // dots removed
   };
   const Row rows[] = {
-      {"by name from the volume", u"nimb_kernel", nullptr, false, EFI_SUCCESS, "Loading 'nimb_kernel'...\r\n"},
+      {"by name from the volume", u"nimb_kernel", nullptr, false, EFI_SUCCESS,
+       "Loading 'nimb_kernel'...\r\n"},
       {"by name over LoadFile", u"nimb_kernel", nullptr, true, EFI_SUCCESS, "Loading 'nimb_kernel'...\r\n"},
       {"by device path over LoadFile", u"other", &networkPath, true, EFI_SUCCESS, "Loading 'other'...\r\n"},
       {"a missing file", u"missing", nullptr, false, EFI_NOT_FOUND,
@@ -495,8 +505,9 @@ TEST_F(KernelTest, LoadKernelFileOpensLoadsAndCloses) {
     Forget();
     nimb::gKernelName = row.kernelName;
     nimb::gKernelDevicePath =
-        row.devicePath ? reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(const_cast<uint8_t *>(row.devicePath->data()))
-                       : nullptr;
+        row.devicePath
+            ? reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(const_cast<uint8_t *>(row.devicePath->data()))
+            : nullptr;
     size_t mark = fw.ConOutText().size();
     EFI_LOAD_FILE_INTERFACE *loadFile = row.overNetwork ? network.Protocol() : nullptr;
     EXPECT_EQ(nimb::LoadKernelFile(loadFile, row.overNetwork ? nullptr : root_), row.status);
@@ -535,7 +546,8 @@ TEST_F(KernelTest, ElfExecutableRoundTrip) {
   Bytes object = kobj::WriteObject(kernel);
   std::vector<std::pair<std::string, Bytes>> forms = {
       {"object", object},
-      {"little-endian fat", kobj::WriteFat({{18, 0, Pattern(0x40)}, {7, 3, object}}, kobj::ByteOrder::kLittle)},
+      {"little-endian fat",
+       kobj::WriteFat({{18, 0, Pattern(0x40)}, {7, 3, object}}, kobj::ByteOrder::kLittle)},
       {"big-endian fat", kobj::WriteFat({{18, 0, Pattern(0x40)}, {7, 3, object}}, kobj::ByteOrder::kBig)},
   };
   for (const auto &[name, contents] : forms) {

@@ -42,11 +42,14 @@ TEST(KobjElfTest, RefusesWhatTheLoaderCouldNotPlace) {
       {"big-endian", [](Bytes &e) { e[5] = 2; }, "not a little-endian"},
       {"relocatable object", [](Bytes &e) { PutLe16(e, 16, 1); }, "not an executable (ELF type 1)"},
       {"position-independent", [](Bytes &e) { PutLe16(e, 16, 3); }, "--no-pie"},
-      {"another processor", [](Bytes &e) { PutLe16(e, 18, 62); }, "not a 32-bit x86 program (ELF machine 62)"},
+      {"another processor", [](Bytes &e) { PutLe16(e, 18, 62); },
+       "not a 32-bit x86 program (ELF machine 62)"},
       {"program headers of another size", [](Bytes &e) { PutLe16(e, 42, 56); }, "of 56 bytes"},
       {"program headers outside the file", [](Bytes &e) { PutLe32(e, 28, 0xFFFFFF00); }, "outside the file"},
-      {"segment bytes outside the file", [](Bytes &e) { PutLe32(e, kPhdr + 4, 0x10000); }, "outside the file"},
-      {"more file bytes than memory", [](Bytes &e) { PutLe32(e, kPhdr + 20, 0x10); }, "more bytes in the file"},
+      {"segment bytes outside the file", [](Bytes &e) { PutLe32(e, kPhdr + 4, 0x10000); },
+       "outside the file"},
+      {"more file bytes than memory", [](Bytes &e) { PutLe32(e, kPhdr + 20, 0x10); },
+       "more bytes in the file"},
       {"no loadable segment", [](Bytes &e) { PutLe32(e, kPhdr, 4), PutLe32(e, kPhdr + 32, 6); },
        "no loadable segment"},
       {"only empty loadable segments",
@@ -78,7 +81,7 @@ TEST(KobjElfTest, RefusesWhatTheLoaderCouldNotPlace) {
 
 TEST(KobjElfTest, TakesLoadableSegmentsAtTheirPhysicalAddresses) {
   Bytes elf = nimbtest::Elf(0xC0100004, {{1, 0xC0100000, 0x00100000, Pattern(0x30), 0x30},
-                                         {6, 0x10, 0x10, Pattern(4), 4},  // not loadable
+                                         {6, 0x10, 0x10, Pattern(4), 4},      // not loadable
                                          {1, 0xC0200000, 0xC0200000, {}, 0},  // empty
                                          {1, 0xC0300000, 0x00300000, {}, 0x2000}});
   kobj::Kernel kernel;

@@ -43,7 +43,8 @@ void Put32(Bytes &bytes, uint32_t value) {
 Properties PlatformProperties(bool unnamed = false) {
   Properties found;
   nimb::DeviceTreeNode *node = nimb::DeviceTreeFindNode("/efi/platform", 0);
-  if (node == nullptr && unnamed && nimb::gDeviceTreeRoot != nullptr && nimb::gDeviceTreeRoot->children != nullptr)
+  if (node == nullptr && unnamed && nimb::gDeviceTreeRoot != nullptr &&
+      nimb::gDeviceTreeRoot->children != nullptr)
     node = nimb::gDeviceTreeRoot->children->children;
   if (node == nullptr)
     return {{"(no node)", {}}};

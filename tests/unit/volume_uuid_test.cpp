@@ -186,7 +186,8 @@ TEST_F(VolumeUuidDiskTest, AShortHardDriveNodeIsSteppedOver) {
   EFI_HANDLE disk = Disk({{1024, {0x482B}}}, {cut});
   const auto *path = reinterpret_cast<const uint8_t *>(fw.DevicePathOf(disk));
   Bytes bytes(path, path + nimb::DevicePathSize(fw.DevicePathOf(disk)) - 4);
-  bytes.insert(bytes.end(), {ACPI_DEVICE_PATH, 2, 4, 0, END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, 4, 0});
+  bytes.insert(bytes.end(),
+               {ACPI_DEVICE_PATH, 2, 4, 0, END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, 4, 0});
   fw.SetDevicePath(disk, bytes);
   std::string text;
   EXPECT_EQ(Uuid(disk, &text), EFI_SUCCESS);
