@@ -2,22 +2,14 @@
 
 #include "memory.h"
 #include "report.h"
+#include "text.h"
 
 namespace nimb::guest {
 
 namespace {
 
 constexpr char kNullName[] = "(null)";
-constexpr char kMemoryMapPath[] = "/chosen/memory-map";
 constexpr uint32_t kValueBytesShown = 64;
-
-bool TextEqual(const char *a, const char *b) {
-  while (*a != '\0' && *a == *b) {
-    a++;
-    b++;
-  }
-  return *a == *b;
-}
 
 // Reads the property image at `offset`; the status says why it can't.
 TreeStatus ReadProperty(const uint8_t *tree, uint32_t length, uint32_t offset, TreeProperty *property,
@@ -292,7 +284,7 @@ void PrintVisitProperty(void *, const TreeNode &node, const TreeProperty &proper
   Print("%s = ", property.name);
   bool bytes = PrintTreeValue(property.value, property.length);
   // Numbers as numbers too; a range as its address and length.
-  if (bytes && property.length == 8 && TextEqual(node.path, kMemoryMapPath)) {
+  if (bytes && property.length == 8 && TextEqual(node.path, kTreeMemoryMapPath)) {
     Print(" (address 0x%x, length 0x%x)", Le32(property.value), Le32(property.value + 4));
   } else if (bytes && property.length == 8) {
     Print(" (0x%llx)", static_cast<unsigned long long>(Le64(property.value)));

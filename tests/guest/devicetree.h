@@ -15,6 +15,10 @@ constexpr uint32_t kTreePropertyHeaderSize = 36;
 constexpr uint32_t kTreeMaxDepth = 16;
 constexpr uint32_t kTreePathSize = 256;
 
+// The node whose properties name the ranges handed to the kernel: each an
+// address and a length, 32 bits each.
+constexpr char kTreeMemoryMapPath[] = "/chosen/memory-map";
+
 enum TreeStatus : uint32_t {
   kTreeOk,
   kTreeTruncated,     // a header or value runs past the end

@@ -26,4 +26,9 @@ inline uint64_t Le64(const uint8_t *p) {
   return static_cast<uint64_t>(Le32(p)) | static_cast<uint64_t>(Le32(p + 4)) << 32;
 }
 
+// [start, start + size) lies within [low, high).
+inline bool Inside(uint64_t start, uint64_t size, uint64_t low, uint64_t high) {
+  return start >= low && start <= high && size <= high - start;
+}
+
 }  // namespace nimb::guest

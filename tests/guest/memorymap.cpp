@@ -36,10 +36,6 @@ uint64_t ByteSize(const Descriptor &descriptor) {
   return descriptor.pages >= (1ull << 52) ? ~0ull : descriptor.pages << 12;
 }
 
-bool Inside(uint64_t start, uint64_t size, uint64_t low, uint64_t high) {
-  return start >= low && start <= high && size <= high - start;
-}
-
 void PrintTypeName(uint32_t type) {
   const char *name = MemoryTypeName(type);
   if (name != nullptr) {
