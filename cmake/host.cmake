@@ -53,6 +53,17 @@ if(NIMB_FUZZ)
     target_compile_options(fuzz_${name} PRIVATE -fsanitize=fuzzer)
     target_link_options(fuzz_${name} PRIVATE -fsanitize=fuzzer)
     target_link_libraries(fuzz_${name} PRIVATE nimbcore_fuzz hostfw)
+    # A short run in every test pass, from the checked-in seeds; what it
+    # finds new goes to the build tree, never to the sources.
+    string(REGEX REPLACE "_fuzz$" "" corpus ${name})
+    set(work ${CMAKE_BINARY_DIR}/fuzz-corpus/${corpus})
+    file(MAKE_DIRECTORY ${work})
+    set(seeds)
+    if(EXISTS ${CMAKE_SOURCE_DIR}/tests/fuzz/corpus/${corpus})
+      set(seeds ${CMAKE_SOURCE_DIR}/tests/fuzz/corpus/${corpus})
+    endif()
+    add_test(NAME fuzz.${corpus} COMMAND fuzz_${name} -max_total_time=15 -timeout=10 -rss_limit_mb=4096 ${work} ${seeds})
+    set_tests_properties(fuzz.${corpus} PROPERTIES LABELS fuzz TIMEOUT 120)
   endforeach()
 endif()
 

@@ -444,7 +444,8 @@ struct Descriptor {
 struct FakeBoot {
   g::EntryState entry{};
   g::BootArgs args{};
-  uint64_t gdt[3] = {0, 0x00CF9E000000FFFFull, 0x00CF92000000FFFFull};
+  // As the gate left it, and with the accessed bit that loading DS set.
+  uint64_t gdt[3] = {0, 0x00CF9E000000FFFFull, 0x00CF93000000FFFFull};
   Node tree{"/", {}, {}};
   std::vector<Descriptor> map;
   uint64_t systemTableSignature = g::kSystemTableSignature;
@@ -643,6 +644,7 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
       {"interrupts on", [](FakeBoot &b) { b.entry.eflags |= g::kEflagsIf; }, {"entry-interrupts"}},
       {"descriptor table limit 0x17", [](FakeBoot &b) { b.entry.gdtLimit = 0x17; }, {"entry-gdt"}},
       {"64-bit code descriptor", [](FakeBoot &b) { b.gdt[1] |= 1ull << 53; }, {"entry-gdt"}},
+      {"writable code descriptor", [](FakeBoot &b) { b.gdt[1] = 0x00CF9A000000FFFFull; }, {"entry-gdt"}},
       {"descriptor table unreadable", [](FakeBoot &b) { b.entry.gdtBase = 0x10; }, {"entry-gdt"}},
       {"BootArgs unreadable",
        [](FakeBoot &b) { b.entry.eax = b.entry.ebx = 0x900000; },

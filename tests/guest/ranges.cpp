@@ -1,3 +1,4 @@
+// The ranges of /chosen/memory-map, and where everything handed over lies.
 #include "checks.h"
 #include "devicetree.h"
 #include "memory.h"
@@ -5,8 +6,6 @@
 #include "text.h"
 
 namespace nimb::guest {
-
-// --- the ranges of /chosen/memory-map ------------------------------------------------------
 
 namespace {
 
