@@ -7,6 +7,7 @@
 #include "config.h"
 #include "console_control.h"
 #include "data_hub.h"
+#include "graphics.h"
 #include "efi/vendor.h"
 #include "exitcodes.h"
 #include "firmware.h"
@@ -242,6 +243,12 @@ void InstallProtocols(const PlatformConfig &config) {
     Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
   }
   gConsole.onSetMode = ReportSetMode;
+  // Drawing for the loader's boot screen; a firmware without graphics output
+  // boots without pictures.
+  status = InstallGraphicsProtocols(gST);
+  if (EFI_ERROR(status)) {
+    SerialPrintf("platform: no graphics for the boot screen (%s)\n", StatusName(status));
+  }
   status = KeyProtocolsInstall(&gKeyState, &gBootPolicy, config);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot install the key protocols (%s)", StatusName(status));
