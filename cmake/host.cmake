@@ -92,6 +92,16 @@ ExternalProject_Add(efi
   INSTALL_COMMAND ""
   BUILD_BYPRODUCTS ${NIMB_EFI_DIR}/nimbboot.efi ${NIMB_EFI_DIR}/BOOTX64.efi)
 
+# --- the call gate's image needs no relocation in either build ------------------------
+find_program(NIMB_OBJDUMP NAMES llvm-objdump llvm-objdump-14)
+if(NIMB_OBJDUMP)
+  add_test(NAME gate.no-relocations
+           COMMAND ${CMAKE_COMMAND} -DOBJDUMP=${NIMB_OBJDUMP}
+                   "-DOBJECTS=${CMAKE_BINARY_DIR}/CMakeFiles/nimbcore.dir/src/boot/gate.S.o;${NIMB_EFI_DIR}/CMakeFiles/nimbboot.dir/src/boot/gate.S.obj"
+                   -P ${CMAKE_SOURCE_DIR}/cmake/check-gate.cmake)
+  set_tests_properties(gate.no-relocations PROPERTIES LABELS unit)
+endif()
+
 # --- QEMU scenarios ------------------------------------------------------------------
 if(NIMB_QEMU_TESTS AND EXISTS ${CMAKE_SOURCE_DIR}/tests/qemu/CMakeLists.txt)
   add_subdirectory(tests/qemu)

@@ -3,6 +3,7 @@
 // the end of boot services and the runtime move.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <functional>
 #include <map>
@@ -245,6 +246,32 @@ TEST_F(HandOffTest, AGrowingMapIsExtendedInPlace) {
   fw.GrowMemoryMapOnNextCall(200);
   ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
   EXPECT_TRUE(fw.BootServicesExited());
+}
+
+TEST_F(HandOffTest, BothAcpiTablesAndTheMachineSignature) {
+  hostfw::AcpiOptions options;
+  options.configurationGuids = {gEfiAcpi10TableGuid, gEfiAcpi20TableGuid};
+  options.hardwareSignature = 0x12345678;
+  hostfw::AcpiTables tables = fw.InstallAcpi(options);
+  Prepare();
+  ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
+  FlatTree tree = ReadTree(bootArgs);
+  std::vector<std::string> aliases;
+  for (const auto &[path, properties] : tree.nodes) {
+    if (path.rfind("/efi/configuration-table/", 0) != 0) continue;
+    auto alias = properties.find("alias");
+    if (alias == properties.end()) continue;
+    aliases.push_back(alias->second);
+    // The child is named by its GUID, and "table" is the firmware's pointer.
+    uint64_t table = 0;
+    memcpy(&table, properties.find("table")->second.data(), 8);
+    EXPECT_EQ(table, tables.rsdp) << path;
+  }
+  std::sort(aliases.begin(), aliases.end());
+  EXPECT_EQ(aliases, (std::vector<std::string>{std::string("ACPI", 5), std::string("ACPI_20", 8)}));
+  EXPECT_EQ(tree.nodes["/efi/configuration-table/8868E871-E4F1-11D3-BC22-0080C73C8881"].count("guid"), 1u);
+  std::string signature = tree.nodes["/chosen"].find("machine-signature")->second;
+  EXPECT_EQ(signature, std::string("\x78\x56\x34\x12", 4));
 }
 
 class MapReadTest : public HandOffTest, public ::testing::WithParamInterface<unsigned> {};
