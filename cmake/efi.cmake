@@ -1,4 +1,12 @@
 # The EFI programs: the loader and the platform layer.
+
+# clang for this target looks like a compiler of another family to CMake,
+# which then writes no header dependencies: ask for them as for gcc.
+foreach(lang C CXX ASM)
+  set(CMAKE_${lang}_DEPFILE_FORMAT gcc)
+  set(CMAKE_DEPFILE_FLAGS_${lang} "-MD -MT <DEP_TARGET> -MF <DEP_FILE>")
+  set(CMAKE_${lang}_DEPENDS_USE_COMPILER TRUE)
+endforeach()
 add_compile_options(-Wall -Wextra -Werror=return-type -Os -ffunction-sections -fdata-sections)
 include_directories(${CMAKE_SOURCE_DIR}/src)
 

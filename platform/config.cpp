@@ -256,6 +256,29 @@ bool ApplyDataHubHex(PlatformConfig *config, const char *name, char *value) {
   return AddEntry(&config->dataHub, name, value, true, true);
 }
 
+// A blob, an answer: any number of bytes, none included.
+bool ApplyBytes(ConfigBytes *bytes, char *value) {
+  UINT32 size = 0;
+  if (!HexSize(value, &size)) {
+    return false;
+  }
+  DecodeHex(value);
+  *bytes = {reinterpret_cast<const UINT8 *>(value), size};
+  return true;
+}
+
+bool ApplyDeviceProperties(PlatformConfig *config, const char *, char *value) {
+  return ApplyBytes(&config->deviceProperties, value);
+}
+
+bool ApplyDhcpResponse(PlatformConfig *config, const char *, char *value) {
+  return ApplyBytes(&config->dhcpResponse, value);
+}
+
+bool ApplyBsdpResponse(PlatformConfig *config, const char *, char *value) {
+  return ApplyBytes(&config->bsdpResponse, value);
+}
+
 // A key whose name ends in '.' is a prefix: it takes every key that starts
 // with it, and its function gets the rest of the key as the name.
 struct ConfigKey {
@@ -274,6 +297,9 @@ constexpr ConfigKey kConfigKeys[] = {
     {"nvram-hex.", ApplyNvramHex},
     {"datahub.", ApplyDataHubText},
     {"datahub-hex.", ApplyDataHubHex},
+    {"device-properties-hex", ApplyDeviceProperties},
+    {"netboot.dhcp-hex", ApplyDhcpResponse},
+    {"netboot.bsdp-hex", ApplyBsdpResponse},
 };
 
 // The name that `key` gives to the function of `entry`, or null when the
@@ -393,6 +419,9 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->keysIgnored = false;
   config->nvram.count = 0;
   config->dataHub.count = 0;
+  config->deviceProperties = {};
+  config->dhcpResponse = {};
+  config->bsdpResponse = {};
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {
@@ -407,6 +436,25 @@ UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport 
     }
   }
   return errors;
+}
+
+EFI_STATUS ConfigBytesAnswer(const ConfigBytes &answer, void *buffer, UINTN *size) {
+  if (size == nullptr) {
+    return EFI_INVALID_PARAMETER;
+  }
+  if (answer.bytes == nullptr) {
+    return EFI_NOT_FOUND;
+  }
+  if (*size < answer.size) {
+    *size = answer.size;
+    return EFI_BUFFER_TOO_SMALL;
+  }
+  if (buffer == nullptr && answer.size != 0) {
+    return EFI_INVALID_PARAMETER;
+  }
+  memcpy(buffer, answer.bytes, answer.size);
+  *size = answer.size;
+  return EFI_SUCCESS;
 }
 
 bool Utf8ToUcs2(const char *text, CHAR16 *destination, UINTN capacity, UINTN *units) {

@@ -34,12 +34,24 @@
 //                          a NUL unit behind it
 //   datahub-hex.<name>=<hex>  the same with raw bytes for the value (may be
 //                          empty)
+//   device-properties-hex=<hex>  the blob of device properties that the
+//                          device properties protocol gives (may be empty,
+//                          any size). Absent: no such protocol, as on
+//                          machines without one
+//   netboot.dhcp-hex=<hex> the DHCP answer that the network boot information
+//                          protocol gives (may be empty)
+//   netboot.bsdp-hex=<hex> its boot-service discovery answer (may be empty).
+//                          With either key the protocol is there, and it
+//                          answers EFI_NOT_FOUND for an answer not given
+// Hexadecimal values are any number of bytes: two digits each, blanks
+// allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
 // text values are UTF-8 within U+FFFF. The text and hexadecimal forms of one
 // name are one variable or one record: the later line wins. Records and
 // variables keep the order of their first line.
 // Without any key there is still a key state protocol (nothing held), a boot
-// policy protocol (answering 0) and a Data Hub (no vendor records).
+// policy protocol (answering 0) and a Data Hub (no vendor records), but no
+// device properties and no network boot information protocol.
 //
 // A new key is a field below, a function that checks and stores its value,
 // and a row of the key table in config.cpp. Values stay in the file's buffer,
@@ -78,6 +90,13 @@ struct ConfigEntryList {
   ConfigEntry entries[kMaxConfigEntries];
 };
 
+// Bytes given in hexadecimal, decoded in the file's buffer; `bytes` is null
+// when the file gives none, and not null for an empty value.
+struct ConfigBytes {
+  const UINT8 *bytes;
+  UINT32 size;
+};
+
 struct PlatformConfig {
   // The loader's path on the platform's own volume.
   const char *loaderPath;
@@ -92,6 +111,9 @@ struct PlatformConfig {
   bool keysIgnored;
   ConfigEntryList nvram;
   ConfigEntryList dataHub;
+  ConfigBytes deviceProperties;
+  ConfigBytes dhcpResponse;
+  ConfigBytes bsdpResponse;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";
@@ -119,6 +141,14 @@ void ConfigSetDefaults(PlatformConfig *config);
 // byte behind `size`, and the strings that `config` gets point into it.
 // Returns the number of errors; `report` hears of every issue.
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context);
+
+// Hands `answer` to a firmware caller whose buffer has room for `*size`
+// bytes: with room enough, copies it and sets `*size` to its size
+// (EFI_SUCCESS); otherwise only sets `*size` to the size needed
+// (EFI_BUFFER_TOO_SMALL), so that a size of 0 and a null buffer ask for the
+// size. An answer not given is EFI_NOT_FOUND, `*size` untouched; a null
+// `size`, or a null buffer where bytes are to go, is EFI_INVALID_PARAMETER.
+EFI_STATUS ConfigBytesAnswer(const ConfigBytes &answer, void *buffer, UINTN *size);
 
 // UTF-8 to UCS-2 with a NUL unit behind. `*units` gets the number of units
 // without the NUL. With a null `destination` only counts; otherwise

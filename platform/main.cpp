@@ -7,13 +7,15 @@
 #include "config.h"
 #include "console_control.h"
 #include "data_hub.h"
-#include "graphics.h"
+#include "device_properties.h"
 #include "efi/vendor.h"
 #include "exitcodes.h"
 #include "firmware.h"
 #include "format.h"
+#include "graphics.h"
 #include "key_state.h"
 #include "memory.h"
+#include "net_boot_info.h"
 #include "serial.h"
 
 namespace nimb::platform {
@@ -28,6 +30,8 @@ PlatformConsole gConsole;
 PlatformKeyState gKeyState;
 PlatformBootPolicy gBootPolicy;
 PlatformDataHub gDataHub;
+PlatformDeviceProperties gDeviceProperties;
+PlatformNetBootInfo gNetBootInfo;
 MemoryMeter gMeter;
 
 // The debug-exit device ends the machine with the code; without one the
@@ -235,6 +239,56 @@ void ReportSetMode(EFI_CONSOLE_CONTROL_SCREEN_MODE mode, EFI_STATUS status) {
   SerialPrintf("\n");
 }
 
+// Every call of the device properties and network boot protocols shows in
+// the log, on a line of its own between the loader's messages: the room the
+// caller gave, the answer and the size given back.
+void ReportAnswerCall(const char *what, UINT64 room, EFI_STATUS status, UINT64 size) {
+  SerialPrintf("\nplatform: %s asked with %u bytes: %s, %u bytes\n", what, room, StatusName(status), size);
+}
+
+void ReportGetProperties(UINT32 room, EFI_STATUS status, UINT32 size) {
+  ReportAnswerCall("device properties", room, status, size);
+}
+
+void ReportGetResponse(const char *answer, UINTN room, EFI_STATUS status, UINTN size) {
+  char what[32];
+  FormatToBuffer(what, sizeof(what), "net boot %s", answer);
+  ReportAnswerCall(what, room, status, size);
+}
+
+// "none" for an answer or blob that the configuration doesn't give, else
+// its size.
+void ReportBytes(const char *what, const ConfigBytes &bytes) {
+  if (bytes.bytes == nullptr) {
+    SerialPrintf("%s none", what);
+  } else {
+    SerialPrintf("%s %u bytes", what, static_cast<UINT64>(bytes.size));
+  }
+}
+
+// The device properties and network boot protocols, each only when the
+// configuration gives what it answers with.
+void InstallAnswerProtocols(const PlatformConfig &config) {
+  ReportBytes("platform: device properties:", config.deviceProperties);
+  ReportBytes("\nplatform: net boot: dhcp", config.dhcpResponse);
+  ReportBytes(", bsdp", config.bsdpResponse);
+  SerialPrintf("\n");
+  if (config.deviceProperties.bytes != nullptr) {
+    const EFI_STATUS status = DevicePropertiesInstall(&gDeviceProperties, config.deviceProperties);
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot install the device properties (%s)", StatusName(status));
+    }
+    gDeviceProperties.onGetProperties = ReportGetProperties;
+  }
+  if (config.dhcpResponse.bytes != nullptr || config.bsdpResponse.bytes != nullptr) {
+    const EFI_STATUS status = NetBootInfoInstall(&gNetBootInfo, config.dhcpResponse, config.bsdpResponse);
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot install the network boot information (%s)", StatusName(status));
+    }
+    gNetBootInfo.onGetResponse = ReportGetResponse;
+  }
+}
+
 // The protocols of the machines that the loader was made for, which the
 // firmware lacks.
 void InstallProtocols(const PlatformConfig &config) {
@@ -261,6 +315,7 @@ void InstallProtocols(const PlatformConfig &config) {
     Fail(kExitPlatformFailed, "cannot install the Data Hub (%s)", StatusName(status));
   }
   SerialPrintf("platform: data hub: %u platform records\n", static_cast<UINT64>(config.dataHub.count));
+  InstallAnswerProtocols(config);
 }
 
 // The loader's variables that the configuration sets; the others stay as

@@ -20,6 +20,7 @@
 #include "checks.h"
 #include "devicetree.h"
 #include "entry.h"
+#include "hold.h"
 #include "memory.h"
 #include "report.h"
 
@@ -782,6 +783,37 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
     std::string result = "kernel: result fail (" + std::to_string(report.checks) + " checks, " +
                          std::to_string(report.failed.size()) + " failed)\n";
     EXPECT_NE(report.text.find(result), std::string::npos) << row.name << "\n" << report.text;
+  }
+}
+
+// --- the hold option ---------------------------------------------------------------
+
+TEST(GuestHold, ReadsTheFirstHoldWord) {
+  struct Row {
+    const char *name;
+    std::string line;
+    uint32_t length;  // of the field; 0: the text's own length
+    uint32_t seconds;
+  };
+  const std::vector<Row> rows = {
+      {"alone", "guest.hold=4", 0, 4},
+      {"between other words", "-v guest.hold=12 foo=1", 0, 12},
+      {"tab and line feed separate", "a\tguest.hold=3\nb", 0, 3},
+      {"absent", "-v foo=1", 0, 0},
+      {"empty line", "", 0, 0},
+      {"inside another word", "xguest.hold=4", 0, 0},
+      {"key without the dot", "guesthold=4", 0, 0},
+      {"key in another case", "Guest.Hold=4", 0, 0},
+      {"no value", "guest.hold= -v", 0, 0},
+      {"not all digits", "guest.hold=4s", 0, 0},
+      {"first word counts", "guest.hold=2 guest.hold=9", 0, 2},
+      {"capped", "guest.hold=99999999999999", 0, g::kMaxHoldSeconds},
+      {"cut by the field's length", "guest.hold=45", 12, 4},
+      {"stops at the NUL", std::string("guest.hold=4\0" "5", 14), 14, 4},
+  };
+  for (const Row &row : rows) {
+    uint32_t length = row.length != 0 ? row.length : static_cast<uint32_t>(row.line.size());
+    EXPECT_EQ(g::HoldSeconds(row.line.data(), length), row.seconds) << row.name;
   }
 }
 

@@ -9,7 +9,8 @@
 //   kernel: memmap <summary>                           the memory map
 //   kernel: range <name> address=0x<hex> length=0x<hex>
 //   kernel: efi <field>=<value> ...                    the firmware's tables
-//   kernel: result pass|fail (<n> checks, <m> failed)  the last line
+//   kernel: result pass|fail (<n> checks, <m> failed)  the end of the report
+//   kernel: hold <n> s                                  guest.hold=<n>: waiting
 //
 // Numbers are C literals: hexadecimal with 0x, or decimal. Text values stand
 // between double quotes, with \" and \\ escaped and any byte outside

@@ -3,15 +3,17 @@
 
 Each scenario (scenarios.py) describes an EFI system partition: the platform
 layer at \\EFI\\BOOT\\BOOTX64.EFI, the loader at \\EFI\\BOOT\\nimbboot.efi, the
-platform's configuration file and any other files and directories. The
-harness builds a GPT disk image with that partition (no mounting: sgdisk and
-mtools), boots it headless under TCG, and reads the serial log and the exit
-code that the platform layer leaves through the debug-exit device.
+platform's configuration file and any other files and directories, such as
+the reference kernel of tests/guest/. The harness builds a GPT disk image
+with that partition (no mounting: sgdisk and mtools), boots it headless under
+TCG, and reads the serial log, the exit code that the platform layer or the
+kernel leaves through the debug-exit device, the kernel's report and, when
+the scenario asks, a screenshot taken over QMP.
 
     harness.py --efi-dir build/efi --scenario no_kernel    one scenario
     harness.py --efi-dir build/efi                          all scenarios
     harness.py --list                                        names only
-    harness.py --demo                                        boot, screenshot into out/
+    harness.py --demo                                        boot the kernel, screenshot into out/
 """
 
 import argparse
@@ -22,18 +24,35 @@ import re
 import shutil
 import signal
 import socket
+import struct
 import subprocess
 import sys
 import tempfile
 import time
+import zlib
 from pathlib import Path
 
 sys.path.insert(0, str(Path(__file__).resolve().parent))
-from scenarios import BASE_CONFIG, SCENARIOS  # noqa: E402
+from scenarios import (  # noqa: E402
+    BASE_CONFIG,
+    PARTITION_GUID,
+    SCENARIOS,
+    GuestFile,
+    KernelExpect,
+    Scenario,
+    ScreenExpect,
+    kernel_file,
+    quoted,
+)
 
 REPO = Path(__file__).resolve().parents[2]
-EXIT_CODES_HEADER = REPO / "platform" / "exitcodes.h"
+# The exit codes of the platform layer and of the reference kernel: one
+# table, no code in both.
+EXIT_CODE_HEADERS = (REPO / "platform" / "exitcodes.h", REPO / "tests" / "guest" / "exitcodes.h")
+GUEST_DIR = REPO / "build" / "tests" / "guest"
+ARTWORK = REPO / "src" / "screen" / "artwork.cpp"
 DEMO_SCREEN = REPO / "out" / "demo-screen.png"
+DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
 DISK_BYTES = 64 << 20
@@ -45,14 +64,14 @@ REPORT_MEMORY = re.compile(r"platform: memory (same|changed)")
 REPORT_CONSOLE_MODE = re.compile(r"platform: console mode (\S+)")
 
 
-# --- the platform's exit codes -------------------------------------------------------
+# --- exit codes -----------------------------------------------------------------------
 
 
 @dataclasses.dataclass(frozen=True)
 class Outcome:
     """What a run's exit status says."""
 
-    name: str  # the platform's name for the code, or a word of the harness's own
+    name: str  # the name of the code in its header, or a word of the harness's own
     status: str | None = None  # the loader's status, when the loader came back
     memory: str | None = None  # "same" or "changed", when the loader came back
 
@@ -60,21 +79,30 @@ class Outcome:
 STATUS_OF_PREFIX = {"Aborted": "EFI_ABORTED", "Success": "EFI_SUCCESS", "Other": "other"}
 
 
-def read_exit_codes(header=EXIT_CODES_HEADER):
-    """The table of platform/exitcodes.h: code -> Outcome."""
-    codes = {}
+def read_exit_codes(headers=EXIT_CODE_HEADERS):
+    """The kExit... constants of the headers (one path or several) as one
+    table: code -> Outcome. A code or a name given twice, in one header or
+    across them, is refused."""
+    if isinstance(headers, (str, Path)):
+        headers = (headers,)
+    codes, origin = {}, {}
     pattern = re.compile(r"constexpr\s+UINT8\s+kExit(\w+)\s*=\s*(0x[0-9A-Fa-f]+|\d+)\s*;")
-    for match in pattern.finditer(Path(header).read_text()):
-        name, code = match.group(1), int(match.group(2), 0)
-        outcome = Outcome(name)
-        loader = re.fullmatch(r"(Aborted|Success|Other)(Same|Changed)", name)
-        if loader:
-            outcome = Outcome(name, STATUS_OF_PREFIX[loader.group(1)], loader.group(2).lower())
-        if code in codes:
-            raise ValueError(f"{header}: code {code:#x} given twice")
-        codes[code] = outcome
-    if not codes:
-        raise ValueError(f"{header}: no exit codes found")
+    for header in headers:
+        found = 0
+        for match in pattern.finditer(Path(header).read_text()):
+            name, code = match.group(1), int(match.group(2), 0)
+            outcome = Outcome(name)
+            loader = re.fullmatch(r"(Aborted|Success|Other)(Same|Changed)", name)
+            if loader:
+                outcome = Outcome(name, STATUS_OF_PREFIX[loader.group(1)], loader.group(2).lower())
+            if code in codes:
+                raise ValueError(f"{header}: code {code:#x} given twice (also in {origin[code]})")
+            if any(known.name == name for known in codes.values()):
+                raise ValueError(f"{header}: name {name} given twice")
+            codes[code], origin[code] = outcome, header
+            found += 1
+        if not found:
+            raise ValueError(f"{header}: no exit codes found")
     return codes
 
 
@@ -92,7 +120,7 @@ def decode_exit(returncode, codes):
     return Outcome(f"QemuExit{returncode}")
 
 
-# --- the serial log ----------------------------------------------------------------
+# --- the serial log -------------------------------------------------------------------
 
 # Escape sequences of the firmware's terminal emulation: CSI sequences,
 # character set selections and two-character escapes.
@@ -161,7 +189,369 @@ def check_report(log, outcome, status, memory, exit_name):
     return problems
 
 
-# --- the disk ------------------------------------------------------------------------
+# --- the kernel's report --------------------------------------------------------------
+
+KERNEL_LINE = re.compile(r"^kernel: (\w+)(?: (.*))?$", re.M)
+KERNEL_CHECK = re.compile(r"(\S+) (ok|FAIL)(?: (.*))?")
+KERNEL_RESULT = re.compile(r"(pass|fail) \((\d+) checks?, (\d+) failed\)")
+KERNEL_RANGE = re.compile(r"(.+) address=(0x[0-9a-f]+) length=(0x[0-9a-f]+)")
+KERNEL_MEMMAP_TYPE = re.compile(r"type (\S+) count=(\d+) pages=(0x[0-9a-f]+)")
+KERNEL_HOLD = re.compile(r"(\d+) s")
+TREE_NODE = re.compile(r"( *)([^=]*)/ \((\d+) propert(?:y|ies), (\d+) child(?:ren)?\)")
+TREE_PROPERTY = re.compile(r"( *)(\S.*?) = (.*)")
+ROOT_UUID_MESSAGE = re.compile(r"root device uuid is '(.*)'")
+
+
+@dataclasses.dataclass(frozen=True)
+class KernelCheck:
+    name: str
+    ok: bool
+    detail: str
+
+
+@dataclasses.dataclass
+class KernelReport:
+    """The kernel's `kernel: ...` lines of a serial log (tests/guest/report.h)."""
+
+    starts: int = 0
+    entry: dict = dataclasses.field(default_factory=dict)  # register -> number
+    checks: list = dataclasses.field(default_factory=list)  # KernelCheck, in order
+    bootargs: dict = dataclasses.field(default_factory=dict)  # field -> number or text
+    tree_lines: list = dataclasses.field(default_factory=list)  # as printed, indent kept
+    tree: dict = dataclasses.field(default_factory=dict)  # node path -> {property: value as printed}
+    tree_errors: list = dataclasses.field(default_factory=list)
+    ranges: dict = dataclasses.field(default_factory=dict)  # name -> (address, length)
+    memmap: list = dataclasses.field(default_factory=list)  # the memmap lines
+    memmap_types: dict = dataclasses.field(default_factory=dict)  # type -> (count, pages)
+    efi: dict = dataclasses.field(default_factory=dict)  # field -> number
+    result: tuple | None = None  # (passed, checks, failed) of the result line
+    hold: int | None = None  # seconds of a hold line
+    unknown: list = dataclasses.field(default_factory=list)  # lines of no known kind
+
+    def failed_checks(self):
+        return [check for check in self.checks if not check.ok]
+
+
+def unquote(value):
+    """A quoted text of the report as (text, rest of the line): escapes
+    undone, each byte one character (\\xNN stays the byte NN)."""
+    if not value.startswith('"'):
+        raise ValueError(f"not a quoted text: {value!r}")
+    out, i = [], 1
+    while i < len(value):
+        char = value[i]
+        if char == '"':
+            return "".join(out), value[i + 1 :]
+        if char == "\\" and value[i + 1 : i + 2] in ('"', "\\"):
+            out.append(value[i + 1])
+            i += 2
+        elif char == "\\" and re.fullmatch(r"x[0-9a-f]{2}", value[i + 1 : i + 4]):
+            out.append(chr(int(value[i + 2 : i + 4], 16)))
+            i += 4
+        else:
+            out.append(char)
+            i += 1
+    raise ValueError(f"unterminated text: {value!r}")
+
+
+def report_value(value):
+    """A value of the report: a quoted text, else a C number, else as it stands."""
+    if value.startswith('"'):
+        return unquote(value)[0]
+    try:
+        return int(value, 0)
+    except ValueError:
+        return value
+
+
+def fields(text):
+    """`name=value name=value ...` of numbers."""
+    return {name: report_value(value) for name, value in re.findall(r"(\w+)=(\S+)", text)}
+
+
+def parse_kernel_report(log):
+    """The kernel's report in a cleaned serial log."""
+    report = KernelReport()
+    nodes = []  # the names of the nodes on the way to the current one
+    for match in KERNEL_LINE.finditer(log):
+        kind, rest = match.group(1), match.group(2) or ""
+        if kind == "start":
+            report.starts += 1
+        elif kind == "entry":
+            report.entry.update(fields(rest))
+        elif kind == "check" and KERNEL_CHECK.fullmatch(rest):
+            name, ok, detail = KERNEL_CHECK.fullmatch(rest).groups()
+            report.checks.append(KernelCheck(name, ok == "ok", detail or ""))
+        elif kind == "bootargs" and "=" in rest:
+            name, value = rest.split("=", 1)
+            report.bootargs[name] = report_value(value)
+        elif kind == "tree" and rest.startswith("error "):
+            report.tree_errors.append(rest[len("error ") :])
+        elif kind == "tree":
+            report.tree_lines.append(rest)
+            node, prop = TREE_NODE.fullmatch(rest), TREE_PROPERTY.fullmatch(rest)
+            if node:
+                depth = len(node.group(1)) // 2
+                nodes[depth:] = [node.group(2)]
+                report.tree.setdefault("/" + "/".join(nodes[1:]), {})
+            elif prop:
+                path = "/" + "/".join(nodes[1 : len(prop.group(1)) // 2])
+                report.tree.setdefault(path, {}).setdefault(prop.group(2), prop.group(3))
+            else:
+                report.unknown.append(match.group(0))
+        elif kind == "range" and KERNEL_RANGE.fullmatch(rest):
+            name, address, length = KERNEL_RANGE.fullmatch(rest).groups()
+            report.ranges[name] = (int(address, 16), int(length, 16))
+        elif kind == "memmap":
+            report.memmap.append(rest)
+            typed = KERNEL_MEMMAP_TYPE.fullmatch(rest)
+            if typed:
+                report.memmap_types[typed.group(1)] = (int(typed.group(2)), int(typed.group(3), 16))
+        elif kind == "efi":
+            report.efi.update(fields(rest))
+        elif kind == "result" and KERNEL_RESULT.fullmatch(rest):
+            verdict, checks, failed = KERNEL_RESULT.fullmatch(rest).groups()
+            report.result = (verdict == "pass", int(checks), int(failed))
+        elif kind == "hold" and KERNEL_HOLD.fullmatch(rest):
+            report.hold = int(KERNEL_HOLD.fullmatch(rest).group(1))
+        else:
+            report.unknown.append(match.group(0))
+    return report
+
+
+def matches(wanted, value):
+    """Whether `value` is as `wanted`: a compiled pattern matches the whole
+    text, a callable says so, anything else is equal."""
+    if isinstance(wanted, re.Pattern):
+        return isinstance(value, str) and wanted.fullmatch(value) is not None
+    if callable(wanted):
+        return wanted(value)
+    return value == wanted
+
+
+def describe(wanted):
+    if isinstance(wanted, re.Pattern):
+        return f"/{wanted.pattern}/"
+    if callable(wanted):
+        return str(wanted)
+    return repr(wanted)
+
+
+def check_kernel(log, expect):
+    """Problems with the kernel's report against `expect` (KernelExpect), and
+    with what holds in any report: one start, a result line that agrees
+    with the checks, no broken tree, a "boot-uuid" that is the text the
+    loader printed."""
+    report = parse_kernel_report(log)
+    if report.starts == 0:
+        return ["kernel: no report (no 'kernel: start' line)"]
+    problems = []
+    if report.starts != 1:
+        problems.append(f"kernel: started {report.starts} times")
+    failed = report.failed_checks()
+    if report.result is None:
+        problems.append("kernel: no result line: the report broke off")
+    elif report.result[1:] != (len(report.checks), len(failed)) or report.result[0] != (not failed):
+        problems.append(
+            f"kernel: result line says {report.result}, the checks {len(report.checks)} of which "
+            f"{len(failed)} failed"
+        )
+    if expect.result == "pass":
+        problems += [f"kernel: check {check.name} FAIL {check.detail}" for check in failed]
+        if not report.checks:
+            problems.append("kernel: no checks reported")
+    elif not failed:
+        problems.append("kernel: every check passed, wanted a failure")
+    problems += [f"kernel: tree error {error}" for error in report.tree_errors]
+    problems += [f"kernel: line of no known kind: {line!r}" for line in report.unknown]
+
+    for name, wanted in expect.bootargs.items():
+        if name not in report.bootargs:
+            problems.append(f"kernel: bootargs {name} not reported")
+        elif not matches(wanted, report.bootargs[name]):
+            problems.append(f"kernel: bootargs {name}={report.bootargs[name]!r}, wanted {describe(wanted)}")
+    for path, properties in expect.tree.items():
+        if path not in report.tree:
+            problems.append(f"kernel: tree has no node {path}")
+            continue
+        for name, wanted in properties.items():
+            got = report.tree[path].get(name)
+            if got is None:
+                problems.append(f"kernel: tree {path} has no property {name}")
+            elif not matches(wanted, got):
+                problems.append(f"kernel: tree {path} {name} = {got}, wanted {describe(wanted)}")
+    for name, length in expect.ranges.items():
+        if name not in report.ranges:
+            problems.append(f"kernel: no range {name}")
+        elif length is not None and report.ranges[name][1] != length:
+            problems.append(f"kernel: range {name} length {report.ranges[name][1]:#x}, wanted {length:#x}")
+
+    printed = ROOT_UUID_MESSAGE.findall(log)
+    uuid = report.tree.get("/chosen", {}).get("boot-uuid")
+    if printed and uuid != quoted(printed[-1]):
+        problems.append(f"kernel: tree /chosen boot-uuid = {uuid}, the loader printed {printed[-1]!r}")
+    return problems
+
+
+# --- the screen -----------------------------------------------------------------------
+
+PNG_SIGNATURE = b"\x89PNG\r\n\x1a\n"
+PICTURE_SIZE = 128  # the logo and the failure picture
+
+
+@dataclasses.dataclass
+class Image:
+    """Pixels as rows of bytes, three (red, green, blue) a pixel."""
+
+    width: int
+    height: int
+    rows: list
+
+    def pixel(self, x, y):
+        return tuple(self.rows[y][3 * x : 3 * x + 3])
+
+
+def read_png(data):
+    """An 8-bit RGB or RGBA PNG file, not interlaced (what QEMU's screendump
+    writes), as an Image; alpha is dropped."""
+    if data[:8] != PNG_SIGNATURE:
+        raise ValueError("not a PNG file")
+    position, header, compressed = 8, None, bytearray()
+    while position < len(data):
+        length, kind = struct.unpack(">I4s", data[position : position + 8])
+        body = data[position + 8 : position + 8 + length]
+        position += 12 + length
+        if kind == b"IHDR":
+            header = struct.unpack(">IIBBBBB", body)
+        elif kind == b"IDAT":
+            compressed += body
+        elif kind == b"IEND":
+            break
+    if header is None:
+        raise ValueError("PNG file without a header")
+    width, height, depth, colour, _, _, interlace = header
+    if depth != 8 or colour not in (2, 6) or interlace != 0:
+        raise ValueError(f"PNG of depth {depth}, colour type {colour}, interlace {interlace}: not read here")
+    step = 3 if colour == 2 else 4
+    stride = width * step
+    raw = zlib.decompress(bytes(compressed))
+    if len(raw) != height * (stride + 1):
+        raise ValueError(f"PNG data of {len(raw)} bytes for {width} x {height}")
+    rows, previous = [], bytearray(stride)
+    for y in range(height):
+        kind = raw[y * (stride + 1)]
+        row = bytearray(raw[y * (stride + 1) + 1 : (y + 1) * (stride + 1)])
+        unfilter(kind, row, previous, step)
+        rows.append(bytes(row if step == 3 else b"".join(row[i : i + 3] for i in range(0, stride, 4))))
+        previous = row
+    return Image(width, height, rows)
+
+
+def unfilter(kind, row, previous, step):
+    """Undoes a PNG row filter in place."""
+    if kind == 0:
+        return
+    if kind == 1:
+        for i in range(step, len(row)):
+            row[i] = (row[i] + row[i - step]) & 0xFF
+    elif kind == 2:
+        row[:] = bytes((a + b) & 0xFF for a, b in zip(row, previous))
+    elif kind == 3:
+        for i in range(len(row)):
+            left = row[i - step] if i >= step else 0
+            row[i] = (row[i] + ((left + previous[i]) >> 1)) & 0xFF
+    elif kind == 4:
+        for i in range(len(row)):
+            a = row[i - step] if i >= step else 0
+            b = previous[i]
+            c = previous[i - step] if i >= step else 0
+            p = a + b - c
+            pa, pb, pc = abs(p - a), abs(p - b), abs(p - c)
+            row[i] = (row[i] + (a if pa <= pb and pa <= pc else b if pb <= pc else c)) & 0xFF
+    else:
+        raise ValueError(f"PNG filter {kind} unknown")
+
+
+def read_artwork(source=ARTWORK):
+    """The loader's pictures, as they should appear on the screen: name ->
+    128 x 128 (red, green, blue) tuples, row by row."""
+    text = Path(source).read_text()
+
+    def array(name):
+        found = re.search(name + r"\[[^\]]*\]\s*=\s*\{(.*?)\};", text, re.S)
+        if not found:
+            raise ValueError(f"{source}: no {name}")
+        return [int(number, 0) for number in re.findall(r"0x[0-9A-Fa-f]+|\d+", found.group(1))]
+
+    table = array("kBootColorTable")
+    runs = array("kLogoRuns")
+    logo = [index for count, index in zip(runs[::2], runs[1::2]) for _ in range(count)]
+    pictures = {"logo": logo, "failure": array("kFailurePicture")}
+    return {name: [tuple(table[3 * i : 3 * i + 3]) for i in indexes] for name, indexes in pictures.items()}
+
+
+def check_screen(image, expect, artwork=None):
+    """Problems with a screenshot against `expect` (ScreenExpect), in two
+    lists. The first: the background colour in the corner, and, with
+    `artwork` and a picture named, the picture's pixels exactly at the place
+    of a centred 128 x 128 picture (without artwork: anything there). The
+    second: anything else on the screen, that is a box of all that isn't
+    background larger than 128 x 128 or off the centre by more than a pixel."""
+    background = bytes(expect.background)
+    if image.pixel(0, 0) != expect.background:
+        return [f"screen: background {image.pixel(0, 0)}, wanted {expect.background}"], []
+    problems = []
+    x0, y0 = (image.width - PICTURE_SIZE) >> 1, (image.height - PICTURE_SIZE) >> 1
+    if artwork is not None and expect.picture is not None:
+        wanted = artwork[expect.picture]
+        wrong = [
+            (x, y)
+            for y in range(PICTURE_SIZE)
+            for x in range(PICTURE_SIZE)
+            if image.pixel(x0 + x, y0 + y) != wanted[y * PICTURE_SIZE + x]
+        ]
+        if wrong:
+            x, y = wrong[0]
+            problems.append(
+                f"screen: {len(wrong)} pixels of the {expect.picture} at ({x0}, {y0}) differ; first at "
+                f"({x}, {y}): {image.pixel(x0 + x, y0 + y)}, wanted {wanted[y * PICTURE_SIZE + x]}"
+            )
+    elif all(image.rows[y0 + y][3 * x0 : 3 * (x0 + PICTURE_SIZE)] == background * PICTURE_SIZE
+             for y in range(PICTURE_SIZE)):  # fmt: skip
+        problems.append(f"screen: no picture at ({x0}, {y0})")
+
+    blank = background * image.width
+    left, top, right, bottom = image.width, image.height, -1, -1
+    for y, row in enumerate(image.rows):
+        if row == blank:
+            continue
+        columns = [x for x in range(image.width) if row[3 * x : 3 * x + 3] != background]
+        left, right = min(left, columns[0]), max(right, columns[-1])
+        top, bottom = min(top, y), max(bottom, y)
+    stray = []
+    if right >= 0:
+        box = f"{right - left + 1} x {bottom - top + 1} at ({left}, {top})"
+        if right - left + 1 > PICTURE_SIZE or bottom - top + 1 > PICTURE_SIZE:
+            stray.append(f"screen: all that isn't background spans {box}, more than {PICTURE_SIZE} x {PICTURE_SIZE}")
+        if abs(left + right + 1 - image.width) > 2 or abs(top + bottom + 1 - image.height) > 2:
+            stray.append(f"screen: all that isn't background spans {box}, not centred on {image.width} x {image.height}")
+    return problems, stray
+
+
+def check_screenshot(path, expect):
+    """check_screen of a PNG file; a missing or unreadable file is a problem
+    of the first list."""
+    if path is None or not Path(path).is_file():
+        return [f"screen: no screenshot (nothing matched {expect.when!r} in time)"], []
+    try:
+        image = read_png(Path(path).read_bytes())
+        artwork = read_artwork() if expect.picture else None
+    except (OSError, ValueError, zlib.error) as error:
+        return [f"screen: {error}"], []
+    return check_screen(image, expect, artwork)
+
+
+# --- the disk -------------------------------------------------------------------------
 
 
 def config_value(value):
@@ -188,14 +578,15 @@ def run_tool(*args, env=None):
 
 
 def build_disk(image, files, directories=()):
-    """A GPT disk of DISK_BYTES with one EFI system partition holding `files`
-    (ESP path with '/' -> bytes or host Path) and `directories` (ESP paths)."""
+    """A GPT disk of DISK_BYTES with one EFI system partition, of the GUID
+    PARTITION_GUID, holding `files` (ESP path with '/' -> bytes or host Path)
+    and `directories` (ESP paths)."""
     image = Path(image).resolve()
     with open(image, "wb") as disk:
         disk.truncate(DISK_BYTES)
     # A fresh image has nothing to zap, and each of sgdisk's steps costs a
     # second of waiting for the kernel to reread the table.
-    run_tool("sgdisk", "-o", "-n", "1:2048:0", "-t", "1:EF00", str(image))
+    run_tool("sgdisk", "-o", "-n", "1:2048:0", "-t", "1:EF00", "-u", f"1:{PARTITION_GUID}", str(image))
     volume = f"{image}@@{PARTITION_OFFSET}"
     env = dict(os.environ, MTOOLS_SKIP_CHECK="1")
     run_tool("mformat", "-i", volume, "-F", "-v", "ESP", "::", env=env)
@@ -216,7 +607,7 @@ def build_disk(image, files, directories=()):
         run_tool("mcopy", "-i", volume, str(Path(source).resolve()), f"::/{path.strip('/')}", env=env)
 
 
-# --- QEMU ----------------------------------------------------------------------------
+# --- QEMU -----------------------------------------------------------------------------
 
 
 def find_ovmf():
@@ -311,7 +702,7 @@ class Machine:
         sys.exit(130)
 
 
-# --- scenarios ------------------------------------------------------------------------
+# --- runs -----------------------------------------------------------------------------
 
 
 @dataclasses.dataclass
@@ -334,7 +725,7 @@ def scenario_config(scenario, override=None):
     return config
 
 
-def prepare(scenario, efi_dir, workdir, loader=None, config_override=None):
+def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
     """Builds the scenario's disk in `workdir`; returns its path."""
     efi_dir = Path(efi_dir)
     files = {
@@ -347,7 +738,12 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None):
     config = scenario_config(scenario, config_override)
     if config or scenario.config_file:
         files["EFI/BOOT/platform.cfg"] = render_config(config)
-    files.update(scenario.files)
+    for path, content in scenario.files.items():
+        if isinstance(content, GuestFile):
+            content = Path(guest_dir) / content.name
+            if not content.is_file():
+                raise FileNotFoundError(f"{content} is missing: build the target guest_kernel first")
+        files[path] = content
     for path in scenario.remove:
         files.pop(path, None)
     disk = workdir / "disk.img"
@@ -355,25 +751,93 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None):
     return disk
 
 
-def run_scenario(scenario, efi_dir, loader=None, timeout=None):
+class SerialFollower:
+    """The lines of a serial log that QEMU is still writing, cleaned, as
+    each one is completed."""
+
+    def __init__(self, path):
+        self.path, self.offset, self.pending = Path(path), 0, b""
+
+    def lines(self, final=False):
+        """The lines completed since the last call; with `final`, also an
+        unfinished last line."""
+        raw = self.path.read_bytes() if self.path.exists() else b""
+        self.pending += raw[self.offset :]
+        self.offset = len(raw)
+        *complete, self.pending = self.pending.split(b"\n")
+        if final and self.pending:
+            complete.append(self.pending)
+            self.pending = b""
+        return [clean_log(line) for line in complete]
+
+
+def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False):
+    """Runs QEMU on `disk` until it ends, for at most `timeout` seconds. With
+    `screen_when`, takes a screenshot into `screen_path` over QMP as soon as
+    a line of the serial log holds that text; with `echo`, prints the
+    cleaned serial log as it comes. Returns the exit status (None: timed
+    out), the cleaned log, the screenshot's path or None, and what went
+    wrong with the screenshot."""
+    serial_log = workdir / "serial.log"
+    qmp_socket = workdir / "qmp.sock" if screen_when else None
+    machine = Machine(qemu_command(workdir, disk, serial_log, qmp_socket), workdir / "qemu.log")
+    deadline = time.monotonic() + timeout
+    shot, trouble = None, []
+    try:
+        if screen_when or echo:
+            qmp = Qmp(qmp_socket, deadline, machine) if screen_when else None
+            follower = SerialFollower(serial_log)
+            while True:
+                running = machine.poll() is None
+                for line in follower.lines(final=not running):
+                    if echo and line.strip():
+                        print(line, flush=True)
+                    if qmp is not None and shot is None and screen_when in line:
+                        qmp.execute("screendump", filename=str(screen_path), format="png")
+                        shot = screen_path
+                if not running or time.monotonic() > deadline:
+                    break
+                time.sleep(0.1)
+            if qmp is not None:
+                qmp.close()
+    except (OSError, ConnectionError, RuntimeError, ValueError) as error:
+        trouble.append(f"screen: QMP: {error}")
+    finally:
+        returncode = machine.wait(max(1.0, deadline - time.monotonic()))
+    log = clean_log(serial_log.read_bytes()) if serial_log.exists() else ""
+    return returncode, log, shot, trouble
+
+
+def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_DIR):
     start = time.monotonic()
     workdir = Path(tempfile.mkdtemp(prefix=f"nimb-qemu-{scenario.name}-"))
     try:
-        disk = prepare(scenario, efi_dir, workdir, loader)
+        disk = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
     except BaseException:
         shutil.rmtree(workdir, ignore_errors=True)
         raise
-    serial_log = workdir / "serial.log"
-    machine = Machine(qemu_command(workdir, disk, serial_log), workdir / "qemu.log")
-    returncode = machine.wait(timeout or scenario.timeout)
-    log = clean_log(serial_log.read_bytes()) if serial_log.exists() else ""
+    limit = timeout or scenario.timeout
+    screen = scenario.screen
+    returncode, log, shot, trouble = boot(
+        disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None
+    )
     (workdir / "serial.txt").write_text(log)
     outcome = decode_exit(returncode, read_exit_codes())
     problems = check_report(log, outcome, scenario.status, scenario.memory, scenario.exit)
     problems += check_log(log, scenario.expect, scenario.forbid)
     problems += check_console_modes(log, scenario.console_modes)
+    if scenario.kernel is not None:
+        problems += check_kernel(log, scenario.kernel)
+    if screen is not None:
+        picture, stray = check_screenshot(shot, screen)
+        problems += trouble + picture
+        if screen.alone:
+            problems += stray
+        else:
+            for problem in stray:
+                print(f"  {scenario.name}, not enforced: {problem}")
     if returncode is None:
-        problems.insert(0, f"timed out after {timeout or scenario.timeout} s")
+        problems.insert(0, f"timed out after {limit} s")
     return Result(not problems, time.monotonic() - start, outcome, problems, log, workdir)
 
 
@@ -393,16 +857,20 @@ def report(scenario, result, show_log=False):
     if qemu_log:
         print("--- qemu ---")
         print(qemu_log)
+    # Once more behind the long log, where a reader of the output looks first.
+    print(f"--- {scenario.name}: {len(result.problems)} expectation(s) failed ---")
+    for problem in result.problems:
+        print(f"  {problem}")
     print(f"--- files kept in {result.workdir} ---")
 
 
-# --- demo ------------------------------------------------------------------------------
+# --- QMP and the demo -----------------------------------------------------------------
 
 
 class Qmp:
     """A QMP connection: commands as JSON lines, answers read past events."""
 
-    def __init__(self, path, deadline):
+    def __init__(self, path, deadline, machine=None):
         while True:
             try:
                 self.sock = socket.socket(socket.AF_UNIX, socket.SOCK_STREAM)
@@ -410,7 +878,7 @@ class Qmp:
                 break
             except (FileNotFoundError, ConnectionRefusedError):
                 self.sock.close()
-                if time.monotonic() > deadline:
+                if time.monotonic() > deadline or (machine is not None and machine.poll() is not None):
                     raise
                 time.sleep(0.1)
         self.sock.settimeout(max(1.0, deadline - time.monotonic()))
@@ -442,58 +910,76 @@ class Qmp:
         self.sock.close()
 
 
-def demo(efi_dir, loader=None, timeout=120.0):
-    """Boots the no-kernel volume in graphics mode, prints the serial log as it
-    comes, takes a screenshot when the platform reports, then quits."""
-    scenario = SCENARIOS["no_kernel"]
+# The demo's volume: the reference kernel under its default name, booted in
+# graphics mode; the kernel holds the machine a while after its report.
+DEMO = Scenario(
+    "demo",
+    config={"console": "graphics", "options": "guest.hold=4"},
+    files=kernel_file(),
+)
+DEMO_SCREEN_EXPECT = ScreenExpect(when="kernel: result", picture="logo")
+
+
+def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
+    """Boots the reference kernel, prints the serial log as it comes, takes
+    a screenshot once the kernel has reported (while it holds the machine)
+    and lets the kernel power off. True when the kernel passed and the
+    screenshot was taken."""
     workdir = Path(tempfile.mkdtemp(prefix="nimb-qemu-demo-"))
-    disk = prepare(scenario, efi_dir, workdir, loader, {"hold": 3, "console": "graphics"})
-    serial_log, qmp_socket = workdir / "serial.log", workdir / "qmp.sock"
+    disk = prepare(DEMO, efi_dir, workdir, loader, guest_dir=guest_dir)
     DEMO_SCREEN.parent.mkdir(parents=True, exist_ok=True)
     if DEMO_SCREEN.exists():
         DEMO_SCREEN.unlink()
-    machine = Machine(qemu_command(workdir, disk, serial_log, qmp_socket), workdir / "qemu.log")
-    deadline = time.monotonic() + timeout
-    printed, pending, shot = 0, "", False
-    try:
-        qmp = Qmp(qmp_socket, deadline)
-        while machine.poll() is None and time.monotonic() < deadline:
-            raw = serial_log.read_bytes() if serial_log.exists() else b""
-            pending += raw[printed:].decode("utf-8", errors="replace")
-            printed = len(raw)
-            *lines, pending = pending.split("\n")
-            for line in lines:
-                text = clean_log(line)
-                if text.strip():
-                    print(text, flush=True)
-                if not shot and REPORT_MEMORY.search(text):
-                    qmp.execute("screendump", filename=str(DEMO_SCREEN), format="png")
-                    shot = True
-                    qmp.execute("quit")
-            time.sleep(0.1)
-        qmp.close()
-    finally:
-        returncode = machine.wait(max(1.0, deadline - time.monotonic()))
-    if not shot:
-        print(f"demo: no report from the platform (exit {returncode}); files kept in {workdir}")
+    returncode, log, shot, trouble = boot(
+        disk, workdir, timeout, DEMO_SCREEN_EXPECT.when, DEMO_SCREEN.resolve(), echo=True
+    )
+    outcome = decode_exit(returncode, read_exit_codes())
+    kernel = parse_kernel_report(log)
+    print()
+    if kernel.result is None:
+        print(f"demo: the kernel gave no result (exit {outcome.name})")
+    else:
+        passed, checks, failed = kernel.result
+        print(f"demo: kernel {'pass' if passed else 'FAIL'}: {checks} checks, {failed} failed (exit {outcome.name})")
+        for check in kernel.failed_checks():
+            print(f"demo:   check {check.name} FAIL {check.detail}")
+    for problem in trouble:
+        print(f"demo: {problem}")
+    if shot is None:
+        print(f"demo: no screenshot; files kept in {workdir}")
         return False
-    shutil.rmtree(workdir, ignore_errors=True)
-    print(f"demo: screenshot in {DEMO_SCREEN}")
-    return True
+    DOCS_SCREEN.parent.mkdir(parents=True, exist_ok=True)
+    shutil.copyfile(shot, DOCS_SCREEN)
+    picture, stray = check_screenshot(shot, DEMO_SCREEN_EXPECT)
+    problems = picture + stray
+    if problems:
+        print("demo: the screen is not the logo centred on grey:")
+        for problem in problems:
+            print(f"demo:   {problem}")
+    else:
+        print("demo: the screen shows the logo centred on the grey background")
+    print(f"demo: screenshot in {DEMO_SCREEN} (and {DOCS_SCREEN})")
+    ok = outcome.name == "KernelPass"
+    if ok:
+        shutil.rmtree(workdir, ignore_errors=True)
+    else:
+        print(f"demo: files kept in {workdir}")
+    return ok
 
 
-# --- command line -----------------------------------------------------------------------
+# --- command line ---------------------------------------------------------------------
 
 
 def main(argv=None):
     parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"), help="where BOOTX64.efi and nimbboot.efi are")
     parser.add_argument("--loader", help="another EFI program to start in place of nimbboot.efi")
+    parser.add_argument("--guest-dir", default=str(GUEST_DIR), help="where the reference kernel's files are")
     parser.add_argument("--scenario", action="append", help="run this scenario (repeatable; default all)")
     parser.add_argument("--timeout", type=float, help="seconds per run, instead of the scenario's own")
     parser.add_argument("--show-log", action="store_true", help="print the serial log of passing runs too")
     parser.add_argument("--list", action="store_true", help="print the scenarios' names")
-    parser.add_argument("--demo", action="store_true", help="boot in graphics mode and take a screenshot")
+    parser.add_argument("--demo", action="store_true", help="boot the reference kernel and take a screenshot")
     args = parser.parse_args(argv)
     for number in (signal.SIGTERM, signal.SIGINT, signal.SIGHUP):
         signal.signal(number, Machine.kill_all)
@@ -502,7 +988,7 @@ def main(argv=None):
         print("\n".join(SCENARIOS))
         return 0
     if args.demo:
-        return 0 if demo(args.efi_dir, args.loader) else 1
+        return 0 if demo(args.efi_dir, args.loader, args.guest_dir) else 1
     names = args.scenario or list(SCENARIOS)
     unknown = [name for name in names if name not in SCENARIOS]
     if unknown:
@@ -510,7 +996,7 @@ def main(argv=None):
     failed = 0
     for name in names:
         try:
-            result = run_scenario(SCENARIOS[name], args.efi_dir, args.loader, args.timeout)
+            result = run_scenario(SCENARIOS[name], args.efi_dir, args.loader, args.timeout, args.guest_dir)
         except (OSError, subprocess.CalledProcessError) as error:
             detail = getattr(error, "stderr", None) or b""
             print(f"FAIL {name}: {error} {detail.decode(errors='replace').strip()}")

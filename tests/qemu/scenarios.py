@@ -3,6 +3,7 @@ what the run must print and end with. harness.py runs them; CMakeLists.txt
 registers one ctest test per name."""
 
 import dataclasses
+import re
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -16,11 +17,113 @@ BASE_CONFIG = {
 # The loader's configuration file on a volume boot.
 BOOT_PLIST = "Library/Preferences/SystemConfiguration/com.quill.Boot.plist"
 
+# The GUID of the system partition on every disk the harness builds: the
+# root volume's UUID as the loader should find it. Its first three fields
+# read differently in either byte order.
+PARTITION_GUID = "0FAB1E5D-3C2B-4A19-8E7F-60C5D4B3A291"
+
+# What a boot of the reference kernel prints, in this order.
+LOADING_KERNEL = "Loading 'nimb_kernel'..."
+ROOT_UUID = "root device uuid is '"
+KERNEL_START = "kernel: start"
+
+# The children of /efi/configuration-table for the ACPI tables that OVMF has.
+ACPI_20_TABLE = "/efi/configuration-table/8868E871-E4F1-11D3-BC22-0080C73C8881"
+ACPI_10_TABLE = "/efi/configuration-table/EB9D2D30-2D88-11D3-9A16-0090273FC14D"
+
 
 def plist(entries):
     """A configuration property list of string values."""
     body = "".join(f"\t<key>{key}</key>\n\t<string>{value}</string>\n" for key, value in entries.items())
     return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
+
+
+# --- what the reference kernel reports -------------------------------------------------
+
+
+@dataclasses.dataclass(frozen=True)
+class GuestFile:
+    """A file of the reference kernel's build directory (--guest-dir), put on
+    the volume in place of content."""
+
+    name: str
+
+
+def quoted(value):
+    """A text as the kernel's report shows it: in double quotes, with \\ and
+    \" escaped and bytes outside printable ASCII as \\xNN."""
+    out = []
+    for byte in value.encode("utf-8") if isinstance(value, str) else value:
+        char = chr(byte)
+        if char in '"\\':
+            out.append("\\" + char)
+        elif 0x20 <= byte <= 0x7E:
+            out.append(char)
+        else:
+            out.append(f"\\x{byte:02x}")
+    return '"' + "".join(out) + '"'
+
+
+def text(value):
+    """A tree value that is a NUL-terminated text, as the report prints it."""
+    return quoted(value)
+
+
+def ucs2(value):
+    """A tree value that is a NUL-terminated UCS-2 text, as the report prints it."""
+    return "u" + quoted(value)
+
+
+@dataclasses.dataclass(frozen=True)
+class AtLeast:
+    """A number no smaller than `minimum`."""
+
+    minimum: int
+
+    def __call__(self, value):
+        return isinstance(value, int) and value >= self.minimum
+
+    def __str__(self):
+        return f">= {self.minimum}"
+
+
+@dataclasses.dataclass(frozen=True)
+class KernelExpect:
+    """What the reference kernel's report must hold. Wanted values are
+    compared with ==, except a compiled pattern (full match of the text as
+    the report prints it) and a callable such as AtLeast (true for the
+    value)."""
+
+    # "pass": every check ok and the result line says so; "fail": at least
+    # one check failed.
+    result: str = "pass"
+    # BootArgs field -> value (texts decoded, numbers as numbers).
+    bootargs: dict = dataclasses.field(default_factory=dict)
+    # Node path -> {property: value as printed}; an empty dict only asks
+    # for the node. text() and ucs2() print values as the kernel does.
+    tree: dict = dataclasses.field(default_factory=dict)
+    # Range of /chosen/memory-map -> its length, or None for any.
+    ranges: dict = dataclasses.field(default_factory=dict)
+
+
+@dataclasses.dataclass(frozen=True)
+class ScreenExpect:
+    """A screenshot, taken once a line of the serial log holds `when`, and
+    what it must show: the background colour in the corner and the
+    loader's artwork `picture` ("logo", "failure"; None: any picture) at the
+    place of a centred 128 x 128 picture, and, when `alone`, nothing else."""
+
+    when: str
+    picture: str | None = None
+    background: tuple = (191, 191, 191)
+    # False: whatever else is on the screen is printed, but doesn't fail the
+    # scenario.
+    alone: bool = True
+
+
+def kernel_file(name="nimb_kernel"):
+    """The volume's files for a boot of the reference kernel."""
+    return {"nimb_kernel": GuestFile(name)}
 
 
 @dataclasses.dataclass(frozen=True)
@@ -33,7 +136,8 @@ class Scenario:
     base_config: bool = True
     # Write platform.cfg even when `config` is empty.
     config_file: bool = False
-    # Extra files of the ESP: path with '/' -> bytes, text or a host Path.
+    # Extra files of the ESP: path with '/' -> bytes, text, a host Path or
+    # a GuestFile.
     files: dict = dataclasses.field(default_factory=dict)
     # ESP paths to leave out (e.g. the loader itself).
     remove: tuple = ()
@@ -49,9 +153,14 @@ class Scenario:
     # EFI_ABORTED and EFI_SUCCESS), and whether free memory came back.
     status: str = "EFI_ABORTED"
     memory: str = "same"
-    # The platform's exit name (exitcodes.h without kExit) when the run is
-    # to end before the loader comes back; overrides status and memory.
+    # The exit name (kExit... of platform/exitcodes.h or of the kernel's
+    # tests/guest/exitcodes.h, without kExit) when the run is to end other
+    # than by the loader's coming back; overrides status and memory.
     exit: str | None = None
+    # The reference kernel's report, when the loader is to start it.
+    kernel: KernelExpect | None = None
+    # A screenshot and what it must show.
+    screen: ScreenExpect | None = None
     timeout: float = 90.0
 
 
@@ -139,6 +248,102 @@ _TABLE = [
         ),
         forbid=("platform: starting",),
         exit="LoaderMissing",
+    ),
+    # A plain graphics boot of the reference kernel from the volume's root,
+    # with what every boot hands over.
+    Scenario(
+        "kernel_plain",
+        config={"console": "graphics", "options": "foo=1"},
+        files=kernel_file(),
+        expect=(LOADING_KERNEL, f"{ROOT_UUID}{PARTITION_GUID}'", KERNEL_START),
+        forbid=("platform: loader returned",),
+        exit="KernelPass",
+        kernel=KernelExpect(
+            bootargs={
+                "commandLine": "foo=1",
+                "videoDisplayMode": 1,
+                "videoWidth": AtLeast(640),
+                "runtimePageCount": AtLeast(2),
+            },
+            tree={
+                "/chosen": {
+                    "boot-file": text("nimb_kernel"),
+                    "boot-args": text("foo=1"),
+                    "boot-uuid": text(PARTITION_GUID),
+                },
+                "/chosen/memory-map": {},
+                "/efi": {"firmware-abi": text("EFI64")},
+                "/efi/platform": {"Model": ucs2("QEMU1,1"), "BusFrequency": re.compile(r"<00 e1 f5 05 00 00 00 00>.*")},
+                "/efi/runtime-services": {},
+                ACPI_20_TABLE: {"alias": text("ACPI_20")},
+                ACPI_10_TABLE: {"alias": text("ACPI")},
+            },
+            ranges={"BootCLUT": 0x300, "Pict-FailedBoot": 0x4020},
+        ),
+    ),
+    # The kernel as fat files, either byte order, under the default name.
+    Scenario(
+        "kernel_fat_be",
+        files=kernel_file("nimb_kernel.fat-be"),
+        expect=(LOADING_KERNEL, KERNEL_START),
+        exit="KernelPass",
+        kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}),
+    ),
+    Scenario(
+        "kernel_fat_le",
+        files=kernel_file("nimb_kernel.fat-le"),
+        expect=(LOADING_KERNEL, KERNEL_START),
+        exit="KernelPass",
+        kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}),
+    ),
+    # -v: the console goes to text and stays there for the kernel.
+    Scenario(
+        "kernel_verbose",
+        config={"console": "graphics", "options": "-v"},
+        files=kernel_file(),
+        expect=(LOADING_KERNEL, KERNEL_START),
+        console_modes=("text",),
+        exit="KernelPass",
+        kernel=KernelExpect(bootargs={"commandLine": "-v", "videoDisplayMode": 2}),
+    ),
+    # The command line merged from load options, boot-args and the
+    # configuration file's Kernel Flags (the first to name a key wins), and
+    # the configuration file's Root UUID in place of the volume's.
+    Scenario(
+        "kernel_config",
+        config={"options": "foo=1", "nvram.boot-args": "foo=2 bar=3"},
+        files={
+            **kernel_file(),
+            BOOT_PLIST: plist({"Kernel Flags": "baz=4 bar=5", "Root UUID": "not-a-uuid"}),
+        },
+        expect=(LOADING_KERNEL, f"{ROOT_UUID}not-a-uuid'", KERNEL_START),
+        forbid=(PARTITION_GUID,),
+        exit="KernelPass",
+        kernel=KernelExpect(
+            bootargs={"commandLine": "foo=1 bar=3 baz=4"},
+            tree={"/chosen": {"boot-uuid": text("not-a-uuid"), "boot-args": text("foo=1 bar=3 baz=4")}},
+        ),
+    ),
+    # The boot screen as the kernel finds it: the logo in the middle of the
+    # grey screen, taken while the kernel holds the machine.
+    Scenario(
+        "screen_logo",
+        config={"console": "graphics", "options": "guest.hold=3"},
+        files=kernel_file(),
+        exit="KernelPass",
+        kernel=KernelExpect(bootargs={"videoDisplayMode": 1}),
+        # OVMF's text console still paints the loader's messages over the
+        # boot screen in graphics mode; alone=True once the platform keeps
+        # text off the screen in that mode.
+        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=False),
+    ),
+    # A failed graphics boot ends on the failure picture, taken while the
+    # platform holds the machine after the loader came back.
+    Scenario(
+        "screen_failure",
+        config={"console": "graphics", "hold": 2},
+        expect=(KERNEL_ERROR, "platform: loader returned"),
+        screen=ScreenExpect(when="platform: memory", picture="failure"),
     ),
 ]
 
