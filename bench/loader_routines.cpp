@@ -1,7 +1,6 @@
 // The loader's checksums and memory routines behind the plain signatures of
 // routines.h. LOADER_ROUTINES names the table this compilation defines.
 #include "routines.h"
-
 #include "support/checksum.h"
 #include "support/strings.h"
 

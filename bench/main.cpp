@@ -108,11 +108,13 @@ bool CheckAll(const Contender<AdlerFunction> (&adlers)[N], const Contender<Md5Fu
       ok &= Agree("MD5", md5s[i].name, size, std::memcmp(mine, digest, 16) == 0);
       std::memset(d.destination.data(), 0, size);
       memcpys[i].function(d.destination.data(), d.bytes.data(), size);
-      ok &= Agree("memcpy", memcpys[i].name, size, std::memcmp(d.destination.data(), d.bytes.data(), size) == 0);
+      ok &= Agree("memcpy", memcpys[i].name, size,
+                  std::memcmp(d.destination.data(), d.bytes.data(), size) == 0);
       // Equal, then unequal in the last byte both ways round. The loader reads
       // bytes as signed, the C library as unsigned: a low bit keeps the two
       // orders the same.
-      ok &= Agree("memcmp", memcmps[i].name, size, memcmps[i].function(d.bytes.data(), d.copy.data(), size) == 0);
+      ok &= Agree("memcmp", memcmps[i].name, size,
+                  memcmps[i].function(d.bytes.data(), d.copy.data(), size) == 0);
       d.copy[size - 1] ^= 0x01;
       const int want = Sign(std::memcmp(d.bytes.data(), d.copy.data(), size));
       ok &= Agree("memcmp", memcmps[i].name, size,
@@ -136,12 +138,13 @@ template <typename Function, size_t N, typename Body>
 void Register(const char *routine, const Contender<Function> (&contenders)[N], Body body) {
   for (size_t size : kSizes) {
     for (const Contender<Function> &c : contenders) {
-      benchmark::RegisterBenchmark(Name(routine, c.name, size).c_str(), [c, size, body](benchmark::State &state) {
-        for (auto _ : state) {
-          body(c.function, size);
-        }
-        state.SetBytesProcessed(static_cast<int64_t>(state.iterations()) * static_cast<int64_t>(size));
-      });
+      benchmark::RegisterBenchmark(
+          Name(routine, c.name, size).c_str(), [c, size, body](benchmark::State &state) {
+            for (auto _ : state) {
+              body(c.function, size);
+            }
+            state.SetBytesProcessed(static_cast<int64_t>(state.iterations()) * static_cast<int64_t>(size));
+          });
     }
   }
 }
@@ -149,14 +152,18 @@ void Register(const char *routine, const Contender<Function> (&contenders)[N], B
 }  // namespace
 
 int main(int argc, char **argv) {
-  const Contender<AdlerFunction> adlers[] = {
-      {"loader", gLoaderHostBuild.adler32}, {"loader-fwflags", gLoaderFirmwareBuild.adler32}, {"zlib", ZlibAdler32}};
-  const Contender<Md5Function> md5s[] = {
-      {"loader", gLoaderHostBuild.md5}, {"loader-fwflags", gLoaderFirmwareBuild.md5}, {"openssl", OpensslMd5}};
-  const Contender<MemcpyFunction> memcpys[] = {
-      {"loader", gLoaderHostBuild.memcpy}, {"loader-fwflags", gLoaderFirmwareBuild.memcpy}, {"libc", LibcMemcpy}};
-  const Contender<MemcmpFunction> memcmps[] = {
-      {"loader", gLoaderHostBuild.memcmp}, {"loader-fwflags", gLoaderFirmwareBuild.memcmp}, {"libc", LibcMemcmp}};
+  const Contender<AdlerFunction> adlers[] = {{"loader", gLoaderHostBuild.adler32},
+                                             {"loader-fwflags", gLoaderFirmwareBuild.adler32},
+                                             {"zlib", ZlibAdler32}};
+  const Contender<Md5Function> md5s[] = {{"loader", gLoaderHostBuild.md5},
+                                         {"loader-fwflags", gLoaderFirmwareBuild.md5},
+                                         {"openssl", OpensslMd5}};
+  const Contender<MemcpyFunction> memcpys[] = {{"loader", gLoaderHostBuild.memcpy},
+                                               {"loader-fwflags", gLoaderFirmwareBuild.memcpy},
+                                               {"libc", LibcMemcpy}};
+  const Contender<MemcmpFunction> memcmps[] = {{"loader", gLoaderHostBuild.memcmp},
+                                               {"loader-fwflags", gLoaderFirmwareBuild.memcmp},
+                                               {"libc", LibcMemcmp}};
   if (!CheckAll(adlers, md5s, memcpys, memcmps)) {
     return 1;
   }
@@ -174,8 +181,9 @@ int main(int argc, char **argv) {
     benchmark::ClobberMemory();
   });
   // Equal buffers: the whole length is read, as when a header matches.
-  Register("memcmp", memcmps,
-           [&d](MemcmpFunction f, size_t size) { benchmark::DoNotOptimize(f(d.bytes.data(), d.copy.data(), size)); });
+  Register("memcmp", memcmps, [&d](MemcmpFunction f, size_t size) {
+    benchmark::DoNotOptimize(f(d.bytes.data(), d.copy.data(), size));
+  });
   benchmark::Initialize(&argc, argv);
   if (benchmark::ReportUnrecognizedArguments(argc, argv)) {
     return 2;

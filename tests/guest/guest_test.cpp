@@ -809,7 +809,7 @@ TEST(GuestHold, ReadsTheFirstHoldWord) {
       {"first word counts", "guest.hold=2 guest.hold=9", 0, 2},
       {"capped", "guest.hold=99999999999999", 0, g::kMaxHoldSeconds},
       {"cut by the field's length", "guest.hold=45", 12, 4},
-      {"stops at the NUL", std::string("guest.hold=4\0" "5", 14), 14, 4},
+      {"stops at the NUL", std::string("guest.hold=4") + '\0' + "5", 14, 4},
   };
   for (const Row &row : rows) {
     uint32_t length = row.length != 0 ? row.length : static_cast<uint32_t>(row.line.size());

@@ -273,7 +273,7 @@ _TABLE = [
                 },
                 "/chosen/memory-map": {},
                 "/efi": {"firmware-abi": text("EFI64")},
-                "/efi/platform": {"Model": ucs2("QEMU1,1"), "BusFrequency": re.compile(r"<00 e1 f5 05 00 00 00 00>.*")},
+                "/efi/platform": {"Model": ucs2("QEMU1,1"), "BusFrequency": "<00 e1 f5 05 00 00 00 00> (0x5f5e100)"},
                 "/efi/runtime-services": {},
                 ACPI_20_TABLE: {"alias": text("ACPI_20")},
                 ACPI_10_TABLE: {"alias": text("ACPI")},

@@ -26,7 +26,8 @@ void ReportOutput(char character) {
     gLine.push_back(character);
     return;
   }
-  const size_t skip = gLine.compare(0, sizeof(kLinePrefix) - 1, kLinePrefix) == 0 ? sizeof(kLinePrefix) - 1 : 0;
+  const size_t skip =
+      gLine.compare(0, sizeof(kLinePrefix) - 1, kLinePrefix) == 0 ? sizeof(kLinePrefix) - 1 : 0;
   std::printf("%s\n", gLine.c_str() + skip);
   gLine.clear();
 }
@@ -34,7 +35,8 @@ void ReportOutput(char character) {
 // The firmware's arena stands for physical memory and is mapped at the same
 // addresses in this process; nothing outside it is the machine's.
 const uint8_t *GuestMemory(uint32_t address, uint32_t length) {
-  if (address < hostfw::kArenaBase || address >= hostfw::kArenaLimit || length > hostfw::kArenaLimit - address) {
+  if (address < hostfw::kArenaBase || address >= hostfw::kArenaLimit ||
+      length > hostfw::kArenaLimit - address) {
     return nullptr;
   }
   return reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(address));

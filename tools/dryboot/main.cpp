@@ -5,6 +5,7 @@
 
 #include <cstdio>
 #include <cstring>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -58,13 +59,11 @@ const HeldKeys kHeldKeys[] = {
 struct Settings {
   bool help = false;
   std::string volume;
-  bool hasLoadOptions = false;
-  std::string loadOptions;
+  std::optional<std::string> loadOptions;
   std::vector<std::pair<std::string, std::vector<uint8_t>>> variables;
   const HeldKeys *keys = nullptr;
   bool text = false;
-  bool hasModel = false;
-  std::string model;
+  std::optional<std::string> model;
 };
 
 // --- the command line ----------------------------------------------------------------
@@ -73,7 +72,11 @@ std::u16string Utf16(const std::string &text) {
   std::u16string out;
   for (size_t i = 0; i < text.size();) {
     const uint8_t lead = static_cast<uint8_t>(text[i]);
-    const size_t length = lead < 0x80 ? 1 : (lead & 0xE0) == 0xC0 ? 2 : (lead & 0xF0) == 0xE0 ? 3 : (lead & 0xF8) == 0xF0 ? 4 : 0;
+    const size_t length = lead < 0x80             ? 1
+                          : (lead & 0xE0) == 0xC0 ? 2
+                          : (lead & 0xF0) == 0xE0 ? 3
+                          : (lead & 0xF8) == 0xF0 ? 4
+                                                  : 0;
     uint32_t c = length == 1 ? lead : length == 0 ? 0 : lead & (0x7F >> length);
     bool valid = length != 0 && i + length <= text.size();
     for (size_t k = 1; valid && k < length; k++) {
@@ -99,7 +102,10 @@ std::u16string Utf16(const std::string &text) {
 }
 
 int HexDigit(char c) {
-  return c >= '0' && c <= '9' ? c - '0' : c >= 'a' && c <= 'f' ? c - 'a' + 10 : c >= 'A' && c <= 'F' ? c - 'A' + 10 : -1;
+  return c >= '0' && c <= '9'   ? c - '0'
+         : c >= 'a' && c <= 'f' ? c - 'a' + 10
+         : c >= 'A' && c <= 'F' ? c - 'A' + 10
+                                : -1;
 }
 
 // The text's bytes, "%XX" read as one byte.
@@ -130,53 +136,52 @@ std::string Parse(int argc, char **argv, Settings *settings) {
       argument.erase(equals);
       hasValue = true;
     }
-    auto take = [&](std::string *out) -> bool {
-      if (!hasValue) {
-        if (i + 1 >= argc) {
-          return false;
-        }
-        value = argv[++i];
+    // The option's value: behind its "=", or the next argument.
+    auto take = [&]() -> bool {
+      if (hasValue) {
+        return true;
       }
-      *out = value;
+      if (i + 1 >= argc) {
+        return false;
+      }
+      value = argv[++i];
       return true;
     };
-    std::string text;
-    if (argument == "--help" || argument == "-h") {
+    if ((argument == "--help" || argument == "--text") && hasValue) {
+      return argument + " takes no value";
+    } else if (argument == "--help" || argument == "-h") {
       settings->help = true;
       return "";
     } else if (argument == "--text") {
       settings->text = true;
     } else if (argument == "--options") {
-      if (!take(&settings->loadOptions)) {
+      if (!take()) {
         return "--options needs a text";
       }
-      settings->hasLoadOptions = true;
+      settings->loadOptions = value;
     } else if (argument == "--model") {
-      if (!take(&settings->model)) {
+      if (!take()) {
         return "--model needs a text";
       }
-      settings->hasModel = true;
+      settings->model = value;
     } else if (argument == "--nvram") {
-      if (!take(&text)) {
+      const size_t split = take() ? value.find('=') : std::string::npos;
+      if (split == std::string::npos || split == 0) {
         return "--nvram needs NAME=VALUE";
       }
-      const size_t split = text.find('=');
-      if (split == std::string::npos || split == 0) {
-        return "--nvram " + text + ": not NAME=VALUE";
-      }
-      settings->variables.emplace_back(text.substr(0, split), VariableBytes(text.substr(split + 1)));
+      settings->variables.emplace_back(value.substr(0, split), VariableBytes(value.substr(split + 1)));
     } else if (argument == "--keys") {
-      if (!take(&text)) {
+      if (!take()) {
         return "--keys needs shift, gui+v or gui+s";
       }
       settings->keys = nullptr;
       for (const HeldKeys &keys : kHeldKeys) {
-        if (text == keys.name) {
+        if (value == keys.name) {
           settings->keys = &keys;
         }
       }
       if (settings->keys == nullptr) {
-        return "--keys " + text + ": not shift, gui+v or gui+s";
+        return "--keys " + value + ": not shift, gui+v or gui+s";
       }
     } else if (argument.compare(0, 1, "-") == 0 && argument != "-") {
       return "unknown option " + argument;
@@ -203,7 +208,8 @@ struct KeyState {
   const HeldKeys *keys;
 };
 
-EFI_STATUS EFIAPI ReadKeyState(NIMB_KEY_STATE_PROTOCOL *This, UINT16 *Modifiers, UINTN *KeyCount, UINT16 *Keys) {
+EFI_STATUS EFIAPI ReadKeyState(NIMB_KEY_STATE_PROTOCOL *This, UINT16 *Modifiers, UINTN *KeyCount,
+                               UINT16 *Keys) {
   const HeldKeys *held = reinterpret_cast<KeyState *>(This)->keys;
   if (Modifiers == nullptr || KeyCount == nullptr || (*KeyCount != 0 && Keys == nullptr)) {
     return EFI_INVALID_PARAMETER;
@@ -239,8 +245,8 @@ void Prepare(hostfw::Firmware &fw, const Settings &settings, KeyState *keyState)
   fw.SetConsoleMode(settings.text ? EfiConsoleControlScreenText : EfiConsoleControlScreenGraphics);
   fw.InstallAcpi(hostfw::AcpiOptions());
   fw.SetBootDevice(fw.AddDirectoryVolume(settings.volume));
-  if (settings.hasLoadOptions) {
-    fw.SetLoadOptions(Utf16(settings.loadOptions));
+  if (settings.loadOptions) {
+    fw.SetLoadOptions(Utf16(*settings.loadOptions));
   }
   for (const auto &variable : settings.variables) {
     fw.PutVariable(Utf16(variable.first), gNimbVendorVariableGuid,
@@ -253,13 +259,13 @@ void Prepare(hostfw::Firmware &fw, const Settings &settings, KeyState *keyState)
     keyState->keys = settings.keys;
     fw.InstallProtocol(fw.NewHandle(), gNimbKeyStateProtocolGuid, keyState);
   }
-  if (settings.hasModel) {
-    std::vector<uint8_t> value = Ucs2Bytes(Utf16(settings.model) + u'\0');
+  if (settings.model) {
+    std::vector<uint8_t> value = Ucs2Bytes(Utf16(*settings.model) + u'\0');
     fw.AddDataHubRecord(gNimbPlatformProducerGuid, u"Model", value);
     // The hub hands over its last record together with the end of the walk,
     // and the loader never looks at that one: a record follows the model,
     // as on a machine that logs many.
-    fw.AddDataHubRecord(gNimbPlatformProducerGuid, u"SystemSerialNumber", Ucs2Bytes(u"DRYBOOT0\0"));
+    fw.AddDataHubRecord(gNimbPlatformProducerGuid, u"SystemSerialNumber", Ucs2Bytes(u"DRYBOOT0"));
   }
 }
 
@@ -271,15 +277,33 @@ std::string StatusText(EFI_STATUS status) {
     const char *name;
   } kNames[] = {
 #define NAMED(status) {status, #status}
-      NAMED(EFI_SUCCESS),          NAMED(EFI_LOAD_ERROR),       NAMED(EFI_INVALID_PARAMETER),
-      NAMED(EFI_UNSUPPORTED),      NAMED(EFI_BAD_BUFFER_SIZE),  NAMED(EFI_BUFFER_TOO_SMALL),
-      NAMED(EFI_NOT_READY),        NAMED(EFI_DEVICE_ERROR),     NAMED(EFI_WRITE_PROTECTED),
-      NAMED(EFI_OUT_OF_RESOURCES), NAMED(EFI_VOLUME_CORRUPTED), NAMED(EFI_VOLUME_FULL),
-      NAMED(EFI_NO_MEDIA),         NAMED(EFI_MEDIA_CHANGED),    NAMED(EFI_NOT_FOUND),
-      NAMED(EFI_ACCESS_DENIED),    NAMED(EFI_NO_RESPONSE),      NAMED(EFI_NO_MAPPING),
-      NAMED(EFI_TIMEOUT),          NAMED(EFI_NOT_STARTED),      NAMED(EFI_ALREADY_STARTED),
-      NAMED(EFI_ABORTED),          NAMED(EFI_PROTOCOL_ERROR),   NAMED(EFI_INCOMPATIBLE_VERSION),
-      NAMED(EFI_SECURITY_VIOLATION), NAMED(EFI_CRC_ERROR),      NAMED(EFI_END_OF_MEDIA),
+      NAMED(EFI_SUCCESS),
+      NAMED(EFI_LOAD_ERROR),
+      NAMED(EFI_INVALID_PARAMETER),
+      NAMED(EFI_UNSUPPORTED),
+      NAMED(EFI_BAD_BUFFER_SIZE),
+      NAMED(EFI_BUFFER_TOO_SMALL),
+      NAMED(EFI_NOT_READY),
+      NAMED(EFI_DEVICE_ERROR),
+      NAMED(EFI_WRITE_PROTECTED),
+      NAMED(EFI_OUT_OF_RESOURCES),
+      NAMED(EFI_VOLUME_CORRUPTED),
+      NAMED(EFI_VOLUME_FULL),
+      NAMED(EFI_NO_MEDIA),
+      NAMED(EFI_MEDIA_CHANGED),
+      NAMED(EFI_NOT_FOUND),
+      NAMED(EFI_ACCESS_DENIED),
+      NAMED(EFI_NO_RESPONSE),
+      NAMED(EFI_NO_MAPPING),
+      NAMED(EFI_TIMEOUT),
+      NAMED(EFI_NOT_STARTED),
+      NAMED(EFI_ALREADY_STARTED),
+      NAMED(EFI_ABORTED),
+      NAMED(EFI_PROTOCOL_ERROR),
+      NAMED(EFI_INCOMPATIBLE_VERSION),
+      NAMED(EFI_SECURITY_VIOLATION),
+      NAMED(EFI_CRC_ERROR),
+      NAMED(EFI_END_OF_MEDIA),
       NAMED(EFI_END_OF_FILE),
 #undef NAMED
   };
@@ -347,7 +371,8 @@ int main(int argc, char **argv) {
     return kExitKernelEntered;
   }
   if (!complaint.empty()) {
-    std::fprintf(stderr, "dryboot: %s\n%s", complaint.c_str(), kUsage);
+    std::fprintf(stderr, "dryboot: %s\nUsage: dryboot [options] VOLUME_DIR (--help for the options)\n",
+                 complaint.c_str());
     return kExitUsage;
   }
 
