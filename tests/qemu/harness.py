@@ -38,7 +38,6 @@ from scenarios import (  # noqa: E402
     PARTITION_GUID,
     SCENARIOS,
     GuestFile,
-    KernelExpect,
     Scenario,
     ScreenExpect,
     kernel_file,

@@ -3,7 +3,6 @@ what the run must print and end with. harness.py runs them; CMakeLists.txt
 registers one ctest test per name."""
 
 import dataclasses
-import re
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 

@@ -57,7 +57,6 @@ TEST(DevicePathTest, WalksVisitEveryNodeAndStopAtTheEndOrAtADamagedNode) {
       {"0xFF/0x01 is no end", Cat({Node(0xFF, 0x01, 4), kEnd}), kWholeBuffer, {0}, 8},
       {"0x7F/0xFE is no end", Cat({Node(0x7F, 0xFE, 4), kEnd}), kWholeBuffer, {0}, 8},
       {"length is little-endian", Cat({Node(4, 4, 0x0104), kEnd}), kWholeBuffer, {0}, 0x108},
-      {"nothing behind the end is read", Cat({kEnd, Node(1, 1, 0)}), kWholeBuffer, {}, 4},
       {"bound ends exactly behind the end node", Cat({Node(1, 1, 6), kEnd, Bytes(8, 0)}), 10, {0}, 10},
       {"node of length 0", Cat({Node(1, 1, 6), Node(1, 1, 0), kEnd}), kWholeBuffer, {0}, 0},
       {"node of length 3", Cat({Node(1, 1, 3), Bytes(1, 0), kEnd}), kWholeBuffer, {}, 0},
@@ -122,12 +121,10 @@ TEST(DevicePathTest, FindNodeTakesTheFirstMatchInFrontOfTheEnd) {
       {2, 1, kWholeBuffer, 0},
       {3, 11, kWholeBuffer, 12},  // bit 7 of the type does not count
       {0x83, 11, kWholeBuffer, kWholeBuffer},
-      {4, 1, kWholeBuffer, 26},  // the first of two
-      {4, 4, kWholeBuffer, 68},
+      {4, 1, kWholeBuffer, 26},            // the first of two
       {5, 1, kWholeBuffer, kWholeBuffer},  // behind the end
       {4, 4, 70, kWholeBuffer},            // the file node runs past the bound
       {0x7F, 0x01, kWholeBuffer, 22},
-      {0x7F, 0xFF, kWholeBuffer, kWholeBuffer},
   };
   for (const Row &row : rows) {
     SCOPED_TRACE(std::to_string(row.type) + "/" + std::to_string(row.subType));
@@ -148,33 +145,28 @@ TEST(DevicePathTest, FindNodeTakesTheFirstMatchInFrontOfTheEnd) {
 
 class DevicePathFirmwareTest : public nimbtest::LoaderTest {};
 
-TEST_F(DevicePathFirmwareTest, DuplicateMakesAnUntrackedCopyOfTheWholePath) {
+TEST_F(DevicePathFirmwareTest, DuplicateMakesAnUntrackedCopyOfTheWholePathOrNone) {
   const Bytes path = Cat({Node(2, 1, 12, 0x11), Node(4, 4, 10, 0x22), kEnd, Node(1, 1, 4)});
   const unsigned copies = fw.CallCount("CopyMem");
   EFI_DEVICE_PATH_PROTOCOL *copy = nimb::DuplicateDevicePath(AsPath(path));
   ASSERT_NE(copy, nullptr);
-  EXPECT_NE(static_cast<const void *>(copy), static_cast<const void *>(path.data()));
   EXPECT_EQ(Bytes(reinterpret_cast<UINT8 *>(copy), reinterpret_cast<UINT8 *>(copy) + 26),
             Bytes(path.begin(), path.begin() + 26));
   EXPECT_EQ(fw.CallCount("CopyMem"), copies + 1);
   EXPECT_EQ(nimb::gMemoryTags, nullptr);
   EXPECT_EQ(fw.LivePoolBlocks(), 1u);
   ASSERT_EQ(nimb::gBS->FreePool(copy), EFI_SUCCESS);
-  ExpectNothingHeld();
-}
 
-TEST_F(DevicePathFirmwareTest, NoCopyOfANullOrDamagedPathOrWithoutMemory) {
+  // No copy of a null or damaged path, nor without memory.
   const Bytes damaged = Cat({Node(1, 1, 0), kEnd});
   const unsigned allocations = fw.AllocatePoolCalls();
   EXPECT_EQ(nimb::DuplicateDevicePath(nullptr), nullptr);
   EXPECT_EQ(nimb::DuplicateDevicePath(AsPath(damaged)), nullptr);
   EXPECT_EQ(fw.AllocatePoolCalls(), allocations);
-
   fw.FailAllocation(1);
   EXPECT_EQ(nimb::DuplicateDevicePath(AsPath(kEnd)), nullptr);
-  const char text[] = "abc";
   fw.FailAllocation(1);
-  EXPECT_EQ(nimb::AllocateCopyPool(sizeof(text), text), nullptr);
+  EXPECT_EQ(nimb::AllocateCopyPool(4, "abc"), nullptr);
   ExpectNothingHeld();
 }
 
