@@ -95,6 +95,67 @@ EFI_STATUS EFIAPI LockStdIn(EFI_CONSOLE_CONTROL_PROTOCOL *, CHAR16 *) {
   return EFI_UNSUPPORTED;
 }
 
+// The text console the loader sees: each call goes to the firmware's, with
+// the firmware's own `This`, except text in graphics mode.
+PlatformConsole *ConsoleOfText(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text) {
+  return reinterpret_cast<PlatformConsole *>(reinterpret_cast<UINT8 *>(text) - offsetof(PlatformConsole, screenText));
+}
+
+EFI_STATUS EFIAPI TextOutputString(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *This, const CHAR16 *String) {
+  PlatformConsole *console = ConsoleOfText(This);
+  if (console->mode == EfiConsoleControlScreenGraphics) {
+    if (console->hiddenText != nullptr && String != nullptr) {
+      console->hiddenText(String);
+    }
+    return EFI_SUCCESS;
+  }
+  return console->text->OutputString(console->text, String);
+}
+
+EFI_STATUS EFIAPI TextReset(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *This, BOOLEAN Extended) {
+  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text = ConsoleOfText(This)->text;
+  return text->Reset(text, Extended);
+}
+
+EFI_STATUS EFIAPI TextSetAttribute(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *This, UINTN Attribute) {
+  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text = ConsoleOfText(This)->text;
+  return text->SetAttribute(text, Attribute);
+}
+
+EFI_STATUS EFIAPI TextClearScreen(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *This) {
+  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text = ConsoleOfText(This)->text;
+  return text->ClearScreen(text);
+}
+
+EFI_STATUS EFIAPI TextEnableCursor(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *This, BOOLEAN Visible) {
+  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text = ConsoleOfText(This)->text;
+  return text->EnableCursor(text, Visible);
+}
+
+// The slots the loader never calls are refused rather than handed the wrong
+// `This`.
+EFI_STATUS EFIAPI TextUnsupported() {
+  return EFI_UNSUPPORTED;
+}
+
+void InitScreenText(PlatformConsole *console) {
+  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL &screen = console->screenText;
+  screen = {};
+  if (console->text == nullptr) {
+    return;
+  }
+  screen.Reset = TextReset;
+  screen.OutputString = TextOutputString;
+  screen.TestString = reinterpret_cast<void *>(TextUnsupported);
+  screen.QueryMode = reinterpret_cast<void *>(TextUnsupported);
+  screen.SetMode = reinterpret_cast<void *>(TextUnsupported);
+  screen.SetAttribute = TextSetAttribute;
+  screen.ClearScreen = TextClearScreen;
+  screen.SetCursorPosition = reinterpret_cast<void *>(TextUnsupported);
+  screen.EnableCursor = TextEnableCursor;
+  screen.Mode = console->text->Mode;
+}
+
 }  // namespace
 
 EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text,
@@ -106,7 +167,23 @@ EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_P
   console->text = text;
   console->graphics = graphics;
   console->onSetMode = nullptr;
+  console->hiddenText = nullptr;
+  InitScreenText(console);
   return Enter(console, mode);
+}
+
+void ConsoleOfferScreenText(PlatformConsole *console, bool on) {
+  if (console->text == nullptr) {
+    return;
+  }
+  gST->ConOut = on ? &console->screenText : console->text;
+  typedef EFI_STATUS(EFIAPI * Crc32Function)(const VOID *Data, UINTN DataSize, UINT32 *Crc32);
+  Crc32Function crc32 = reinterpret_cast<Crc32Function>(gBS->CalculateCrc32);
+  UINT32 crc = 0;
+  gST->Hdr.CRC32 = 0;
+  if (crc32 != nullptr && !EFI_ERROR(crc32(gST, gST->Hdr.HeaderSize, &crc))) {
+    gST->Hdr.CRC32 = crc;
+  }
 }
 
 EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode) {

@@ -297,6 +297,7 @@ void InstallProtocols(const PlatformConfig &config) {
     Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
   }
   gConsole.onSetMode = ReportSetMode;
+  gConsole.hiddenText = SerialWriteText;
   // Drawing for the loader's boot screen; a firmware without graphics output
   // boots without pictures.
   status = InstallGraphicsProtocols(gST);
@@ -353,7 +354,11 @@ EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
     image->LoadOptions = launch.options;
     image->LoadOptionsSize = launch.optionsSize;
   }
-  return gBS->StartImage(loader, nullptr, nullptr);
+  // While the loader runs, its text stays off a graphics screen.
+  ConsoleOfferScreenText(&gConsole, true);
+  status = gBS->StartImage(loader, nullptr, nullptr);
+  ConsoleOfferScreenText(&gConsole, false);
+  return status;
 }
 
 }  // namespace

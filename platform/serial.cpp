@@ -37,6 +37,12 @@ void SerialPrintv(const char *format, va_list arguments) {
   FormatText(SerialOutput, nullptr, format, arguments);
 }
 
+void SerialWriteText(const CHAR16 *text) {
+  for (; *text != 0; text++) {
+    SerialWriteByte(*text < 0x80 ? static_cast<UINT8>(*text) : static_cast<UINT8>('?'));
+  }
+}
+
 void SerialPrintf(const char *format, ...) {
   va_list arguments;
   va_start(arguments, format);

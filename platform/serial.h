@@ -13,6 +13,8 @@ namespace nimb::platform {
 // out as CR LF.
 void SerialPrintf(const char *format, ...);
 void SerialPrintv(const char *format, va_list arguments);
+// Writes UCS-2 text as it stands, a byte a unit; units beyond ASCII as '?'.
+void SerialWriteText(const CHAR16 *text);
 
 // Port I/O for the machine's own devices.
 inline void PortWriteByte(UINT16 port, UINT8 value) {

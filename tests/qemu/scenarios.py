@@ -331,10 +331,9 @@ _TABLE = [
         files=kernel_file(),
         exit="KernelPass",
         kernel=KernelExpect(bootargs={"videoDisplayMode": 1}),
-        # OVMF's text console still paints the loader's messages over the
-        # boot screen in graphics mode; alone=True once the platform keeps
-        # text off the screen in that mode.
-        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=False),
+        # The platform keeps the loader's text off a graphics screen: the
+        # logo stands alone on the grey.
+        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True),
     ),
     # A failed graphics boot ends on the failure picture, taken while the
     # platform holds the machine after the loader came back.
