@@ -568,6 +568,11 @@ EFI_STATUS EFIAPI FakeClearScreen(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *) {
   return gScreen->clearStatus;
 }
 
+EFI_STATUS EFIAPI FakeOutputString(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *, const CHAR16 *text) {
+  gScreen->calls.push_back("text " + std::string(text, text + std::char_traits<char16_t>::length(text)));
+  return EFI_SUCCESS;
+}
+
 EFI_STATUS EFIAPI FakeEnableCursor(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *, BOOLEAN visible) {
   gScreen->calls.push_back(visible ? "cursor on" : "cursor off");
   return EFI_SUCCESS;
@@ -592,6 +597,7 @@ struct Firmware {
   Firmware() {
     gScreen = &screen;
     text.ClearScreen = FakeClearScreen;
+    text.OutputString = FakeOutputString;
     text.EnableCursor = FakeEnableCursor;
     info.HorizontalResolution = 1280;
     info.VerticalResolution = 800;
@@ -639,6 +645,29 @@ TEST(PlatformConsole, SwitchesModesOnTheRealConsole) {
     EXPECT_EQ(uga, TRUE);
     EXPECT_EQ(locked, FALSE);
   }
+}
+
+std::vector<std::string> *gHidden;
+void Hide(const CHAR16 *text) {
+  gHidden->push_back(std::string(text, text + std::char_traits<char16_t>::length(text)));
+}
+
+TEST(PlatformConsole, TheLoadersTextStaysOffAGraphicsScreen) {
+  Firmware firmware;
+  PlatformConsole console;
+  std::vector<std::string> hidden;
+  gHidden = &hidden;
+  ASSERT_EQ(ConsoleControlInit(&console, &firmware.text, &firmware.graphics, kGraphics), EFI_SUCCESS);
+  console.hiddenText = Hide;
+  firmware.screen.calls.clear();
+  EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *out = &console.screenText;
+  EXPECT_EQ(out->OutputString(out, u"a"), EFI_SUCCESS);
+  ASSERT_EQ(console.protocol.SetMode(&console.protocol, kText), EFI_SUCCESS);
+  EXPECT_EQ(out->OutputString(out, u"b"), EFI_SUCCESS);
+  // The other slots reach the firmware with its own `This`.
+  EXPECT_EQ(out->EnableCursor(out, FALSE), EFI_SUCCESS);
+  EXPECT_EQ(hidden, std::vector<std::string>{"a"});
+  EXPECT_EQ(firmware.screen.calls, (std::vector<std::string>{"clear", "cursor on", "text b", "cursor off"}));
 }
 
 TEST(PlatformConsole, StartsCleanAndCopesWithoutGraphics) {
