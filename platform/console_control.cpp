@@ -98,7 +98,8 @@ EFI_STATUS EFIAPI LockStdIn(EFI_CONSOLE_CONTROL_PROTOCOL *, CHAR16 *) {
 // The text console the loader sees: each call goes to the firmware's, with
 // the firmware's own `This`, except text in graphics mode.
 PlatformConsole *ConsoleOfText(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text) {
-  return reinterpret_cast<PlatformConsole *>(reinterpret_cast<UINT8 *>(text) - offsetof(PlatformConsole, screenText));
+  return reinterpret_cast<PlatformConsole *>(reinterpret_cast<UINT8 *>(text) -
+                                             offsetof(PlatformConsole, screenText));
 }
 
 EFI_STATUS EFIAPI TextOutputString(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *This, const CHAR16 *String) {

@@ -47,11 +47,12 @@ static DeviceTreeNode *Chosen(const char *failure) {
 static void AddNetworkIdentity() {
   const UINT8 *mac = reinterpret_cast<const UINT8 *>(
       DevicePathFindNode(gBootDevicePath, kMaxDevicePathSize, MESSAGING_DEVICE_PATH, MSG_MAC_ADDR_DP));
-  if (mac == nullptr ||
-      DevicePathNodeLength(reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(mac)) <= kMacInterfaceTypeOffset) {
+  if (mac == nullptr || DevicePathNodeLength(reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(mac)) <=
+                            kMacInterfaceTypeOffset) {
     return;
   }
-  char *text = static_cast<char *>(TrackedAllocatePool(strlen(kRootMatchingHead) + strlen(kRootMatchingTail) + 80));
+  char *text =
+      static_cast<char *>(TrackedAllocatePool(strlen(kRootMatchingHead) + strlen(kRootMatchingTail) + 80));
   if (text == nullptr) {
     return;
   }
@@ -99,7 +100,8 @@ static void AddNetworkAnswers() {
   NIMB_NET_BOOT_INFO_PROTOCOL *info = nullptr;
   if (EFI_ERROR(gBS->HandleProtocol(gLoadedImage->DeviceHandle, &gNimbNetBootInfoProtocolGuid,
                                     reinterpret_cast<void **>(&info))) &&
-      EFI_ERROR(gBS->LocateProtocol(&gNimbNetBootInfoProtocolGuid, nullptr, reinterpret_cast<void **>(&info)))) {
+      EFI_ERROR(
+          gBS->LocateProtocol(&gNimbNetBootInfoProtocolGuid, nullptr, reinterpret_cast<void **>(&info)))) {
     return;
   }
   if (info == nullptr) {
@@ -194,7 +196,9 @@ static UINT32 ReadU32(const UINT8 *p) {
          static_cast<UINT32>(p[3]) << 24;
 }
 
-static UINT64 ReadU64(const UINT8 *p) { return ReadU32(p) | static_cast<UINT64>(ReadU32(p + 4)) << 32; }
+static UINT64 ReadU64(const UINT8 *p) {
+  return ReadU32(p) | static_cast<UINT64>(ReadU32(p + 4)) << 32;
+}
 
 // The hardware signature of the firmware's ACPI control structure, which
 // changes when the machine's hardware does.
@@ -277,8 +281,8 @@ static UINTN CountRuntimeRegions(UINTN *mapKey, MapShape *shape, UINTN *mapBytes
       }
     }
     bufferSize = capacity;
-    EFI_STATUS status = gBS->GetMemoryMap(&bufferSize, reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(buffer), mapKey,
-                                          &shape->descriptorSize, &shape->descriptorVersion);
+    EFI_STATUS status = gBS->GetMemoryMap(&bufferSize, reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(buffer),
+                                          mapKey, &shape->descriptorSize, &shape->descriptorVersion);
     if (!EFI_ERROR(status)) {
       break;
     }
@@ -289,7 +293,8 @@ static UINTN CountRuntimeRegions(UINTN *mapKey, MapShape *shape, UINTN *mapBytes
   CheckStride(*shape, "Can't get current memory map (4, %lx)\n");
   UINTN runtimeCount = 0;
   for (UINTN offset = 0; offset + shape->descriptorSize <= bufferSize; offset += shape->descriptorSize) {
-    const EFI_MEMORY_DESCRIPTOR *descriptor = reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(buffer + offset);
+    const EFI_MEMORY_DESCRIPTOR *descriptor =
+        reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(buffer + offset);
     if (descriptor->Type == EfiRuntimeServicesCode || descriptor->Type == EfiRuntimeServicesData) {
       runtimeCount++;
     }
@@ -360,7 +365,8 @@ EFI_STATUS FinishBootInfo(UINTN *mapKey, const char *options) {
   }
 
   // Boot services are gone: no console, no pool, no Fatal from here on.
-  MapRuntimeServices(mapStart, mapEnd, &mapEnd, shape.descriptorSize, shape.descriptorVersion, &nextVirtual, FALSE);
+  MapRuntimeServices(mapStart, mapEnd, &mapEnd, shape.descriptorSize, shape.descriptorVersion, &nextVirtual,
+                     FALSE);
   bootArgs->systemTable = static_cast<UINT32>(reinterpret_cast<UINT64>(gST));
   gBS = nullptr;
   gRT = nullptr;

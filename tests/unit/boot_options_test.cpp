@@ -4,11 +4,10 @@
 #include "config/boot_options.h"
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
 #include <algorithm>
 #include <filesystem>
-#include <fstream>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -16,10 +15,10 @@
 #include "hostfw/network.h"
 #include "loader_fixture.h"
 #include "support/devicepath.h"
+#include "temp_dir.h"
 
 namespace {
 
-namespace fs = std::filesystem;
 using namespace nimb;
 
 struct FakeKeyState {
@@ -72,9 +71,8 @@ class BootOptionsTest : public nimbtest::LoaderTest {
  protected:
   void SetUp() override {
     LoaderTest::SetUp();
-    char pattern[] = "/tmp/nimb-opts-XXXXXX";
-    dir_ = mkdtemp(pattern);
-    device_ = fw.AddDirectoryVolume(dir_);
+    dir_ = std::make_unique<nimbtest::TempDir>();
+    device_ = fw.AddDirectoryVolume(dir_->path());
     fw.SetBootDevice(device_);
     nimb::gLoadedImage = fw.LoadedImage();
     nimb::gBootDevicePath = fw.DevicePathOf(device_);
@@ -85,12 +83,9 @@ class BootOptionsTest : public nimbtest::LoaderTest {
   }
   void TearDown() override {
     LoaderTest::TearDown();
-    fs::remove_all(dir_);
+    dir_.reset();
   }
-  void Put(const std::string &name, const std::string &content) {
-    fs::create_directories(fs::path(dir_ + "/" + name).parent_path());
-    std::ofstream(dir_ + "/" + name) << content;
-  }
+  void Put(const std::string &name, const std::string &content) { dir_->File(name, content); }
   void Config(const std::string &entries) {
     Put("Library/Preferences/SystemConfiguration/com.quill.Boot.plist", Dict(entries));
   }
@@ -120,7 +115,7 @@ class BootOptionsTest : public nimbtest::LoaderTest {
     return text != nullptr ? std::u16string(text) : u"(null)";
   }
 
-  std::string dir_;
+  std::unique_ptr<nimbtest::TempDir> dir_;
   EFI_HANDLE device_ = nullptr;
   EFI_FILE *root_ = nullptr;
   FakeKeyState keys_ = {};
@@ -171,16 +166,14 @@ TEST_F(BootOptionsTest, OptionStrings) {
     nimb::gST = local.SystemTable();
     nimb::gBS = local.BootServices();
     nimb::gRT = local.RuntimeServices();
-    char pattern[] = "/tmp/nimb-opts-XXXXXX";
-    std::string dir = mkdtemp(pattern);
+    nimbtest::TempDir dir;
     if (row.kernelFlags != nullptr) {
-      fs::create_directories(dir + "/Library/Preferences/SystemConfiguration");
-      std::ofstream(dir + "/Library/Preferences/SystemConfiguration/com.quill.Boot.plist")
-          << Dict(std::string("<key>Kernel Flags</key><string>") + row.kernelFlags + "</string>");
+      dir.File("Library/Preferences/SystemConfiguration/com.quill.Boot.plist",
+               Dict(std::string("<key>Kernel Flags</key><string>") + row.kernelFlags + "</string>"));
     }
     if (row.bootArgs != nullptr)
       local.PutVariable(u"boot-args", gNimbVendorVariableGuid, 7, Bytes(row.bootArgs));
-    EFI_HANDLE device = local.AddDirectoryVolume(dir);
+    EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
     local.SetBootDevice(device);
     nimb::gLoadedImage = local.LoadedImage();
     nimb::gBootDevicePath = local.DevicePathOf(device);
@@ -199,7 +192,6 @@ TEST_F(BootOptionsTest, OptionStrings) {
     EXPECT_EQ(WithoutDots(local.ConOutText()), row.printed) << row.name;
     root->Close(root);
     TrackedFreeAll();
-    fs::remove_all(dir);
   }
   nimbtest::ResetLoaderState();
   Attach();

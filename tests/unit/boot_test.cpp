@@ -3,11 +3,9 @@
 #include "boot/boot.h"
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
 #include <cstring>
 #include <filesystem>
-#include <fstream>
 #include <functional>
 #include <string>
 #include <vector>
@@ -15,29 +13,11 @@
 #include "boot/gate.h"
 #include "boot/volume.h"
 #include "loader_fixture.h"
+#include "temp_dir.h"
 
 namespace {
 
-namespace fs = std::filesystem;
-
-// A directory that goes away with the test.
-class TempDir {
- public:
-  TempDir() {
-    char pattern[] = "/tmp/nimb-boot-XXXXXX";
-    path_ = mkdtemp(pattern);
-  }
-  ~TempDir() { fs::remove_all(path_); }
-  const std::string &path() const { return path_; }
-  void File(const std::string &name, const std::string &content) {
-    fs::create_directories(fs::path(path_ + "/" + name).parent_path());
-    std::ofstream(path_ + "/" + name) << content;
-  }
-  void Directory(const std::string &name) { fs::create_directories(path_ + "/" + name); }
-
- private:
-  std::string path_;
-};
+using nimbtest::TempDir;
 
 class BootTest : public nimbtest::LoaderTest {
  protected:
@@ -285,7 +265,9 @@ TEST_F(BootTest, AVerboseBootGoesToTextAndTheFailureRestoresTheScreen) {
     EFI_CONSOLE_CONTROL_SCREEN_MODE start;
     std::vector<EFI_CONSOLE_CONTROL_SCREEN_MODE> sets;
   } rows[] = {
-      {u"-v", EfiConsoleControlScreenGraphics, {EfiConsoleControlScreenText, EfiConsoleControlScreenGraphics}},
+      {u"-v",
+       EfiConsoleControlScreenGraphics,
+       {EfiConsoleControlScreenText, EfiConsoleControlScreenGraphics}},
       {u"-v", EfiConsoleControlScreenText, {}},
       {u"foo=1", EfiConsoleControlScreenGraphics, {}},
   };
@@ -300,7 +282,8 @@ TEST_F(BootTest, AVerboseBootGoesToTextAndTheFailureRestoresTheScreen) {
     EXPECT_EQ(result.status, EFI_ABORTED);
     std::vector<EFI_CONSOLE_CONTROL_SCREEN_MODE> sets;
     for (const hostfw::ConsoleModeCall &call : local.ConsoleModeCalls()) {
-      if (call.set) sets.push_back(call.mode);
+      if (call.set)
+        sets.push_back(call.mode);
     }
     EXPECT_EQ(sets, row.sets);
     EXPECT_EQ(local.ConsoleMode(), row.start);

@@ -3,19 +3,17 @@
 #include "load/bootfile.h"
 
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
 #include <filesystem>
-#include <fstream>
 #include <string>
 #include <vector>
 
 #include "hostfw/network.h"
 #include "loader_fixture.h"
+#include "temp_dir.h"
 
 namespace {
 
-namespace fs = std::filesystem;
 using nimb::BootFile;
 
 std::vector<uint8_t> Pattern(size_t size) {
@@ -29,9 +27,7 @@ class BootFileTest : public nimbtest::LoaderTest {
  protected:
   void SetUp() override {
     LoaderTest::SetUp();
-    char pattern[] = "/tmp/nimb-file-XXXXXX";
-    dir_ = mkdtemp(pattern);
-    EFI_HANDLE device = fw.AddDirectoryVolume(dir_);
+    EFI_HANDLE device = fw.AddDirectoryVolume(dir_.path());
     EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
     ASSERT_EQ(fw.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
                                                 reinterpret_cast<void **>(&fileSystem)),
@@ -41,12 +37,8 @@ class BootFileTest : public nimbtest::LoaderTest {
   void TearDown() override {
     root_->Close(root_);
     LoaderTest::TearDown();
-    fs::remove_all(dir_);
   }
-  void Put(const std::string &name, const std::vector<uint8_t> &bytes) {
-    std::ofstream(dir_ + "/" + name, std::ios::binary)
-        .write(reinterpret_cast<const char *>(bytes.data()), bytes.size());
-  }
+  void Put(const std::string &name, const std::vector<uint8_t> &bytes) { dir_.File(name, bytes); }
   size_t Dots() const {
     size_t dots = 0;
     for (const std::u16string &call : fw.ConOutCalls())
@@ -54,7 +46,7 @@ class BootFileTest : public nimbtest::LoaderTest {
     return dots;
   }
 
-  std::string dir_;
+  nimbtest::TempDir dir_;
   EFI_FILE *root_ = nullptr;
 };
 

@@ -1,34 +1,35 @@
 // The boot record and the first properties of the tree.
+#include "boot/bootinfo.h"
+
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
 #include <cstring>
 #include <filesystem>
 #include <functional>
-#include <fstream>
+#include <memory>
 #include <string>
 #include <vector>
 
-#include "boot/bootinfo.h"
 #include "devicetree/devicetree.h"
 #include "loader_fixture.h"
 #include "memory/kernel_region.h"
 #include "support/devicepath.h"
+#include "temp_dir.h"
 
 namespace {
 
-namespace fs = std::filesystem;
 using namespace nimb;
 
-std::string Dict(const std::string &entries) { return "<plist><dict>" + entries + "</dict></plist>"; }
+std::string Dict(const std::string &entries) {
+  return "<plist><dict>" + entries + "</dict></plist>";
+}
 
 class BootInfoTest : public nimbtest::LoaderTest {
  protected:
   void SetUp() override {
     LoaderTest::SetUp();
-    char pattern[] = "/tmp/nimb-info-XXXXXX";
-    dir_ = mkdtemp(pattern);
-    device_ = fw.AddDirectoryVolume(dir_);
+    dir_ = std::make_unique<nimbtest::TempDir>();
+    device_ = fw.AddDirectoryVolume(dir_->path());
     fw.SetBootDevice(device_);
     gLoadedImage = fw.LoadedImage();
     gBootDevicePath = fw.DevicePathOf(device_);
@@ -40,7 +41,7 @@ class BootInfoTest : public nimbtest::LoaderTest {
   }
   void TearDown() override {
     LoaderTest::TearDown();
-    fs::remove_all(dir_);
+    dir_.reset();
   }
   // Parses a configuration dictionary into gConfigDict.
   void Config(const std::string &entries) {
@@ -57,12 +58,14 @@ class BootInfoTest : public nimbtest::LoaderTest {
   static std::string Property(const char *path, const char *name, bool *present = nullptr) {
     DeviceTreeNode *node = DeviceTreeFindNode(path, 0);
     DeviceTreeProperty *property = node != nullptr ? DeviceTreeFindProperty(node, name) : nullptr;
-    if (present != nullptr) *present = property != nullptr;
-    if (property == nullptr) return "";
+    if (present != nullptr)
+      *present = property != nullptr;
+    if (property == nullptr)
+      return "";
     return std::string(static_cast<const char *>(property->value), property->length);
   }
 
-  std::string dir_;
+  std::unique_ptr<nimbtest::TempDir> dir_;
   std::string text_;
   std::string printed_;
   EFI_HANDLE device_ = nullptr;
@@ -117,7 +120,8 @@ TEST_F(BootInfoTest, RootIdentity) {
   for (const Row &row : rows) {
     TearDown();
     SetUp();
-    if (row.config != nullptr) Config(row.config);
+    if (row.config != nullptr)
+      Config(row.config);
     // A device with a path but no partition node and no disk behind it.
     EFI_HANDLE anonymous = fw.NewHandle();
     fw.SetDevicePath(anonymous, {1, 1, 6, 0, 0, 2, 0x7F, 0xFF, 4, 0});

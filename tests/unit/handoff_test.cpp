@@ -1,6 +1,8 @@
 // The final hand-off over the host firmware, end to end: the tree's last
 // properties, the flattened tree and the memory map in the kernel region,
 // the end of boot services and the runtime move.
+#include "boot/handoff.h"
+
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -11,7 +13,6 @@
 #include <vector>
 
 #include "boot/bootinfo.h"
-#include "boot/handoff.h"
 #include "devicetree/devicetree.h"
 #include "devicetree/platform.h"
 #include "efi/vendor.h"
@@ -31,7 +32,8 @@ struct FlatTree {
 };
 
 bool ReadNode(const uint8_t *data, size_t size, size_t *at, const std::string &parent, FlatTree *tree) {
-  if (*at + 8 > size) return false;
+  if (*at + 8 > size)
+    return false;
   uint32_t properties, children;
   memcpy(&properties, data + *at, 4);
   memcpy(&children, data + *at + 4, 4);
@@ -39,22 +41,27 @@ bool ReadNode(const uint8_t *data, size_t size, size_t *at, const std::string &p
   std::multimap<std::string, std::string> props;
   std::string name;
   for (uint32_t i = 0; i < properties; i++) {
-    if (*at + 36 > size) return false;
-    std::string key(reinterpret_cast<const char *>(data + *at), strnlen(reinterpret_cast<const char *>(data + *at), 32));
+    if (*at + 36 > size)
+      return false;
+    std::string key(reinterpret_cast<const char *>(data + *at),
+                    strnlen(reinterpret_cast<const char *>(data + *at), 32));
     uint32_t length;
     memcpy(&length, data + *at + 32, 4);
     *at += 36;
-    if (*at + length > size) return false;
+    if (*at + length > size)
+      return false;
     std::string value(reinterpret_cast<const char *>(data + *at), length);
     *at += (length + 3) & ~3u;
-    if (key == "name") name = value.substr(0, value.size() - 1);
+    if (key == "name")
+      name = value.substr(0, value.size() - 1);
     props.emplace(key, value);
   }
   std::string path = parent.empty() ? "/" : (parent == "/" ? "/" + name : parent + "/" + name);
   tree->nodes[path] = props;
   tree->order.push_back(path);
   for (uint32_t i = 0; i < children; i++) {
-    if (!ReadNode(data, size, at, path, tree)) return false;
+    if (!ReadNode(data, size, at, path, tree))
+      return false;
   }
   return true;
 }
@@ -100,13 +107,13 @@ class HandOffTest : public nimbtest::LoaderTest {
   void Prepare(const char *options = "-v a=1") {
     options_ = options;
     ASSERT_EQ(fw.Call([&] {
-                InitPlatformDescription();
-                UINT64 address = 0x200000, size = 0x3000;
-                ASSERT_NE(AllocateKernelPages(&address, &size), 0u);
-                gKernelRegionBase = 0x200000;
-                gKernelRegionTop = 0x203000;
-                InitBootInfo(gLoadedImage, "rd");
-              }).end,
+                  InitPlatformDescription();
+                  UINT64 address = 0x200000, size = 0x3000;
+                  ASSERT_NE(AllocateKernelPages(&address, &size), 0u);
+                  gKernelRegionBase = 0x200000;
+                  gKernelRegionTop = 0x203000;
+                  InitBootInfo(gLoadedImage, "rd");
+                }).end,
               hostfw::RunEnd::Returned);
   }
   hostfw::RunResult Finish() {
@@ -174,12 +181,13 @@ TEST_F(HandOffTest, AnOrdinaryBootEndsWithTheKernelsRecordComplete) {
         path == "/efi/configuration-table" || path == "/efi/platform")
       top.push_back(path);
   }
-  EXPECT_EQ(top, (std::vector<std::string>{"/chosen", "/efi", "/efi/runtime-services", "/efi/configuration-table",
-                                           "/efi/platform"}));
+  EXPECT_EQ(top, (std::vector<std::string>{"/chosen", "/efi", "/efi/runtime-services",
+                                           "/efi/configuration-table", "/efi/platform"}));
 }
 
 // Each case ends boot services, so each gets a firmware of its own.
-class CommandLineTest : public HandOffTest, public ::testing::WithParamInterface<std::pair<size_t, size_t>> {};
+class CommandLineTest : public HandOffTest,
+                        public ::testing::WithParamInterface<std::pair<size_t, size_t>> {};
 
 TEST_P(CommandLineTest, IsCutTo1023Bytes) {
   auto [length, kept] = GetParam();
@@ -194,7 +202,8 @@ INSTANTIATE_TEST_SUITE_P(Lengths, CommandLineTest,
                          ::testing::Values(std::make_pair(1023, 1023), std::make_pair(1024, 1023),
                                            std::make_pair(3000, 1023), std::make_pair(0, 0)));
 
-class NetworkIdentityTest : public HandOffTest, public ::testing::WithParamInterface<std::pair<int, size_t>> {};
+class NetworkIdentityTest : public HandOffTest,
+                            public ::testing::WithParamInterface<std::pair<int, size_t>> {};
 
 TEST_P(NetworkIdentityTest, DigitsByInterfaceType) {
   auto [interfaceType, digits] = GetParam();
@@ -214,8 +223,8 @@ TEST_P(NetworkIdentityTest, DigitsByInterfaceType) {
 }
 
 INSTANTIATE_TEST_SUITE_P(Types, NetworkIdentityTest,
-                         ::testing::Values(std::make_pair(0, 12), std::make_pair(1, 12), std::make_pair(2, 64),
-                                           std::make_pair(6, 64)));
+                         ::testing::Values(std::make_pair(0, 12), std::make_pair(1, 12),
+                                           std::make_pair(2, 64), std::make_pair(6, 64)));
 
 TEST_F(HandOffTest, ALoadFileDeviceWithoutAMacNodeIsNoNetworkIdentity) {
   hostfw::NetworkDevice net(fw, /*macNode=*/false);
@@ -230,7 +239,8 @@ TEST_F(HandOffTest, ALoadFileDeviceWithoutAMacNodeIsNoNetworkIdentity) {
 
 TEST_F(HandOffTest, DevicePropertiesLargerThanTheFirstBuffer) {
   FakeDeviceProperties properties = {{{}, GetDeviceProperties}, std::vector<uint8_t>(6000, 0x5C), 0};
-  for (size_t i = 0; i < properties.blob.size(); i++) properties.blob[i] = static_cast<uint8_t>(i);
+  for (size_t i = 0; i < properties.blob.size(); i++)
+    properties.blob[i] = static_cast<uint8_t>(i);
   fw.InstallProtocol(fw.NewHandle(), gNimbDevicePropertiesProtocolGuid, &properties);
   Prepare();
   ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
@@ -258,9 +268,11 @@ TEST_F(HandOffTest, BothAcpiTablesAndTheMachineSignature) {
   FlatTree tree = ReadTree(bootArgs);
   std::vector<std::string> aliases;
   for (const auto &[path, properties] : tree.nodes) {
-    if (path.rfind("/efi/configuration-table/", 0) != 0) continue;
+    if (path.rfind("/efi/configuration-table/", 0) != 0)
+      continue;
     auto alias = properties.find("alias");
-    if (alias == properties.end()) continue;
+    if (alias == properties.end())
+      continue;
     aliases.push_back(alias->second);
     // The child is named by its GUID, and "table" is the firmware's pointer.
     uint64_t table = 0;
@@ -281,7 +293,8 @@ TEST_P(MapReadTest, FourFailingReadsOfTheFinalMapEndTheRun) {
   Prepare();
   // The first look is a probe and a read; the final loop probes and reads
   // again each time: its reads are the 4th, 6th, 8th and 10th calls.
-  for (unsigned i = 0; i < failures; i++) fw.FailCall("GetMemoryMap", 4 + 2 * i, EFI_DEVICE_ERROR);
+  for (unsigned i = 0; i < failures; i++)
+    fw.FailCall("GetMemoryMap", 4 + 2 * i, EFI_DEVICE_ERROR);
   size_t before = fw.ConOutText().size();
   hostfw::RunResult result = Finish();
   if (failures < 4) {

@@ -1,7 +1,6 @@
 // Builders of kernel image bytes for the tests, written out field by field
 // so that they do not share the faults of the code under test: kernel
-// objects with any commands (well-formed or not), fat files in either byte
-// order, and 32-bit ELF executables.
+// objects with any commands, fat files in either order, 32-bit ELF files.
 #pragma once
 
 #include <cstdint>
@@ -13,25 +12,21 @@ namespace nimbtest {
 
 using Bytes = std::vector<uint8_t>;
 
+// `value` as `width` bytes at `at`, growing `bytes` to hold them.
+inline void Put(Bytes &bytes, size_t at, uint32_t value, size_t width, bool bigEndian = false) {
+  if (bytes.size() < at + width)
+    bytes.resize(at + width);
+  for (size_t i = 0; i < width; i++)
+    bytes[at + i] = static_cast<uint8_t>(value >> (8 * (bigEndian ? width - 1 - i : i)));
+}
 inline void PutLe32(Bytes &bytes, size_t at, uint32_t value) {
-  if (bytes.size() < at + 4)
-    bytes.resize(at + 4);
-  for (int i = 0; i < 4; i++)
-    bytes[at + i] = static_cast<uint8_t>(value >> (8 * i));
+  Put(bytes, at, value, 4);
 }
-
 inline void PutBe32(Bytes &bytes, size_t at, uint32_t value) {
-  if (bytes.size() < at + 4)
-    bytes.resize(at + 4);
-  for (int i = 0; i < 4; i++)
-    bytes[at + i] = static_cast<uint8_t>(value >> (24 - 8 * i));
+  Put(bytes, at, value, 4, true);
 }
-
 inline void PutLe16(Bytes &bytes, size_t at, uint32_t value) {
-  if (bytes.size() < at + 2)
-    bytes.resize(at + 2);
-  bytes[at] = static_cast<uint8_t>(value);
-  bytes[at + 1] = static_cast<uint8_t>(value >> 8);
+  Put(bytes, at, value, 2);
 }
 
 inline uint32_t GetLe32(const Bytes &bytes, size_t at) {
@@ -47,14 +42,14 @@ inline Bytes Pattern(size_t size, unsigned seed = 1) {
 
 // --- kernel objects -------------------------------------------------------------
 
-// A load command of `length` bytes (at least 8) whose words after the
-// opening are `words`, the rest zero.
+// A load command that states `length` and is that long (at least 8 bytes):
+// type, length, then `words`, the rest zero.
 inline Bytes Command(uint32_t type, uint32_t length, const std::vector<uint32_t> &words = {}) {
-  Bytes command(length < 8 ? 8 : length);
+  Bytes command(8 + 4 * words.size());
   PutLe32(command, 0, type);
-  PutLe32(command, 4, length);
   for (size_t i = 0; i < words.size(); i++)
     PutLe32(command, 8 + 4 * i, words[i]);
+  PutLe32(command, 4, length);
   command.resize(length < 8 ? 8 : length);
   return command;
 }
@@ -62,22 +57,19 @@ inline Bytes Command(uint32_t type, uint32_t length, const std::vector<uint32_t>
 // A segment command: name (16 bytes of zero), then its four fields.
 inline Bytes Segment(uint32_t address, uint32_t memorySize, uint32_t fileOffset, uint32_t fileSize,
                      uint32_t length = 56) {
-  Bytes command = Command(1, 56, {0, 0, 0, 0, address, memorySize, fileOffset, fileSize, 7, 7});
-  PutLe32(command, 4, length);
-  command.resize(length < 8 ? 8 : length);
-  return command;
+  return Command(1, length, {0, 0, 0, 0, address, memorySize, fileOffset, fileSize, 7, 7});
 }
 
-// A thread command with the entry at byte 56 of its 80.
+// A thread command with the entry at byte 56 of its 80, between register
+// words that must not be taken for it.
 inline Bytes Thread(uint32_t entry, uint32_t length = 80) {
-  Bytes command = Command(5, 80, {1, 16});
-  PutLe32(command, 56, entry);
-  // Registers around the entry word, which must not be taken for it.
-  PutLe32(command, 52, 0x11111111);
-  PutLe32(command, 60, 0x22222222);
-  PutLe32(command, 4, length);
-  command.resize(length < 8 ? 8 : length);
-  return command;
+  std::vector<uint32_t> words(18, 0);
+  words[0] = 1;
+  words[1] = 16;
+  words[11] = 0x11111111;
+  words[12] = entry;
+  words[13] = 0x22222222;
+  return Command(5, length, words);
 }
 
 // Segment data lies at this offset of the object, behind the commands.
@@ -98,13 +90,12 @@ struct Object {
       out.insert(out.end(), command.begin(), command.end());
       size += command.size();
     }
-    PutLe32(out, 0, magic);
-    PutLe32(out, 4, 7);
-    PutLe32(out, 8, 3);
-    PutLe32(out, 12, 2);
-    PutLe32(out, 16, static_cast<uint32_t>(commandCount >= 0 ? commandCount : commands.size()));
-    PutLe32(out, 20, static_cast<uint32_t>(commandsSize >= 0 ? commandsSize : size));
-    PutLe32(out, 24, 0);
+    const auto count = static_cast<uint32_t>(commandCount >= 0 ? commandCount : commands.size());
+    const auto length = static_cast<uint32_t>(commandsSize >= 0 ? commandsSize : size);
+    // Magic, processor, subtype, file type, count, size, flags.
+    const uint32_t header[] = {magic, 7, 3, 2, count, length, 0};
+    for (size_t i = 0; i < 7; i++)
+      PutLe32(out, 4 * i, header[i]);
     if (!data.empty()) {
       out.resize(kObjectDataStart);
       out.insert(out.end(), data.begin(), data.end());
@@ -139,12 +130,10 @@ inline Bytes Fat(bool bigEndian, const std::vector<FatRecord> &records,
   put(out, 0, 0xCAFEBABE);
   put(out, 4, static_cast<uint32_t>(sliceCount >= 0 ? sliceCount : records.size()));
   for (size_t i = 0; i < records.size(); i++) {
-    size_t at = 8 + 20 * i;
-    put(out, at, records[i].cpuType);
-    put(out, at + 4, records[i].cpuSubtype);
-    put(out, at + 8, records[i].offset);
-    put(out, at + 12, records[i].size);
-    put(out, at + 16, records[i].alignment);
+    const FatRecord &r = records[i];
+    const uint32_t fields[] = {r.cpuType, r.cpuSubtype, r.offset, r.size, r.alignment};
+    for (size_t field = 0; field < 5; field++)
+      put(out, 8 + 20 * i + 4 * field, fields[field]);
   }
   for (const FatContent &content : contents) {
     if (out.size() < content.offset + content.bytes.size())
@@ -184,15 +173,12 @@ inline Bytes Elf(uint32_t entry, const std::vector<ElfSegment> &segments) {
     size_t offset = (out.size() + 0xFFF) & ~size_t{0xFFF};
     out.resize(offset);
     out.insert(out.end(), segment.bytes.begin(), segment.bytes.end());
-    size_t at = 52 + 32 * i;
-    PutLe32(out, at, segment.type);
-    PutLe32(out, at + 4, static_cast<uint32_t>(offset));
-    PutLe32(out, at + 8, segment.vaddr);
-    PutLe32(out, at + 12, segment.paddr);
-    PutLe32(out, at + 16, static_cast<uint32_t>(segment.bytes.size()));
-    PutLe32(out, at + 20, segment.memorySize);
-    PutLe32(out, at + 24, 6);
-    PutLe32(out, at + 28, 0x1000);
+    const auto fileOffset = static_cast<uint32_t>(offset),
+               fileSize = static_cast<uint32_t>(segment.bytes.size());
+    const uint32_t fields[] = {segment.type,       fileOffset, segment.vaddr, segment.paddr, fileSize,
+                               segment.memorySize, 6,          0x1000};
+    for (size_t field = 0; field < 8; field++)
+      PutLe32(out, 52 + 32 * i + 4 * field, fields[field]);
   }
   return out;
 }
