@@ -428,14 +428,4 @@ TEST_F(BootScreenFirmwareScreen, BltFillsAndCopiesInsideTheScreenOnly) {
   EXPECT_EQ(Color(799, 599), rgb(buffer[0]));
 }
 
-TEST_F(BootScreenFirmwareScreen, SixteenBitScreenKeepsFiveBitsEach) {
-  fw.AddScreen({64, 32, 16, 60, 256});
-  ASSERT_EQ(nimb::EnterGraphics(), EFI_SUCCESS);
-  EXPECT_EQ(nimb::gScreenDepth, 16u);
-  EFI_UGA_PIXEL pixel = {0xFF, 0x80, 0x08, 0};
-  ASSERT_EQ(nimb::gUgaDraw->Blt(nimb::gUgaDraw, &pixel, EfiUgaVideoFill, 0, 0, 63, 31, 1, 1, 0), EFI_SUCCESS);
-  EXPECT_EQ(fw.ScreenPixel(63, 31), UINT32(1 << 10 | 16 << 5 | 31));
-  EXPECT_EQ(fw.ScreenFacts().size, 256u * 32);
-}
-
 }  // namespace

@@ -60,7 +60,7 @@ TEST(DevicePathTest, WalksVisitEveryNodeAndStopAtTheEndOrAtADamagedNode) {
       {"bound ends exactly behind the end node", Cat({Node(1, 1, 6), kEnd, Bytes(8, 0)}), 10, {0}, 10},
       {"node of length 0", Cat({Node(1, 1, 6), Node(1, 1, 0), kEnd}), kWholeBuffer, {0}, 0},
       {"node of length 3", Cat({Node(1, 1, 3), Bytes(1, 0), kEnd}), kWholeBuffer, {}, 0},
-      {"first node runs past the buffer", Cat({Node(1, 1, 8)}), 6, {}, 0},
+      {"first node one byte past the buffer", Cat({Node(1, 1, 8)}), 7, {}, 0},
       {"node runs past the buffer", Cat({Node(1, 1, 4), Node(4, 4, 0x100)}), 40, {0}, 0},
       {"no end node", Node(1, 1, 6), kWholeBuffer, {0}, 0},
       {"end node cut short", Cat({Node(1, 1, 4), Bytes{0x7F, 0xFF}}), kWholeBuffer, {0}, 0},

@@ -5,6 +5,7 @@
 
 #include <functional>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "kernel_images.h"
@@ -88,12 +89,11 @@ TEST(KobjElfTest, TakesLoadableSegmentsAtTheirPhysicalAddresses) {
   ASSERT_EQ(kobj::ReadElf(elf, &kernel), "");
   EXPECT_EQ(kernel.entry, 0xC0100004u);
   ASSERT_EQ(kernel.segments.size(), 2u);
-  EXPECT_EQ(kernel.segments[0].address, 0x00100000u);
-  EXPECT_EQ(kernel.segments[0].memorySize, 0x30u);
-  EXPECT_EQ(kernel.segments[0].bytes, Pattern(0x30));
-  EXPECT_EQ(kernel.segments[1].address, 0x00300000u);
-  EXPECT_EQ(kernel.segments[1].memorySize, 0x2000u);
-  EXPECT_TRUE(kernel.segments[1].bytes.empty());
+  const auto &[first, second] = std::tie(kernel.segments[0], kernel.segments[1]);
+  EXPECT_EQ(std::make_tuple(first.address, first.memorySize, first.bytes),
+            std::make_tuple(0x100000, 0x30, Pattern(0x30)));
+  EXPECT_EQ(std::make_tuple(second.address, second.memorySize, second.bytes),
+            std::make_tuple(0x300000, 0x2000, Bytes()));
 }
 
 TEST(KobjWriterTest, ObjectRecords) {
@@ -128,14 +128,11 @@ TEST(KobjWriterTest, ObjectRecords) {
       {"thread length", thread + 4, 80},
       {"thread flavor", thread + 8, 1},
       {"register words", thread + 12, 16},
-      {"entry", thread + 56, 0xC0100010},
   };
   for (const Field &field : fields)
     EXPECT_EQ(GetLe32(out, field.at), field.value) << field.name;
-  for (size_t at = thread + 16; at < thread + 80; at += 4) {
-    if (at != thread + 56)
-      EXPECT_EQ(GetLe32(out, at), 0u) << "register word at " << at;
-  }
+  for (size_t at = thread + 16; at < thread + 80; at += 4)
+    EXPECT_EQ(GetLe32(out, at), at == thread + 56 ? 0xC0100010 : 0u) << "register word at " << at;
   size_t first = GetLe32(out, 28 + 32);
   size_t second = GetLe32(out, 68 + 32);
   EXPECT_GE(first, 28u + 160u);

@@ -32,9 +32,17 @@ Bytes Ucs2(const std::u16string &text) {
   return bytes;
 }
 
+// `value` as `width` little-endian bytes.
+Bytes Address(UINT64 value, size_t width) {
+  Bytes b;
+  for (size_t i = 0; i < width; i++)
+    b.push_back(uint8_t(value >> (8 * i)));
+  return b;
+}
+
 void Put32(Bytes &bytes, uint32_t value) {
-  for (int i = 0; i < 4; i++)
-    bytes.push_back(uint8_t(value >> (8 * i)));
+  const Bytes b = Address(value, 4);
+  bytes.insert(bytes.end(), b.begin(), b.end());
 }
 
 // The properties of /efi/platform in their order, "name" left out. With
@@ -57,39 +65,48 @@ Properties PlatformProperties(bool unnamed = false) {
   return found;
 }
 
-// Points the loader at `firmware`, from a fresh start.
-void Use(hostfw::Firmware &firmware) {
-  nimbtest::ResetLoaderState();
-  nimb::gST = firmware.SystemTable();
-  nimb::gBS = firmware.BootServices();
-  nimb::gRT = firmware.RuntimeServices();
-  nimb::gImageHandle = firmware.ImageHandle();
-}
-
 struct Record {
   const EFI_GUID *producer;
   std::u16string name;
   Bytes value;
 };
+const EFI_GUID *const kVendor = &gNimbPlatformProducerGuid;
 
-class PlatformTest : public nimbtest::LoaderTest {
- protected:
+// A firmware of the row's own, with the loader pointed at it from a fresh
+// start; what the loader took is given back when it goes.
+struct Local {
+  Local() {
+    nimbtest::ResetLoaderState();
+    nimb::gST = fw.SystemTable();
+    nimb::gBS = fw.BootServices();
+    nimb::gRT = fw.RuntimeServices();
+    nimb::gImageHandle = fw.ImageHandle();
+  }
+  ~Local() {
+    nimb::TrackedFreeAll();
+    nimbtest::ResetLoaderState();
+  }
   // Logs the records, then one more that the walk never looks at (it comes
   // with the count 0).
-  void LogRecords(hostfw::Firmware &firmware, const std::vector<Record> &records) {
+  void Log(const std::vector<Record> &records) {
     for (const Record &r : records)
-      firmware.AddDataHubRecord(*r.producer, r.name, r.value);
-    firmware.AddDataHubRecord(gNimbPlatformProducerGuid, u"last", {1});
+      fw.AddDataHubRecord(*r.producer, r.name, r.value);
+    fw.AddDataHubRecord(*kVendor, u"last", {1});
   }
-  EFI_STATUS Init() {
-    EFI_STATUS status = EFI_ABORTED;
-    EXPECT_EQ(fw.Call([&] { status = nimb::InitPlatformDescription(); }).end, hostfw::RunEnd::Returned);
-    return status;
+  // InitPlatformDescription, which must return success, then the model name.
+  std::string Init() {
+    std::string model;
+    EXPECT_EQ(fw.Call([&] {
+                  EXPECT_EQ(nimb::InitPlatformDescription(), EFI_SUCCESS);
+                  model = nimb::GetModelName();
+                }).end,
+              hostfw::RunEnd::Returned);
+    return model;
   }
+  hostfw::Firmware fw;
 };
 
-TEST_F(PlatformTest, VendorRecordsBecomePlatformPropertiesInOrder) {
-  const EFI_GUID *vendor = &gNimbPlatformProducerGuid;
+TEST(PlatformTest, VendorRecordsBecomePlatformPropertiesInOrder) {
   const EFI_GUID *other = &kOtherProducer;
   struct Row {
     const char *name;
@@ -98,31 +115,24 @@ TEST_F(PlatformTest, VendorRecordsBecomePlatformPropertiesInOrder) {
   };
   const std::vector<Row> rows = {
       {"no record but the last", {}, {}},
-      {"one vendor record", {{vendor, u"Model", Ucs2(u"Box1,1")}}, {{"Model", Ucs2(u"Box1,1")}}},
       {"other producers skipped",
-       {{other, u"A", {1}}, {vendor, u"B", {2, 3}}, {other, u"B", {4}}, {vendor, u"C", {5}}},
+       {{other, u"A", {1}}, {kVendor, u"B", {2, 3}}, {other, u"B", {4}}, {kVendor, u"C", {5}}},
        {{"B", {2, 3}}, {"C", {5}}}},
       {"names become UTF-8, values stay raw",
-       {{vendor, u"caf\u00e9\u4e2d", {0xFF, 0x00, 0x7F}}, {vendor, u"t", Ucs2(u"x\0")}},
+       {{kVendor, u"caf\u00e9\u4e2d", {0xFF, 0x00, 0x7F}}, {kVendor, u"t", Ucs2(u"x\0")}},
        {{"caf\xC3\xA9\xE4\xB8\xAD", {0xFF, 0x00, 0x7F}}, {"t", Ucs2(u"x\0")}}},
-      {"same name twice", {{vendor, u"n", {1}}, {vendor, u"n", {2}}}, {{"n", {1}}, {"n", {2}}}},
+      {"same name twice", {{kVendor, u"n", {1}}, {kVendor, u"n", {2}}}, {{"n", {1}}, {"n", {2}}}},
   };
   for (const Row &row : rows) {
-    hostfw::Firmware local;
-    Use(local);
-    LogRecords(local, row.records);
-    EFI_STATUS status = EFI_ABORTED;
-    ASSERT_EQ(local.Call([&] { status = nimb::InitPlatformDescription(); }).end, hostfw::RunEnd::Returned);
-    EXPECT_EQ(status, EFI_SUCCESS) << row.name;
+    Local local;
+    local.Log(row.records);
+    local.Init();
     EXPECT_EQ(PlatformProperties(), row.expected) << row.name;
-    EXPECT_EQ(local.CallCount("GetNextDataRecord"), row.records.size() + 1) << row.name;
-    nimb::TrackedFreeAll();
+    EXPECT_EQ(local.fw.CallCount("GetNextDataRecord"), row.records.size() + 1) << row.name;
   }
-  nimbtest::ResetLoaderState();
-  Attach();
 }
 
-TEST_F(PlatformTest, AWalkThatCannotStartOrGoOnKeepsWhatItHas) {
+TEST(PlatformTest, AWalkThatCannotStartOrGoOnKeepsWhatItHas) {
   struct Row {
     const char *name;
     bool hub;
@@ -138,145 +148,112 @@ TEST_F(PlatformTest, AWalkThatCannotStartOrGoOnKeepsWhatItHas) {
       {"whole walk", true, nullptr, 0, nullptr, {{"a", {1}}, {"b", {2}}}},
   };
   for (const Row &row : rows) {
-    hostfw::Firmware local;
-    Use(local);
+    Local local;
     if (row.hub)
-      LogRecords(local, {{&gNimbPlatformProducerGuid, u"a", {1}}, {&gNimbPlatformProducerGuid, u"b", {2}}});
+      local.Log({{kVendor, u"a", {1}}, {kVendor, u"b", {2}}});
     if (row.failing != nullptr)
-      local.FailCall(row.failing, row.nth, EFI_DEVICE_ERROR, row.protocol);
-    EFI_STATUS status = EFI_ABORTED;
-    ASSERT_EQ(local.Call([&] { status = nimb::InitPlatformDescription(); }).end, hostfw::RunEnd::Returned);
-    EXPECT_EQ(status, EFI_SUCCESS) << row.name;
+      local.fw.FailCall(row.failing, row.nth, EFI_DEVICE_ERROR, row.protocol);
+    local.Init();
     EXPECT_EQ(PlatformProperties(), row.expected) << row.name;
-    EXPECT_NE(nimb::DeviceTreeFindNode("/", 0), nullptr) << row.name;
-    nimb::TrackedFreeAll();
   }
-  nimbtest::ResetLoaderState();
-  Attach();
 }
 
 // Whichever allocation fails, the walk goes on and loses at most the record
 // it was at; only a tree that cannot start at all is fatal, and that comes
 // before any record is read.
-TEST_F(PlatformTest, AnAllocationFailureLosesAtMostOneRecord) {
+TEST(PlatformTest, AnAllocationFailureLosesAtMostOneRecord) {
   const Properties all = {{"a", {1}}, {"b", {2}}, {"c", {3}}};
   bool started = false;
   unsigned lost = 0;
   for (unsigned nth = 1; nth <= 16; nth++) {
-    hostfw::Firmware local;
-    Use(local);
-    LogRecords(local, {{&gNimbPlatformProducerGuid, u"a", {1}},
-                       {&gNimbPlatformProducerGuid, u"b", {2}},
-                       {&gNimbPlatformProducerGuid, u"c", {3}}});
-    local.FailAllocation(nth);
-    hostfw::RunResult result = local.Call([] { nimb::InitPlatformDescription(); });
+    Local local;
+    local.Log({{kVendor, u"a", {1}}, {kVendor, u"b", {2}}, {kVendor, u"c", {3}}});
+    local.fw.FailAllocation(nth);
+    hostfw::RunResult result = local.fw.Call([] { nimb::InitPlatformDescription(); });
     if (result.end == hostfw::RunEnd::Exited) {
       EXPECT_FALSE(started) << nth;
       EXPECT_EQ(result.status, EFI_ABORTED) << nth;
       // The tree's first block, or the memory tracking's own.
-      EXPECT_TRUE(local.ConOutText() == "Couldn't create root node" ||
-                  local.ConOutText() == "Can't allocate memory tag")
-          << nth << local.ConOutText();
-      EXPECT_EQ(local.CallCount("GetNextDataRecord"), 0u) << nth;
+      const std::string text = local.fw.ConOutText();
+      EXPECT_TRUE(text == "Couldn't create root node" || text == "Can't allocate memory tag") << nth << text;
+      EXPECT_EQ(local.fw.CallCount("GetNextDataRecord"), 0u) << nth;
       continue;
     }
     ASSERT_EQ(result.end, hostfw::RunEnd::Returned) << nth;
     started = true;
     Properties found = PlatformProperties(true);
     size_t matched = 0;
-    for (const auto &property : all) {
-      if (matched < found.size() && found[matched] == property)
-        matched++;
-    }
+    for (const auto &property : all)
+      matched += matched < found.size() && found[matched] == property;
     EXPECT_EQ(matched, found.size()) << nth << ": not a part of the records, in order";
     EXPECT_GE(found.size(), all.size() - 1) << nth;
     lost += found.size() < all.size();
-    nimb::TrackedFreeAll();
   }
   EXPECT_TRUE(started);
   EXPECT_GE(lost, 3u) << "each record's allocations were reached";
-  nimbtest::ResetLoaderState();
-  Attach();
 }
 
 // --- the model name -------------------------------------------------------------
 
-TEST_F(PlatformTest, ModelNameFromRecordOrDsdtOrNeither) {
-  std::u16string wide40(40, u'\u4e2d');
-  std::string cut;
+TEST(PlatformTest, ModelNameFromRecordOrDsdtOrNeither) {
+  std::string cut;  // 21 whole characters of three bytes fit in 64
   for (int i = 0; i < 21; i++)
     cut += "\xE4\xB8\xAD";
-  struct Row {
-    const char *name;
-    bool model;
-    Bytes value;  // of the "Model" record
-    bool acpi;
-    hostfw::AcpiOptions options;
-    std::string expected;
-  };
-  auto acpi = [](std::string id, UINT32 revision, UINT8 facpRevision = 4) {
+  auto acpi = [](std::string id, UINT32 revision, UINT8 facpRevision, bool dsdt32, bool dsdt64) {
     hostfw::AcpiOptions o;
     o.oemTableId = std::move(id);
     o.oemRevision = revision;
     o.facpRevision = facpRevision;
+    o.facpLength = facpRevision < 3 ? 244 : 0;
+    o.dsdt32 = dsdt32;
+    o.dsdt64 = dsdt64;
     return o;
   };
-  hostfw::AcpiOptions only64 = acpi("ABCD", 0x00010002, 4);
-  only64.dsdt32 = false;
-  hostfw::AcpiOptions only32 = only64;
-  only32.dsdt32 = true;
-  only32.dsdt64 = false;
-  hostfw::AcpiOptions old64 = acpi("ABCD", 0x00010002, 2);
-  old64.facpLength = 244;
-  old64.dsdt32 = false;
-  hostfw::AcpiOptions old32 = old64;
-  old32.dsdt32 = true;
-  old32.dsdt64 = false;
+  const hostfw::AcpiOptions one = acpi("ABCD", 1, 4, true, true),
+                            both = acpi("ABCD", 0x00010002, 4, true, true),
+                            eight = acpi("ABCDEFGH", 0xFFFF0010, 4, true, true),
+                            nuls = acpi(std::string("XY\0\0\0\0\0\0", 8), 7, 4, true, true),
+                            new64 = acpi("ABCD", 0x00010002, 4, false, true),
+                            new32 = acpi("ABCD", 0x00010002, 4, true, false),
+                            old64 = acpi("ABCD", 0x00010002, 2, false, true),
+                            old32 = acpi("ABCD", 0x00010002, 2, true, false);
+  struct Row {
+    const char *name;
+    Bytes model;  // the "Model" record's value; empty: no record
+    const hostfw::AcpiOptions *acpi;
+    std::string expected;
+  };
   const std::vector<Row> rows = {
-      {"record without NUL", true, Ucs2(u"Box4,2"), true, acpi("ABCD", 1), "Box4,2"},
-      {"record with NUL", true, Ucs2(std::u16string(u"Box4,2") + u'\0'), false, {}, "Box4,2"},
-      {"40 wide characters cut whole", true, Ucs2(wide40), false, {}, cut},
-      {"record converting to nothing", true, Ucs2(std::u16string(2, u'\0')), true, acpi("ABCD", 1), "ACPI"},
-      {"record of one byte", true, {'X'}, true, acpi("ABCD", 1), "ACPI"},
-      {"DSDT id with blanks", false, {}, true, acpi("ABCD", 0x00010002), "ABCD1,2"},
-      {"DSDT id of 8 characters", false, {}, true, acpi("ABCDEFGH", 0xFFFF0010), "ABCDEFGH65535,16"},
-      {"DSDT id with NULs", false, {}, true, acpi(std::string("XY\0\0\0\0\0\0", 8), 7), "XY0,7"},
-      {"new FACP reads the 64-bit field", false, {}, true, only64, "ABCD1,2"},
-      {"new FACP ignores the 32-bit field", false, {}, true, only32, "ACPI"},
-      {"old FACP ignores the 64-bit field", false, {}, true, old64, "ACPI"},
-      {"old FACP reads the 32-bit field", false, {}, true, old32, "ABCD1,2"},
-      {"neither", false, {}, false, {}, "ACPI"},
+      {"record without NUL", Ucs2(u"Box4,2"), &one, "Box4,2"},
+      {"record with NUL", Ucs2(std::u16string(u"Box4,2") + u'\0'), nullptr, "Box4,2"},
+      {"40 wide characters cut whole", Ucs2(std::u16string(40, u'\u4e2d')), nullptr, cut},
+      {"record converting to nothing", Ucs2(std::u16string(2, u'\0')), &one, "ACPI"},
+      {"DSDT id with blanks", {}, &both, "ABCD1,2"},
+      {"DSDT id of 8 characters", {}, &eight, "ABCDEFGH65535,16"},
+      {"DSDT id with NULs", {}, &nuls, "XY0,7"},
+      {"new FACP reads the 64-bit field", {}, &new64, "ABCD1,2"},
+      {"new FACP ignores the 32-bit field", {}, &new32, "ACPI"},
+      {"old FACP ignores the 64-bit field", {}, &old64, "ACPI"},
+      {"old FACP reads the 32-bit field", {}, &old32, "ABCD1,2"},
+      {"neither", {}, nullptr, "ACPI"},
   };
   for (const Row &row : rows) {
-    hostfw::Firmware local;
-    Use(local);
-    if (row.model)
-      LogRecords(local, {{&gNimbPlatformProducerGuid, u"Model", row.value}});
-    if (row.acpi)
-      local.InstallAcpi(row.options);
-    const char *model = nullptr;
-    ASSERT_EQ(local
-                  .Call([&] {
-                    nimb::InitPlatformDescription();
-                    model = nimb::GetModelName();
-                  })
-                  .end,
-              hostfw::RunEnd::Returned);
-    EXPECT_EQ(model, nimb::gModelName) << row.name;
-    EXPECT_EQ(std::string(model), row.expected) << row.name;
-    nimb::TrackedFreeAll();
+    Local local;
+    if (!row.model.empty())
+      local.Log({{kVendor, u"Model", row.model}});
+    if (row.acpi != nullptr)
+      local.fw.InstallAcpi(*row.acpi);
+    EXPECT_EQ(local.Init(), row.expected) << row.name;
+    EXPECT_EQ(nimb::GetModelName(), nimb::gModelName) << row.name;
   }
-  nimbtest::ResetLoaderState();
-  Attach();
-}
 
-TEST_F(PlatformTest, ModelNameIsWorkedOutOnce) {
-  ASSERT_EQ(Init(), EFI_SUCCESS);
-  EXPECT_STREQ(nimb::GetModelName(), "ACPI");
+  // Worked out once: neither a later record nor later tables change it.
+  Local local;
+  EXPECT_EQ(local.Init(), "ACPI");
   static const char16_t kModel[] = u"Box";
   nimb::DeviceTreeAddProperty(nimb::DeviceTreeFindNode("/efi/platform", 0), "Model", sizeof(kModel), kModel,
                               1);
-  fw.InstallAcpi({});
+  local.fw.InstallAcpi({});
   EXPECT_STREQ(nimb::GetModelName(), "ACPI");
 }
 
@@ -285,35 +262,30 @@ TEST_F(PlatformTest, ModelNameIsWorkedOutOnce) {
 TEST(DataHubTest, CountsRunThroughTheRecordsAndEndAtZeroWithTheLast) {
   hostfw::Firmware local;
   EFI_DATA_HUB_PROTOCOL *hub = nullptr;
-  EFI_BOOT_SERVICES *bs = local.BootServices();
-  EXPECT_EQ(bs->LocateProtocol(&gEfiDataHubProtocolGuid, nullptr, reinterpret_cast<void **>(&hub)),
-            EFI_NOT_FOUND);
+  auto locate = [&] {
+    return local.BootServices()->LocateProtocol(&gEfiDataHubProtocolGuid, nullptr,
+                                                reinterpret_cast<void **>(&hub));
+  };
+  EXPECT_EQ(locate(), EFI_NOT_FOUND) << "no record, no hub";
   local.AddDataHubRecord(gNimbPlatformProducerGuid, u"a", {1, 2});
   local.AddDataHubRecord(kOtherProducer, u"bc", {});
-  local.AddDataHubRecordData(gNimbPlatformProducerGuid, {9});
-  ASSERT_EQ(bs->LocateProtocol(&gEfiDataHubProtocolGuid, nullptr, reinterpret_cast<void **>(&hub)),
-            EFI_SUCCESS);
-
-  const std::vector<std::pair<UINT32, const EFI_GUID *>> expected = {
-      {96 + 4 + 2, &gNimbPlatformProducerGuid}, {96 + 6, &kOtherProducer}, {73, &gNimbPlatformProducerGuid}};
+  ASSERT_EQ(locate(), EFI_SUCCESS);
+  // Header, name and value sizes, the name, the value.
+  const UINT32 sizes[] = {96 + 4 + 2, 96 + 6};
   UINT64 count = 0;
-  for (size_t i = 0; i < expected.size(); i++) {
+  for (size_t i = 0; i < 2; i++) {
     EFI_DATA_RECORD_HEADER *record = nullptr;
     ASSERT_EQ(hub->GetNextDataRecord(hub, &count, nullptr, &record), EFI_SUCCESS) << i;
-    EXPECT_EQ(record->RecordSize, expected[i].first) << i;
-    EXPECT_EQ(std::memcmp(&record->ProducerName, expected[i].second, 16), 0) << i;
-    EXPECT_EQ(count, i + 1 < expected.size() ? record->LogMonotonicCount + 1 : 0) << i;
+    EXPECT_EQ(record->RecordSize, sizes[i]) << i;
+    EXPECT_EQ(count, i == 0 ? record->LogMonotonicCount + 1 : 0) << i;
   }
   count = 7;
   EFI_DATA_RECORD_HEADER *record = nullptr;
   EXPECT_EQ(hub->GetNextDataRecord(hub, &count, nullptr, &record), EFI_NOT_FOUND);
-  count = 0;
-  EFI_EVENT filter = nullptr;
-  EXPECT_EQ(hub->GetNextDataRecord(hub, &count, &filter, &record), EFI_INVALID_PARAMETER);
 }
 
 // Records whose sizes lie are skipped; ASan sees any read past a record.
-TEST_F(PlatformTest, LyingRecordSizesAreNeverFollowed) {
+TEST(PlatformTest, LyingRecordSizesAreNeverFollowed) {
   auto data = [](uint32_t nameSize, uint32_t valueSize, size_t bytes) {
     Bytes d(16, 0xEE);
     Put32(d, nameSize);
@@ -341,10 +313,11 @@ TEST_F(PlatformTest, LyingRecordSizesAreNeverFollowed) {
     const uint32_t nameSize = next() % 24, valueSize = next() % 24, bytes = next() % 40;
     all.push_back({data(nameSize, valueSize, bytes), nameSize + valueSize <= bytes});
   }
+  Local local;
   for (const Row &row : all)
-    fw.AddDataHubRecordData(gNimbPlatformProducerGuid, row.data);
-  fw.AddDataHubRecord(gNimbPlatformProducerGuid, u"last", {});
-  ASSERT_EQ(Init(), EFI_SUCCESS);
+    local.fw.AddDataHubRecordData(*kVendor, row.data);
+  local.fw.AddDataHubRecord(*kVendor, u"last", {});
+  local.Init();
 
   size_t kept = 0;
   for (const Row &row : all)
@@ -368,9 +341,7 @@ TEST_F(PlatformTest, LyingRecordSizesAreNeverFollowed) {
 
 // --- the FACP, through the host firmware's ACPI tables -----------------------------
 
-class AcpiTest : public nimbtest::LoaderTest {};
-
-TEST_F(AcpiTest, FindFacpFollowsTheRsdpRevisionAndTheEntryOrder) {
+TEST(AcpiTest, FindFacpFollowsTheRsdpRevisionAndTheEntryOrder) {
   const EFI_GUID *v1 = &gEfiAcpi10TableGuid;
   const EFI_GUID *v2 = &gEfiAcpi20TableGuid;
   auto rsdp = [](UINT8 revision, bool rsdt = true, bool xsdt = true, bool facp = true) {
@@ -400,7 +371,6 @@ TEST_F(AcpiTest, FindFacpFollowsTheRsdpRevisionAndTheEntryOrder) {
       {"revision 2 without XSDT", {rsdp(2, true, false)}, {{v2, 0}}, -1},
       {"revision 0 through the 2.0 GUID reads the RSDT", {rsdp(0)}, {{v2, 0}}, 0},
       {"no FACP listed", {rsdp(2, true, true, false)}, {{v2, 0}}, -1},
-      {"1.0 behind 2.0", {rsdp(2), rsdp(0)}, {{v2, 0}, {v1, 1}}, 0},
       {"2.0 behind 1.0", {rsdp(0), rsdp(2)}, {{v1, 0}, {v2, 1}}, 1},
       {"later 1.0 replaces 1.0", {rsdp(0), rsdp(0)}, {{v1, 0}, {v1, 1}}, 1},
       {"first 2.0 wins", {rsdp(2), rsdp(2)}, {{v2, 0}, {v2, 1}}, 0},
@@ -408,68 +378,50 @@ TEST_F(AcpiTest, FindFacpFollowsTheRsdpRevisionAndTheEntryOrder) {
       {"no ACPI", {}, {{&gEfiDevicePathProtocolGuid, -1}}, -1},
   };
   for (const Row &row : rows) {
-    hostfw::Firmware local;
-    Use(local);
+    Local local;
     std::vector<hostfw::AcpiTables> sets;
     for (const hostfw::AcpiOptions &options : row.sets)
-      sets.push_back(local.InstallAcpi(options));
+      sets.push_back(local.fw.InstallAcpi(options));
     for (const Entry &entry : row.entries) {
       void *table = entry.set < 0 ? nullptr : reinterpret_cast<void *>(sets[size_t(entry.set)].rsdp);
-      local.AddConfigurationTable(*entry.guid, table);
+      local.fw.AddConfigurationTable(*entry.guid, table);
     }
     const UINT8 *facp = nimb::FindFacp();
     EXPECT_EQ(reinterpret_cast<UINT64>(facp), row.expected < 0 ? 0 : sets[size_t(row.expected)].facp)
         << row.name;
   }
-  nimbtest::ResetLoaderState();
-  Attach();
 }
 
-TEST_F(AcpiTest, TablesLieInAcpiMemoryWithTheirChecksumsRight) {
+TEST(AcpiTest, TablesLieInAcpiMemoryWithTheirChecksumsRight) {
   for (UINT8 revision : {UINT8(0), UINT8(2)}) {
     hostfw::Firmware local;
     hostfw::AcpiOptions options;
     options.rsdpRevision = revision;
-    options.hardwareSignature = 0xCAFEF00D;
     hostfw::AcpiTables t = local.InstallAcpi(options);
-    auto at = [](UINT64 address) { return reinterpret_cast<const uint8_t *>(address); };
     auto sum = [&](UINT64 address, size_t length) {
       uint8_t s = 0;
       for (size_t i = 0; i < length; i++)
-        s = uint8_t(s + at(address)[i]);
+        s = uint8_t(s + reinterpret_cast<const uint8_t *>(address)[i]);
       return s;
     };
-    auto length = [&](UINT64 address) {
-      UINT32 l;
-      std::memcpy(&l, at(address) + 4, 4);
-      return l;
-    };
-    EXPECT_EQ(std::memcmp(at(t.rsdp), "RSD PTR ", 8), 0);
-    EXPECT_EQ(sum(t.rsdp, 20), 0) << int(revision);
-    if (revision == 2)
-      EXPECT_EQ(sum(t.rsdp, 36), 0);
-    std::vector<UINT64> tables = {t.rsdt, t.facp, t.dsdt};
-    if (revision == 2)
-      tables.push_back(t.xsdt);
-    for (UINT64 table : tables)
-      EXPECT_EQ(sum(table, length(table)), 0)
-          << int(revision) << " " << std::string(at(table), at(table) + 4);
-    UINT32 signature;
-    std::memcpy(&signature, at(t.facs) + 8, 4);
-    EXPECT_EQ(signature, 0xCAFEF00D);
-
     auto typeOf = [&](UINT64 address) {
       for (const EFI_MEMORY_DESCRIPTOR &d : local.MemoryMap()) {
-        if (address >= d.PhysicalStart && address < d.PhysicalStart + d.NumberOfPages * EFI_PAGE_SIZE)
+        if (address - d.PhysicalStart < d.NumberOfPages * EFI_PAGE_SIZE)
           return d.Type;
       }
       return UINT32(EfiMaxMemoryType);
     };
-    for (UINT64 table : tables)
+    EXPECT_EQ(sum(t.rsdp, 20), 0) << int(revision);
+    if (revision == 2)
+      EXPECT_EQ(sum(t.rsdp, 36), 0);
+    for (UINT64 table : {t.rsdt, t.facp, t.dsdt, revision == 2 ? t.xsdt : t.rsdt}) {
+      UINT32 length;
+      std::memcpy(&length, reinterpret_cast<const void *>(table + 4), 4);
+      EXPECT_EQ(sum(table, length), 0)
+          << int(revision) << " " << std::string(reinterpret_cast<const char *>(table), 4);
       EXPECT_EQ(typeOf(table), UINT32(EfiACPIReclaimMemory));
+    }
     EXPECT_EQ(typeOf(t.facs), UINT32(EfiACPIMemoryNVS));
-    ASSERT_EQ(local.SystemTable()->NumberOfTableEntries, 1u);
-    EXPECT_EQ(local.SystemTable()->ConfigurationTable[0].VendorTable, reinterpret_cast<void *>(t.rsdp));
   }
 }
 
@@ -508,14 +460,7 @@ Bytes Table(const char *signature, uint32_t length, size_t size, const Bytes &bo
   return t;
 }
 
-Bytes Address(UINT64 address, size_t width) {
-  Bytes b;
-  for (size_t i = 0; i < width; i++)
-    b.push_back(uint8_t(address >> (8 * i)));
-  return b;
-}
-
-TEST_F(AcpiTest, LyingLengthsAreNeverReadPast) {
+TEST(AcpiTest, LyingLengthsAreNeverReadPast) {
   struct Row {
     const char *name;
     UINT8 revision;       // of the RSDP
@@ -528,9 +473,8 @@ TEST_F(AcpiTest, LyingLengthsAreNeverReadPast) {
   };
   const std::vector<Row> rows = {
       {"RSDT shorter than a header", 0, 35, 116, 1, 36, false, "ACPI"},
-      {"RSDT with a part of an entry", 0, 39, 116, 1, 36, false, "ACPI"},
       {"XSDT with a part of an entry", 2, 43, 244, 4, 36, false, "ACPI"},
-      {"XSDT of length 0", 2, 0, 244, 4, 36, false, "ACPI"},
+      {"an RSDP of revision 1 names no root", 1, 52, 148, 3, 36, false, "ACPI"},
       {"FACP too short for the DSDT", 0, 44, 43, 1, 36, true, "ACPI"},
       {"FACP too short for the wide DSDT", 2, 52, 147, 3, 36, true, "ACPI"},
       {"DSDT shorter than a header", 2, 52, 148, 3, 35, true, "ACPI"},
@@ -538,9 +482,7 @@ TEST_F(AcpiTest, LyingLengthsAreNeverReadPast) {
       {"all of a size, old FACP", 0, 44, 44, 2, 36, true, "OEMTABLE0,9"},
   };
   for (const Row &row : rows) {
-    hostfw::Firmware local;
-    Use(local);
-
+    Local local;
     Bytes dsdtBytes = Table("DSDT", row.dsdtLength, row.dsdtLength);
     if (row.dsdtLength >= 28) {
       std::memcpy(&dsdtBytes[16], "OEMTABLE", 8);
@@ -565,23 +507,10 @@ TEST_F(AcpiTest, LyingLengthsAreNeverReadPast) {
     Bytes address = Address(root.address(), width);
     std::copy(address.begin(), address.end(), rsdpBytes.begin() + (row.revision == 0 ? 16 : 24));
     GuardedBytes rsdp(rsdpBytes);
-    local.AddConfigurationTable(gEfiAcpi20TableGuid, reinterpret_cast<void *>(rsdp.address()));
-
-    const UINT8 *found = nimb::FindFacp();
-    EXPECT_EQ(reinterpret_cast<UINT64>(found), row.facpFound ? facp.address() : 0) << row.name;
-    const char *model = nullptr;
-    ASSERT_EQ(local
-                  .Call([&] {
-                    nimb::InitPlatformDescription();
-                    model = nimb::GetModelName();
-                  })
-                  .end,
-              hostfw::RunEnd::Returned);
-    EXPECT_STREQ(model, row.model) << row.name;
-    nimb::TrackedFreeAll();
+    local.fw.AddConfigurationTable(gEfiAcpi20TableGuid, reinterpret_cast<void *>(rsdp.address()));
+    EXPECT_EQ(reinterpret_cast<UINT64>(nimb::FindFacp()), row.facpFound ? facp.address() : 0) << row.name;
+    EXPECT_EQ(local.Init(), row.model) << row.name;
   }
-  nimbtest::ResetLoaderState();
-  Attach();
 }
 
 }  // namespace

