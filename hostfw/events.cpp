@@ -102,22 +102,14 @@ EFI_STATUS EFIAPI SetWatchdogTimer(UINTN, UINT64, UINTN, CHAR16 *) {
 }
 
 // Waiting needs time to pass, which it does not here.
-EFI_STATUS EventUnprovided(const char *name) {
-  State &s = Services::Active();
-  EFI_STATUS failure;
-  if (Refused(s, name, &failure))
-    return failure;
-  std::fprintf(stderr, "hostfw: %s is not provided\n", name);
-  return EFI_UNSUPPORTED;
-}
 EFI_STATUS EFIAPI WaitForEvent() {
-  return EventUnprovided("WaitForEvent");
+  return Unprovided("WaitForEvent");
 }
 EFI_STATUS EFIAPI SignalEvent() {
-  return EventUnprovided("SignalEvent");
+  return Unprovided("SignalEvent");
 }
 EFI_STATUS EFIAPI CheckEvent() {
-  return EventUnprovided("CheckEvent");
+  return Unprovided("CheckEvent");
 }
 
 }  // namespace

@@ -62,17 +62,6 @@ EFI_STATUS EFIAPI StartImage(EFI_HANDLE, UINTN *, CHAR16 **) {
   return EFI_UNSUPPORTED;
 }
 
-// Table slots that the host firmware does not implement: a call is counted
-// under the slot's name, reported, and refused.
-EFI_STATUS Unprovided(const char *name) {
-  State &s = Services::Active();
-  EFI_STATUS failure;
-  if (Refused(s, name, &failure))
-    return failure;
-  std::fprintf(stderr, "hostfw: %s is not provided\n", name);
-  return EFI_UNSUPPORTED;
-}
-
 #define HOSTFW_UNPROVIDED(Name)          \
   EFI_STATUS EFIAPI Unprovided##Name() { \
     return Unprovided(#Name);            \
@@ -173,6 +162,17 @@ bool TakeFault(State &s, const char *name, const EFI_GUID *protocol, EFI_STATUS 
 }
 
 }  // namespace
+
+// Table slots that the host firmware does not implement: a call is counted
+// under the slot's name, reported, and refused.
+EFI_STATUS Unprovided(const char *name) {
+  State &s = Services::Active();
+  EFI_STATUS failure;
+  if (Refused(s, name, &failure))
+    return failure;
+  std::fprintf(stderr, "hostfw: %s is not provided\n", name);
+  return EFI_UNSUPPORTED;
+}
 
 // --- Shared helpers -----------------------------------------------------------------
 

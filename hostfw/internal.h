@@ -232,6 +232,9 @@ bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *pr
              const UINTN *size = nullptr);
 // The same for the runtime services, which stay callable after ExitBootServices.
 bool RefusedAtRuntime(State &s, const char *name, EFI_STATUS *failure);
+// A boot service slot the host firmware does not implement: the call is
+// counted under `name`, reported on stderr and refused.
+EFI_STATUS Unprovided(const char *name);
 
 // The innermost Run or Call; `what` is what needs one, for the message when
 // there is none (a misuse: the code under test belongs in Firmware::Call).
