@@ -67,25 +67,8 @@ std::string Dict(const std::string &entries) {
   return "<?xml version=\"1.0\"?>\n<plist version=\"1.0\">\n<dict>\n" + entries + "</dict>\n</plist>\n";
 }
 
-class BootOptionsTest : public nimbtest::LoaderTest {
+class BootOptionsTest : public nimbtest::VolumeTest {
  protected:
-  void SetUp() override {
-    LoaderTest::SetUp();
-    dir_ = std::make_unique<nimbtest::TempDir>();
-    device_ = fw.AddDirectoryVolume(dir_->path());
-    fw.SetBootDevice(device_);
-    nimb::gLoadedImage = fw.LoadedImage();
-    nimb::gBootDevicePath = fw.DevicePathOf(device_);
-    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
-    fw.BootServices()->HandleProtocol(device_, &gEfiSimpleFileSystemProtocolGuid,
-                                      reinterpret_cast<void **>(&fileSystem));
-    fileSystem->OpenVolume(fileSystem, &root_);
-  }
-  void TearDown() override {
-    LoaderTest::TearDown();
-    dir_.reset();
-  }
-  void Put(const std::string &name, const std::string &content) { dir_->File(name, content); }
   void Config(const std::string &entries) {
     Put("Library/Preferences/SystemConfiguration/com.quill.Boot.plist", Dict(entries));
   }
@@ -115,9 +98,6 @@ class BootOptionsTest : public nimbtest::LoaderTest {
     return text != nullptr ? std::u16string(text) : u"(null)";
   }
 
-  std::unique_ptr<nimbtest::TempDir> dir_;
-  EFI_HANDLE device_ = nullptr;
-  EFI_FILE *root_ = nullptr;
   FakeKeyState keys_ = {};
 };
 

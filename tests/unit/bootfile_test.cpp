@@ -23,31 +23,14 @@ std::vector<uint8_t> Pattern(size_t size) {
   return bytes;
 }
 
-class BootFileTest : public nimbtest::LoaderTest {
+class BootFileTest : public nimbtest::VolumeTest {
  protected:
-  void SetUp() override {
-    LoaderTest::SetUp();
-    EFI_HANDLE device = fw.AddDirectoryVolume(dir_.path());
-    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
-    ASSERT_EQ(fw.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
-                                                reinterpret_cast<void **>(&fileSystem)),
-              EFI_SUCCESS);
-    ASSERT_EQ(fileSystem->OpenVolume(fileSystem, &root_), EFI_SUCCESS);
-  }
-  void TearDown() override {
-    root_->Close(root_);
-    LoaderTest::TearDown();
-  }
-  void Put(const std::string &name, const std::vector<uint8_t> &bytes) { dir_.File(name, bytes); }
   size_t Dots() const {
     size_t dots = 0;
     for (const std::u16string &call : fw.ConOutCalls())
       dots += call == u".";
     return dots;
   }
-
-  nimbtest::TempDir dir_;
-  EFI_FILE *root_ = nullptr;
 };
 
 TEST_F(BootFileTest, VolumeReadsGoInChunksWithADotEach) {
@@ -232,7 +215,7 @@ TEST_F(BootFileTest, LoadFileFailures) {
 }
 
 TEST_F(BootFileTest, ReadWhole) {
-  Put("empty", {});
+  Put("empty", std::string());
   Put("data", Pattern(70000));
   UINT64 size = 77;
   UINT8 *buffer = reinterpret_cast<UINT8 *>(1);

@@ -24,24 +24,15 @@ std::string Dict(const std::string &entries) {
   return "<plist><dict>" + entries + "</dict></plist>";
 }
 
-class BootInfoTest : public nimbtest::LoaderTest {
+class BootInfoTest : public nimbtest::VolumeTest {
  protected:
   void SetUp() override {
-    LoaderTest::SetUp();
-    dir_ = std::make_unique<nimbtest::TempDir>();
-    device_ = fw.AddDirectoryVolume(dir_->path());
-    fw.SetBootDevice(device_);
-    gLoadedImage = fw.LoadedImage();
-    gBootDevicePath = fw.DevicePathOf(device_);
+    VolumeTest::SetUp();
     ASSERT_NE(DeviceTreeInit(), nullptr);
     // As if a kernel lay at 0x200000..0x205000.
     gKernelRegionBase = 0x200000;
     gKernelRegionTop = 0x205000;
     gKernelName = u"a\\b";
-  }
-  void TearDown() override {
-    LoaderTest::TearDown();
-    dir_.reset();
   }
   // Parses a configuration dictionary into gConfigDict.
   void Config(const std::string &entries) {
@@ -65,10 +56,8 @@ class BootInfoTest : public nimbtest::LoaderTest {
     return std::string(static_cast<const char *>(property->value), property->length);
   }
 
-  std::unique_ptr<nimbtest::TempDir> dir_;
   std::string text_;
   std::string printed_;
-  EFI_HANDLE device_ = nullptr;
 };
 
 TEST_F(BootInfoTest, TheRecordSitsAtTheTopOfTheKernelRegion) {

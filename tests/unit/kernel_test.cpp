@@ -66,26 +66,12 @@ void ExpectPlaced(uint64_t address, const Bytes &bytes, uint64_t size) {
       << std::hex << address;
 }
 
-class KernelTest : public nimbtest::LoaderTest {
+class KernelTest : public nimbtest::VolumeTest {
  protected:
-  void SetUp() override {
-    LoaderTest::SetUp();
-    EFI_HANDLE device = fw.AddDirectoryVolume(dir_.path());
-    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
-    ASSERT_EQ(fw.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
-                                                reinterpret_cast<void **>(&fileSystem)),
-              EFI_SUCCESS);
-    ASSERT_EQ(fileSystem->OpenVolume(fileSystem, &root_), EFI_SUCCESS);
-  }
-  void TearDown() override {
-    root_->Close(root_);
-    LoaderTest::TearDown();
-  }
-
   // Opens `bytes` as a file of the given kind; the bytes must outlive it.
   void Open(Source source, const Bytes &bytes, BootFile *file) {
     if (source == Source::kVolume) {
-      dir_.File("k", bytes);
+      dir_->File("k", bytes);
       ASSERT_EQ(nimb::BootFileOpen(nullptr, root_, u"k", file), EFI_SUCCESS);
       return;
     }
@@ -113,9 +99,6 @@ class KernelTest : public nimbtest::LoaderTest {
 
   // Console output since `mark` (a length of ConOutText).
   std::string OutputSince(size_t mark) const { return fw.ConOutText().substr(mark); }
-
-  nimbtest::TempDir dir_;
-  EFI_FILE *root_ = nullptr;
 };
 
 // --- finding the slice ------------------------------------------------------------
@@ -400,7 +383,7 @@ TEST_F(KernelTest, LoadKernelFileOpensLoadsAndCloses) {
       Object{0xFEEDFACE, {Segment(0x200000, 0x10, kObjectDataStart, 0x10), Thread(0xC0200004)}, Pattern(0x10)}
           .Build();
   Bytes fat = WrapInFat(kernel, true);
-  dir_.File("nimb_kernel", fat);
+  dir_->File("nimb_kernel", fat);
   hostfw::NetworkDevice network(fw);
   network.PutFile(u"nimb_kernel", fat);
   network.PutFile(u"net\\k", kernel);

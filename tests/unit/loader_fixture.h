@@ -4,7 +4,9 @@
 
 #include <gtest/gtest.h>
 
+#include <memory>
 #include <string>
+#include <vector>
 
 #include "boot/boot.h"
 #include "boot/stop.h"
@@ -18,6 +20,7 @@
 #include "screen/bootscreen.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
+#include "temp_dir.h"
 
 namespace nimbtest {
 
@@ -97,6 +100,35 @@ class LoaderTest : public ::testing::Test {
   }
 
   hostfw::Firmware fw;
+};
+
+// A LoaderTest booting from a volume over a fresh host directory: the device
+// is the loaded image's, its path the boot device path, and its root open.
+class VolumeTest : public LoaderTest {
+ protected:
+  void SetUp() override {
+    LoaderTest::SetUp();
+    dir_ = std::make_unique<TempDir>();
+    device_ = fw.AddDirectoryVolume(dir_->path());
+    fw.SetBootDevice(device_);
+    nimb::gLoadedImage = fw.LoadedImage();
+    nimb::gBootDevicePath = fw.DevicePathOf(device_);
+    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
+    ASSERT_EQ(fw.BootServices()->HandleProtocol(device_, &gEfiSimpleFileSystemProtocolGuid,
+                                                reinterpret_cast<void **>(&fileSystem)),
+              EFI_SUCCESS);
+    ASSERT_EQ(fileSystem->OpenVolume(fileSystem, &root_), EFI_SUCCESS);
+  }
+  void TearDown() override {
+    LoaderTest::TearDown();
+    dir_.reset();
+  }
+  void Put(const std::string &name, const std::string &content) { dir_->File(name, content); }
+  void Put(const std::string &name, const std::vector<uint8_t> &bytes) { dir_->File(name, bytes); }
+
+  std::unique_ptr<TempDir> dir_;
+  EFI_HANDLE device_ = nullptr;
+  EFI_FILE *root_ = nullptr;
 };
 
 }  // namespace nimbtest
