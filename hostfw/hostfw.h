@@ -214,6 +214,8 @@ class Firmware {
   // map, as real firmware makes them: the next GetMemoryMap call after this
   // finds `extraDescriptors` more entries than the one before.
   void GrowMemoryMapOnNextCall(unsigned extraDescriptors);
+  // The same, for the n-th GetMemoryMap call from now (1 for the next).
+  void GrowMemoryMapOnCall(unsigned nth, unsigned extraDescriptors);
 
   // --- Handles and protocols ----------------------------------------------
   EFI_HANDLE NewHandle();

@@ -156,6 +156,8 @@ struct Firmware::State {
   std::map<void *, PoolBlock> pool;
   UINTN mapKey = 1;
   unsigned pendingGrowth = 0;
+  unsigned growthCountdown = 0;  // GetMemoryMap calls until growthLater applies
+  unsigned growthLater = 0;
   std::vector<SavedRange> saved;
 
   // Tables.

@@ -212,6 +212,10 @@ EFI_STATUS EFIAPI GetMemoryMap(UINTN *MemoryMapSize, EFI_MEMORY_DESCRIPTOR *Memo
     return failure;
   if (MemoryMapSize == nullptr)
     return EFI_INVALID_PARAMETER;
+  if (s.growthCountdown > 0 && --s.growthCountdown == 0) {
+    s.pendingGrowth += s.growthLater;
+    s.growthLater = 0;
+  }
   ApplyGrowth(s);
   std::vector<EFI_MEMORY_DESCRIPTOR> map = BuildMap(s);
   UINTN needed = map.size() * kDescriptorSize;
@@ -403,6 +407,13 @@ unsigned Firmware::FreePagesCalls() const {
 UINTN Firmware::MapKey() const {
   return s_->mapKey;
 }
+void Firmware::GrowMemoryMapOnCall(unsigned nth, unsigned extraDescriptors) {
+  if (nth == 0)
+    Misuse("GrowMemoryMapOnCall counts from 1");
+  s_->growthCountdown = nth;
+  s_->growthLater = extraDescriptors;
+}
+
 void Firmware::GrowMemoryMapOnNextCall(unsigned extraDescriptors) {
   s_->pendingGrowth += extraDescriptors;
 }

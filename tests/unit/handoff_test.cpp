@@ -250,12 +250,25 @@ TEST_F(HandOffTest, DevicePropertiesLargerThanTheFirstBuffer) {
   EXPECT_EQ(blob, std::string(properties.blob.begin(), properties.blob.end()));
 }
 
-TEST_F(HandOffTest, AGrowingMapIsExtendedInPlace) {
+TEST_F(HandOffTest, AMapThatGrowsBetweenTheReadsIsExtendedInPlace) {
   Prepare();
-  // Many descriptors more at every read after the first look.
-  fw.GrowMemoryMapOnNextCall(200);
+  // The first look is a probe and a read; the final loop's probe (the third
+  // call) finds 200 descriptors more than the margins allow for.
+  fw.GrowMemoryMapOnCall(3, 200);
   ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
   EXPECT_TRUE(fw.BootServicesExited());
+  // The map stayed where it was allocated, and holds every descriptor: it
+  // was extended by pages right behind it, below the tree's successors.
+  UINT64 top = bootArgs->memoryMap + bootArgs->memoryMapSize;
+  EXPECT_GT(bootArgs->memoryMapSize, 200 * hostfw::kDescriptorSize);
+  EXPECT_LE(top, bootArgs->runtimePageStart * EFI_PAGE_SIZE);
+  EXPECT_GT(bootArgs->memoryMap, bootArgs->deviceTree);
+  unsigned types = 0;
+  const uint8_t *map = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(bootArgs->memoryMap));
+  for (UINT32 offset = 0; offset < bootArgs->memoryMapSize; offset += bootArgs->memoryDescriptorSize) {
+    types += reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(map + offset)->Type == EfiBootServicesCode;
+  }
+  EXPECT_GE(types, 100u);
 }
 
 TEST_F(HandOffTest, BothAcpiTablesAndTheMachineSignature) {
