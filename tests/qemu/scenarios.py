@@ -3,6 +3,7 @@ what the run must print and end with. harness.py runs them; CMakeLists.txt
 registers one ctest test per name."""
 
 import dataclasses
+import re
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -321,6 +322,31 @@ _TABLE = [
         kernel=KernelExpect(
             bootargs={"commandLine": "foo=1 bar=3 baz=4"},
             tree={"/chosen": {"boot-uuid": text("not-a-uuid"), "boot-args": text("foo=1 bar=3 baz=4")}},
+        ),
+    ),
+    # What the platform hands over for the kernel: a device properties blob
+    # larger than the loader's first buffer (so it asks twice) and the two
+    # network answers, all of which reach the tree.
+    Scenario(
+        "kernel_devices",
+        config={
+            "options": "foo=1",
+            "device-properties-hex": bytes(i * 7 % 256 for i in range(5000)).hex(),
+            "netboot.dhcp-hex": bytes(range(200)).hex(),
+            "netboot.bsdp-hex": "0102030405",
+        },
+        files=kernel_file(),
+        expect=("platform: device properties asked with 4096 bytes: EFI_BUFFER_TOO_SMALL, 5000 bytes",
+                KERNEL_START),
+        exit="KernelPass",
+        kernel=KernelExpect(
+            tree={
+                "/efi": {"device-properties": re.compile(r"<00 07 0e 15 .*\.\.\.> \(5000 bytes\)")},
+                "/chosen": {
+                    "dhcp-response": re.compile(r"<00 01 02 03 .*\.\.\.> \(200 bytes\)"),
+                    "svcd-response": "<01 02 03 04 05>",
+                },
+            },
         ),
     ),
     # The boot screen as the kernel finds it: the logo in the middle of the
