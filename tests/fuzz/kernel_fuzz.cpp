@@ -6,6 +6,7 @@
 #include <vector>
 
 #include "boot/boot.h"
+#include "fuzz_firmware.h"
 #include "hostfw/hostfw.h"
 #include "load/bootfile.h"
 #include "load/kernel.h"
@@ -49,13 +50,7 @@ hostfw::Firmware &TheFirmware() {
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   hostfw::Firmware &fw = TheFirmware();
-  nimb::gST = fw.SystemTable();
-  nimb::gBS = fw.BootServices();
-  nimb::gRT = fw.RuntimeServices();
-  nimb::gImageHandle = fw.ImageHandle();
-  nimb::gMemoryTags = nullptr;
-  nimb::gFreeMemoryTags = nullptr;
-  nimb::gMemoryTagBlocks = nullptr;
+  nimbfuzz::AttachLoader(fw);
   nimb::gKernelRegionBase = 0xFFFFFFFF;
   nimb::gKernelRegionTop = 0;
   nimb::gKernelEntry = 0x5EED;

@@ -7,6 +7,7 @@
 
 #include "boot/boot.h"
 #include "config/plist.h"
+#include "fuzz_firmware.h"
 #include "hostfw/hostfw.h"
 #include "memory/tracking.h"
 
@@ -52,13 +53,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   // One firmware for the whole run: making one per input costs far more
   // than the parse. Each input starts and ends with nothing allocated.
   static hostfw::Firmware fw;
-  nimb::gST = fw.SystemTable();
-  nimb::gBS = fw.BootServices();
-  nimb::gRT = fw.RuntimeServices();
-  nimb::gImageHandle = fw.ImageHandle();
-  nimb::gMemoryTags = nullptr;
-  nimb::gFreeMemoryTags = nullptr;
-  nimb::gMemoryTagBlocks = nullptr;
+  nimbfuzz::AttachLoader(fw);
   nimb::gPlistFreeTags = nullptr;
   nimb::gPlistSymbols = nullptr;
   Check(fw.LivePoolBlocks() == 0);
