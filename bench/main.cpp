@@ -8,9 +8,12 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <map>
+#include <algorithm>
 #include <string>
 #include <vector>
 
+#include "figures.h"
 #include "routines.h"
 
 namespace {
@@ -149,6 +152,65 @@ void Register(const char *routine, const Contender<Function> (&contenders)[N], B
   }
 }
 
+
+// --- the summary figures ----------------------------------------------------------------
+
+// Google Benchmark's console table, and the rate of every run kept by
+// benchmark name (the median over repetitions).
+class FigureReporter : public benchmark::ConsoleReporter {
+ public:
+  void ReportRuns(const std::vector<Run> &runs) override {
+    ConsoleReporter::ReportRuns(runs);
+    for (const Run &run : runs) {
+      if (run.run_type != Run::RT_Iteration || run.error_occurred) {
+        continue;
+      }
+      const auto found = run.counters.find("bytes_per_second");
+      if (found != run.counters.end()) {
+        rates_[run.run_name.str()].push_back(found->second.value);
+      }
+    }
+  }
+
+  // The median rate of a benchmark, or a negative number when it did not run.
+  double Rate(const std::string &name) const {
+    const auto found = rates_.find(name);
+    if (found == rates_.end() || found->second.empty()) {
+      return -1;
+    }
+    std::vector<double> values = found->second;
+    std::sort(values.begin(), values.end());
+    return values[values.size() / 2];
+  }
+
+ private:
+  std::map<std::string, std::vector<double>> rates_;
+};
+
+std::string RateText(double rate) {
+  const char *units[] = {"B/s", "KiB/s", "MiB/s", "GiB/s"};
+  int unit = 0;
+  while (rate >= 1024 && unit < 3) {
+    rate /= 1024;
+    unit++;
+  }
+  char text[64];
+  std::snprintf(text, sizeof text, "%.3g %s", rate, units[unit]);
+  return text;
+}
+
+// One line per figure whose two benchmarks both ran (a filter may leave some out).
+void PrintFigures(const FigureReporter &reporter) {
+  for (const Figure &figure : Figures()) {
+    const double loader = reporter.Rate(figure.loader), peer = reporter.Rate(figure.peer);
+    if (loader <= 0 || peer <= 0) {
+      continue;
+    }
+    std::printf("figure %s: %s vs %s = %.2fx\n", figure.name.c_str(), RateText(loader).c_str(),
+                RateText(peer).c_str(), loader / peer);
+  }
+}
+
 }  // namespace
 
 int main(int argc, char **argv) {
@@ -164,7 +226,7 @@ int main(int argc, char **argv) {
   const Contender<MemcmpFunction> memcmps[] = {{"loader", gLoaderHostBuild.memcmp},
                                                {"loader-fwflags", gLoaderFirmwareBuild.memcmp},
                                                {"libc", LibcMemcmp}};
-  if (!CheckAll(adlers, md5s, memcpys, memcmps)) {
+  if (!CheckAll(adlers, md5s, memcpys, memcmps) || !SetUpSuites()) {
     return 1;
   }
 
@@ -184,11 +246,18 @@ int main(int argc, char **argv) {
   Register("memcmp", memcmps, [&d](MemcmpFunction f, size_t size) {
     benchmark::DoNotOptimize(f(d.bytes.data(), d.copy.data(), size));
   });
+  // The figures: the firmware build's code on the largest size.
+  const std::string largest = std::to_string(kLargest);
+  AddFigure("adler32-vs-zlib", "Adler32/loader-fwflags/" + largest, "Adler32/zlib/" + largest);
+  AddFigure("md5-vs-openssl", "MD5/loader-fwflags/" + largest, "MD5/openssl/" + largest);
   benchmark::Initialize(&argc, argv);
   if (benchmark::ReportUnrecognizedArguments(argc, argv)) {
     return 2;
   }
-  benchmark::RunSpecifiedBenchmarks();
+  FigureReporter reporter;
+  benchmark::RunSpecifiedBenchmarks(&reporter);
+  std::fflush(stdout);
+  PrintFigures(reporter);
   benchmark::Shutdown();
   return 0;
 }
