@@ -737,7 +737,7 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
     config = scenario_config(scenario, config_override)
     if config or scenario.config_file:
         files["EFI/BOOT/platform.cfg"] = render_config(config)
-    for path, content in scenario.files.items():
+    for path, content in {**(scenario.extensions or {}), **scenario.files}.items():
         if isinstance(content, GuestFile):
             content = Path(guest_dir) / content.name
             if not content.is_file():

@@ -126,6 +126,54 @@ def kernel_file(name="nimb_kernel"):
     return {"nimb_kernel": GuestFile(name)}
 
 
+# --- the extensions directory ------------------------------------------------------------
+
+EXTENSIONS_DIR = "System/Library/Extensions"
+
+
+def driver_plist(identifier, required=None, executable=None, libraries=()):
+    """A driver bundle's Info.plist: its identifier, and the keys that the
+    loader reads when given (`required` a string, or another tag's text)."""
+    lines = [f"\t<key>VzBundleIdentifier</key>\n\t<string>{identifier}</string>\n"]
+    if executable is not None:
+        lines.append(f"\t<key>VzBundleExecutable</key>\n\t<string>{executable}</string>\n")
+    if required is not None:
+        tag = required if required.startswith("<") else f"<string>{required}</string>"
+        lines.append(f"\t<key>VzBundleRequired</key>\n\t{tag}\n")
+    if libraries:
+        entries = "".join(f"\t\t<key>{name}</key>\n\t\t<string>1.0</string>\n" for name in libraries)
+        lines.append(f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n")
+    body = "".join(lines)
+    return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
+
+
+def driver_code(seed, length):
+    """A small driver's code: bytes that differ from bundle to bundle."""
+    return bytes((seed * 131 + i * 7 + (i >> 5)) & 0xFF for i in range(length))
+
+
+def standard_extensions():
+    """The extensions directory that every volume carries unless its scenario
+    says otherwise: a flat bundle with code, a full-layout bundle whose code
+    is a fat file (the reference kernel's, any x86 slice will do) with a
+    nested bundle that has no code, and a "Safe Boot" bundle that the loader
+    leaves out."""
+    root = EXTENSIONS_DIR
+    return {
+        f"{root}/Console.drvb/Info.plist": driver_plist("com.quill.driver.Console", "Root", "Console"),
+        f"{root}/Console.drvb/Console": driver_code(1, 1001),
+        f"{root}/Storage.drvb/Contents/Info.plist": driver_plist(
+            "com.quill.driver.Storage", "Local-Root", "Storage", libraries=("com.quill.driver.Console",)
+        ),
+        f"{root}/Storage.drvb/Contents/Tarnix/Storage": GuestFile("nimb_kernel.fat-le"),
+        f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist": driver_plist(
+            "com.quill.driver.Partition", ""
+        ),
+        f"{root}/Network.drvb/Info.plist": driver_plist("com.quill.driver.Network", "Safe Boot", "Network"),
+        f"{root}/Network.drvb/Network": driver_code(3, 64),
+    }
+
+
 @dataclasses.dataclass(frozen=True)
 class Scenario:
     name: str
@@ -141,6 +189,9 @@ class Scenario:
     files: dict = dataclasses.field(default_factory=dict)
     # ESP paths to leave out (e.g. the loader itself).
     remove: tuple = ()
+    # The extensions directory's files (paths as in `files`), put on the
+    # volume with the others; None: no extensions directory at all.
+    extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
     directories: tuple = ()
     # Texts that must appear in the serial log, in this order.
     expect: tuple = ()
