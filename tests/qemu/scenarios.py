@@ -4,6 +4,11 @@ registers one ctest test per name."""
 
 import dataclasses
 import re
+import sys
+from pathlib import Path
+
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkdisk"))
+import mkdisk  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -20,7 +25,7 @@ BOOT_PLIST = "Library/Preferences/SystemConfiguration/com.quill.Boot.plist"
 # The GUID of the system partition on every disk the harness builds: the
 # root volume's UUID as the loader should find it. Its first three fields
 # read differently in either byte order.
-PARTITION_GUID = "0FAB1E5D-3C2B-4A19-8E7F-60C5D4B3A291"
+PARTITION_GUID = mkdisk.DEFAULT_PARTITION_GUID
 
 # What a boot of the reference kernel prints, in this order.
 LOADING_KERNEL = "Loading 'nimb_kernel'..."
@@ -193,6 +198,9 @@ class Scenario:
     # volume with the others; None: no extensions directory at all.
     extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
     directories: tuple = ()
+    # Exact modification times (UTC, "YYYY-MM-DD hh:mm:ss.nnnnnnnnn") of
+    # files or directories of the volume, as the platform layer serves them.
+    times: dict = dataclasses.field(default_factory=dict)
     # Texts that must appear in the serial log, in this order.
     expect: tuple = ()
     # Texts that must not appear.
@@ -306,7 +314,14 @@ _TABLE = [
         "kernel_plain",
         config={"console": "graphics", "options": "foo=1"},
         files=kernel_file(),
-        expect=(LOADING_KERNEL, f"{ROOT_UUID}{PARTITION_GUID}'", KERNEL_START),
+        # The boot device path that the disk tool computes for kernel caches
+        # is the one the firmware gives the loader.
+        expect=(
+            f"platform: boot device path {mkdisk.boot_device_path().hex()}\n",
+            LOADING_KERNEL,
+            f"{ROOT_UUID}{PARTITION_GUID}'",
+            KERNEL_START,
+        ),
         forbid=("platform: loader returned",),
         exit="KernelPass",
         kernel=KernelExpect(
