@@ -160,9 +160,9 @@ def driver_code(seed, length):
 def standard_extensions():
     """The extensions directory that every volume carries unless its scenario
     says otherwise: a flat bundle with code, a full-layout bundle whose code
-    is a fat file (the reference kernel's, any x86 slice will do) with a
-    nested bundle that has no code, and a "Safe Boot" bundle that the loader
-    leaves out."""
+    is a fat file (tests/guest's driver.fat, whose x86 slice is the file
+    nimb_kernel) with a nested bundle that has no code, and a "Safe Boot"
+    bundle that the loader leaves out."""
     root = EXTENSIONS_DIR
     return {
         f"{root}/Console.drvb/Info.plist": driver_plist("com.quill.driver.Console", "Root", "Console"),
@@ -170,7 +170,7 @@ def standard_extensions():
         f"{root}/Storage.drvb/Contents/Info.plist": driver_plist(
             "com.quill.driver.Storage", "Local-Root", "Storage", libraries=("com.quill.driver.Console",)
         ),
-        f"{root}/Storage.drvb/Contents/Tarnix/Storage": GuestFile("nimb_kernel.fat-le"),
+        f"{root}/Storage.drvb/Contents/Tarnix/Storage": GuestFile("driver.fat"),
         f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist": driver_plist(
             "com.quill.driver.Partition", ""
         ),
