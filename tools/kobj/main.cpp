@@ -133,21 +133,23 @@ void SetOrder(Options *options, kobj::ByteOrder order) {
   options->fat = true;
 }
 
+// The value of the option `arg` that takes one: what follows '=' in the long
+// form, or the next word (moving `*i` on).
+std::string OptionValue(const std::string &arg, const std::string &name, int argc, char **argv, int *i) {
+  if (arg.size() > name.size() && arg.compare(0, name.size() + 1, name + "=") == 0)
+    return arg.substr(name.size() + 1);
+  if (*i + 1 >= argc)
+    UsageError(name + " needs a value");
+  return argv[++*i];
+}
+
 Options ParseCommandLine(int argc, char **argv) {
   Options options;
   bool outputGiven = false;
   bool optionsEnded = false;
   for (int i = 1; i < argc; i++) {
     std::string arg = argv[i];
-    // The value of an option that takes one: the next word, or what follows
-    // '=' in the long form.
-    auto value = [&](const std::string &name) -> std::string {
-      if (arg.size() > name.size() && arg.compare(0, name.size() + 1, name + "=") == 0)
-        return arg.substr(name.size() + 1);
-      if (i + 1 >= argc)
-        UsageError(name + " needs a value");
-      return argv[++i];
-    };
+    auto value = [&](const std::string &name) { return OptionValue(arg, name, argc, argv, &i); };
     auto is = [&](const std::string &name) {
       return arg == name || (name.size() > 2 && arg.compare(0, name.size() + 1, name + "=") == 0);
     };
@@ -216,13 +218,7 @@ int FatMain(int argc, char **argv) {
   bool needX86 = true;
   for (int i = 2; i < argc; i++) {
     std::string arg = argv[i];
-    auto value = [&](const std::string &name) -> std::string {
-      if (arg.size() > name.size() && arg.compare(0, name.size() + 1, name + "=") == 0)
-        return arg.substr(name.size() + 1);
-      if (i + 1 >= argc)
-        UsageError(name + " needs a value");
-      return argv[++i];
-    };
+    auto value = [&](const std::string &name) { return OptionValue(arg, name, argc, argv, &i); };
     if (arg == "-h" || arg == "--help") {
       std::fputs(kFatUsage, stdout);
       return 0;
