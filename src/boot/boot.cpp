@@ -9,6 +9,7 @@
 #include "devicetree/platform.h"
 #include "load/kernel.h"
 #include "memory/tracking.h"
+#include "resume/resume.h"
 #include "screen/bootscreen.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
@@ -57,6 +58,9 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
   if (EFI_ERROR(status)) {
     Fatal("Could not allocate kernel call gate (%x)\n", status);
   }
+
+  // A hibernated image asked for: restarted from in here, or a reset.
+  TryResume();
 
   if (EFI_ERROR(gBS->HandleProtocol(gImageHandle, &gEfiLoadedImageProtocolGuid,
                                     reinterpret_cast<void **>(&gLoadedImage))) ||
