@@ -12,6 +12,7 @@
 #include "load/kernel.h"
 #include "load/kernel_cache.h"
 #include "memory/tracking.h"
+#include "resume/resume.h"
 #include "screen/bootscreen.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
@@ -60,6 +61,9 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
   if (EFI_ERROR(status)) {
     Fatal("Could not allocate kernel call gate (%x)\n", status);
   }
+
+  // A hibernated image asked for: restarted from in here, or a reset.
+  TryResume();
 
   if (EFI_ERROR(gBS->HandleProtocol(gImageHandle, &gEfiLoadedImageProtocolGuid,
                                     reinterpret_cast<void **>(&gLoadedImage))) ||
