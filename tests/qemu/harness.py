@@ -194,6 +194,7 @@ KERNEL_RESULT = re.compile(r"(pass|fail) \((\d+) checks?, (\d+) failed\)")
 KERNEL_RANGE = re.compile(r"(.+) address=(0x[0-9a-f]+) length=(0x[0-9a-f]+)")
 KERNEL_MEMMAP_TYPE = re.compile(r"type (\S+) count=(\d+) pages=(0x[0-9a-f]+)")
 KERNEL_HOLD = re.compile(r"(\d+) s")
+KERNEL_DRIVER = re.compile(r'(".*") from=(\w+) address=(0x[0-9a-f]+) plist=(0x[0-9a-f]+) code=(0x[0-9a-f]+) sum=(0x[0-9a-f]+)')
 TREE_NODE = re.compile(r"( *)([^=]*)/ \((\d+) propert(?:y|ies), (\d+) child(?:ren)?\)")
 TREE_PROPERTY = re.compile(r"( *)(\S.*?) = (.*)")
 ROOT_UUID_MESSAGE = re.compile(r"root device uuid is '(.*)'")
@@ -223,6 +224,10 @@ class KernelReport:
     efi: dict = dataclasses.field(default_factory=dict)  # field -> number
     result: tuple | None = None  # (passed, checks, failed) of the result line
     hold: int | None = None  # seconds of a hold line
+    drivers: list = dataclasses.field(default_factory=list)  # (identifier, from, plist, code, sum), in order
+    package: tuple | None = None  # (length, sum) of the driver package
+    drivers_from: str | None = None  # "loader", "cache" or "none"
+    tsc: dict = dataclasses.field(default_factory=dict)  # moment -> time stamp counter
     unknown: list = dataclasses.field(default_factory=list)  # lines of no known kind
 
     def failed_checks(self):
@@ -309,6 +314,16 @@ def parse_kernel_report(log):
         elif kind == "result" and KERNEL_RESULT.fullmatch(rest):
             verdict, checks, failed = KERNEL_RESULT.fullmatch(rest).groups()
             report.result = (verdict == "pass", int(checks), int(failed))
+        elif kind == "driver" and KERNEL_DRIVER.fullmatch(rest):
+            identifier, source, _, plist, code, checksum = KERNEL_DRIVER.fullmatch(rest).groups()
+            report.drivers.append((unquote(identifier)[0], source, int(plist, 16), int(code, 16), int(checksum, 16)))
+        elif kind == "package":
+            numbers = fields(rest)
+            report.package = (numbers.get("length"), numbers.get("sum"))
+        elif kind == "tsc":
+            report.tsc.update(fields(rest))
+        elif kind == "drivers":
+            report.drivers_from = fields(rest).get("from")
         elif kind == "hold" and KERNEL_HOLD.fullmatch(rest):
             report.hold = int(KERNEL_HOLD.fullmatch(rest).group(1))
         else:
@@ -334,7 +349,42 @@ def describe(wanted):
     return repr(wanted)
 
 
-def check_kernel(log, expect):
+def content_bytes(content, guest_dir=GUEST_DIR):
+    """The bytes of a file's content as scenarios give it: bytes, text, a
+    host Path or a GuestFile."""
+    if isinstance(content, GuestFile):
+        content = Path(guest_dir) / content.name
+    if isinstance(content, Path):
+        return content.read_bytes()
+    return content.encode() if isinstance(content, str) else bytes(content)
+
+
+def check_drivers(report, expect, guest_dir=GUEST_DIR):
+    """Problems with the drivers that the kernel reported against `expect`:
+    where they came from, the driver blocks in order (identifier, length of
+    the text with its zero, length and Adler-32 of the code) and the
+    package (length and Adler-32)."""
+    problems = []
+    if expect.drivers_from is not None and report.drivers_from != expect.drivers_from:
+        problems.append(f"kernel: drivers from {report.drivers_from}, wanted {expect.drivers_from}")
+    if expect.drivers is not None:
+        wanted = []
+        for identifier, driver in expect.drivers.items():
+            code = content_bytes(driver.code, guest_dir)
+            wanted.append((identifier, len(content_bytes(driver.plist)) + 1, len(code), zlib.adler32(code)))
+        got = [(identifier, plist, code, checksum) for identifier, _, plist, code, checksum in report.drivers]
+        if got != wanted:
+            show = lambda rows: [f"{i} plist={p:#x} code={c:#x} sum={s:#x}" for i, p, c, s in rows]  # noqa: E731
+            problems.append(f"kernel: drivers {show(got)}, wanted {show(wanted)}")
+    if expect.package is not None:
+        package = content_bytes(expect.package, guest_dir)
+        wanted = (len(package), zlib.adler32(package))
+        if report.package != wanted:
+            problems.append(f"kernel: package (length, sum) {report.package}, wanted {wanted}")
+    return problems
+
+
+def check_kernel(log, expect, guest_dir=GUEST_DIR):
     """Problems with the kernel's report against `expect` (KernelExpect), and
     with what holds in any report: one start, a result line that agrees
     with the checks, no broken tree, a "boot-uuid" that is the text the
@@ -382,6 +432,8 @@ def check_kernel(log, expect):
             problems.append(f"kernel: no range {name}")
         elif length is not None and report.ranges[name][1] != length:
             problems.append(f"kernel: range {name} length {report.ranges[name][1]:#x}, wanted {length:#x}")
+
+    problems += check_drivers(report, expect, guest_dir)
 
     printed = ROOT_UUID_MESSAGE.findall(log)
     uuid = report.tree.get("/chosen", {}).get("boot-uuid")
@@ -703,14 +755,9 @@ def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
     for path, content in files.items():
         target = volume / path.strip("/")
         target.parent.mkdir(parents=True, exist_ok=True)
-        if isinstance(content, GuestFile):
-            content = Path(guest_dir) / content.name
-            if not content.is_file():
-                raise FileNotFoundError(f"{content} is missing: build the target guest_kernel first")
-        if isinstance(content, Path):
-            shutil.copyfile(content, target)
-        else:
-            target.write_bytes(content.encode() if isinstance(content, str) else content)
+        if isinstance(content, GuestFile) and not (Path(guest_dir) / content.name).is_file():
+            raise FileNotFoundError(f"{Path(guest_dir) / content.name} is missing: build the target guest_kernel first")
+        target.write_bytes(content_bytes(content, guest_dir))
     # Deepest first: setting a directory's time after its children's.
     for path, when in sorted(scenario.times.items(), key=lambda item: -item[0].count("/")):
         mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
@@ -808,7 +855,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     problems += check_log(log, scenario.expect, scenario.forbid)
     problems += check_console_modes(log, scenario.console_modes)
     if scenario.kernel is not None:
-        problems += check_kernel(log, scenario.kernel)
+        problems += check_kernel(log, scenario.kernel, guest_dir)
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
         problems += trouble + picture

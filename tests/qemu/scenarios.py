@@ -109,6 +109,25 @@ class KernelExpect:
     tree: dict = dataclasses.field(default_factory=dict)
     # Range of /chosen/memory-map -> its length, or None for any.
     ranges: dict = dataclasses.field(default_factory=dict)
+    # Where the drivers came from: "loader" (staged or a package), "cache"
+    # (prelinked in a kernel cache) or "none"; None: not checked.
+    drivers_from: str | None = None
+    # The driver blocks, in order: identifier -> DriverExpect; None: not
+    # checked.
+    drivers: dict | None = None
+    # The driver package's bytes (its x86 slice), as content; None: not
+    # checked.
+    package: object = None
+
+
+@dataclasses.dataclass(frozen=True)
+class DriverExpect:
+    """A driver block as the kernel must find it: the text of the bundle's
+    Info.plist and the code (its x86 slice), as content (bytes, text, a host
+    Path or a GuestFile)."""
+
+    plist: object
+    code: object = b""
 
 
 @dataclasses.dataclass(frozen=True)
