@@ -49,6 +49,8 @@ REPO = Path(__file__).resolve().parents[2]
 # table, no code in both.
 EXIT_CODE_HEADERS = (REPO / "platform" / "exitcodes.h", REPO / "tests" / "guest" / "exitcodes.h")
 GUEST_DIR = REPO / "build" / "tests" / "guest"
+# The host tools (kcache); --tools-dir changes it.
+TOOLS_DIR = REPO / "build" / "tools"
 ARTWORK = REPO / "src" / "screen" / "artwork.cpp"
 DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
@@ -763,20 +765,45 @@ def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
         mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
 
 
+def make_cache(cache, volume):
+    """Writes the kernel cache of `cache` (KernelCache) on the staged
+    volume with kcache, for the machine the harness boots (model and boot
+    device path), then shifts its time or breaks its checksum as asked.
+    Returns the name the loader will look for, as kcache printed it."""
+    kcache = Path(TOOLS_DIR) / "kcache"
+    if not kcache.is_file():
+        raise FileNotFoundError(f"{kcache} is missing: build the target kcache first")
+    args = [str(kcache), str(volume / cache.kernel), "--model", cache.model,
+            "--boot-path-hex", mkdisk.boot_device_path().hex(), "--volume", str(volume)]
+    for arg in cache.args:
+        args.append(str(volume / arg[len("volume:"):]) if arg.startswith("volume:") else arg)
+    done = subprocess.run(args, check=True, capture_output=True, text=True)
+    name = done.stdout.strip().splitlines()[-1]
+    path = volume / name.replace("\\", "/")
+    when = path.stat().st_mtime_ns
+    if cache.break_checksum:
+        data = bytearray(path.read_bytes())
+        data[8] ^= 0xFF  # the header's Adler-32
+        path.write_bytes(data)
+    mkdisk.set_time(path, when + int(cache.shift * 1_000_000_000))
+    return name
+
+
 def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
-    """Builds the scenario's disk in `workdir` with the disk tool; returns
-    its path."""
+    """Builds the scenario's disk in `workdir` with the disk tool. Returns
+    its path and the name of the kernel cache on it, or None."""
     efi_dir = Path(efi_dir)
     volume = workdir / "volume"
     volume.mkdir()
     stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
+    cache_name = make_cache(scenario.cache, volume) if scenario.cache is not None else None
     loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
     disk = workdir / "disk.img"
     try:
-        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader)
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20)
     except mkdisk.DiskError as error:
         raise OSError(str(error)) from error
-    return disk
+    return disk, cache_name
 
 
 class SerialFollower:
@@ -840,7 +867,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     start = time.monotonic()
     workdir = Path(tempfile.mkdtemp(prefix=f"nimb-qemu-{scenario.name}-"))
     try:
-        disk = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
+        disk, cache_name = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
     except BaseException:
         shutil.rmtree(workdir, ignore_errors=True)
         raise
@@ -853,6 +880,10 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     outcome = decode_exit(returncode, read_exit_codes())
     problems = check_report(log, outcome, scenario.status, scenario.memory, scenario.exit)
     problems += check_log(log, scenario.expect, scenario.forbid)
+    if cache_name is not None:
+        # The name that kcache gave the cache, from the boot device path the
+        # disk tool computes, is the one the loader looks for.
+        problems += check_log(log, [f"Looking for kernel cache file '{cache_name}'"])
     problems += check_console_modes(log, scenario.console_modes)
     if scenario.kernel is not None:
         problems += check_kernel(log, scenario.kernel, guest_dir)
@@ -954,7 +985,7 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
     and lets the kernel power off. True when the kernel passed and the
     screenshot was taken."""
     workdir = Path(tempfile.mkdtemp(prefix="nimb-qemu-demo-"))
-    disk = prepare(DEMO, efi_dir, workdir, loader, guest_dir=guest_dir)
+    disk, _ = prepare(DEMO, efi_dir, workdir, loader, guest_dir=guest_dir)
     DEMO_SCREEN.parent.mkdir(parents=True, exist_ok=True)
     if DEMO_SCREEN.exists():
         DEMO_SCREEN.unlink()
@@ -1000,10 +1031,12 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
 
 
 def main(argv=None):
+    global TOOLS_DIR
     parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"), help="where BOOTX64.efi and nimbboot.efi are")
     parser.add_argument("--loader", help="another EFI program to start in place of nimbboot.efi")
     parser.add_argument("--guest-dir", default=str(GUEST_DIR), help="where the reference kernel's files are")
+    parser.add_argument("--tools-dir", default=str(TOOLS_DIR), help="where the host tools (kcache) are")
     parser.add_argument("--scenario", action="append", help="run this scenario (repeatable; default all)")
     parser.add_argument("--timeout", type=float, help="seconds per run, instead of the scenario's own")
     parser.add_argument("--show-log", action="store_true", help="print the serial log of passing runs too")
@@ -1012,6 +1045,7 @@ def main(argv=None):
     args = parser.parse_args(argv)
     for number in (signal.SIGTERM, signal.SIGINT, signal.SIGHUP):
         signal.signal(number, Machine.kill_all)
+    TOOLS_DIR = Path(args.tools_dir)
 
     if args.list:
         print("\n".join(SCENARIOS))

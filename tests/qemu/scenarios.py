@@ -199,6 +199,22 @@ def standard_extensions():
 
 
 @dataclasses.dataclass(frozen=True)
+class KernelCache:
+    """A kernel cache that the harness has kcache write on the volume, after
+    the files and their times, for the machine it boots. kcache gives it the
+    time one second after the newer of the kernel and the extensions
+    directory; `shift` seconds are added to that. Arguments of `args` that
+    start with "volume:" are paths on the volume."""
+
+    args: tuple = ()
+    kernel: str = "nimb_kernel"
+    model: str = "QEMU1,1"
+    shift: float = 0
+    # Breaks the header's checksum, so that the cache decompresses but fails.
+    break_checksum: bool = False
+
+
+@dataclasses.dataclass(frozen=True)
 class Scenario:
     name: str
     # platform.cfg keys, over BASE_CONFIG; the file is left out when there
@@ -217,6 +233,10 @@ class Scenario:
     # volume with the others; None: no extensions directory at all.
     extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
     directories: tuple = ()
+    # A kernel cache made for the volume, or None.
+    cache: KernelCache | None = None
+    # The disk's size in MiB.
+    disk_mib: int = 64
     # Exact modification times (UTC, "YYYY-MM-DD hh:mm:ss.nnnnnnnnn") of
     # files or directories of the volume, as the platform layer serves them.
     times: dict = dataclasses.field(default_factory=dict)
