@@ -12,6 +12,7 @@ from pathlib import Path
 import harness
 from scenarios import (
     BASE_CONFIG,
+    mkdisk,
     SCENARIOS,
     AtLeast,
     DriverExpect,
@@ -354,6 +355,33 @@ class KernelReport(unittest.TestCase):
                 self.assertEqual(len(problems), len(wanted), problems)
                 for problem, part in zip(problems, wanted):
                     self.assertIn(part, problem)
+
+
+class DiskTool(unittest.TestCase):
+    def test_time_rows(self):
+        rows = [
+            ("year boundary", "2006-12-31 23:59:59.500000000"),
+            ("leap day", "2008-02-29 00:00:00.000000001"),
+            ("before 1970", "1969-12-31 23:59:59.999999999"),
+        ]
+        for name, text in rows:
+            with self.subTest(name):
+                self.assertEqual(mkdisk.efi_time_text(mkdisk.parse_time(text)), text)
+        self.assertEqual(mkdisk.parse_time("1970-01-01 00:00:01.5"), 1_500_000_000)
+        self.assertRaises(ValueError, mkdisk.parse_time, "2006-12-31T23:59:59")
+
+    def test_times_table_and_boot_path(self):
+        with tempfile.TemporaryDirectory() as directory:
+            volume = Path(directory)
+            (volume / "System" / "Library").mkdir(parents=True)
+            (volume / "nimb_kernel").write_bytes(b"k")
+            mkdisk.set_time(volume / "nimb_kernel", mkdisk.parse_time("2006-12-31 23:59:59.5"))
+            lines = mkdisk.times_table(volume).splitlines()
+        self.assertIn("2006-12-31 23:59:59.500000000 \\nimb_kernel", lines)
+        self.assertEqual([line.split(" ", 2)[2] for line in lines[1:]],
+                         ["\\System", "\\System\\Library", "\\nimb_kernel"])  # fmt: skip
+        path = mkdisk.boot_device_path(disk_bytes=64 << 20)
+        self.assertEqual((len(path), path[-4:], path[28:30]), (74, b"\x7f\xff\x04\x00", b"\x04\x01"))
 
 
 class SerialFollower(unittest.TestCase):

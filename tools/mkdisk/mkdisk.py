@@ -25,6 +25,7 @@ import re
 import struct
 import subprocess
 import sys
+import tempfile
 import uuid
 from pathlib import Path
 
@@ -176,21 +177,20 @@ def build_disk(image, volume, platform, loader, config=None, disk_bytes=DISK_BYT
     entries = [(path.relative_to(volume).as_posix(), path) for path in walk(volume)]
     directories = {path for path, source in entries if source.is_dir()}
     files = {path: source for path, source in entries if not source.is_dir()}
-    staging = image.parent / (image.name + ".generated")
-    for path, content in generated.items():
-        if not isinstance(content, Path):
-            staging.mkdir(exist_ok=True)
-            source = staging / Path(path).name
-            source.write_text(content)
-            content = source
-        files[path] = content
-    for path in files:
-        parts = path.split("/")
-        directories.update("/".join(parts[:i]) for i in range(1, len(parts)))
-    for directory in sorted(directories, key=lambda d: (d.count("/"), d)):
-        run_tool("mmd", "-i", target, f"::/{directory}")
-    for path in sorted(files):
-        run_tool("mcopy", "-m", "-i", target, str(Path(files[path]).resolve()), f"::/{path}")
+    with tempfile.TemporaryDirectory(prefix="mkdisk-") as staging:
+        for path, content in generated.items():
+            if not isinstance(content, Path):
+                source = Path(staging) / Path(path).name
+                source.write_text(content)
+                content = source
+            files[path] = content
+        for path in files:
+            parts = path.split("/")
+            directories.update("/".join(parts[:i]) for i in range(1, len(parts)))
+        for directory in sorted(directories, key=lambda d: (d.count("/"), d)):
+            run_tool("mmd", "-i", target, f"::/{directory}")
+        for path in sorted(files):
+            run_tool("mcopy", "-m", "-i", target, str(Path(files[path]).resolve()), f"::/{path}")
     return image
 
 
