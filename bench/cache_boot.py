@@ -8,7 +8,8 @@ real x86 code (the host's own shared libraries and programs), which
 compresses as a kernel does, then incompressible bytes up to a cache of about
 16 MiB (the cache writer's optimal parse takes minutes on tens of MiB of
 code, and the kernel's segments must fit the firmware's free low memory).
-The platform layer reads the cache whole through the
+The kernel is the one linked at 64 MiB, since the firmware leaves no room
+for 16 MiB behind 1 MiB. The platform layer reads the cache whole through the
 firmware's file system (time-read in platform.cfg) and notes the time stamp
 counter around that read and right before it starts the loader; the kernel
 notes it at its entry. Under TCG the counter follows virtual time, so only
@@ -86,8 +87,9 @@ def main(argv=None):
     payload = real_code(code) + random.Random(1).randbytes(filler)
     scenario = Scenario(
         "cache_boot",
+        # Linked at 64 MiB: the firmware leaves no 16 MiB free behind 1 MiB.
         files={
-            **kernel_file(),
+            **kernel_file("nimb_kernel.high"),
             f"{PAYLOAD}/Info.plist": driver_plist("com.quill.driver.Payload", "Root", "Payload"),
             f"{PAYLOAD}/Payload": payload,
         },
@@ -99,7 +101,7 @@ def main(argv=None):
     volume.mkdir()
     config = harness.scenario_config(scenario)
     harness.stage_volume(scenario, volume, config, args.guest_dir)
-    name = harness.make_cache(scenario.cache, volume)
+    name = harness.make_cache(scenario.cache, volume, scenario.disk_mib << 20)
     cache = volume / name.replace("\\", "/")
     # The firmware reads the same file, timed, before the loader starts.
     config["time-read"] = "\\" + name

@@ -767,16 +767,17 @@ def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
         mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
 
 
-def make_cache(cache, volume):
+def make_cache(cache, volume, disk_bytes=mkdisk.DISK_BYTES):
     """Writes the kernel cache of `cache` (KernelCache) on the staged
     volume with kcache, for the machine the harness boots (model and boot
-    device path), then shifts its time or breaks its checksum as asked.
-    Returns the name the loader will look for, as kcache printed it."""
+    device path of a disk of `disk_bytes`), then shifts its time or breaks
+    its checksum as asked. Returns the name the loader will look for, as
+    kcache printed it."""
     kcache = Path(TOOLS_DIR) / "kcache"
     if not kcache.is_file():
         raise FileNotFoundError(f"{kcache} is missing: build the target kcache first")
     args = [str(kcache), str(volume / cache.kernel), "--model", cache.model,
-            "--boot-path-hex", mkdisk.boot_device_path().hex(), "--volume", str(volume)]
+            "--boot-path-hex", mkdisk.boot_device_path(disk_bytes=disk_bytes).hex(), "--volume", str(volume)]
     for arg in cache.args:
         args.append(str(volume / arg[len("volume:"):]) if arg.startswith("volume:") else arg)
     done = subprocess.run(args, check=True, capture_output=True, text=True)
@@ -798,11 +799,12 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
     volume = workdir / "volume"
     volume.mkdir()
     stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
-    cache_name = make_cache(scenario.cache, volume) if scenario.cache is not None else None
+    disk_bytes = scenario.disk_mib << 20
+    cache_name = make_cache(scenario.cache, volume, disk_bytes) if scenario.cache is not None else None
     loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
     disk = workdir / "disk.img"
     try:
-        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20)
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=disk_bytes)
     except mkdisk.DiskError as error:
         raise OSError(str(error)) from error
     return disk, cache_name
