@@ -4,6 +4,8 @@
 // of each input.
 #pragma once
 
+#include <vector>
+
 #include "boot/boot.h"
 #include "hostfw/hostfw.h"
 #include "memory/tracking.h"
@@ -18,6 +20,35 @@ inline void AttachLoader(hostfw::Firmware &fw) {
   nimb::gMemoryTags = nullptr;
   nimb::gFreeMemoryTags = nullptr;
   nimb::gMemoryTagBlocks = nullptr;
+}
+
+// Declares all of the arena above its first `usable` bytes reserved, so that
+// a segment or block of a gigabyte is refused at once instead of being
+// filled byte by byte on every run.
+inline void LimitUsableMemory(hostfw::Firmware &fw, UINT64 usable) {
+  UINT64 cut = hostfw::kArenaBase + usable;
+  for (const EFI_MEMORY_DESCRIPTOR &d : fw.MemoryMap()) {
+    UINT64 start = d.PhysicalStart;
+    UINT64 end = start + d.NumberOfPages * EFI_PAGE_SIZE;
+    if (d.Type != EfiConventionalMemory || end <= cut)
+      continue;
+    if (start < cut)
+      start = cut;
+    fw.AddMemoryRegion(EfiReservedMemoryType, start, (end - start) / EFI_PAGE_SIZE, 0);
+  }
+}
+
+// For a target whose firmware records every file name opened: each input
+// then leaves heap behind it, and libFuzzer would scan the whole arena for
+// leaks after each. The loader's own memory is checked by the firmware's
+// counts instead. Called from LLVMFuzzerInitialize.
+inline void WithoutLeakScan(int *argc, char ***argv) {
+  static std::vector<char *> arguments(*argv, *argv + *argc);
+  static char noLeaks[] = "-detect_leaks=0";
+  arguments.push_back(noLeaks);
+  arguments.push_back(nullptr);
+  *argc += 1;
+  *argv = arguments.data();
 }
 
 }  // namespace nimbfuzz
