@@ -32,21 +32,13 @@ uint32_t GetLe32(const uint8_t *at) {
 
 constexpr UINT64 kRegionTop = hostfw::kArenaBase + (8ull << 20);
 
-struct Machine {
-  hostfw::Firmware fw;
-  std::string directory;
-  EFI_FILE *root = nullptr;
+struct Machine : nimbfuzz::VolumeMachine {
   std::vector<std::string> lists;  // the two Info.plist files on the host
 };
 
 Machine &TheMachine() {
   static Machine *machine = [] {
     auto *m = new Machine;
-    m->fw.SetConOutPresent(false);
-    m->fw.SetStdErrPresent(false);
-    nimbfuzz::LimitUsableMemory(m->fw, 32ull << 20);
-    char pattern[] = "/tmp/nimb-bundles-fuzz-XXXXXX";
-    m->directory = mkdtemp(pattern);
     // A full bundle with a nested flat one; code under the name "a" in both,
     // the nested one a fat file whose slice runs past its end.
     const std::string a = m->directory + "/System/Library/Extensions/A.drvb";
@@ -58,11 +50,6 @@ Machine &TheMachine() {
                            0,    32,   0,    0,    0, 8, 0, 0, 0, 0, 0, 0, 0, 0, 'c', 'o', 'd', 'e'};
     std::ofstream(b + "/a", std::ios::binary).write(reinterpret_cast<const char *>(fat), sizeof(fat));
     m->lists = {a + "/Contents/Info.plist", b + "/Info.plist"};
-    EFI_HANDLE device = m->fw.AddDirectoryVolume(m->directory);
-    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
-    m->fw.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
-                                         reinterpret_cast<void **>(&fileSystem));
-    Check(fileSystem->OpenVolume(fileSystem, &m->root) == EFI_SUCCESS);
     return m;
   }();
   return *machine;

@@ -4,6 +4,9 @@
 // of each input.
 #pragma once
 
+#include <stdlib.h>
+
+#include <string>
 #include <vector>
 
 #include "boot/boot.h"
@@ -37,6 +40,30 @@ inline void LimitUsableMemory(hostfw::Firmware &fw, UINT64 usable) {
     fw.AddMemoryRegion(EfiReservedMemoryType, start, (end - start) / EFI_PAGE_SIZE, 0);
   }
 }
+
+// A firmware for targets that read files: quiet (messages would pile up in
+// its records over millions of runs), with the usable memory limited, and
+// a directory volume over a fresh host directory whose root stays open.
+struct VolumeMachine {
+  hostfw::Firmware fw;
+  std::string directory;
+  EFI_HANDLE device = nullptr;
+  EFI_FILE *root = nullptr;
+
+  VolumeMachine() {
+    fw.SetConOutPresent(false);
+    fw.SetStdErrPresent(false);
+    LimitUsableMemory(fw, 32ull << 20);
+    char pattern[] = "/tmp/nimb-fuzz-XXXXXX";
+    directory = mkdtemp(pattern);
+    device = fw.AddDirectoryVolume(directory);
+    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
+    fw.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
+                                      reinterpret_cast<void **>(&fileSystem));
+    if (fileSystem == nullptr || EFI_ERROR(fileSystem->OpenVolume(fileSystem, &root)))
+      abort();
+  }
+};
 
 // For a target whose firmware records every file name opened: each input
 // then leaves heap behind it, and libFuzzer would scan the whole arena for

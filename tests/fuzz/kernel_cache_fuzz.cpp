@@ -46,11 +46,7 @@ uint32_t GetBe32(const uint8_t *at) {
   return uint32_t(at[0]) << 24 | uint32_t(at[1]) << 16 | uint32_t(at[2]) << 8 | at[3];
 }
 
-struct Machine {
-  hostfw::Firmware fw;
-  std::string directory;
-  EFI_HANDLE device = nullptr;
-  EFI_FILE *root = nullptr;
+struct Machine : nimbfuzz::VolumeMachine {
   std::string cachePath;  // on the host
 };
 
@@ -70,20 +66,10 @@ void Prepare(Machine &m) {
 Machine &TheMachine() {
   static Machine *machine = [] {
     auto *m = new Machine;
-    m->fw.SetConOutPresent(false);
-    m->fw.SetStdErrPresent(false);
-    nimbfuzz::LimitUsableMemory(m->fw, 32ull << 20);
-    char pattern[] = "/tmp/nimb-cache-fuzz-XXXXXX";
-    m->directory = mkdtemp(pattern);
     std::ofstream(m->directory + "/nimb_kernel") << "k";
     const std::string extensions = m->directory + "/System/Library/Extensions";
     std::filesystem::create_directories(extensions);
     std::filesystem::create_directories(m->directory + "/System/Library/Caches/com.quill.kernelcaches");
-    m->device = m->fw.AddDirectoryVolume(m->directory);
-    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
-    m->fw.BootServices()->HandleProtocol(m->device, &gEfiSimpleFileSystemProtocolGuid,
-                                         reinterpret_cast<void **>(&fileSystem));
-    Check(fileSystem->OpenVolume(fileSystem, &m->root) == EFI_SUCCESS);
     // The first try names the file.
     Prepare(*m);
     std::strcpy(nimb::gModelName, "FuzzBox1,1");
