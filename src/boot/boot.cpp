@@ -4,6 +4,7 @@
 #include "boot/gate.h"
 #include "boot/handoff.h"
 #include "boot/machine.h"
+#include "boot/stop.h"
 #include "boot/volume.h"
 #include "config/boot_options.h"
 #include "devicetree/platform.h"
@@ -11,6 +12,7 @@
 #include "load/kernel.h"
 #include "load/kernel_cache.h"
 #include "memory/tracking.h"
+#include "resume/resume.h"
 #include "screen/bootscreen.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
@@ -59,6 +61,9 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
   if (EFI_ERROR(status)) {
     Fatal("Could not allocate kernel call gate (%x)\n", status);
   }
+
+  // A hibernated image asked for: restarted from in here, or a reset.
+  TryResume();
 
   if (EFI_ERROR(gBS->HandleProtocol(gImageHandle, &gEfiLoadedImageProtocolGuid,
                                     reinterpret_cast<void **>(&gLoadedImage))) ||
@@ -110,10 +115,11 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
   FinishBootInfo(&mapKey, gBootOptions);
 
   // Boot services are gone. Nothing but the arguments' loading stands between
-  // the interrupts going off and the call; the gate does not come back (and
-  // with boot services gone there would be no console to say so).
+  // the interrupts going off and the call. The gate does not come back; should
+  // it, there is no console left to say so.
   MachineDisableInterrupts();
-  MachineCallGate(gCallGate, reinterpret_cast<UINT64>(bootArgs), gKernelEntry);
+  MachineEnterGate(gCallGate, reinterpret_cast<UINT64>(bootArgs), gKernelEntry);
+  StopAfterBootServices("Kernel entry failed\n", FALSE);
 }
 
 }  // namespace nimb
