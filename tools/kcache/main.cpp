@@ -154,6 +154,9 @@ Options ParseOptions(int argc, char **argv) {
   if (!options.haveBootPath) {
     UsageError("no --boot-path-hex given");
   }
+  if (options.model.empty()) {
+    UsageError("--model is empty");
+  }
   if (options.kernelName.empty()) {
     UsageError("--kernel-name is empty");
   }
