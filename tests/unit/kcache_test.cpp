@@ -1,7 +1,6 @@
-// The kernel cache writer: the key and the name it gives, the header and
-// the stream behind it read back with the loader's decoder and checksum, the
-// file's time, prelinked drivers loaded back with the loader's LoadKernel,
-// and whole caches booted by the loader's LoadKernelCache.
+// The kernel cache writer: the key and the name it gives, the file's time,
+// prelinked drivers against the loader's own staging and loaded back with
+// its LoadKernel, and whole caches booted by the loader's LoadKernelCache.
 #include <gtest/gtest.h>
 
 #include <algorithm>
@@ -17,9 +16,7 @@
 #include "load/bundles.h"
 #include "load/kernel.h"
 #include "load/kernel_cache.h"
-#include "load/lzss.h"
 #include "loader_fixture.h"
-#include "support/checksum.h"
 #include "support/devicepath.h"
 
 namespace {
@@ -51,8 +48,6 @@ TEST(KcacheTest, KeyAndName) {
   const std::string nul(1, '\0');
   const Row rows[] = {
       {"plain", "Box9,1", 24, "nimb_kernel", "nimb_kernel" + nul},
-      {"model cut at 64", std::string(70, 'M'), 24, "k", "k" + nul},
-      {"250-byte path", "Box", 250, "nimb_kernel", "nimb_" + nul},
       {"two- and three-byte characters", "Box", 24, "k\xC3\xA9rn\xE2\x82\xACl",
        "k\xC3\xA9rn\xE2\x82\xACl" + nul},
       {"a character that does not fit", "Box", 252, "\xC3\xA9\xC3\xA9", "\xC3\xA9" + nul},
@@ -91,41 +86,13 @@ TEST(KcacheTest, DevicePathsThatAreNotOne) {
   } rows[] = {
       {DevicePath(24), true},
       {{0x7F, 0xFF, 0x04, 0x00}, true},
-      {{0xFF, 0xFF, 0x04, 0x00}, true},
       {{0x7F, 0x01, 0x04, 0x00}, false},  // the end of an instance only
       {{0x04, 0x03, 0x02, 0x00, 0x7F, 0xFF, 0x04, 0x00}, false},
-      {{0x04, 0x03, 0x40, 0x00, 0x7F, 0xFF, 0x04, 0x00}, false},
       {{0x7F, 0xFF, 0x04, 0x00, 0x00}, false},
       {{}, false},
   };
   for (const auto &row : rows)
     EXPECT_EQ(kcache::CheckDevicePath(row.path).empty(), row.good) << testing::PrintToString(row.path);
-}
-
-uint32_t GetBe32(const Bytes &bytes, size_t at) {
-  return static_cast<uint32_t>(bytes[at]) << 24 | bytes[at + 1] << 16 | bytes[at + 2] << 8 | bytes[at + 3];
-}
-
-TEST(KcacheTest, HeaderAndStreamReadBackWithTheLoadersCode) {
-  Bytes kernel = nimbtest::Pattern(70000);
-  kernel.insert(kernel.end(), 9000, 0);
-  const kcache::CacheKey key = kcache::MakeCacheKey("Box9,1", DevicePath(30), "nimb_kernel");
-  for (bool match : {true, false}) {
-    const Bytes file = kcache::WriteCache(kernel, key, match);
-    ASSERT_GT(file.size(), 384u);
-    EXPECT_EQ(std::string(file.begin(), file.begin() + 8), "complzss");
-    EXPECT_EQ(GetBe32(file, 12), kernel.size());
-    EXPECT_EQ(GetBe32(file, 16), file.size() - 384);
-    const Bytes fields(file.begin() + 64, file.begin() + 384);
-    EXPECT_EQ(fields, match ? Bytes(key.begin(), key.end()) : Bytes(320, 0));
-
-    Bytes out(kernel.size());
-    EXPECT_EQ(nimb::DecompressLzss(out.data(), out.size(), file.data() + 384, GetBe32(file, 16)),
-              kernel.size());
-    EXPECT_EQ(out, kernel);
-    const uint32_t sum = nimb::Adler32(out.data(), out.size());
-    EXPECT_EQ(std::memcmp(&file[8], &sum, 4), 0);
-  }
 }
 
 TEST(KcacheTest, TimeIsOneSecondAfterTheNewer) {
@@ -152,6 +119,24 @@ class PrelinkTest : public nimbtest::VolumeTest {};
 Bytes Memory(uint64_t address, uint64_t size) {
   const auto *at = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(address));
   return Bytes(at, at + size);
+}
+
+// The drivers' blocks from `block` on, each on pages of its own, up to the
+// kernel region's top, as the loader stages them.
+void ExpectBlocks(uint64_t block, const std::vector<kcache::Driver> &drivers) {
+  for (const kcache::Driver &driver : drivers) {
+    const Bytes header = Memory(block, 16);
+    const uint32_t length = nimbtest::GetLe32(header, 4);
+    EXPECT_EQ(nimbtest::GetLe32(header, 0), block + 16) << driver.bundle;
+    EXPECT_EQ(nimbtest::GetLe32(header, 8), driver.code.empty() ? 0 : block + 16 + length) << driver.bundle;
+    EXPECT_EQ(nimbtest::GetLe32(header, 12), driver.code.size()) << driver.bundle;
+    Bytes text = driver.text;
+    text.push_back(0);
+    EXPECT_EQ(Memory(block + 16, length), text) << driver.bundle;
+    EXPECT_EQ(Memory(block + 16 + length, driver.code.size()), driver.code) << driver.bundle;
+    block = (block + 16 + length + driver.code.size() + 0xFFF) & ~uint64_t{0xFFF};
+  }
+  EXPECT_EQ(block, nimb::gKernelRegionTop);
 }
 
 std::string Plist(const std::string &entries) {
@@ -199,17 +184,7 @@ TEST_F(PrelinkTest, TheLoadersBundlesLandBehindTheKernel) {
   ASSERT_EQ(nimb::ScanDriverBundles(root_, u"System\\Library\\Extensions", 1), EFI_SUCCESS);
   nimb::WalkDriverLibraries();
   nimb::StageDrivers(root_);
-  uint64_t block = 0x400000;
-  for (const kcache::Driver &driver : drivers) {
-    const Bytes header = Memory(block, 16);
-    const uint32_t length = nimbtest::GetLe32(header, 4), codeLength = nimbtest::GetLe32(header, 12);
-    Bytes text = driver.text;
-    text.push_back(0);
-    EXPECT_EQ(Memory(block + 16, length), text) << driver.bundle;
-    EXPECT_EQ(Memory(block + 16 + length, codeLength), driver.code) << driver.bundle;
-    block = (block + 16 + length + codeLength + 0xFFF) & ~uint64_t{0xFFF};
-  }
-  EXPECT_EQ(block, nimb::gKernelRegionTop);
+  ExpectBlocks(0x400000, drivers);
   nimb::TrackedFreeAll();
   nimb::gKernelRegionBase = 0xFFFFFFFF;
   nimb::gKernelRegionTop = 0;
@@ -240,21 +215,7 @@ TEST_F(PrelinkTest, TheLoadersBundlesLandBehindTheKernel) {
     const Bytes head = Memory(base, 8);
     EXPECT_EQ(nimbtest::GetLe32(head, 0), nimb::kPrelinkMagic);
     EXPECT_EQ(nimbtest::GetLe32(head, 4), drivers.size());
-    block = base + 0x1000;
-    for (const kcache::Driver &driver : drivers) {
-      const Bytes header = Memory(block, 16);
-      const uint32_t length = nimbtest::GetLe32(header, 4);
-      EXPECT_EQ(nimbtest::GetLe32(header, 0), block + 16) << driver.bundle;
-      EXPECT_EQ(length, driver.text.size() + 1) << driver.bundle;
-      EXPECT_EQ(nimbtest::GetLe32(header, 8), driver.code.empty() ? 0 : block + 16 + length) << driver.bundle;
-      EXPECT_EQ(nimbtest::GetLe32(header, 12), driver.code.size()) << driver.bundle;
-      Bytes text = driver.text;
-      text.push_back(0);
-      EXPECT_EQ(Memory(block + 16, length), text) << driver.bundle;
-      EXPECT_EQ(Memory(block + 16 + length, driver.code.size()), driver.code) << driver.bundle;
-      block = (block + 16 + length + driver.code.size() + 0xFFF) & ~uint64_t{0xFFF};
-    }
-    EXPECT_EQ(block, nimb::gKernelRegionTop);
+    ExpectBlocks(base + 0x1000, drivers);
     nimb::TrackedFreeAll();
     nimb::gKernelRegionBase = 0xFFFFFFFF;
     nimb::gKernelRegionTop = 0;
@@ -304,8 +265,11 @@ TEST_F(KcacheBootTest, TheLoaderTakesWhatTheWriterWrote) {
       ASSERT_EQ(kcache::CollectDrivers(dir_->path() + "/" + extensions, &drivers), "");
       ASSERT_EQ(kcache::AddPrelinkSegment(row.fatKernel ? fat : kernel, drivers, &content), "");
     }
-    Put(kcache::CacheFileName(key),
-        row.compressed ? kcache::WriteCache(content, key, row.matchFields) : content);
+    const Bytes file = row.compressed ? kcache::WriteCache(content, key, row.matchFields) : content;
+    if (row.compressed)  // the fields the loader compares, or zeros
+      EXPECT_EQ(Bytes(file.begin() + 64, file.begin() + 384),
+                row.matchFields ? Bytes(key.begin(), key.end()) : Bytes(320, 0));
+    Put(kcache::CacheFileName(key), file);
     ASSERT_EQ(kcache::SetCacheTime(dir_->path() + "/" + kcache::CacheFileName(key),
                                    dir_->path() + "/nimb_kernel", dir_->path() + "/" + extensions),
               "");
