@@ -35,7 +35,7 @@ from pathlib import Path
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
-    PARTITION_GUID,
+    mkdisk,
     SCENARIOS,
     GuestFile,
     Scenario,
@@ -54,8 +54,6 @@ DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
-DISK_BYTES = 64 << 20
-PARTITION_OFFSET = 1 << 20  # first sector 2048
 
 # The platform's report, on the serial port.
 REPORT_STATUS = re.compile(r"platform: loader returned 0x([0-9a-f]+) \((\w+)\)")
@@ -572,40 +570,6 @@ def render_config(keys):
     return "".join(f"{key}={config_value(value)}\n" for key, value in items)
 
 
-def run_tool(*args, env=None):
-    subprocess.run(args, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, env=env)
-
-
-def build_disk(image, files, directories=()):
-    """A GPT disk of DISK_BYTES with one EFI system partition, of the GUID
-    PARTITION_GUID, holding `files` (ESP path with '/' -> bytes or host Path)
-    and `directories` (ESP paths)."""
-    image = Path(image).resolve()
-    with open(image, "wb") as disk:
-        disk.truncate(DISK_BYTES)
-    # A fresh image has nothing to zap, and each of sgdisk's steps costs a
-    # second of waiting for the kernel to reread the table.
-    run_tool("sgdisk", "-o", "-n", "1:2048:0", "-t", "1:EF00", "-u", f"1:{PARTITION_GUID}", str(image))
-    volume = f"{image}@@{PARTITION_OFFSET}"
-    env = dict(os.environ, MTOOLS_SKIP_CHECK="1")
-    run_tool("mformat", "-i", volume, "-F", "-v", "ESP", "::", env=env)
-    needed = set()
-    for path in list(directories) + [str(Path(p).parent) for p in files]:
-        parts = Path(path.strip("/")).parts
-        needed.update("/".join(parts[: i + 1]) for i in range(len(parts)))
-    needed.discard("")
-    for directory in sorted(needed, key=lambda d: (d.count("/"), d)):
-        run_tool("mmd", "-i", volume, f"::/{directory}", env=env)
-    staging = image.parent / "files"
-    for path, content in files.items():
-        source = content
-        if not isinstance(content, Path):
-            source = staging / path.strip("/")
-            source.parent.mkdir(parents=True, exist_ok=True)
-            source.write_bytes(content.encode() if isinstance(content, str) else content)
-        run_tool("mcopy", "-i", volume, str(Path(source).resolve()), f"::/{path.strip('/')}", env=env)
-
-
 # --- QEMU -----------------------------------------------------------------------------
 
 
@@ -724,29 +688,47 @@ def scenario_config(scenario, override=None):
     return config
 
 
-def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
-    """Builds the scenario's disk in `workdir`; returns its path."""
-    efi_dir = Path(efi_dir)
-    files = {
-        "EFI/BOOT/BOOTX64.EFI": efi_dir / "BOOTX64.efi",
-        "EFI/BOOT/nimbboot.efi": Path(loader) if loader else efi_dir / "nimbboot.efi",
-    }
-    for path in files.values():
-        if not path.is_file():
-            raise FileNotFoundError(f"{path} is missing: build the EFI programs first")
-    config = scenario_config(scenario, config_override)
+def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
+    """Writes the scenario's files and directories (the extensions
+    directory's too) into the host directory `volume`, with platform.cfg
+    when `config` has keys or the scenario asks for the file, then gives
+    the paths of `scenario.times` their exact times."""
+    files = {**(scenario.extensions or {}), **scenario.files}
     if config or scenario.config_file:
-        files["EFI/BOOT/platform.cfg"] = render_config(config)
-    for path, content in scenario.files.items():
+        files[f"{mkdisk.BOOT_DIR}/{mkdisk.CONFIG_NAME}"] = render_config(config)
+    for path in scenario.remove:
+        files.pop(path, None)
+    for directory in scenario.directories:
+        (volume / directory.strip("/")).mkdir(parents=True, exist_ok=True)
+    for path, content in files.items():
+        target = volume / path.strip("/")
+        target.parent.mkdir(parents=True, exist_ok=True)
         if isinstance(content, GuestFile):
             content = Path(guest_dir) / content.name
             if not content.is_file():
                 raise FileNotFoundError(f"{content} is missing: build the target guest_kernel first")
-        files[path] = content
-    for path in scenario.remove:
-        files.pop(path, None)
+        if isinstance(content, Path):
+            shutil.copyfile(content, target)
+        else:
+            target.write_bytes(content.encode() if isinstance(content, str) else content)
+    # Deepest first: setting a directory's time after its children's.
+    for path, when in sorted(scenario.times.items(), key=lambda item: -item[0].count("/")):
+        mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
+
+
+def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
+    """Builds the scenario's disk in `workdir` with the disk tool; returns
+    its path."""
+    efi_dir = Path(efi_dir)
+    volume = workdir / "volume"
+    volume.mkdir()
+    stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
+    loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
     disk = workdir / "disk.img"
-    build_disk(disk, files, scenario.directories)
+    try:
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader)
+    except mkdisk.DiskError as error:
+        raise OSError(str(error)) from error
     return disk
 
 
