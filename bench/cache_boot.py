@@ -63,6 +63,24 @@ def real_code(size):
     return bytes(out)
 
 
+def text_moments(log):
+    """(moment, first line of the text) of each `platform: tsc text=` line."""
+    return [(int(value, 16), text) for value, text in re.findall(r"platform: tsc text=0x([0-9a-f]+)\n([^\n]*)", log)]
+
+
+def breakdown(log, entry):
+    """Where the loader's time went, from the moments of its texts: up to
+    the cache's look-up, the read (from there to the last dot of a read
+    chunk), the rest (decompression, checksum, placing, hand-off) up to the
+    kernel's entry. None when the texts are not there."""
+    texts = text_moments(log)
+    look = next((moment for moment, text in texts if text.startswith("Looking for kernel cache")), None)
+    dots = [moment for moment, text in texts if look is not None and moment > look and text.strip(".") == ""]
+    if look is None or not dots:
+        return None
+    return look, dots[-1] - look, entry - dots[-1]
+
+
 def tsc_moments(log):
     moments = {name: int(value, 16) for name, value in re.findall(r"platform: tsc (\S+)=0x([0-9a-f]+)", log)}
     entry = harness.parse_kernel_report(log).tsc.get("entry")
@@ -79,6 +97,8 @@ def main(argv=None):
     parser.add_argument("--code-mib", type=float, default=CODE_BYTES / (1 << 20), help="MiB of real code in the driver")
     parser.add_argument("--cache-mib", type=float, default=CACHE_BYTES / (1 << 20), help="the cache's size to aim at")
     parser.add_argument("--keep", action="store_true", help="keep the work directory")
+    parser.add_argument("--breakdown", action="store_true",
+                        help="boot once more with time-text=1 and say where the loader's time went")
     args = parser.parse_args(argv)
     harness.TOOLS_DIR = Path(args.tools_dir)
 
@@ -126,6 +146,23 @@ def main(argv=None):
     loader = moments["kernel-entry"] - moments["start-image"]
     print(f"cache_boot: firmware read {read} cycles, loader start to kernel entry {loader} cycles")
     print(f"figure cache-boot-vs-read: {loader / 1e6:.1f} Mcycles vs {read / 1e6:.1f} Mcycles = {loader / read:.2f}x")
+    if args.breakdown:
+        # The moments of the texts cost time of their own: a second boot.
+        config["time-text"] = "1"
+        (volume / mkdisk.BOOT_DIR / mkdisk.CONFIG_NAME).write_text(harness.render_config(config))
+        mkdisk.build_disk(disk, volume, Path(args.efi_dir) / "BOOTX64.efi", Path(args.efi_dir) / "nimbboot.efi",
+                          disk_bytes=scenario.disk_mib << 20)
+        _, log, _, _ = harness.boot(disk, workdir, 600)
+        (workdir / "serial-texts.txt").write_text(log)
+        moments = tsc_moments(log)
+        parts = breakdown(log, moments.get("kernel-entry", 0)) if "start-image" in moments else None
+        if parts is None:
+            print("cache_boot: no breakdown: the texts' moments are missing")
+        else:
+            look, read_part, rest = parts
+            print(f"cache_boot: breakdown (second boot, texts timed): to the cache's look-up "
+                  f"{look - moments['start-image']} cycles, reading it {read_part}, decompressing, checking, "
+                  f"placing and handing over {rest}; the firmware's read took {moments['read-end'] - moments['read-start']}")
     if args.keep:
         print(f"cache_boot: files in {workdir}")
     else:

@@ -29,6 +29,14 @@ bool ApplyTimedRead(PlatformConfig *config, const char *, char *value) {
   return true;
 }
 
+bool ApplyTimeText(PlatformConfig *config, const char *, char *value) {
+  if (strcmp(value, "0") != 0 && strcmp(value, "1") != 0) {
+    return false;
+  }
+  config->timeText = value[0] == '1';
+  return true;
+}
+
 bool ApplyOptions(PlatformConfig *config, const char *, char *value) {
   if (!Utf8ToUcs2(value, nullptr, 0, nullptr)) {
     return false;
@@ -309,6 +317,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"netboot.dhcp-hex", ApplyDhcpResponse},
     {"netboot.bsdp-hex", ApplyBsdpResponse},
     {"time-read", ApplyTimedRead},
+    {"time-text", ApplyTimeText},
 };
 
 // The name that `key` gives to the function of `entry`, or null when the
@@ -432,6 +441,7 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->dhcpResponse = {};
   config->bsdpResponse = {};
   config->timedReadPath = nullptr;
+  config->timeText = false;
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {

@@ -47,6 +47,9 @@
 //                          whole through the firmware's file system before
 //                          starting the loader, timed with the time stamp
 //                          counter (platform: tsc read-start, read-end)
+//   time-text=0|1          1: each text of the loader that the platform keeps
+//                          off a graphics screen comes behind a time stamp
+//                          counter moment (platform: tsc text); 0
 // Hexadecimal values are any number of bytes: two digits each, blanks
 // allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
@@ -120,6 +123,8 @@ struct PlatformConfig {
   ConfigBytes bsdpResponse;
   // The file to read timed before the loader starts; null: none.
   const char *timedReadPath;
+  // Every hidden text of the loader gets a moment before it.
+  bool timeText;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";

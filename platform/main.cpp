@@ -266,6 +266,12 @@ void TimeFirmwareRead(EFI_FILE_PROTOCOL *root, const char *path) {
   ReportTsc("read-end", end);
 }
 
+// The loader's hidden text behind the moment it came.
+void TimedWriteText(const CHAR16 *text) {
+  ReportTsc("text", ReadTsc());
+  SerialWriteText(text);
+}
+
 // The device path of the loader's device, end node included, in hex: the
 // loader finds its kernel cache by a checksum over these bytes.
 void ReportBootDevicePath(EFI_HANDLE device) {
@@ -402,7 +408,7 @@ void InstallProtocols(const PlatformConfig &config) {
     Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
   }
   gConsole.onSetMode = ReportSetMode;
-  gConsole.hiddenText = SerialWriteText;
+  gConsole.hiddenText = config.timeText ? TimedWriteText : SerialWriteText;
   // Drawing for the loader's boot screen; a firmware without graphics output
   // boots without pictures.
   status = InstallGraphicsProtocols(gST);
