@@ -64,19 +64,33 @@ def real_code(size):
 
 
 def text_moments(log):
-    """(moment, first line of the text) of each `platform: tsc text=` line."""
-    return [(int(value, 16), text) for value, text in re.findall(r"platform: tsc text=0x([0-9a-f]+)\n([^\n]*)", log)]
+    """(moment, text) of each `platform: tsc text=` line and the text the
+    loader wrote behind it (the loader writes a character at a time)."""
+    found = re.findall(r"platform: tsc text=0x([0-9a-f]+)\n(.*?)(?=\nplatform: |\Z)", log, re.S)
+    return [(int(value, 16), text) for value, text in found]
 
 
 def breakdown(log, entry):
     """Where the loader's time went, from the moments of its texts: up to
-    the cache's look-up, the read (from there to the last dot of a read
-    chunk), the rest (decompression, checksum, placing, hand-off) up to the
-    kernel's entry. None when the texts are not there."""
+    the cache's look-up, the read (from the line after the look-up to the
+    last of the dots that follow, one a read chunk), the rest
+    (decompression, checksum, placing, hand-off) up to the kernel's entry.
+    None when the texts are not there."""
     texts = text_moments(log)
-    look = next((moment for moment, text in texts if text.startswith("Looking for kernel cache")), None)
-    dots = [moment for moment, text in texts if look is not None and moment > look and text.strip(".") == ""]
-    if look is None or not dots:
+    written = "".join(text for _, text in texts)
+    look_at = written.find("Looking for kernel cache")
+    if look_at < 0:
+        return None
+    starts, offset = [], 0
+    for moment, text in texts:
+        starts.append((offset, moment))
+        offset += len(text)
+    look = next(moment for at, moment in starts if at + 1 > look_at)
+    after = written.index("\n", look_at) + 1
+    # The run of dots right behind the look-up's line.
+    run_end = after + len(written[after:]) - len(written[after:].lstrip("."))
+    dots = [moment for (at, moment), (_, text) in zip(starts, texts) if after <= at < run_end]
+    if not dots:
         return None
     return look, dots[-1] - look, entry - dots[-1]
 

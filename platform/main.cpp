@@ -495,8 +495,11 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
     TimeFirmwareRead(root, config.timedReadPath);
   }
   ServeExactTimes(root, device);
+  // The firmware's FAT keeps a few directories cached after they are closed
+  // (the last ones used); the same walk before both measurements leaves the
+  // same ones cached, so that only what the loader kept shows. The root
+  // stays open for the second walk.
   const UINTN directories = MemoryWarmDirectoryCache(root);
-  root->Close(root);
   InstallProtocols(config);
   SetVariables(config.nvram);
   MemoryStockPool();
@@ -509,6 +512,7 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
 
   const UINT64 pagesBefore = FreePagesOrFail("before the loader");
   const EFI_STATUS loaderStatus = RunLoader(launch, config);
+  MemoryWarmDirectoryCache(root);
   const UINT64 pagesAfter = FreePagesOrFail("after the loader");
 
   SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));
