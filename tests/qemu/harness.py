@@ -4,8 +4,10 @@
 Each scenario (scenarios.py) describes an EFI system partition: the platform
 layer at \\EFI\\BOOT\\BOOTX64.EFI, the loader at \\EFI\\BOOT\\nimbboot.efi, the
 platform's configuration file and any other files and directories, such as
-the reference kernel of tests/guest/. The harness builds a GPT disk image
-with that partition (no mounting: sgdisk and mtools), boots it headless under
+the reference kernel of tests/guest/, an extensions directory of test driver
+bundles, exact times for some of them and a kernel cache that kcache writes.
+The harness stages them in a directory and has the disk tool
+(tools/mkdisk/mkdisk.py) make a GPT disk image of it, boots it headless under
 TCG, and reads the serial log, the exit code that the platform layer or the
 kernel leaves through the debug-exit device, the kernel's report and, when
 the scenario asks, a screenshot taken over QMP.
