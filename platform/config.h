@@ -117,6 +117,8 @@ struct PlatformConfig {
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";
+// On a network boot: the loader's name on the TFTP server.
+constexpr const char *kDefaultNetLoaderName = "nimbboot.efi";
 constexpr UINT32 kMaxHoldSeconds = 3600;
 
 enum ConfigProblem : UINT32 {

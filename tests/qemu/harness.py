@@ -196,6 +196,7 @@ KERNEL_RESULT = re.compile(r"(pass|fail) \((\d+) checks?, (\d+) failed\)")
 KERNEL_RANGE = re.compile(r"(.+) address=(0x[0-9a-f]+) length=(0x[0-9a-f]+)")
 KERNEL_MEMMAP_TYPE = re.compile(r"type (\S+) count=(\d+) pages=(0x[0-9a-f]+)")
 KERNEL_HOLD = re.compile(r"(\d+) s")
+KERNEL_VALUE = re.compile(r"(\S+) (.+) ([0-9a-f]*)")
 TREE_NODE = re.compile(r"( *)([^=]*)/ \((\d+) propert(?:y|ies), (\d+) child(?:ren)?\)")
 TREE_PROPERTY = re.compile(r"( *)(\S.*?) = (.*)")
 ROOT_UUID_MESSAGE = re.compile(r"root device uuid is '(.*)'")
@@ -219,6 +220,7 @@ class KernelReport:
     tree_lines: list = dataclasses.field(default_factory=list)  # as printed, indent kept
     tree: dict = dataclasses.field(default_factory=dict)  # node path -> {property: value as printed}
     tree_errors: list = dataclasses.field(default_factory=list)
+    values: dict = dataclasses.field(default_factory=dict)  # (node path, property) -> whole value, bytes
     ranges: dict = dataclasses.field(default_factory=dict)  # name -> (address, length)
     memmap: list = dataclasses.field(default_factory=list)  # the memmap lines
     memmap_types: dict = dataclasses.field(default_factory=dict)  # type -> (count, pages)
@@ -298,6 +300,9 @@ def parse_kernel_report(log):
                 report.tree.setdefault(path, {}).setdefault(prop.group(2), prop.group(3))
             else:
                 report.unknown.append(match.group(0))
+        elif kind == "value" and KERNEL_VALUE.fullmatch(rest):
+            path, name, value = KERNEL_VALUE.fullmatch(rest).groups()
+            report.values[(path, name)] = bytes.fromhex(value)
         elif kind == "range" and KERNEL_RANGE.fullmatch(rest):
             name, address, length = KERNEL_RANGE.fullmatch(rest).groups()
             report.ranges[name] = (int(address, 16), int(length, 16))
@@ -389,6 +394,96 @@ def check_kernel(log, expect):
     uuid = report.tree.get("/chosen", {}).get("boot-uuid")
     if printed and uuid != quoted(printed[-1]):
         problems.append(f"kernel: tree /chosen boot-uuid = {uuid}, the loader printed {printed[-1]!r}")
+    return problems
+
+
+# --- the wire -------------------------------------------------------------------------
+
+DHCP_MAGIC = bytes([99, 130, 83, 99])
+ROOT_MATCHING = (
+    "<dict><key>ZoryaProviderClass</key><string>ZoryaNetworkInterface</string><key>ZoryaParentMatch</key>"
+    '<dict><key>ZoryaPropertyMatch</key><dict><key>ZoryaMACAddress</key><data format="hex">{}</data>'
+    "</dict></dict></dict>"
+)
+
+
+def read_pcap(data):
+    """The frames of a classic pcap file (what QEMU's filter-dump writes)."""
+    magic = data[:4]
+    order = "<" if magic == b"\xd4\xc3\xb2\xa1" else ">" if magic == b"\xa1\xb2\xc3\xd4" else None
+    if order is None:
+        raise ValueError("not a pcap file")
+    frames, offset = [], 24
+    while offset + 16 <= len(data):
+        length = struct.unpack(order + "I", data[offset + 8 : offset + 12])[0]
+        frames.append(data[offset + 16 : offset + 16 + length])
+        offset += 16 + length
+    return frames
+
+
+def dhcp_messages(frames):
+    """(client MAC, server's DHCP messages) of the captured frames: the
+    Ethernet source of the client's first message and the UDP payloads
+    that left port 67, in order."""
+    client, answers = None, []
+    for frame in frames:
+        if frame[12:14] != b"\x08\x00" or len(frame) < 34 or frame[23] != 17:
+            continue
+        ip = frame[14:]
+        header = (ip[0] & 15) * 4
+        source, destination, length = struct.unpack(">HHH", ip[header : header + 6])
+        payload = ip[header + 8 : header + length]
+        if source == 68 and destination == 67 and client is None:
+            client = frame[6:12]
+        elif source == 67:
+            answers.append(payload)
+    return client, answers
+
+
+def dhcp_type(message):
+    """The DHCP message type (option 53) of a message, or None."""
+    if message[236:240] != DHCP_MAGIC:
+        return None
+    offset = 240
+    while offset + 1 < len(message) and message[offset] != 255:
+        if message[offset] == 0:
+            offset += 1
+            continue
+        if message[offset] == 53:
+            return message[offset + 2]
+        offset += 2 + message[offset + 1]
+    return None
+
+
+def check_capture(log, pcap):
+    """Problems with the kernel's network identity and answers against the
+    packets on the wire: "dhcp-response" must be the server's DHCP ACK byte
+    for byte (the firmware keeps no length, so what follows the end option
+    may be left off, and must then be padding of zeros), "root-matching"
+    the client's MAC."""
+    try:
+        client, answers = dhcp_messages(read_pcap(Path(pcap).read_bytes()))
+    except (OSError, ValueError) as error:
+        return [f"capture: {error}"]
+    acks = [message for message in answers if dhcp_type(message) == 5]
+    if client is None or not acks:
+        return ["capture: no DHCP exchange on the wire"]
+    report = parse_kernel_report(log)
+    problems = []
+    wanted = quoted(ROOT_MATCHING.format(client.hex()))
+    got = report.tree.get("/chosen", {}).get("root-matching")
+    if got != wanted:
+        problems.append(f"capture: root-matching {got}, wanted the client's MAC {client.hex()}")
+    ack = acks[-1]
+    dhcp = report.values.get(("/chosen", "dhcp-response"))
+    if dhcp is None:
+        problems.append("capture: no whole dhcp-response in the kernel's report")
+    elif dhcp != ack[: len(dhcp)] or any(ack[len(dhcp) :]) or len(dhcp) > len(ack):
+        first = next((i for i, (a, b) in enumerate(zip(dhcp, ack)) if a != b), min(len(dhcp), len(ack)))
+        problems.append(
+            f"capture: dhcp-response of {len(dhcp)} bytes differs from the ACK of {len(ack)} on the wire "
+            f"at byte {first}"
+        )
     return problems
 
 
@@ -626,7 +721,30 @@ def find_ovmf():
     raise FileNotFoundError("OVMF_CODE_4M.fd and OVMF_VARS_4M.fd not found (package ovmf)")
 
 
-def qemu_command(workdir, disk, serial_log, qmp_socket=None):
+# The boot file that QEMU's DHCP server names on a network boot: the
+# platform layer, at the root of the served directory.
+NET_BOOT_FILE = "BOOTX64.efi"
+NET_ID = "n0"
+# Not QEMU's default, so that a MAC that reaches the kernel came from the NIC.
+NET_MAC = "52:54:00:a7:3c:e1"
+
+
+def network_arguments(tftp_dir, pcap=None):
+    """QEMU's user network with its TFTP server on `tftp_dir` and a virtio NIC
+    without option ROM, so that the firmware's own PXE boots from it; with
+    `pcap`, every packet of the NIC is written there."""
+    arguments = [
+        "-netdev", f"user,id={NET_ID},tftp={tftp_dir},bootfile={NET_BOOT_FILE}",
+        "-device", f"virtio-net-pci,netdev={NET_ID},mac={NET_MAC},romfile=",
+    ]
+    if pcap is not None:
+        arguments += ["-object", f"filter-dump,id=dump0,netdev={NET_ID},file={pcap}"]
+    return arguments
+
+
+def qemu_command(workdir, disk, serial_log, qmp_socket=None, network=None):
+    """With `network` (the extra arguments of network_arguments) and no
+    `disk`, the machine boots over the network."""
     code, variables = find_ovmf()
     private_vars = workdir / "OVMF_VARS.fd"
     shutil.copyfile(variables, private_vars)
@@ -635,9 +753,10 @@ def qemu_command(workdir, disk, serial_log, qmp_socket=None):
         "-display", "none", "-no-reboot",
         "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={code}",
         "-drive", f"if=pflash,format=raw,unit=1,file={private_vars}",
-        "-drive", f"format=raw,file={disk}",
+        *(["-drive", f"format=raw,file={disk}"] if disk is not None else []),
         "-device", "isa-debug-exit,iobase=0xf4,iosize=0x04",
-        "-nic", "none", "-serial", f"file:{serial_log}", "-monitor", "none",
+        *(network if network is not None else ["-nic", "none"]),
+        "-serial", f"file:{serial_log}", "-monitor", "none",
     ]
     if qmp_socket is not None:
         command += ["-qmp", f"unix:{qmp_socket},server=on,wait=off"]
@@ -745,9 +864,28 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
         files[path] = content
     for path in scenario.remove:
         files.pop(path, None)
+    if scenario.network:
+        return build_tftp_dir(workdir / "tftp", files)
     disk = workdir / "disk.img"
     build_disk(disk, files, scenario.directories)
     return disk
+
+
+def build_tftp_dir(directory, files):
+    """The served directory of a network boot: the disk's files with
+    \\EFI\\BOOT\\ dropped from the platform's own, so that the boot file, the
+    loader and platform.cfg lie at its root."""
+    directory.mkdir(parents=True, exist_ok=True)
+    for path, content in files.items():
+        name = path[len("EFI/BOOT/"):] if path.startswith("EFI/BOOT/") else path
+        name = NET_BOOT_FILE if name == "BOOTX64.EFI" else name
+        target = directory / name.strip("/")
+        target.parent.mkdir(parents=True, exist_ok=True)
+        if isinstance(content, Path):
+            shutil.copyfile(content, target)
+        else:
+            target.write_bytes(content.encode() if isinstance(content, str) else content)
+    return directory
 
 
 class SerialFollower:
@@ -770,41 +908,60 @@ class SerialFollower:
         return [clean_log(line) for line in complete]
 
 
-def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False):
+def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False, network=False, actions=()):
     """Runs QEMU on `disk` until it ends, for at most `timeout` seconds. With
-    `screen_when`, takes a screenshot into `screen_path` over QMP as soon as
-    a line of the serial log holds that text; with `echo`, prints the
-    cleaned serial log as it comes. Returns the exit status (None: timed
-    out), the cleaned log, the screenshot's path or None, and what went
-    wrong with the screenshot."""
+    `network`, `disk` is the directory served over TFTP and the machine
+    boots from it (its packets go to workdir/net.pcap). With `screen_when`,
+    takes a screenshot into `screen_path` over QMP as soon as a line of the
+    serial log holds that text; `actions` (Scenario.actions) are done in the
+    same way; with `echo`, prints the cleaned serial log as it comes.
+    Returns the exit status (None: timed out), the cleaned log, the
+    screenshot's path or None, and what went wrong with the screenshot or an
+    action."""
     serial_log = workdir / "serial.log"
-    qmp_socket = workdir / "qmp.sock" if screen_when else None
-    machine = Machine(qemu_command(workdir, disk, serial_log, qmp_socket), workdir / "qemu.log")
+    qmp_socket = workdir / "qmp.sock" if screen_when or actions else None
+    net = network_arguments(Path(disk).resolve(), workdir / "net.pcap") if network else None
+    command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, net)
+    machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
-    shot, trouble = None, []
+    shot, trouble, pending = None, [], list(actions)
     try:
-        if screen_when or echo:
-            qmp = Qmp(qmp_socket, deadline, machine) if screen_when else None
+        if screen_when or echo or actions:
+            qmp = Qmp(qmp_socket, deadline, machine) if qmp_socket else None
             follower = SerialFollower(serial_log)
             while True:
                 running = machine.poll() is None
                 for line in follower.lines(final=not running):
                     if echo and line.strip():
                         print(line, flush=True)
-                    if qmp is not None and shot is None and screen_when in line:
+                    if screen_when and shot is None and screen_when in line:
                         qmp.execute("screendump", filename=str(screen_path), format="png")
                         shot = screen_path
+                    for action in [action for action in pending if action[0] in line]:
+                        pending.remove(action)
+                        do_action(action[1], qmp, disk)
                 if not running or time.monotonic() > deadline:
                     break
-                time.sleep(0.1)
+                time.sleep(0.05)
             if qmp is not None:
                 qmp.close()
     except (OSError, ConnectionError, RuntimeError, ValueError) as error:
         trouble.append(f"screen: QMP: {error}")
     finally:
         returncode = machine.wait(max(1.0, deadline - time.monotonic()))
+    trouble += [f"action {action[1]!r} not done: {action[0]!r} never came" for action in pending]
     log = clean_log(serial_log.read_bytes()) if serial_log.exists() else ""
     return returncode, log, shot, trouble
+
+
+def do_action(action, qmp, served):
+    """One of Scenario.actions on the running machine."""
+    if action[0] == "link-off":
+        qmp.execute("set_link", name=NET_ID, up=False)
+    elif action[0] == "truncate":
+        os.truncate(Path(served) / action[1], action[2])
+    else:
+        raise ValueError(f"unknown action {action!r}")
 
 
 def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_DIR):
@@ -818,7 +975,8 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     limit = timeout or scenario.timeout
     screen = scenario.screen
     returncode, log, shot, trouble = boot(
-        disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None
+        disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None,
+        network=scenario.network, actions=scenario.actions,
     )
     (workdir / "serial.txt").write_text(log)
     outcome = decode_exit(returncode, read_exit_codes())
@@ -827,9 +985,12 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     problems += check_console_modes(log, scenario.console_modes)
     if scenario.kernel is not None:
         problems += check_kernel(log, scenario.kernel)
+    if scenario.capture:
+        problems += check_capture(log, workdir / "net.pcap")
+    problems += trouble
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
-        problems += trouble + picture
+        problems += picture
         if screen.alone:
             problems += stray
         else:

@@ -162,6 +162,19 @@ class Scenario:
     # A screenshot and what it must show.
     screen: ScreenExpect | None = None
     timeout: float = 90.0
+    # A network boot: no disk; the files (platform.cfg, the loader
+    # nimbboot.efi and the others, by their paths on the server) are served
+    # over QEMU's TFTP, and the firmware's PXE starts the platform layer as
+    # the boot file. Needs a build of the platform with the network.
+    network: bool = False
+    # What the harness does to the running machine when a line of the serial
+    # log holds a text: (text, action) pairs, each done once. Actions:
+    # ("link-off",) takes the NIC's link down; ("truncate", path, size) cuts a
+    # served file.
+    actions: tuple = ()
+    # Check the kernel's network identity and DHCP answer against the
+    # packets captured on the wire.
+    capture: bool = False
 
 
 _TABLE = [
@@ -368,6 +381,38 @@ _TABLE = [
         config={"console": "graphics", "hold": 2},
         expect=(KERNEL_ERROR, "platform: loader returned"),
         screen=ScreenExpect(when="platform: memory", picture="failure"),
+    ),
+]
+
+# --- network boots ----------------------------------------------------------------------
+
+# The loader's defaults on a network boot: the kernel next to the loader and
+# its package behind it.
+NET_KERNEL = "nimb.tarnix"
+NET_PACKAGE = "nimb.tarnix.drvpk"
+
+
+def net_kernel_files(name="nimb_kernel"):
+    return {NET_KERNEL: GuestFile(name)}
+
+
+_TABLE += [
+    # The firmware's PXE starts the platform, which serves the loader's files
+    # from the same TFTP server: the reference kernel boots with the network's
+    # identity and the server's real answers in its tree.
+    Scenario(
+        "net_kernel",
+        network=True,
+        config={"options": "foo=1"},
+        files=net_kernel_files(),
+        expect=("platform: net boot: station", "platform: net read of nimbboot.efi", KERNEL_START),
+        exit="KernelPass",
+        kernel=KernelExpect(
+            bootargs={"commandLine": "foo=1"},
+            tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
+        ),
+        capture=True,
+        timeout=150.0,
     ),
 ]
 
