@@ -358,6 +358,10 @@ void SetVariables(const ConfigEntryList &variables) {
   }
 }
 
+void ReportReadStart(const char *name, UINT64 room) {
+  SerialPrintf("\nplatform: net read of %s into %u bytes starts\n", name, room);
+}
+
 // The firmware picks the loader's device by its path, and the NIC's own
 // handle has the same path as the network handle: the loader is to see the
 // network handle, which alone serves its files.
@@ -422,6 +426,7 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
     Fail(kExitPlatformFailed, "no file system and no network on the boot device (%s)", StatusName(status));
   }
   gNetBoot.loadFile.onTransfer = ReportTransfer;
+  gNetBoot.loadFile.onReadStart = ReportReadStart;
   const EFI_PXE_BASE_CODE_MODE *mode = gNetBoot.pxe->Mode;
   const UINT8 *server = gNetBoot.loadFile.server.v4;
   SerialPrintf("platform: net boot: station %u.%u.%u.%u, server %u.%u.%u.%u\n",

@@ -12,23 +12,19 @@ bool IsSeparator(char c) {
   return c == '/' || c == '\\';
 }
 
-// A failed transfer as the caller should see it: the server's "file not
-// found" is EFI_NOT_FOUND.
-EFI_STATUS TransferStatus(EFI_PXE_BASE_CODE_PROTOCOL *pxe, EFI_STATUS status) {
-  if (status == EFI_TFTP_ERROR && pxe->Mode != nullptr && pxe->Mode->TftpErrorReceived &&
-      pxe->Mode->TftpError.ErrorCode == TFTP_ERROR_FILE_NOT_FOUND) {
-    return EFI_NOT_FOUND;
-  }
-  return status;
+// A failed transfer as the caller should see it: a server that answers the
+// request with an error packet (its "file not found", or a refusal) doesn't
+// have the file to give.
+EFI_STATUS TransferStatus(EFI_STATUS status) {
+  return status == EFI_TFTP_ERROR ? EFI_NOT_FOUND : status;
 }
 
 EFI_STATUS QuerySize(PlatformNetLoadFile *loader, const char *name, UINT64 *size) {
   *size = 0;
   UINTN blockSize = loader->blockSize;
-  const EFI_STATUS status = TransferStatus(
-      loader->pxe, loader->pxe->Mtftp(loader->pxe, EFI_PXE_BASE_CODE_TFTP_GET_FILE_SIZE, nullptr, FALSE, size,
-                                      &blockSize, &loader->server,
-                                      reinterpret_cast<UINT8 *>(const_cast<char *>(name)), nullptr, FALSE));
+  const EFI_STATUS status = TransferStatus(loader->pxe->Mtftp(
+      loader->pxe, EFI_PXE_BASE_CODE_TFTP_GET_FILE_SIZE, nullptr, FALSE, size, &blockSize, &loader->server,
+      reinterpret_cast<UINT8 *>(const_cast<char *>(name)), nullptr, FALSE));
   if (loader->onTransfer != nullptr) {
     loader->onTransfer(name, "size", 0, status, *size);
   }
@@ -48,11 +44,13 @@ EFI_STATUS Transfer(PlatformNetLoadFile *loader, const char *name, UINTN *buffer
   }
   const UINT64 room = *bufferSize;
   size = room;
+  if (loader->onReadStart != nullptr) {
+    loader->onReadStart(name, room);
+  }
   UINTN blockSize = loader->blockSize;
-  EFI_STATUS status = TransferStatus(
-      loader->pxe, loader->pxe->Mtftp(loader->pxe, EFI_PXE_BASE_CODE_TFTP_READ_FILE, buffer, FALSE, &size,
-                                      &blockSize, &loader->server,
-                                      reinterpret_cast<UINT8 *>(const_cast<char *>(name)), nullptr, FALSE));
+  EFI_STATUS status = TransferStatus(loader->pxe->Mtftp(
+      loader->pxe, EFI_PXE_BASE_CODE_TFTP_READ_FILE, buffer, FALSE, &size, &blockSize, &loader->server,
+      reinterpret_cast<UINT8 *>(const_cast<char *>(name)), nullptr, FALSE));
   if (loader->onTransfer != nullptr) {
     loader->onTransfer(name, "read", room, status, size);
   }
@@ -147,6 +145,7 @@ void NetLoadFileInit(PlatformNetLoadFile *loader, EFI_PXE_BASE_CODE_PROTOCOL *px
   loader->server = server;
   loader->blockSize = kTftpBlockSize;
   loader->onTransfer = nullptr;
+  loader->onReadStart = nullptr;
 }
 
 EFI_STATUS NetLoadFileFetch(PlatformNetLoadFile *loader, const char *name, void *(*allocate)(UINTN size),

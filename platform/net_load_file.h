@@ -30,6 +30,9 @@ struct PlatformNetLoadFile {
   // caller gave (reads only), the status and the size that came back; null
   // for none.
   void (*onTransfer)(const char *name, const char *what, UINT64 room, EFI_STATUS status, UINT64 size);
+  // Hears of a read as it starts, with the room the caller gave; null for
+  // none.
+  void (*onReadStart)(const char *name, UINT64 room);
 };
 
 // Fills in the protocol over the base code and the server's address.

@@ -104,9 +104,6 @@ struct EFI_PXE_BASE_CODE_TFTP_ERROR {
   CHAR8 ErrorString[127];
 };
 
-// TFTP error codes of the wire protocol.
-#define TFTP_ERROR_FILE_NOT_FOUND 1
-
 struct EFI_PXE_BASE_CODE_MODE {
   BOOLEAN Started;
   BOOLEAN Ipv6Available;

@@ -491,6 +491,11 @@ def check_capture(log, pcap):
 
 PNG_SIGNATURE = b"\x89PNG\r\n\x1a\n"
 PICTURE_SIZE = 128  # the logo and the failure picture
+SPINNER_SIZE = 32  # a frame of the spinner, centred 200 pixels below the middle
+SPINNER_DROP = 200
+# Between the two screenshots that show the spinner turning: a few of its
+# 100 ms ticks.
+SPINNER_GAP = 0.5
 
 
 @dataclasses.dataclass
@@ -568,7 +573,8 @@ def unfilter(kind, row, previous, step):
 
 def read_artwork(source=ARTWORK):
     """The loader's pictures, as they should appear on the screen: name ->
-    128 x 128 (red, green, blue) tuples, row by row."""
+    (red, green, blue) tuples, row by row: "logo" and "failure" of 128 x 128,
+    "spinner0" to "spinner17" of 32 x 32."""
     text = Path(source).read_text()
 
     def array(name):
@@ -581,6 +587,9 @@ def read_artwork(source=ARTWORK):
     runs = array("kLogoRuns")
     logo = [index for count, index in zip(runs[::2], runs[1::2]) for _ in range(count)]
     pictures = {"logo": logo, "failure": array("kFailurePicture")}
+    strip = array("kSpinnerStrip")
+    frame = SPINNER_SIZE * SPINNER_SIZE
+    pictures.update({f"spinner{i}": strip[i * frame : (i + 1) * frame] for i in range(len(strip) // frame)})
     return {name: [tuple(table[3 * i : 3 * i + 3]) for i in indexes] for name, indexes in pictures.items()}
 
 
@@ -630,6 +639,40 @@ def check_screen(image, expect, artwork=None):
         if abs(left + right + 1 - image.width) > 2 or abs(top + bottom + 1 - image.height) > 2:
             stray.append(f"{spans}, not centred on {image.width} x {image.height}")
     return problems, stray
+
+
+def spinner_frame(image, artwork):
+    """The number of the spinner's frame in its square of the screen; None
+    when the square is all background, -1 when it holds anything else."""
+    x0 = (image.width - SPINNER_SIZE) >> 1
+    y0 = ((image.height - SPINNER_SIZE) >> 1) + SPINNER_DROP
+    square = [image.pixel(x0 + x, y0 + y) for y in range(SPINNER_SIZE) for x in range(SPINNER_SIZE)]
+    if all(pixel == square[0] for pixel in square) and square[0] == image.pixel(0, 0):
+        return None
+    for name, pixels in artwork.items():
+        if name.startswith("spinner") and pixels == square:
+            return int(name[len("spinner") :])
+    return -1
+
+
+def check_spinner(paths, expect):
+    """Problems with the spinner in the screenshots of a scenario: "turning"
+    wants a frame of the spinner in each of two, and two different frames;
+    "gone" wants its square all background in the first."""
+    if expect.spinner is None:
+        return []
+    try:
+        artwork = read_artwork()
+        frames = [spinner_frame(read_png(Path(p).read_bytes()), artwork) for p in paths if p and Path(p).is_file()]
+    except (OSError, ValueError, zlib.error) as error:
+        return [f"spinner: {error}"]
+    if expect.spinner == "gone":
+        return [] if frames and frames[0] is None else [f"spinner: frames {frames}, wanted its square empty"]
+    if len(frames) < 2 or None in frames or -1 in frames:
+        return [f"spinner: frames {frames} in the screenshots, wanted a frame of the spinner in two"]
+    if frames[0] == frames[1]:
+        return [f"spinner: frame {frames[0]} in both screenshots {SPINNER_GAP} s apart: it doesn't turn"]
+    return []
 
 
 def check_screenshot(path, expect):
@@ -858,9 +901,12 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
         files["EFI/BOOT/platform.cfg"] = render_config(config)
     for path, content in scenario.files.items():
         if isinstance(content, GuestFile):
-            content = Path(guest_dir) / content.name
+            pad_to, content = content.pad_to, Path(guest_dir) / content.name
             if not content.is_file():
                 raise FileNotFoundError(f"{content} is missing: build the target guest_kernel first")
+            if pad_to:
+                data = content.read_bytes()
+                content = data + bytes(max(0, pad_to - len(data)))
         files[path] = content
     for path in scenario.remove:
         files.pop(path, None)
@@ -908,12 +954,18 @@ class SerialFollower:
         return [clean_log(line) for line in complete]
 
 
-def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False, network=False, actions=()):
+def second_path(path):
+    return Path(path).with_name(Path(path).stem + "-2.png")
+
+
+def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False, network=False, actions=(),
+         second_shot=False):
     """Runs QEMU on `disk` until it ends, for at most `timeout` seconds. With
     `network`, `disk` is the directory served over TFTP and the machine
     boots from it (its packets go to workdir/net.pcap). With `screen_when`,
     takes a screenshot into `screen_path` over QMP as soon as a line of the
-    serial log holds that text; `actions` (Scenario.actions) are done in the
+    serial log holds that text, and with `second_shot` another SPINNER_GAP
+    later (second_path); `actions` (Scenario.actions) are done in the
     same way; with `echo`, prints the cleaned serial log as it comes.
     Returns the exit status (None: timed out), the cleaned log, the
     screenshot's path or None, and what went wrong with the screenshot or an
@@ -937,6 +989,9 @@ def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False,
                     if screen_when and shot is None and screen_when in line:
                         qmp.execute("screendump", filename=str(screen_path), format="png")
                         shot = screen_path
+                        if second_shot:
+                            time.sleep(SPINNER_GAP)
+                            qmp.execute("screendump", filename=str(second_path(screen_path)), format="png")
                     for action in [action for action in pending if action[0] in line]:
                         pending.remove(action)
                         do_action(action[1], qmp, disk)
@@ -977,6 +1032,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     returncode, log, shot, trouble = boot(
         disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None,
         network=scenario.network, actions=scenario.actions,
+        second_shot=bool(screen and screen.spinner == "turning"),
     )
     (workdir / "serial.txt").write_text(log)
     outcome = decode_exit(returncode, read_exit_codes())
@@ -990,7 +1046,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     problems += trouble
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
-        problems += picture
+        problems += picture + check_spinner([shot, shot and second_path(shot)], screen)
         if screen.alone:
             problems += stray
         else:

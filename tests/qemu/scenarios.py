@@ -47,6 +47,8 @@ class GuestFile:
     the volume in place of content."""
 
     name: str
+    # Zero bytes behind the file up to this size (0: none).
+    pad_to: int = 0
 
 
 def quoted(value):
@@ -119,6 +121,10 @@ class ScreenExpect:
     # False: whatever else is on the screen is printed, but doesn't fail the
     # scenario.
     alone: bool = True
+    # The spinner below the logo: "turning" (a frame of it in this shot and
+    # another frame in a second shot a moment later), "gone" (its square is
+    # background) or None (not looked at).
+    spinner: str | None = None
 
 
 def kernel_file(name="nimb_kernel"):
@@ -392,8 +398,12 @@ NET_KERNEL = "nimb.tarnix"
 NET_PACKAGE = "nimb.tarnix.drvpk"
 
 
-def net_kernel_files(name="nimb_kernel"):
-    return {NET_KERNEL: GuestFile(name)}
+def net_kernel_files(name="nimb_kernel", pad_to=0):
+    return {NET_KERNEL: GuestFile(name, pad_to)}
+
+
+# A kernel file as large as a real one, which takes a while to come.
+BIG_KERNEL = 16 << 20
 
 
 _TABLE += [
@@ -403,16 +413,29 @@ _TABLE += [
     Scenario(
         "net_kernel",
         network=True,
-        config={"options": "foo=1"},
+        config={"options": "foo=1 guest.hold=1"},
         files=net_kernel_files(),
         expect=("platform: net boot: station", "platform: net read of nimbboot.efi", KERNEL_START),
         exit="KernelPass",
         kernel=KernelExpect(
-            bootargs={"commandLine": "foo=1"},
+            bootargs={"commandLine": "foo=1 guest.hold=1"},
             tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
         ),
         capture=True,
+        # The spinner is wiped before the hand-off: the logo stands alone.
+        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
         timeout=150.0,
+    ),
+    # The spinner turns below the logo while a large kernel comes over the
+    # network.
+    Scenario(
+        "net_spinner",
+        network=True,
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        expect=(f"platform: net read of {NET_KERNEL} into {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
+        exit="KernelPass",
+        screen=ScreenExpect(when=f"net read of {NET_KERNEL} into", picture="logo", alone=False, spinner="turning"),
+        timeout=200.0,
     ),
 ]
 
