@@ -79,11 +79,15 @@ EFI_STATUS EFIAPI NetLoadFile(EFI_LOAD_FILE_PROTOCOL *This, EFI_DEVICE_PATH_PROT
     return EFI_INVALID_PARAMETER;
   }
   char name[kMaxTftpNameLength + 1];
+  PlatformNetLoadFile *loader = reinterpret_cast<PlatformNetLoadFile *>(This);
   const EFI_STATUS status = NetLoadFileName(FilePath, name, sizeof(name));
   if (EFI_ERROR(status)) {
+    if (loader->onTransfer != nullptr) {
+      loader->onTransfer("a path of no TFTP name", "request", 0, status, 0);
+    }
     return status;
   }
-  return Transfer(reinterpret_cast<PlatformNetLoadFile *>(This), name, BufferSize, Buffer);
+  return Transfer(loader, name, BufferSize, Buffer);
 }
 
 }  // namespace

@@ -35,8 +35,9 @@ from pathlib import Path
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
-    PARTITION_GUID,
+    mkdisk,
     SCENARIOS,
+    NET_MAC,
     GuestFile,
     Scenario,
     ScreenExpect,
@@ -54,8 +55,6 @@ DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
-DISK_BYTES = 64 << 20
-PARTITION_OFFSET = 1 << 20  # first sector 2048
 
 # The platform's report, on the serial port.
 REPORT_STATUS = re.compile(r"platform: loader returned 0x([0-9a-f]+) \((\w+)\)")
@@ -710,40 +709,6 @@ def render_config(keys):
     return "".join(f"{key}={config_value(value)}\n" for key, value in items)
 
 
-def run_tool(*args, env=None):
-    subprocess.run(args, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, env=env)
-
-
-def build_disk(image, files, directories=()):
-    """A GPT disk of DISK_BYTES with one EFI system partition, of the GUID
-    PARTITION_GUID, holding `files` (ESP path with '/' -> bytes or host Path)
-    and `directories` (ESP paths)."""
-    image = Path(image).resolve()
-    with open(image, "wb") as disk:
-        disk.truncate(DISK_BYTES)
-    # A fresh image has nothing to zap, and each of sgdisk's steps costs a
-    # second of waiting for the kernel to reread the table.
-    run_tool("sgdisk", "-o", "-n", "1:2048:0", "-t", "1:EF00", "-u", f"1:{PARTITION_GUID}", str(image))
-    volume = f"{image}@@{PARTITION_OFFSET}"
-    env = dict(os.environ, MTOOLS_SKIP_CHECK="1")
-    run_tool("mformat", "-i", volume, "-F", "-v", "ESP", "::", env=env)
-    needed = set()
-    for path in list(directories) + [str(Path(p).parent) for p in files]:
-        parts = Path(path.strip("/")).parts
-        needed.update("/".join(parts[: i + 1]) for i in range(len(parts)))
-    needed.discard("")
-    for directory in sorted(needed, key=lambda d: (d.count("/"), d)):
-        run_tool("mmd", "-i", volume, f"::/{directory}", env=env)
-    staging = image.parent / "files"
-    for path, content in files.items():
-        source = content
-        if not isinstance(content, Path):
-            source = staging / path.strip("/")
-            source.parent.mkdir(parents=True, exist_ok=True)
-            source.write_bytes(content.encode() if isinstance(content, str) else content)
-        run_tool("mcopy", "-i", volume, str(Path(source).resolve()), f"::/{path.strip('/')}", env=env)
-
-
 # --- QEMU -----------------------------------------------------------------------------
 
 
@@ -768,8 +733,6 @@ def find_ovmf():
 # platform layer, at the root of the served directory.
 NET_BOOT_FILE = "BOOTX64.efi"
 NET_ID = "n0"
-# Not QEMU's default, so that a MAC that reaches the kernel came from the NIC.
-NET_MAC = "52:54:00:a7:3c:e1"
 
 
 def network_arguments(tftp_dir, pcap=None):
@@ -886,20 +849,21 @@ def scenario_config(scenario, override=None):
     return config
 
 
-def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
-    """Builds the scenario's disk in `workdir`; returns its path."""
-    efi_dir = Path(efi_dir)
-    files = {
-        "EFI/BOOT/BOOTX64.EFI": efi_dir / "BOOTX64.efi",
-        "EFI/BOOT/nimbboot.efi": Path(loader) if loader else efi_dir / "nimbboot.efi",
-    }
-    for path in files.values():
-        if not path.is_file():
-            raise FileNotFoundError(f"{path} is missing: build the EFI programs first")
-    config = scenario_config(scenario, config_override)
+def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
+    """Writes the scenario's files and directories (the extensions
+    directory's too) into the host directory `volume`, with platform.cfg
+    when `config` has keys or the scenario asks for the file, then gives
+    the paths of `scenario.times` their exact times."""
+    files = {**(scenario.extensions or {}), **scenario.files}
     if config or scenario.config_file:
-        files["EFI/BOOT/platform.cfg"] = render_config(config)
-    for path, content in scenario.files.items():
+        files[f"{mkdisk.BOOT_DIR}/{mkdisk.CONFIG_NAME}"] = render_config(config)
+    for path in scenario.remove:
+        files.pop(path, None)
+    for directory in scenario.directories:
+        (volume / directory.strip("/")).mkdir(parents=True, exist_ok=True)
+    for path, content in files.items():
+        target = volume / path.strip("/")
+        target.parent.mkdir(parents=True, exist_ok=True)
         if isinstance(content, GuestFile):
             pad_to, content = content.pad_to, Path(guest_dir) / content.name
             if not content.is_file():
@@ -907,31 +871,46 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
             if pad_to:
                 data = content.read_bytes()
                 content = data + bytes(max(0, pad_to - len(data)))
-        files[path] = content
-    for path in scenario.remove:
-        files.pop(path, None)
-    if scenario.network:
-        return build_tftp_dir(workdir / "tftp", files)
-    disk = workdir / "disk.img"
-    build_disk(disk, files, scenario.directories)
-    return disk
-
-
-def build_tftp_dir(directory, files):
-    """The served directory of a network boot: the disk's files with
-    \\EFI\\BOOT\\ dropped from the platform's own, so that the boot file, the
-    loader and platform.cfg lie at its root."""
-    directory.mkdir(parents=True, exist_ok=True)
-    for path, content in files.items():
-        name = path[len("EFI/BOOT/"):] if path.startswith("EFI/BOOT/") else path
-        name = NET_BOOT_FILE if name == "BOOTX64.EFI" else name
-        target = directory / name.strip("/")
-        target.parent.mkdir(parents=True, exist_ok=True)
         if isinstance(content, Path):
             shutil.copyfile(content, target)
         else:
             target.write_bytes(content.encode() if isinstance(content, str) else content)
-    return directory
+    # Deepest first: setting a directory's time after its children's.
+    for path, when in sorted(scenario.times.items(), key=lambda item: -item[0].count("/")):
+        mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
+
+
+def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
+    """Builds the scenario's disk in `workdir` with the disk tool; returns
+    its path."""
+    efi_dir = Path(efi_dir)
+    volume = workdir / "volume"
+    volume.mkdir()
+    stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
+    loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
+    if scenario.network:
+        return serve_volume(volume, efi_dir / "BOOTX64.efi", loader)
+    disk = workdir / "disk.img"
+    try:
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader)
+    except mkdisk.DiskError as error:
+        raise OSError(str(error)) from error
+    return disk
+
+
+def serve_volume(volume, platform, loader):
+    """The staged volume as the directory served on a network boot: the
+    platform as the boot file, the loader and platform.cfg at its root."""
+    boot = volume / mkdisk.BOOT_DIR
+    if (boot / mkdisk.CONFIG_NAME).is_file():
+        (boot / mkdisk.CONFIG_NAME).rename(volume / mkdisk.CONFIG_NAME)
+    for directory in (boot, boot.parent):
+        if directory.is_dir() and not any(directory.iterdir()):
+            directory.rmdir()
+    shutil.copyfile(platform, volume / NET_BOOT_FILE)
+    if loader is not None:
+        shutil.copyfile(loader, volume / mkdisk.LOADER_NAME)
+    return volume
 
 
 class SerialFollower:

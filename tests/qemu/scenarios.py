@@ -3,7 +3,14 @@ what the run must print and end with. harness.py runs them; CMakeLists.txt
 registers one ctest test per name."""
 
 import dataclasses
+import functools
 import re
+import struct
+import sys
+from pathlib import Path
+
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkdisk"))
+import mkdisk  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -20,7 +27,7 @@ BOOT_PLIST = "Library/Preferences/SystemConfiguration/com.quill.Boot.plist"
 # The GUID of the system partition on every disk the harness builds: the
 # root volume's UUID as the loader should find it. Its first three fields
 # read differently in either byte order.
-PARTITION_GUID = "0FAB1E5D-3C2B-4A19-8E7F-60C5D4B3A291"
+PARTITION_GUID = mkdisk.DEFAULT_PARTITION_GUID
 
 # What a boot of the reference kernel prints, in this order.
 LOADING_KERNEL = "Loading 'nimb_kernel'..."
@@ -132,6 +139,54 @@ def kernel_file(name="nimb_kernel"):
     return {"nimb_kernel": GuestFile(name)}
 
 
+# --- the extensions directory ------------------------------------------------------------
+
+EXTENSIONS_DIR = "System/Library/Extensions"
+
+
+def driver_plist(identifier, required=None, executable=None, libraries=()):
+    """A driver bundle's Info.plist: its identifier, and the keys that the
+    loader reads when given (`required` a string, or another tag's text)."""
+    lines = [f"\t<key>VzBundleIdentifier</key>\n\t<string>{identifier}</string>\n"]
+    if executable is not None:
+        lines.append(f"\t<key>VzBundleExecutable</key>\n\t<string>{executable}</string>\n")
+    if required is not None:
+        tag = required if required.startswith("<") else f"<string>{required}</string>"
+        lines.append(f"\t<key>VzBundleRequired</key>\n\t{tag}\n")
+    if libraries:
+        entries = "".join(f"\t\t<key>{name}</key>\n\t\t<string>1.0</string>\n" for name in libraries)
+        lines.append(f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n")
+    body = "".join(lines)
+    return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
+
+
+def driver_code(seed, length):
+    """A small driver's code: bytes that differ from bundle to bundle."""
+    return bytes((seed * 131 + i * 7 + (i >> 5)) & 0xFF for i in range(length))
+
+
+def standard_extensions():
+    """The extensions directory that every volume carries unless its scenario
+    says otherwise: a flat bundle with code, a full-layout bundle whose code
+    is a fat file (tests/guest's driver.fat, whose x86 slice is the file
+    nimb_kernel) with a nested bundle that has no code, and a "Safe Boot"
+    bundle that the loader leaves out."""
+    root = EXTENSIONS_DIR
+    return {
+        f"{root}/Console.drvb/Info.plist": driver_plist("com.quill.driver.Console", "Root", "Console"),
+        f"{root}/Console.drvb/Console": driver_code(1, 1001),
+        f"{root}/Storage.drvb/Contents/Info.plist": driver_plist(
+            "com.quill.driver.Storage", "Local-Root", "Storage", libraries=("com.quill.driver.Console",)
+        ),
+        f"{root}/Storage.drvb/Contents/Tarnix/Storage": GuestFile("driver.fat"),
+        f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist": driver_plist(
+            "com.quill.driver.Partition", ""
+        ),
+        f"{root}/Network.drvb/Info.plist": driver_plist("com.quill.driver.Network", "Safe Boot", "Network"),
+        f"{root}/Network.drvb/Network": driver_code(3, 64),
+    }
+
+
 @dataclasses.dataclass(frozen=True)
 class Scenario:
     name: str
@@ -147,7 +202,13 @@ class Scenario:
     files: dict = dataclasses.field(default_factory=dict)
     # ESP paths to leave out (e.g. the loader itself).
     remove: tuple = ()
+    # The extensions directory's files (paths as in `files`), put on the
+    # volume with the others; None: no extensions directory at all.
+    extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
     directories: tuple = ()
+    # Exact modification times (UTC, "YYYY-MM-DD hh:mm:ss.nnnnnnnnn") of
+    # files or directories of the volume, as the platform layer serves them.
+    times: dict = dataclasses.field(default_factory=dict)
     # Texts that must appear in the serial log, in this order.
     expect: tuple = ()
     # Texts that must not appear.
@@ -274,7 +335,14 @@ _TABLE = [
         "kernel_plain",
         config={"console": "graphics", "options": "foo=1"},
         files=kernel_file(),
-        expect=(LOADING_KERNEL, f"{ROOT_UUID}{PARTITION_GUID}'", KERNEL_START),
+        # The boot device path that the disk tool computes for kernel caches
+        # is the one the firmware gives the loader.
+        expect=(
+            f"platform: boot device path {mkdisk.boot_device_path().hex()}\n",
+            LOADING_KERNEL,
+            f"{ROOT_UUID}{PARTITION_GUID}'",
+            KERNEL_START,
+        ),
         forbid=("platform: loader returned",),
         exit="KernelPass",
         kernel=KernelExpect(
@@ -405,14 +473,34 @@ def net_kernel_files(name="nimb_kernel", pad_to=0):
 # A kernel file as large as a real one, which takes a while to come.
 BIG_KERNEL = 16 << 20
 
+# The NIC's MAC address: not QEMU's default, so that a MAC that reaches the
+# kernel came from the NIC.
+NET_MAC = "52:54:00:a7:3c:e1"
+
+
+def net_file_path(name):
+    """A device path over the network device, as NVRAM holds the kernel's
+    path: PciRoot(0)/Pci(2,0)/MAC(NET_MAC,1)/File(name)/End, in bytes."""
+    mac = bytes.fromhex(NET_MAC.replace(":", "")).ljust(32, b"\0")
+    text = (name + "\0").encode("utf-16-le")
+    return b"".join((
+        bytes([2, 1, 12, 0]) + struct.pack("<II", 0x0A0341D0, 0),
+        bytes([1, 1, 6, 0, 0, 2]),
+        bytes([3, 11, 37, 0]) + mac + bytes([1]),
+        bytes([4, 4]) + struct.pack("<H", 4 + len(text)) + text,
+        bytes([0x7F, 0xFF, 4, 0]),
+    ))
+
+
+# A network boot: nothing but the served files (no extensions directory).
+NetScenario = functools.partial(Scenario, network=True, extensions=None, timeout=150.0)
 
 _TABLE += [
     # The firmware's PXE starts the platform, which serves the loader's files
     # from the same TFTP server: the reference kernel boots with the network's
     # identity and the server's real answers in its tree.
-    Scenario(
+    NetScenario(
         "net_kernel",
-        network=True,
         config={"options": "foo=1 guest.hold=1"},
         files=net_kernel_files(),
         expect=("platform: net boot: station", "platform: net read of nimbboot.efi", KERNEL_START),
@@ -424,18 +512,59 @@ _TABLE += [
         capture=True,
         # The spinner is wiped before the hand-off: the logo stands alone.
         screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
-        timeout=150.0,
     ),
     # The spinner turns below the logo while a large kernel comes over the
     # network.
-    Scenario(
+    NetScenario(
         "net_spinner",
-        network=True,
         files=net_kernel_files(pad_to=BIG_KERNEL),
         expect=(f"platform: net read of {NET_KERNEL} into {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
         exit="KernelPass",
         screen=ScreenExpect(when=f"net read of {NET_KERNEL} into", picture="logo", alone=False, spinner="turning"),
         timeout=200.0,
+    ),
+    # efi-boot-file-data names another kernel on the server, and the
+    # configuration file comes from the server too.
+    NetScenario(
+        "net_other_kernel",
+        config={"nvram-hex.efi-boot-file-data": net_file_path("kernels\\other_kernel").hex()},
+        files={
+            "kernels/other_kernel": GuestFile("nimb_kernel.fat-le"),
+            "com.quill.Boot.plist": plist({"Kernel Flags": "from_server=1"}),
+        },
+        expect=(
+            "platform: net read of com.quill.Boot.plist into",
+            "platform: net read of kernels/other_kernel into",
+            KERNEL_START,
+        ),
+        forbid=(f"of {NET_KERNEL}",),
+        exit="KernelPass",
+        kernel=KernelExpect(bootargs={"commandLine": "from_server=1"}),
+    ),
+    # Bad input on the wire ends the boot with a clear message, never a hang:
+    # the kernel cut short on the server while it comes, ...
+    NetScenario(
+        "net_size_mismatch",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        actions=((f"net read of {NET_KERNEL} into", ("truncate", NET_KERNEL, 1 << 20)),),
+        expect=(f"net read of {NET_KERNEL} into", "Network file size mismatch", "platform: loader returned"),
+        timeout=200.0,
+    ),
+    # ... a server that stops answering in the middle of the kernel (the
+    # firmware's TFTP gives up), ...
+    NetScenario(
+        "net_server_gone",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        actions=((f"net read of {NET_KERNEL} into", ("link-off",)),),
+        expect=(f"net read of {NET_KERNEL} into", f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
+        timeout=300.0,
+    ),
+    # ... and a kernel whose name no TFTP request can carry.
+    NetScenario(
+        "net_long_name",
+        config={"nvram-hex.efi-boot-file-data": net_file_path("k" * 500).hex()},
+        expect=("platform: net request of a path of no TFTP name: EFI_INVALID_PARAMETER",
+                f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
     ),
 ]
 
