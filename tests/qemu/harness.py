@@ -384,6 +384,9 @@ def check_kernel(log, expect):
             elif not matches(wanted, got):
                 problems.append(f"kernel: tree {path} {name} = {got}, wanted {describe(wanted)}")
     for name, length in expect.ranges.items():
+        if isinstance(name, re.Pattern):
+            found = [known for known in report.ranges if name.fullmatch(known)]
+            name = found[0] if len(found) == 1 else describe(name)
         if name not in report.ranges:
             problems.append(f"kernel: no range {name}")
         elif length is not None and report.ranges[name][1] != length:

@@ -111,7 +111,8 @@ class KernelExpect:
     # Node path -> {property: value as printed}; an empty dict only asks
     # for the node. text() and ucs2() print values as the kernel does.
     tree: dict = dataclasses.field(default_factory=dict)
-    # Range of /chosen/memory-map -> its length, or None for any.
+    # Range of /chosen/memory-map (its name, or a compiled pattern that one
+    # name must match) -> its length, or None for any.
     ranges: dict = dataclasses.field(default_factory=dict)
 
 
@@ -466,8 +467,20 @@ NET_KERNEL = "nimb.tarnix"
 NET_PACKAGE = "nimb.tarnix.drvpk"
 
 
-def net_kernel_files(name="nimb_kernel", pad_to=0):
-    return {NET_KERNEL: GuestFile(name, pad_to)}
+# A driver package: the loader copies it as it stands (it isn't fat).
+NET_PACKAGE_BYTES = bytes(i * 13 % 251 for i in range(20000))
+
+
+def net_kernel_files(name="nimb_kernel", pad_to=0, package=True):
+    """The served kernel under its default name, with its package."""
+    files = {NET_KERNEL: GuestFile(name, pad_to)}
+    if package:
+        files[NET_PACKAGE] = NET_PACKAGE_BYTES
+    return files
+
+
+# The package's range in /chosen/memory-map, named by its address.
+PACKAGE_RANGE = re.compile(r"DriversPackage-[0-9a-f]+")
 
 
 # A kernel file as large as a real one, which takes a while to come.
@@ -503,11 +516,17 @@ _TABLE += [
         "net_kernel",
         config={"options": "foo=1 guest.hold=1"},
         files=net_kernel_files(),
-        expect=("platform: net boot: station", "platform: net read of nimbboot.efi", KERNEL_START),
+        expect=(
+            "platform: net boot: station",
+            "platform: net read of nimbboot.efi",
+            f"platform: net read of {NET_PACKAGE} into",
+            KERNEL_START,
+        ),
         exit="KernelPass",
         kernel=KernelExpect(
             bootargs={"commandLine": "foo=1 guest.hold=1"},
             tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
+            ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
         ),
         capture=True,
         # The spinner is wiped before the hand-off: the logo stands alone.
@@ -530,6 +549,7 @@ _TABLE += [
         config={"nvram-hex.efi-boot-file-data": net_file_path("kernels\\other_kernel").hex()},
         files={
             "kernels/other_kernel": GuestFile("nimb_kernel.fat-le"),
+            "kernels/other_kernel.drvpk": NET_PACKAGE_BYTES,
             "com.quill.Boot.plist": plist({"Kernel Flags": "from_server=1"}),
         },
         expect=(
@@ -540,6 +560,14 @@ _TABLE += [
         forbid=(f"of {NET_KERNEL}",),
         exit="KernelPass",
         kernel=KernelExpect(bootargs={"commandLine": "from_server=1"}),
+    ),
+    # A network boot has no driver bundles to fall back on: without its
+    # package the boot ends.
+    NetScenario(
+        "net_no_package",
+        files=net_kernel_files(package=False),
+        expect=(f"platform: net size of {NET_PACKAGE}: EFI_NOT_FOUND", "Error loading drivers",
+                "platform: loader returned"),
     ),
     # Bad input on the wire ends the boot with a clear message, never a hang:
     # the kernel cut short on the server while it comes, ...
