@@ -14,6 +14,9 @@
 //   console=text|graphics  the console mode the loader finds; graphics
 //   hold=<seconds>         wait between the report and the power-off, 0 to
 //                          3600; 0
+//   net.time-pxe=0|1       on a network boot, 1 times the firmware's own
+//                          download of the boot file before the loader
+//                          starts; 0
 //   keys=<key>+<key>...    the keys held down at start, as the key state
 //                          protocol reports them. Modifiers: ctrl, shift,
 //                          alt, gui (left ones; also lctrl, lshift, lalt,
@@ -107,6 +110,9 @@ struct PlatformConfig {
   EFI_CONSOLE_CONTROL_SCREEN_MODE consoleMode;
   // Seconds to wait between the report and the power-off.
   UINT32 holdSeconds;
+  // On a network boot: time the firmware's own download of the boot file
+  // before the loader starts (net.time-pxe=1).
+  bool timePxeDownload;
   HeldKeys keys;
   bool keysIgnored;
   ConfigEntryList nvram;

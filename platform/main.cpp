@@ -19,6 +19,7 @@
 #include "net_boot.h"
 #include "net_boot_info.h"
 #include "serial.h"
+#include "tsc.h"
 
 namespace nimb::platform {
 
@@ -424,8 +425,40 @@ void SetVariables(const ConfigEntryList &variables) {
   }
 }
 
+// A read's moments go to the log as TSC values, taken on either side of the
+// transfer alone.
 void ReportReadStart(const char *name, UINT64 room) {
   SerialPrintf("\nplatform: net read of %s into %u bytes starts\n", name, room);
+  ReportTsc("net-read-start", ReadTsc());
+}
+
+// The firmware's own PXE download of the boot file again, timed, to set the
+// network file loader's transfers against.
+void TimePxeDownload(EFI_HANDLE device) {
+  void *interface = nullptr;
+  EFI_STATUS status = gBS->HandleProtocol(device, &gEfiLoadFileProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no firmware LoadFile to time (%s)", StatusName(status));
+  }
+  EFI_LOAD_FILE_PROTOCOL *firmware = static_cast<EFI_LOAD_FILE_PROTOCOL *>(interface);
+  EFI_DEVICE_PATH_PROTOCOL end = {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}};
+  UINTN size = 0;
+  status = firmware->LoadFile(firmware, &end, TRUE, &size, nullptr);
+  if (status != EFI_BUFFER_TOO_SMALL) {
+    Fail(kExitPlatformFailed, "the firmware's PXE gave no boot file size (%s)", StatusName(status));
+  }
+  EFI_PHYSICAL_ADDRESS buffer = 0;
+  status = gBS->AllocatePages(AllocateAnyPages, EfiLoaderData, EFI_SIZE_TO_PAGES(size), &buffer);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no memory for the boot file (%s)", StatusName(status));
+  }
+  const UINT64 start = ReadTsc();
+  status = firmware->LoadFile(firmware, &end, TRUE, &size, reinterpret_cast<void *>(buffer));
+  const UINT64 stop = ReadTsc();
+  SerialPrintf("platform: net firmware download of the boot file: %s, %u bytes\n", StatusName(status), size);
+  ReportTsc("pxe-download-start", start);
+  ReportTsc("pxe-download-end", stop);
+  gBS->FreePages(buffer, EFI_SIZE_TO_PAGES(size));
 }
 
 // The firmware picks the loader's device by its path, and the NIC's own
@@ -475,11 +508,15 @@ void *AllocateForFetch(UINTN size) {
 
 // Every TFTP transfer shows in the log, on a line of its own.
 void ReportTransfer(const char *name, const char *what, UINT64 room, EFI_STATUS status, UINT64 size) {
+  const UINT64 end = ReadTsc();
   if (room == 0) {
     SerialPrintf("\nplatform: net %s of %s: %s, %u bytes\n", what, name, StatusName(status), size);
   } else {
     SerialPrintf("\nplatform: net %s of %s into %u bytes: %s, %u bytes\n", what, name, room,
                  StatusName(status), size);
+  }
+  if (room != 0) {
+    ReportTsc("net-read-end", end);
   }
 }
 
@@ -512,6 +549,9 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
     Fail(kExitConfigInvalid, "cannot fetch %s (%s)", kConfigName, StatusName(status));
   } else {
     ParseConfig(static_cast<char *>(bytes), size, config);
+  }
+  if (config->timePxeDownload) {
+    TimePxeDownload(device);
   }
   status = NetLoadFileFetch(&gNetBoot.loadFile, config->loaderPath, AllocateForFetch, &bytes, &size);
   if (EFI_ERROR(status)) {

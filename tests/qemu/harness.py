@@ -39,9 +39,11 @@ from scenarios import (  # noqa: E402
     SCENARIOS,
     NET_MAC,
     GuestFile,
+    NetScenario,
     Scenario,
     ScreenExpect,
     kernel_file,
+    net_kernel_files,
     quoted,
 )
 
@@ -1116,20 +1118,28 @@ DEMO = Scenario(
     files=kernel_file(),
 )
 DEMO_SCREEN_EXPECT = ScreenExpect(when="kernel: result", picture="logo")
+# The network's demo: the same kernel, with its driver package, served over
+# TFTP to a machine without a disk.
+NET_DEMO = NetScenario("demo-net", config={"options": "guest.hold=4"}, files=net_kernel_files(), timeout=150.0)
+NET_DEMO_SCREEN = REPO / "out" / "demo-net-screen.png"
 
 
-def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
+def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0, network=False):
     """Boots the reference kernel, prints the serial log as it comes, takes
     a screenshot once the kernel has reported (while it holds the machine)
-    and lets the kernel power off. True when the kernel passed and the
-    screenshot was taken."""
+    and lets the kernel power off. With `network`, the machine has no disk
+    and boots over QEMU's TFTP from a directory of the same files. True when
+    the kernel passed and the screenshot was taken."""
     workdir = Path(tempfile.mkdtemp(prefix="nimb-qemu-demo-"))
-    disk = prepare(DEMO, efi_dir, workdir, loader, guest_dir=guest_dir)
-    DEMO_SCREEN.parent.mkdir(parents=True, exist_ok=True)
-    if DEMO_SCREEN.exists():
-        DEMO_SCREEN.unlink()
+    scenario, screen = (NET_DEMO, NET_DEMO_SCREEN) if network else (DEMO, DEMO_SCREEN)
+    disk = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
+    if network:
+        print(f"demo: serving {disk} over TFTP")
+    screen.parent.mkdir(parents=True, exist_ok=True)
+    if screen.exists():
+        screen.unlink()
     returncode, log, shot, trouble = boot(
-        disk, workdir, timeout, DEMO_SCREEN_EXPECT.when, DEMO_SCREEN.resolve(), echo=True
+        disk, workdir, timeout, DEMO_SCREEN_EXPECT.when, screen.resolve(), echo=True, network=network
     )
     outcome = decode_exit(returncode, read_exit_codes())
     kernel = parse_kernel_report(log)
@@ -1146,8 +1156,9 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
     if shot is None:
         print(f"demo: no screenshot; files kept in {workdir}")
         return False
-    DOCS_SCREEN.parent.mkdir(parents=True, exist_ok=True)
-    shutil.copyfile(shot, DOCS_SCREEN)
+    if not network:
+        DOCS_SCREEN.parent.mkdir(parents=True, exist_ok=True)
+        shutil.copyfile(shot, DOCS_SCREEN)
     picture, stray = check_screenshot(shot, DEMO_SCREEN_EXPECT)
     if picture:
         print("demo: the screen is not the logo centred on grey:")
@@ -1157,7 +1168,7 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
         print("demo: " + ("and " if not picture else "") + "more than the logo is on the screen:")
     for problem in picture + stray:
         print(f"demo:   {problem}")
-    print(f"demo: screenshot in {DEMO_SCREEN} (and {DOCS_SCREEN})")
+    print(f"demo: screenshot in {screen}" + ("" if network else f" (and {DOCS_SCREEN})"))
     ok = outcome.name == "KernelPass"
     if ok:
         shutil.rmtree(workdir, ignore_errors=True)
@@ -1179,6 +1190,7 @@ def main(argv=None):
     parser.add_argument("--show-log", action="store_true", help="print the serial log of passing runs too")
     parser.add_argument("--list", action="store_true", help="print the scenarios' names")
     parser.add_argument("--demo", action="store_true", help="boot the reference kernel and take a screenshot")
+    parser.add_argument("--net", action="store_true", help="with --demo: boot it over the network")
     args = parser.parse_args(argv)
     for number in (signal.SIGTERM, signal.SIGINT, signal.SIGHUP):
         signal.signal(number, Machine.kill_all)
@@ -1187,7 +1199,7 @@ def main(argv=None):
         print("\n".join(SCENARIOS))
         return 0
     if args.demo:
-        return 0 if demo(args.efi_dir, args.loader, args.guest_dir) else 1
+        return 0 if demo(args.efi_dir, args.loader, args.guest_dir, network=args.net) else 1
     names = args.scenario or list(SCENARIOS)
     unknown = [name for name in names if name not in SCENARIOS]
     if unknown:

@@ -1,0 +1,110 @@
+#!/usr/bin/env python3
+"""Figure net-fetch-vs-pxe: the loader's fetch of a 16 MiB kernel over the
+platform layer's network file loader against the firmware's own PXE download
+of a boot file of the same size, in the same QEMU run.
+
+The served directory holds the platform layer padded to 16 MiB (the boot
+file that the firmware's PXE fetches), the loader, the reference kernel
+padded to 16 MiB and its driver package. With net.time-pxe=1 the platform
+has the firmware's PXE download its boot file once more before it starts the
+loader; both transfers are timed with the TSC on either side of the
+transfer alone, and the log carries the counter values. Under TCG the TSC
+follows virtual time: the ratio means something, the ticks alone don't.
+
+    bench/net_fetch_vs_pxe.py [--runs N] [--efi-dir build/efi] [--guest-dir build/tests/guest]
+
+Prints each run's times and the figure of the median run:
+    figure net-fetch-vs-pxe: LOADER Mticks vs FIRMWARE Mticks = R.RRx
+where R is the loader's time over the firmware's (goal: at most 1.2x).
+"""
+
+import argparse
+import re
+import shutil
+import statistics
+import sys
+import tempfile
+from pathlib import Path
+
+REPO = Path(__file__).resolve().parents[1]
+sys.path.insert(0, str(REPO / "tests" / "qemu"))
+import harness  # noqa: E402
+
+SIZE = 16 << 20
+KERNEL = "nimb.tarnix"
+TSC = re.compile(r"platform: tsc ([\w-]+)=0x([0-9a-f]+)")
+READ = re.compile(r"platform: net read of (\S+) into (\d+) bytes: (\w+), (\d+) bytes")
+PXE = re.compile(r"platform: net firmware download of the boot file: (\w+), (\d+) bytes")
+
+
+def padded(path, size):
+    data = Path(path).read_bytes()
+    return data + bytes(max(0, size - len(data)))
+
+
+def serve(directory, efi_dir, guest_dir):
+    directory.mkdir()
+    (directory / harness.NET_BOOT_FILE).write_bytes(padded(Path(efi_dir) / "BOOTX64.efi", SIZE))
+    shutil.copyfile(Path(efi_dir) / "nimbboot.efi", directory / "nimbboot.efi")
+    (directory / KERNEL).write_bytes(padded(Path(guest_dir) / "nimb_kernel", SIZE))
+    (directory / f"{KERNEL}.drvpk").write_bytes(bytes(4096))
+    (directory / "platform.cfg").write_text("net.time-pxe=1\n")
+
+
+def measure(log):
+    """(firmware ticks, loader ticks) of one run's log."""
+    lines = log.splitlines()
+    ticks = {}
+    reading = None
+    for line in lines:
+        pxe, read, tsc = PXE.search(line), READ.search(line), TSC.search(line)
+        if pxe and (pxe.group(1) != "EFI_SUCCESS" or int(pxe.group(2)) != SIZE):
+            raise RuntimeError(f"the firmware's download: {line.strip()}")
+        if read and read.group(1) == KERNEL:
+            if read.group(3) != "EFI_SUCCESS" or int(read.group(4)) != SIZE:
+                raise RuntimeError(f"the loader's fetch: {line.strip()}")
+            reading = KERNEL
+        if "net read of" in line and "starts" in line:
+            reading = line.split("net read of ")[1].split()[0]
+        if tsc:
+            moment, value = tsc.group(1), int(tsc.group(2), 16)
+            if moment.startswith("pxe-download"):
+                ticks[moment] = value
+            elif moment.startswith("net-read") and reading == KERNEL:
+                ticks[moment] = value
+    wanted = ("pxe-download-start", "pxe-download-end", "net-read-start", "net-read-end")
+    if any(moment not in ticks for moment in wanted):
+        raise RuntimeError(f"moments missing from the log: {[m for m in wanted if m not in ticks]}")
+    return ticks["pxe-download-end"] - ticks["pxe-download-start"], ticks["net-read-end"] - ticks["net-read-start"]
+
+
+def main():
+    parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
+    parser.add_argument("--runs", type=int, default=1)
+    parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"))
+    parser.add_argument("--guest-dir", default=str(REPO / "build" / "tests" / "guest"))
+    parser.add_argument("--timeout", type=float, default=400.0)
+    args = parser.parse_args()
+    results = []
+    for run in range(args.runs):
+        workdir = Path(tempfile.mkdtemp(prefix="nimb-bench-net-"))
+        served = workdir / "tftp"
+        serve(served, args.efi_dir, args.guest_dir)
+        returncode, log, _, _ = harness.boot(served, workdir, args.timeout, network=True)
+        try:
+            firmware, loader = measure(log)
+        except RuntimeError as error:
+            print(f"run {run + 1}: {error}; files kept in {workdir}", file=sys.stderr)
+            return 1
+        shutil.rmtree(workdir, ignore_errors=True)
+        print(f"run {run + 1}: firmware {firmware / 1e6:.1f} Mticks, loader {loader / 1e6:.1f} Mticks, "
+              f"{loader / firmware:.2f}x")
+        results.append((loader / firmware, firmware, loader))
+    ratio = statistics.median(result[0] for result in results)
+    _, firmware, loader = min(results, key=lambda result: abs(result[0] - ratio))
+    print(f"figure net-fetch-vs-pxe: {loader / 1e6:.1f} Mticks vs {firmware / 1e6:.1f} Mticks = {ratio:.2f}x")
+    return 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())
