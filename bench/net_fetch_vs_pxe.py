@@ -8,8 +8,10 @@ file that the firmware's PXE fetches), the loader, the reference kernel
 padded to 16 MiB and its driver package. With net.time-pxe=1 the platform
 has the firmware's PXE download its boot file once more before it starts the
 loader; both transfers are timed with the TSC on either side of the
-transfer alone, and the log carries the counter values. Under TCG the TSC
-follows virtual time: the ratio means something, the ticks alone don't.
+transfer alone, and the log carries the counter values. QEMU runs with
+-icount, so that virtual time (and the TSC) follows the instructions the
+guest runs rather than the host's clock: the ratio means something, the
+ticks alone don't.
 
     bench/net_fetch_vs_pxe.py [--runs N] [--efi-dir build/efi] [--guest-dir build/tests/guest]
 
@@ -31,6 +33,10 @@ sys.path.insert(0, str(REPO / "tests" / "qemu"))
 import harness  # noqa: E402
 
 SIZE = 16 << 20
+# Virtual time by instructions, not by the host's clock: the TSC then counts
+# the guest's own work, whatever else the host is busy with. Without it the
+# ratio wanders with the host's load.
+ICOUNT = ("-icount", "shift=2,align=off,sleep=off")
 KERNEL = "nimb.tarnix"
 TSC = re.compile(r"platform: tsc ([\w-]+)=0x([0-9a-f]+)")
 READ = re.compile(r"platform: net read of (\S+) into (\d+) bytes: (\w+), (\d+) bytes")
@@ -83,20 +89,22 @@ def main():
     parser.add_argument("--runs", type=int, default=1)
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"))
     parser.add_argument("--guest-dir", default=str(REPO / "build" / "tests" / "guest"))
-    parser.add_argument("--timeout", type=float, default=400.0)
+    parser.add_argument("--timeout", type=float, default=600.0)
+    parser.add_argument("--keep", action="store_true", help="keep each run's files (log, packets)")
     args = parser.parse_args()
     results = []
     for run in range(args.runs):
         workdir = Path(tempfile.mkdtemp(prefix="nimb-bench-net-"))
         served = workdir / "tftp"
         serve(served, args.efi_dir, args.guest_dir)
-        returncode, log, _, _ = harness.boot(served, workdir, args.timeout, network=True)
+        returncode, log, _, _ = harness.boot(served, workdir, args.timeout, network=True, qemu_args=ICOUNT)
         try:
             firmware, loader = measure(log)
         except RuntimeError as error:
             print(f"run {run + 1}: {error}; files kept in {workdir}", file=sys.stderr)
             return 1
-        shutil.rmtree(workdir, ignore_errors=True)
+        if not args.keep:
+            shutil.rmtree(workdir, ignore_errors=True)
         print(f"run {run + 1}: firmware {firmware / 1e6:.1f} Mticks, loader {loader / 1e6:.1f} Mticks, "
               f"{loader / firmware:.2f}x")
         results.append((loader / firmware, firmware, loader))

@@ -943,13 +943,14 @@ def second_path(path):
 
 
 def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False, network=False, actions=(),
-         second_shot=False):
+         second_shot=False, qemu_args=()):
     """Runs QEMU on `disk` until it ends, for at most `timeout` seconds. With
     `network`, `disk` is the directory served over TFTP and the machine
     boots from it (its packets go to workdir/net.pcap). With `screen_when`,
     takes a screenshot into `screen_path` over QMP as soon as a line of the
     serial log holds that text, and with `second_shot` another SPINNER_GAP
-    later (second_path); `actions` (Scenario.actions) are done in the
+    later (second_path); `qemu_args` go behind QEMU's own; `actions`
+    (Scenario.actions) are done in the
     same way; with `echo`, prints the cleaned serial log as it comes.
     Returns the exit status (None: timed out), the cleaned log, the
     screenshot's path or None, and what went wrong with the screenshot or an
@@ -957,7 +958,7 @@ def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False,
     serial_log = workdir / "serial.log"
     qmp_socket = workdir / "qmp.sock" if screen_when or actions else None
     net = network_arguments(Path(disk).resolve(), workdir / "net.pcap") if network else None
-    command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, net)
+    command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, net) + list(qemu_args)
     machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
     shot, trouble, pending = None, [], list(actions)
