@@ -52,6 +52,8 @@ REPO = Path(__file__).resolve().parents[2]
 # table, no code in both.
 EXIT_CODE_HEADERS = (REPO / "platform" / "exitcodes.h", REPO / "tests" / "guest" / "exitcodes.h")
 GUEST_DIR = REPO / "build" / "tests" / "guest"
+# The host tools (kcache); --tools-dir changes it.
+TOOLS_DIR = REPO / "build" / "tools"
 ARTWORK = REPO / "src" / "screen" / "artwork.cpp"
 DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
@@ -198,6 +200,7 @@ KERNEL_RANGE = re.compile(r"(.+) address=(0x[0-9a-f]+) length=(0x[0-9a-f]+)")
 KERNEL_MEMMAP_TYPE = re.compile(r"type (\S+) count=(\d+) pages=(0x[0-9a-f]+)")
 KERNEL_HOLD = re.compile(r"(\d+) s")
 KERNEL_VALUE = re.compile(r"(\S+) (.+) ([0-9a-f]*)")
+KERNEL_DRIVER = re.compile(r'(".*") from=(\w+) address=(0x[0-9a-f]+) plist=(0x[0-9a-f]+) code=(0x[0-9a-f]+) sum=(0x[0-9a-f]+)')
 TREE_NODE = re.compile(r"( *)([^=]*)/ \((\d+) propert(?:y|ies), (\d+) child(?:ren)?\)")
 TREE_PROPERTY = re.compile(r"( *)(\S.*?) = (.*)")
 ROOT_UUID_MESSAGE = re.compile(r"root device uuid is '(.*)'")
@@ -228,6 +231,10 @@ class KernelReport:
     efi: dict = dataclasses.field(default_factory=dict)  # field -> number
     result: tuple | None = None  # (passed, checks, failed) of the result line
     hold: int | None = None  # seconds of a hold line
+    drivers: list = dataclasses.field(default_factory=list)  # (identifier, from, plist, code, sum), in order
+    package: tuple | None = None  # (length, sum) of the driver package
+    drivers_from: str | None = None  # "loader", "cache" or "none"
+    tsc: dict = dataclasses.field(default_factory=dict)  # moment -> time stamp counter
     unknown: list = dataclasses.field(default_factory=list)  # lines of no known kind
 
     def failed_checks(self):
@@ -317,6 +324,16 @@ def parse_kernel_report(log):
         elif kind == "result" and KERNEL_RESULT.fullmatch(rest):
             verdict, checks, failed = KERNEL_RESULT.fullmatch(rest).groups()
             report.result = (verdict == "pass", int(checks), int(failed))
+        elif kind == "driver" and KERNEL_DRIVER.fullmatch(rest):
+            identifier, source, _, plist, code, checksum = KERNEL_DRIVER.fullmatch(rest).groups()
+            report.drivers.append((unquote(identifier)[0], source, int(plist, 16), int(code, 16), int(checksum, 16)))
+        elif kind == "package":
+            numbers = fields(rest)
+            report.package = (numbers.get("length"), numbers.get("sum"))
+        elif kind == "tsc":
+            report.tsc.update(fields(rest))
+        elif kind == "drivers":
+            report.drivers_from = fields(rest).get("from")
         elif kind == "hold" and KERNEL_HOLD.fullmatch(rest):
             report.hold = int(KERNEL_HOLD.fullmatch(rest).group(1))
         else:
@@ -342,7 +359,43 @@ def describe(wanted):
     return repr(wanted)
 
 
-def check_kernel(log, expect):
+def content_bytes(content, guest_dir=GUEST_DIR):
+    """The bytes of a file's content as scenarios give it: bytes, text, a
+    host Path or a GuestFile."""
+    if isinstance(content, GuestFile):
+        data = (Path(guest_dir) / content.name).read_bytes()
+        return data + bytes(max(0, content.pad_to - len(data)))
+    if isinstance(content, Path):
+        return content.read_bytes()
+    return content.encode() if isinstance(content, str) else bytes(content)
+
+
+def check_drivers(report, expect, guest_dir=GUEST_DIR):
+    """Problems with the drivers that the kernel reported against `expect`:
+    where they came from, the driver blocks in order (identifier, length of
+    the text with its zero, length and Adler-32 of the code) and the
+    package (length and Adler-32)."""
+    problems = []
+    if expect.drivers_from is not None and report.drivers_from != expect.drivers_from:
+        problems.append(f"kernel: drivers from {report.drivers_from}, wanted {expect.drivers_from}")
+    if expect.drivers is not None:
+        wanted = []
+        for identifier, driver in expect.drivers.items():
+            code = content_bytes(driver.code, guest_dir)
+            wanted.append((identifier, len(content_bytes(driver.plist)) + 1, len(code), zlib.adler32(code)))
+        got = [(identifier, plist, code, checksum) for identifier, _, plist, code, checksum in report.drivers]
+        if got != wanted:
+            show = lambda rows: [f"{i} plist={p:#x} code={c:#x} sum={s:#x}" for i, p, c, s in rows]  # noqa: E731
+            problems.append(f"kernel: drivers {show(got)}, wanted {show(wanted)}")
+    if expect.package is not None:
+        package = content_bytes(expect.package, guest_dir)
+        wanted = (len(package), zlib.adler32(package))
+        if report.package != wanted:
+            problems.append(f"kernel: package (length, sum) {report.package}, wanted {wanted}")
+    return problems
+
+
+def check_kernel(log, expect, guest_dir=GUEST_DIR):
     """Problems with the kernel's report against `expect` (KernelExpect), and
     with what holds in any report: one start, a result line that agrees
     with the checks, no broken tree, a "boot-uuid" that is the text the
@@ -393,6 +446,8 @@ def check_kernel(log, expect):
             problems.append(f"kernel: no range {name}")
         elif length is not None and report.ranges[name][1] != length:
             problems.append(f"kernel: range {name} length {report.ranges[name][1]:#x}, wanted {length:#x}")
+
+    problems += check_drivers(report, expect, guest_dir)
 
     printed = ROOT_UUID_MESSAGE.findall(log)
     uuid = report.tree.get("/chosen", {}).get("boot-uuid")
@@ -869,38 +924,55 @@ def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
     for path, content in files.items():
         target = volume / path.strip("/")
         target.parent.mkdir(parents=True, exist_ok=True)
-        if isinstance(content, GuestFile):
-            pad_to, content = content.pad_to, Path(guest_dir) / content.name
-            if not content.is_file():
-                raise FileNotFoundError(f"{content} is missing: build the target guest_kernel first")
-            if pad_to:
-                data = content.read_bytes()
-                content = data + bytes(max(0, pad_to - len(data)))
-        if isinstance(content, Path):
-            shutil.copyfile(content, target)
-        else:
-            target.write_bytes(content.encode() if isinstance(content, str) else content)
+        if isinstance(content, GuestFile) and not (Path(guest_dir) / content.name).is_file():
+            raise FileNotFoundError(f"{Path(guest_dir) / content.name} is missing: build the target guest_kernel first")
+        target.write_bytes(content_bytes(content, guest_dir))
     # Deepest first: setting a directory's time after its children's.
     for path, when in sorted(scenario.times.items(), key=lambda item: -item[0].count("/")):
         mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
 
 
+def make_cache(cache, volume):
+    """Writes the kernel cache of `cache` (KernelCache) on the staged
+    volume with kcache, for the machine the harness boots (model and boot
+    device path), then shifts its time or breaks its checksum as asked.
+    Returns the name the loader will look for, as kcache printed it."""
+    kcache = Path(TOOLS_DIR) / "kcache"
+    if not kcache.is_file():
+        raise FileNotFoundError(f"{kcache} is missing: build the target kcache first")
+    args = [str(kcache), str(volume / cache.kernel), "--model", cache.model,
+            "--boot-path-hex", mkdisk.boot_device_path().hex(), "--volume", str(volume)]
+    for arg in cache.args:
+        args.append(str(volume / arg[len("volume:"):]) if arg.startswith("volume:") else arg)
+    done = subprocess.run(args, check=True, capture_output=True, text=True)
+    name = done.stdout.strip().splitlines()[-1]
+    path = volume / name.replace("\\", "/")
+    when = path.stat().st_mtime_ns
+    if cache.break_checksum:
+        data = bytearray(path.read_bytes())
+        data[8] ^= 0xFF  # the header's Adler-32
+        path.write_bytes(data)
+    mkdisk.set_time(path, when + int(cache.shift * 1_000_000_000))
+    return name
+
+
 def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
-    """Builds the scenario's disk in `workdir` with the disk tool; returns
-    its path."""
+    """Builds the scenario's disk in `workdir` with the disk tool. Returns
+    its path and the name of the kernel cache on it, or None."""
     efi_dir = Path(efi_dir)
     volume = workdir / "volume"
     volume.mkdir()
     stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
+    cache_name = make_cache(scenario.cache, volume) if scenario.cache is not None else None
     loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
     if scenario.network:
-        return serve_volume(volume, efi_dir / "BOOTX64.efi", loader)
+        return serve_volume(volume, efi_dir / "BOOTX64.efi", loader), cache_name
     disk = workdir / "disk.img"
     try:
-        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader)
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20)
     except mkdisk.DiskError as error:
         raise OSError(str(error)) from error
-    return disk
+    return disk, cache_name
 
 
 def serve_volume(volume, platform, loader):
@@ -1008,7 +1080,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     start = time.monotonic()
     workdir = Path(tempfile.mkdtemp(prefix=f"nimb-qemu-{scenario.name}-"))
     try:
-        disk = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
+        disk, cache_name = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
     except BaseException:
         shutil.rmtree(workdir, ignore_errors=True)
         raise
@@ -1023,9 +1095,13 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     outcome = decode_exit(returncode, read_exit_codes())
     problems = check_report(log, outcome, scenario.status, scenario.memory, scenario.exit)
     problems += check_log(log, scenario.expect, scenario.forbid)
+    if cache_name is not None:
+        # The name that kcache gave the cache, from the boot device path the
+        # disk tool computes, is the one the loader looks for.
+        problems += check_log(log, [f"Looking for kernel cache file '{cache_name}'"])
     problems += check_console_modes(log, scenario.console_modes)
     if scenario.kernel is not None:
-        problems += check_kernel(log, scenario.kernel)
+        problems += check_kernel(log, scenario.kernel, guest_dir)
     if scenario.capture:
         problems += check_capture(log, workdir / "net.pcap")
     problems += trouble
@@ -1133,7 +1209,7 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0, network=False
     the kernel passed and the screenshot was taken."""
     workdir = Path(tempfile.mkdtemp(prefix="nimb-qemu-demo-"))
     scenario, screen = (NET_DEMO, NET_DEMO_SCREEN) if network else (DEMO, DEMO_SCREEN)
-    disk = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
+    disk, _ = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
     if network:
         print(f"demo: serving {disk} over TFTP")
     screen.parent.mkdir(parents=True, exist_ok=True)
@@ -1182,10 +1258,12 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0, network=False
 
 
 def main(argv=None):
+    global TOOLS_DIR
     parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"), help="where BOOTX64.efi and nimbboot.efi are")
     parser.add_argument("--loader", help="another EFI program to start in place of nimbboot.efi")
     parser.add_argument("--guest-dir", default=str(GUEST_DIR), help="where the reference kernel's files are")
+    parser.add_argument("--tools-dir", default=str(TOOLS_DIR), help="where the host tools (kcache) are")
     parser.add_argument("--scenario", action="append", help="run this scenario (repeatable; default all)")
     parser.add_argument("--timeout", type=float, help="seconds per run, instead of the scenario's own")
     parser.add_argument("--show-log", action="store_true", help="print the serial log of passing runs too")
@@ -1195,6 +1273,7 @@ def main(argv=None):
     args = parser.parse_args(argv)
     for number in (signal.SIGTERM, signal.SIGINT, signal.SIGHUP):
         signal.signal(number, Machine.kill_all)
+    TOOLS_DIR = Path(args.tools_dir)
 
     if args.list:
         print("\n".join(SCENARIOS))

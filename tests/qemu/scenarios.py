@@ -114,6 +114,25 @@ class KernelExpect:
     # Range of /chosen/memory-map (its name, or a compiled pattern that one
     # name must match) -> its length, or None for any.
     ranges: dict = dataclasses.field(default_factory=dict)
+    # Where the drivers came from: "loader" (staged or a package), "cache"
+    # (prelinked in a kernel cache) or "none"; None: not checked.
+    drivers_from: str | None = None
+    # The driver blocks, in order: identifier -> DriverExpect; None: not
+    # checked.
+    drivers: dict | None = None
+    # The driver package's bytes (its x86 slice), as content; None: not
+    # checked.
+    package: object = None
+
+
+@dataclasses.dataclass(frozen=True)
+class DriverExpect:
+    """A driver block as the kernel must find it: the text of the bundle's
+    Info.plist and the code (its x86 slice), as content (bytes, text, a host
+    Path or a GuestFile)."""
+
+    plist: object
+    code: object = b""
 
 
 @dataclasses.dataclass(frozen=True)
@@ -189,6 +208,22 @@ def standard_extensions():
 
 
 @dataclasses.dataclass(frozen=True)
+class KernelCache:
+    """A kernel cache that the harness has kcache write on the volume, after
+    the files and their times, for the machine it boots. kcache gives it the
+    time one second after the newer of the kernel and the extensions
+    directory; `shift` seconds are added to that. Arguments of `args` that
+    start with "volume:" are paths on the volume."""
+
+    args: tuple = ()
+    kernel: str = "nimb_kernel"
+    model: str = "QEMU1,1"
+    shift: float = 0
+    # Breaks the header's checksum, so that the cache decompresses but fails.
+    break_checksum: bool = False
+
+
+@dataclasses.dataclass(frozen=True)
 class Scenario:
     name: str
     # platform.cfg keys, over BASE_CONFIG; the file is left out when there
@@ -207,6 +242,10 @@ class Scenario:
     # volume with the others; None: no extensions directory at all.
     extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
     directories: tuple = ()
+    # A kernel cache made for the volume, or None.
+    cache: KernelCache | None = None
+    # The disk's size in MiB.
+    disk_mib: int = 64
     # Exact modification times (UTC, "YYYY-MM-DD hh:mm:ss.nnnnnnnnn") of
     # files or directories of the volume, as the platform layer serves them.
     times: dict = dataclasses.field(default_factory=dict)
