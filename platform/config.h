@@ -16,7 +16,8 @@
 //                          3600; 0
 //   net.time-pxe=0|1       on a network boot, 1 times the firmware's own
 //                          download of the boot file before the loader
-//                          starts; 0
+//                          starts, then fetches it over the network's own
+//                          LoadFile; 0
 //   keys=<key>+<key>...    the keys held down at start, as the key state
 //                          protocol reports them. Modifiers: ctrl, shift,
 //                          alt, gui (left ones; also lctrl, lshift, lalt,
