@@ -154,11 +154,18 @@ void NetLoadFileInit(PlatformNetLoadFile *loader, EFI_PXE_BASE_CODE_PROTOCOL *px
 
 EFI_STATUS NetLoadFileFetch(PlatformNetLoadFile *loader, const char *name, void *(*allocate)(UINTN size),
                             void **buffer, UINT64 *size) {
+  *buffer = nullptr;
+  *size = 0;
+  UINTN length = 0;
+  while (name[length] != 0 && length <= kMaxTftpNameLength) {
+    length++;
+  }
+  if (length == 0 || length > kMaxTftpNameLength) {
+    return EFI_INVALID_PARAMETER;
+  }
   UINTN bufferSize = 0;
   EFI_STATUS status = Transfer(loader, name, &bufferSize, nullptr);
   if (status != EFI_BUFFER_TOO_SMALL) {
-    *buffer = nullptr;
-    *size = 0;
     return EFI_ERROR(status) ? status : EFI_SUCCESS;
   }
   *buffer = allocate(bufferSize);

@@ -61,6 +61,8 @@ EFI_STATUS NetLoadFileName(const EFI_DEVICE_PATH_PROTOCOL *path, char *name, UIN
 // A whole file by its TFTP name, as LoadFile fetches it: a size query, then
 // one transfer into a buffer from `allocate`, whose size is returned in
 // `*size`. The buffer is the caller's, also on a failure after it was given.
+// A name as LoadFile would refuse it is EFI_INVALID_PARAMETER; a file that
+// comes with another size than listed is EFI_END_OF_FILE.
 EFI_STATUS NetLoadFileFetch(PlatformNetLoadFile *loader, const char *name, void *(*allocate)(UINTN size),
                             void **buffer, UINT64 *size);
 

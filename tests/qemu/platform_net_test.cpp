@@ -192,6 +192,9 @@ TEST(PlatformNetLoadFile, FetchesWholeFilesAndSeesMismatches) {
   EXPECT_EQ(size, 3u);
   EXPECT_EQ(NetLoadFileFetch(&loader, "missing", allocate, &bytes, &size), EFI_NOT_FOUND);
   EXPECT_EQ(bytes, nullptr);
+  const std::string longName(kMaxTftpNameLength + 1, 'n');
+  EXPECT_EQ(NetLoadFileFetch(&loader, longName.c_str(), allocate, &bytes, &size), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(pxe.requests.size(), 5u);  // two for each file that came, one for the missing one
 }
 
 TEST(PlatformNetBoot, DhcpMessageLength) {
