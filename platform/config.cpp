@@ -177,13 +177,22 @@ bool ApplyKeys(PlatformConfig *config, const char *, char *value) {
   return true;
 }
 
-bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
-  UINT64 flag = 0;
-  if (!ParseDecimal(value, 1, &flag) || value[1] != '\0') {
+// A flag: 0 or 1.
+bool ApplyFlag(bool *flag, const char *value) {
+  UINT64 number = 0;
+  if (!ParseDecimal(value, 1, &number) || value[1] != '\0') {
     return false;
   }
-  config->keysIgnored = flag != 0;
+  *flag = number != 0;
   return true;
+}
+
+bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
+  return ApplyFlag(&config->keysIgnored, value);
+}
+
+bool ApplyTimePxe(PlatformConfig *config, const char *, char *value) {
+  return ApplyFlag(&config->timePxeDownload, value);
 }
 
 // Variables and records.
@@ -299,6 +308,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"options", ApplyOptions},
     {"console", ApplyConsole},
     {"hold", ApplyHold},
+    {"net.time-pxe", ApplyTimePxe},
     {"keys", ApplyKeys},
     {"keys-ignored", ApplyKeysIgnored},
     {"nvram.", ApplyNvramText},
@@ -424,6 +434,7 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->options = nullptr;
   config->consoleMode = EfiConsoleControlScreenGraphics;
   config->holdSeconds = 0;
+  config->timePxeDownload = false;
   config->keys = {};
   config->keysIgnored = false;
   config->nvram.count = 0;

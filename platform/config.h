@@ -14,6 +14,10 @@
 //   console=text|graphics  the console mode the loader finds; graphics
 //   hold=<seconds>         wait between the report and the power-off, 0 to
 //                          3600; 0
+//   net.time-pxe=0|1       on a network boot, 1 times the firmware's own
+//                          download of the boot file before the loader
+//                          starts, then fetches it over the network's own
+//                          LoadFile; 0
 //   keys=<key>+<key>...    the keys held down at start, as the key state
 //                          protocol reports them. Modifiers: ctrl, shift,
 //                          alt, gui (left ones; also lctrl, lshift, lalt,
@@ -111,6 +115,9 @@ struct PlatformConfig {
   EFI_CONSOLE_CONTROL_SCREEN_MODE consoleMode;
   // Seconds to wait between the report and the power-off.
   UINT32 holdSeconds;
+  // On a network boot: time the firmware's own download of the boot file
+  // before the loader starts (net.time-pxe=1).
+  bool timePxeDownload;
   HeldKeys keys;
   bool keysIgnored;
   ConfigEntryList nvram;
@@ -123,6 +130,8 @@ struct PlatformConfig {
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";
+// On a network boot: the loader's name on the TFTP server.
+constexpr const char *kDefaultNetLoaderName = "nimbboot.efi";
 constexpr UINT32 kMaxHoldSeconds = 3600;
 
 enum ConfigProblem : UINT32 {

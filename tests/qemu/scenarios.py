@@ -3,7 +3,9 @@ what the run must print and end with. harness.py runs them; CMakeLists.txt
 registers one ctest test per name."""
 
 import dataclasses
+import functools
 import re
+import struct
 import sys
 from pathlib import Path
 
@@ -52,6 +54,8 @@ class GuestFile:
     the volume in place of content."""
 
     name: str
+    # Zero bytes behind the file up to this size (0: none).
+    pad_to: int = 0
 
 
 def quoted(value):
@@ -107,7 +111,8 @@ class KernelExpect:
     # Node path -> {property: value as printed}; an empty dict only asks
     # for the node. text() and ucs2() print values as the kernel does.
     tree: dict = dataclasses.field(default_factory=dict)
-    # Range of /chosen/memory-map -> its length, or None for any.
+    # Range of /chosen/memory-map (its name, or a compiled pattern that one
+    # name must match) -> its length, or None for any.
     ranges: dict = dataclasses.field(default_factory=dict)
     # Where the drivers came from: "loader" (staged or a package), "cache"
     # (prelinked in a kernel cache) or "none"; None: not checked.
@@ -143,6 +148,10 @@ class ScreenExpect:
     # False: whatever else is on the screen is printed, but doesn't fail the
     # scenario.
     alone: bool = True
+    # The spinner below the logo: "turning" (a frame of it in this shot and
+    # another frame in a second shot a moment later), "gone" (its square is
+    # background) or None (not looked at).
+    spinner: str | None = None
 
 
 def kernel_file(name="nimb_kernel"):
@@ -286,6 +295,19 @@ class Scenario:
     # A screenshot and what it must show.
     screen: ScreenExpect | None = None
     timeout: float = 90.0
+    # A network boot: no disk; the files (platform.cfg, the loader
+    # nimbboot.efi and the others, by their paths on the server) are served
+    # over QEMU's TFTP, and the firmware's PXE starts the platform layer as
+    # the boot file. Needs a build of the platform with the network.
+    network: bool = False
+    # What the harness does to the running machine when a line of the serial
+    # log holds a text: (text, action) pairs, each done once. Actions:
+    # ("link-off",) takes the NIC's link down; ("truncate", path, size) cuts a
+    # served file.
+    actions: tuple = ()
+    # Check the kernel's network identity and DHCP answer against the
+    # packets captured on the wire.
+    capture: bool = False
 
 
 _TABLE = [
@@ -499,6 +521,143 @@ _TABLE = [
         config={"console": "graphics", "hold": 2},
         expect=(KERNEL_ERROR, "platform: loader returned"),
         screen=ScreenExpect(when="platform: memory", picture="failure"),
+    ),
+]
+
+# --- network boots ----------------------------------------------------------------------
+
+# The loader's defaults on a network boot: the kernel next to the loader and
+# its package behind it.
+NET_KERNEL = "nimb.tarnix"
+NET_PACKAGE = "nimb.tarnix.drvpk"
+
+
+# A driver package: the loader copies it as it stands (it isn't fat).
+NET_PACKAGE_BYTES = bytes(i * 13 % 251 for i in range(20000))
+
+
+def net_kernel_files(name="nimb_kernel", pad_to=0, package=True):
+    """The served kernel under its default name, with its package."""
+    files = {NET_KERNEL: GuestFile(name, pad_to)}
+    if package:
+        files[NET_PACKAGE] = NET_PACKAGE_BYTES
+    return files
+
+
+# The package's range in /chosen/memory-map, named by its address.
+PACKAGE_RANGE = re.compile(r"DriversPackage-[0-9a-f]+")
+
+
+# A kernel file as large as a real one, which takes a while to come.
+BIG_KERNEL = 16 << 20
+
+# The NIC's MAC address: not QEMU's default, so that a MAC that reaches the
+# kernel came from the NIC.
+NET_MAC = "52:54:00:a7:3c:e1"
+
+
+def net_file_path(name):
+    """A device path over the network device, as NVRAM holds the kernel's
+    path: PciRoot(0)/Pci(2,0)/MAC(NET_MAC,1)/File(name)/End, in bytes."""
+    mac = bytes.fromhex(NET_MAC.replace(":", "")).ljust(32, b"\0")
+    text = (name + "\0").encode("utf-16-le")
+    return b"".join((
+        bytes([2, 1, 12, 0]) + struct.pack("<II", 0x0A0341D0, 0),
+        bytes([1, 1, 6, 0, 0, 2]),
+        bytes([3, 11, 37, 0]) + mac + bytes([1]),
+        bytes([4, 4]) + struct.pack("<H", 4 + len(text)) + text,
+        bytes([0x7F, 0xFF, 4, 0]),
+    ))
+
+
+# A network boot: nothing but the served files (no extensions directory).
+NetScenario = functools.partial(Scenario, network=True, extensions=None, timeout=150.0)
+
+_TABLE += [
+    # The firmware's PXE starts the platform, which serves the loader's files
+    # from the same TFTP server: the reference kernel boots with the network's
+    # identity and the server's real answers in its tree.
+    NetScenario(
+        "net_kernel",
+        config={"options": "foo=1 guest.hold=1"},
+        files=net_kernel_files(),
+        expect=(
+            "platform: net boot: station",
+            "platform: net read of nimbboot.efi",
+            f"platform: net read of {NET_PACKAGE} into",
+            KERNEL_START,
+        ),
+        exit="KernelPass",
+        kernel=KernelExpect(
+            bootargs={"commandLine": "foo=1 guest.hold=1"},
+            tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
+            ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
+        ),
+        capture=True,
+        # The spinner is wiped before the hand-off: the logo stands alone.
+        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
+    ),
+    # The spinner turns below the logo while a large kernel comes over the
+    # network.
+    NetScenario(
+        "net_spinner",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        expect=(f"platform: net read of {NET_KERNEL} into {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
+        exit="KernelPass",
+        screen=ScreenExpect(when=f"net read of {NET_KERNEL} into", picture="logo", alone=False, spinner="turning"),
+        timeout=200.0,
+    ),
+    # efi-boot-file-data names another kernel on the server, and the
+    # configuration file comes from the server too.
+    NetScenario(
+        "net_other_kernel",
+        config={"nvram-hex.efi-boot-file-data": net_file_path("kernels\\other_kernel").hex()},
+        files={
+            "kernels/other_kernel": GuestFile("nimb_kernel.fat-le"),
+            "kernels/other_kernel.drvpk": NET_PACKAGE_BYTES,
+            "com.quill.Boot.plist": plist({"Kernel Flags": "from_server=1"}),
+        },
+        expect=(
+            "platform: net read of com.quill.Boot.plist into",
+            "platform: net read of kernels/other_kernel into",
+            KERNEL_START,
+        ),
+        forbid=(f"of {NET_KERNEL}",),
+        exit="KernelPass",
+        kernel=KernelExpect(bootargs={"commandLine": "from_server=1"}),
+    ),
+    # A network boot has no driver bundles to fall back on: without its
+    # package the boot ends.
+    NetScenario(
+        "net_no_package",
+        files=net_kernel_files(package=False),
+        expect=(f"platform: net size of {NET_PACKAGE}: EFI_NOT_FOUND", "Error loading drivers",
+                "platform: loader returned"),
+    ),
+    # Bad input on the wire ends the boot with a clear message, never a hang:
+    # the kernel cut short on the server while it comes, ...
+    NetScenario(
+        "net_size_mismatch",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        actions=((f"net read of {NET_KERNEL} into", ("truncate", NET_KERNEL, 1 << 20)),),
+        expect=(f"net read of {NET_KERNEL} into", "Network file size mismatch", "platform: loader returned"),
+        timeout=200.0,
+    ),
+    # ... a server that stops answering in the middle of the kernel (the
+    # firmware's TFTP gives up), ...
+    NetScenario(
+        "net_server_gone",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        actions=((f"net read of {NET_KERNEL} into", ("link-off",)),),
+        expect=(f"net read of {NET_KERNEL} into", f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
+        timeout=300.0,
+    ),
+    # ... and a kernel whose name no TFTP request can carry.
+    NetScenario(
+        "net_long_name",
+        config={"nvram-hex.efi-boot-file-data": net_file_path("k" * 500).hex()},
+        expect=("platform: net request of a path of no TFTP name: EFI_INVALID_PARAMETER",
+                f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
     ),
 ]
 
