@@ -279,6 +279,10 @@ bool ApplyBsdpResponse(PlatformConfig *config, const char *, char *value) {
   return ApplyBytes(&config->bsdpResponse, value);
 }
 
+bool ApplyTimedRead(PlatformConfig *config, const char *, char *value) {
+  return ApplyBytes(&config->timedRead, value);
+}
+
 // A key whose name ends in '.' is a prefix: it takes every key that starts
 // with it, and its function gets the rest of the key as the name.
 struct ConfigKey {
@@ -300,6 +304,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"device-properties-hex", ApplyDeviceProperties},
     {"netboot.dhcp-hex", ApplyDhcpResponse},
     {"netboot.bsdp-hex", ApplyBsdpResponse},
+    {"timed-read-hex", ApplyTimedRead},
 };
 
 // The name that `key` gives to the function of `entry`, or null when the
@@ -422,6 +427,7 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->deviceProperties = {};
   config->dhcpResponse = {};
   config->bsdpResponse = {};
+  config->timedRead = {};
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {

@@ -43,6 +43,11 @@
 //   netboot.bsdp-hex=<hex> its boot-service discovery answer (may be empty).
 //                          With either key the protocol is there, and it
 //                          answers EFI_NOT_FOUND for an answer not given
+//   timed-read-hex=<hex>   before the loader starts, the platform reads
+//                          these extents of one partition through DiskIO
+//                          and prints the time in TSC ticks: u32 partition
+//                          number, then u64 start and u64 length pairs,
+//                          little-endian
 // Hexadecimal values are any number of bytes: two digits each, blanks
 // allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
@@ -114,6 +119,7 @@ struct PlatformConfig {
   ConfigBytes deviceProperties;
   ConfigBytes dhcpResponse;
   ConfigBytes bsdpResponse;
+  ConfigBytes timedRead;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";

@@ -16,6 +16,7 @@
 #include "key_state.h"
 #include "memory.h"
 #include "net_boot_info.h"
+#include "resume_watch.h"
 #include "serial.h"
 
 namespace nimb::platform {
@@ -320,7 +321,8 @@ void InstallProtocols(const PlatformConfig &config) {
 }
 
 // The loader's variables that the configuration sets; the others stay as
-// they are.
+// they are. The values are wiped behind them: the variable store keeps the
+// only copy (a key among them is looked for in memory after a resume).
 void SetVariables(const ConfigEntryList &variables) {
   constexpr UINT32 kAttributes =
       EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
@@ -335,6 +337,10 @@ void SetVariables(const ConfigEntryList &variables) {
       Fail(kExitPlatformFailed, "cannot set NVRAM variable %s (%s)", variable.name, StatusName(status));
     }
     SerialPrintf("platform: nvram %s set, %u bytes\n", variable.name, static_cast<UINT64>(variable.size));
+    volatile UINT8 *bytes = const_cast<UINT8 *>(variable.bytes);
+    for (UINT32 j = 0; j < variable.size; j++) {
+      bytes[j] = 0;
+    }
   }
 }
 
@@ -356,6 +362,7 @@ EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
   }
   // While the loader runs, its text stays off a graphics screen.
   ConsoleOfferScreenText(&gConsole, true);
+  SerialPrintf("platform: tsc at start 0x%x\n", ReadTsc());
   status = gBS->StartImage(loader, nullptr, nullptr);
   ConsoleOfferScreenText(&gConsole, false);
   return status;
@@ -381,7 +388,17 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   const UINTN directories = MemoryWarmDirectoryCache(root);
   root->Close(root);
   InstallProtocols(config);
-  SetVariables(config.nvram);
+  // A machine that resets starts again on the same variable store: the
+  // configured variables are set on the first start only.
+  const UINT32 boot = CountBoot();
+  ReportResumeVariables();
+  if (boot == 1) {
+    SetVariables(config.nvram);
+  }
+  if (config.timedRead.bytes != nullptr) {
+    TimedRead(config.timedRead);
+  }
+  WatchDiskAndReset();
   MemoryStockPool();
   const EFI_STATUS status = MemoryMeterInit(&gMeter);
   if (EFI_ERROR(status)) {
