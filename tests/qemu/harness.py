@@ -36,6 +36,7 @@ sys.path.insert(0, str(Path(__file__).resolve().parent))
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
     PARTITION_GUID,
+    RESUME_PARTITION_GUID,
     SCENARIOS,
     GuestFile,
     Scenario,
@@ -56,6 +57,12 @@ DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
 DISK_BYTES = 64 << 20
 PARTITION_OFFSET = 1 << 20  # first sector 2048
+# With a raw resume partition: the system partition takes 62 MiB, the raw
+# one follows at 63 MiB.
+ESP_SECTORS_BESIDE_RAW = 126976
+RAW_PARTITION_LBA = 129024
+RESUME_TOOL = REPO / "tools" / "mkresume" / "mkresume.py"
+RESUME_PROBE = "resume_probe.elf"
 
 # The platform's report, on the serial port.
 REPORT_STATUS = re.compile(r"platform: loader returned 0x([0-9a-f]+) \((\w+)\)")
@@ -226,6 +233,7 @@ class KernelReport:
     result: tuple | None = None  # (passed, checks, failed) of the result line
     hold: int | None = None  # seconds of a hold line
     unknown: list = dataclasses.field(default_factory=list)  # lines of no known kind
+    resume: list = dataclasses.field(default_factory=list)  # the restart probe's own lines
 
     def failed_checks(self):
         return [check for check in self.checks if not check.ok]
@@ -311,6 +319,8 @@ def parse_kernel_report(log):
         elif kind == "result" and KERNEL_RESULT.fullmatch(rest):
             verdict, checks, failed = KERNEL_RESULT.fullmatch(rest).groups()
             report.result = (verdict == "pass", int(checks), int(failed))
+        elif kind == "resume":
+            report.resume.append(rest)
         elif kind == "hold" and KERNEL_HOLD.fullmatch(rest):
             report.hold = int(KERNEL_HOLD.fullmatch(rest).group(1))
         else:
@@ -496,6 +506,8 @@ def check_screen(image, expect, artwork=None):
     of a centred 128 x 128 picture (without artwork: anything there). The
     second: anything else on the screen, that is a box of all that isn't
     background larger than 128 x 128 or off the centre by more than a pixel."""
+    if expect.background is None:  # a screen of no fixed background: only taken
+        return [], []
     background = bytes(expect.background)
     if image.pixel(0, 0) != expect.background:
         return [f"screen: background {image.pixel(0, 0)}, wanted {expect.background}"], []
@@ -576,19 +588,32 @@ def run_tool(*args, env=None):
     subprocess.run(args, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, env=env)
 
 
-def build_disk(image, files, directories=()):
+def build_disk(image, files, directories=(), raw=None):
     """A GPT disk of DISK_BYTES with one EFI system partition, of the GUID
     PARTITION_GUID, holding `files` (ESP path with '/' -> bytes or host Path)
-    and `directories` (ESP paths)."""
+    and `directories` (ESP paths). With `raw` (a partition image), a second
+    partition of RESUME_PARTITION_GUID behind a smaller system partition
+    holds its bytes."""
     image = Path(image).resolve()
+    raw_bytes = (Path(raw).stat().st_size + 511) // 512 * 512 if raw else 0
     with open(image, "wb") as disk:
-        disk.truncate(DISK_BYTES)
+        disk.truncate(DISK_BYTES + raw_bytes)
     # A fresh image has nothing to zap, and each of sgdisk's steps costs a
     # second of waiting for the kernel to reread the table.
-    run_tool("sgdisk", "-o", "-n", "1:2048:0", "-t", "1:EF00", "-u", f"1:{PARTITION_GUID}", str(image))
+    layout = ["-n", "1:2048:0"]
+    if raw:
+        end = RAW_PARTITION_LBA + raw_bytes // 512 - 1
+        layout = ["-n", f"1:2048:{RAW_PARTITION_LBA - 1}", "-n", f"2:{RAW_PARTITION_LBA}:{end}",
+                  "-u", f"2:{RESUME_PARTITION_GUID}"]  # fmt: skip
+    run_tool("sgdisk", "-o", *layout, "-t", "1:EF00", "-u", f"1:{PARTITION_GUID}", str(image))
     volume = f"{image}@@{PARTITION_OFFSET}"
     env = dict(os.environ, MTOOLS_SKIP_CHECK="1")
-    run_tool("mformat", "-i", volume, "-F", "-v", "ESP", "::", env=env)
+    size = ["-T", str(ESP_SECTORS_BESIDE_RAW)] if raw else []
+    run_tool("mformat", "-i", volume, *size, "-F", "-v", "ESP", "::", env=env)
+    if raw:
+        with open(image, "r+b") as disk, open(raw, "rb") as source:
+            disk.seek(RAW_PARTITION_LBA * 512)
+            shutil.copyfileobj(source, disk)
     needed = set()
     for path in list(directories) + [str(Path(p).parent) for p in files]:
         parts = Path(path.strip("/")).parts
@@ -626,13 +651,15 @@ def find_ovmf():
     raise FileNotFoundError("OVMF_CODE_4M.fd and OVMF_VARS_4M.fd not found (package ovmf)")
 
 
-def qemu_command(workdir, disk, serial_log, qmp_socket=None):
+def qemu_command(workdir, disk, serial_log, qmp_socket=None, reboot=False, extra=()):
+    """QEMU's command line; with `reboot`, a reset starts the machine again
+    (on the same variable store) instead of ending QEMU."""
     code, variables = find_ovmf()
     private_vars = workdir / "OVMF_VARS.fd"
     shutil.copyfile(variables, private_vars)
     command = [
-        "qemu-system-x86_64", "-machine", "q35", "-m", "512M", "-accel", "tcg",
-        "-display", "none", "-no-reboot",
+        "qemu-system-x86_64", "-machine", "q35", "-m", "512M", "-accel", "tcg", *extra,
+        "-display", "none", *([] if reboot else ["-no-reboot"]),
         "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={code}",
         "-drive", f"if=pflash,format=raw,unit=1,file={private_vars}",
         "-drive", f"format=raw,file={disk}",
@@ -727,6 +754,9 @@ def scenario_config(scenario, override=None):
 def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
     """Builds the scenario's disk in `workdir`; returns its path."""
     efi_dir = Path(efi_dir)
+    raw, resume_keys = None, {}
+    if scenario.resume is not None:
+        raw, resume_keys = make_resume(scenario.resume, workdir, guest_dir)
     files = {
         "EFI/BOOT/BOOTX64.EFI": efi_dir / "BOOTX64.efi",
         "EFI/BOOT/nimbboot.efi": Path(loader) if loader else efi_dir / "nimbboot.efi",
@@ -735,6 +765,8 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
         if not path.is_file():
             raise FileNotFoundError(f"{path} is missing: build the EFI programs first")
     config = scenario_config(scenario, config_override)
+    for key, value in resume_keys.items():
+        config.setdefault(key, value)
     if config or scenario.config_file:
         files["EFI/BOOT/platform.cfg"] = render_config(config)
     for path, content in scenario.files.items():
@@ -746,8 +778,64 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
     for path in scenario.remove:
         files.pop(path, None)
     disk = workdir / "disk.img"
-    build_disk(disk, files, scenario.directories)
+    build_disk(disk, files, scenario.directories, raw)
     return disk
+
+
+def make_resume(resume, workdir, guest_dir, extra=()):
+    """Writes the scenario's resume image onto a partition image with
+    mkresume and the restart probe; returns its path and the platform.cfg
+    keys that ask for the restart."""
+    probe = Path(guest_dir) / RESUME_PROBE
+    if not probe.is_file():
+        raise FileNotFoundError(f"{probe} is missing: build the target guest_kernel first")
+    partition, settings = workdir / "resume.img", workdir / "resume.cfg"
+    command = [
+        sys.executable, str(RESUME_TOOL), "--restart", str(probe), "--partition", str(partition),
+        "--partition-bytes", str(resume.partition_bytes), "--partition-number", "2",
+        "--partition-guid", RESUME_PARTITION_GUID, "--partition-start-lba", str(RAW_PARTITION_LBA),
+        "--partition-lbas", str(resume.partition_bytes // 512), "--nvram-out", str(settings),
+        *resume.args, *extra,
+    ]  # fmt: skip
+    if resume.preview is not None:
+        picture = workdir / "preview.ppm"
+        picture.write_bytes(resume.preview())
+        command += ["--preview", str(picture)]
+    subprocess.run(command, check=True, capture_output=True)
+    keys = dict(line.split("=", 1) for line in settings.read_text().splitlines() if "=" in line)
+    return partition, keys
+
+
+def check_boots(log, wanted):
+    """Problems with the number of starts of the platform layer."""
+    starts = log.count("platform: started")
+    return [] if starts == wanted else [f"the machine started {starts} times, wanted {wanted}"]
+
+
+READ_LINE = re.compile(r"platform: read offset=0x([0-9a-f]+) size=0x([0-9a-f]+) to=0x([0-9a-f]+)")
+
+
+def check_resume_reads(log, expect):
+    """Problems with the loader's DiskIO reads that the platform logged at
+    the reset, against `expect` (ResumeReads): the header read first, then
+    at most `after_header` reads, each inside the first stage behind a
+    page-aligned header."""
+    if expect is None:
+        return []
+    reads = [tuple(int(v, 16) for v in m) for m in READ_LINE.findall(log)]
+    if not reads or reads[0][1] != 512:
+        return [f"reads: the first read is not the 512-byte header: {reads[:1]}"]
+    problems, later = [], reads[1:]
+    if expect.after_header is not None and len(later) > expect.after_header:
+        problems.append(f"reads: {len(later)} reads after the header, wanted at most {expect.after_header}")
+    if later:
+        header = later[0][2] - 512
+        if header % 4096:
+            problems.append(f"reads: the first read behind the header lands at {later[0][2]:#x}, no page + 512")
+        for offset, size, to in later:
+            if not (header + 512 <= to and to + size <= header + expect.first_stage):
+                problems.append(f"reads: {size:#x} bytes to {to:#x} leave the first stage at {header:#x}")
+    return problems
 
 
 class SerialFollower:
@@ -770,20 +858,23 @@ class SerialFollower:
         return [clean_log(line) for line in complete]
 
 
-def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False):
+def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False, boots=1, extra=()):
     """Runs QEMU on `disk` until it ends, for at most `timeout` seconds. With
     `screen_when`, takes a screenshot into `screen_path` over QMP as soon as
     a line of the serial log holds that text; with `echo`, prints the
-    cleaned serial log as it comes. Returns the exit status (None: timed
-    out), the cleaned log, the screenshot's path or None, and what went
-    wrong with the screenshot."""
+    cleaned serial log as it comes. With `boots` above 1, a reset starts
+    the machine again on the same variable store, and the run ends when
+    the platform layer starts once more than that. Returns the exit status
+    (None: timed out or stopped), the cleaned log, the screenshot's path or
+    None, and what went wrong with the screenshot or the boots."""
     serial_log = workdir / "serial.log"
     qmp_socket = workdir / "qmp.sock" if screen_when else None
-    machine = Machine(qemu_command(workdir, disk, serial_log, qmp_socket), workdir / "qemu.log")
+    command = qemu_command(workdir, disk, serial_log, qmp_socket, reboot=boots > 1, extra=extra)
+    machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
-    shot, trouble = None, []
+    shot, trouble, starts = None, [], 0
     try:
-        if screen_when or echo:
+        if screen_when or echo or boots > 1:
             qmp = Qmp(qmp_socket, deadline, machine) if screen_when else None
             follower = SerialFollower(serial_log)
             while True:
@@ -794,6 +885,11 @@ def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False)
                     if qmp is not None and shot is None and screen_when in line:
                         qmp.execute("screendump", filename=str(screen_path), format="png")
                         shot = screen_path
+                    starts += line.startswith("platform: started")
+                if starts > boots:
+                    trouble.append(f"boots: the machine started more than {boots} times; stopped")
+                    machine.kill()
+                    break
                 if not running or time.monotonic() > deadline:
                     break
                 time.sleep(0.1)
@@ -818,7 +914,8 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     limit = timeout or scenario.timeout
     screen = scenario.screen
     returncode, log, shot, trouble = boot(
-        disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None
+        disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None,
+        boots=scenario.boots,
     )
     (workdir / "serial.txt").write_text(log)
     outcome = decode_exit(returncode, read_exit_codes())
@@ -827,6 +924,10 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     problems += check_console_modes(log, scenario.console_modes)
     if scenario.kernel is not None:
         problems += check_kernel(log, scenario.kernel)
+    if scenario.boots > 1:
+        problems += [t for t in trouble if t.startswith("boots:")] + check_boots(log, scenario.boots)
+        trouble = [t for t in trouble if not t.startswith("boots:")]
+    problems += check_resume_reads(log, scenario.reads)
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
         problems += trouble + picture
