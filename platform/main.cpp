@@ -337,8 +337,11 @@ void SetVariables(const ConfigEntryList &variables) {
       Fail(kExitPlatformFailed, "cannot set NVRAM variable %s (%s)", variable.name, StatusName(status));
     }
     SerialPrintf("platform: nvram %s set, %u bytes\n", variable.name, static_cast<UINT64>(variable.size));
-    volatile UINT8 *bytes = const_cast<UINT8 *>(variable.bytes);
-    for (UINT32 j = 0; j < variable.size; j++) {
+  }
+  ReportKeyCopies(variables);
+  for (UINT32 i = 0; i < variables.count; i++) {
+    volatile UINT8 *bytes = const_cast<UINT8 *>(variables.entries[i].bytes);
+    for (UINT32 j = 0; j < variables.entries[i].size; j++) {
       bytes[j] = 0;
     }
   }
@@ -362,7 +365,7 @@ EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
   }
   // While the loader runs, its text stays off a graphics screen.
   ConsoleOfferScreenText(&gConsole, true);
-  SerialPrintf("platform: tsc at start 0x%x\n", ReadTsc());
+  ReportLoaderStart();
   status = gBS->StartImage(loader, nullptr, nullptr);
   ConsoleOfferScreenText(&gConsole, false);
   return status;

@@ -104,6 +104,12 @@ UINT32 PartitionNumberOf(EFI_HANDLE handle) {
   }
 }
 
+UINT64 ReadTsc() {
+  UINT32 low, high;
+  __asm__ volatile("rdtsc" : "=a"(low), "=d"(high));
+  return static_cast<UINT64>(high) << 32 | low;
+}
+
 UINT64 ReadLe(const UINT8 *bytes, UINT32 count) {
   UINT64 value = 0;
   for (UINT32 i = count; i > 0; i--) {
@@ -165,6 +171,75 @@ void WatchDiskAndReset() {
   reinterpret_cast<CalculateCrc32Function>(gBS->CalculateCrc32)(gRT, gRT->Hdr.HeaderSize, &crc);
   gRT->Hdr.CRC32 = crc;
   SerialPrintf("platform: watching %u disk interfaces and the reset\n", static_cast<UINT64>(gDiskCount));
+}
+
+void ReportKeyCopies(const ConfigEntryList &variables) {
+  const ConfigEntry *key = nullptr;
+  for (UINT32 i = 0; i < variables.count; i++) {
+    const char *name = variables.entries[i].name;
+    const char *wanted = kResumeVariableNames[2];
+    UINT32 j = 0;
+    while (name[j] != 0 && name[j] == wanted[j]) {
+      j++;
+    }
+    if (name[j] == wanted[j] && variables.entries[i].size >= 8) {
+      key = &variables.entries[i];
+    }
+  }
+  if (key == nullptr) {
+    return;
+  }
+  UINTN size = 0, mapKey = 0, descriptorSize = 0;
+  UINT32 version = 0;
+  gBS->GetMemoryMap(&size, nullptr, &mapKey, &descriptorSize, &version);
+  size += 4 * descriptorSize;
+  UINT8 *map = nullptr;
+  if (EFI_ERROR(gBS->AllocatePool(EfiBootServicesData, size, reinterpret_cast<VOID **>(&map))) ||
+      EFI_ERROR(gBS->GetMemoryMap(&size, reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map), &mapKey,
+                                  &descriptorSize, &version))) {
+    SerialPrintf("platform: key copies: no memory map\n");
+    return;
+  }
+  // The key's words at each byte offset: an occurrence anywhere has one of
+  // them in a 4-byte-aligned word among its first seven bytes.
+  UINT32 words[4];
+  for (UINT32 k = 0; k < 4; k++) {
+    words[k] = static_cast<UINT32>(ReadLe(key->bytes + k, 4));
+  }
+  UINT32 found = 0;
+  for (UINT8 *d = map; d < map + size; d += descriptorSize) {
+    const EFI_MEMORY_DESCRIPTOR *descriptor = reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(d);
+    const UINT64 start = descriptor->PhysicalStart;
+    const UINT64 end = start + descriptor->NumberOfPages * 4096;
+    // Memory that the firmware and the programs hold data in (free memory
+    // holds none of the key: the harness sees the probe find none there).
+    if (descriptor->Type < EfiLoaderCode || descriptor->Type > EfiRuntimeServicesData || end > (1ull << 32)) {
+      continue;
+    }
+    for (UINT64 at = start; at + 4 <= end; at += 4) {
+      const UINT32 word = *reinterpret_cast<const volatile UINT32 *>(at);
+      for (UINT32 k = 0; k < 4; k++) {
+        const UINT8 *bytes = reinterpret_cast<const UINT8 *>(at - k);
+        if (word != words[k] || at - k < start || at - k + key->size > end || bytes == key->bytes) {
+          continue;
+        }
+        UINT32 i = 0;
+        while (i < key->size && bytes[i] == key->bytes[i]) {
+          i++;
+        }
+        if (i == key->size) {
+          SerialPrintf("platform: key copy at 0x%x type %u\n", at - k, static_cast<UINT64>(descriptor->Type));
+          found++;
+        }
+      }
+    }
+  }
+  gBS->FreePool(map);
+  SerialPrintf("platform: key copies %u\n", static_cast<UINT64>(found));
+}
+
+void ReportLoaderStart() {
+  SerialPrintf("platform: tsc at start 0x%x\n", ReadTsc());
 }
 
 void TimedRead(const ConfigBytes &request) {

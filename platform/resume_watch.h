@@ -18,6 +18,12 @@ UINT32 CountBoot();
 // boot-image-key=absent": the size of each resume variable, or absent.
 void ReportResumeVariables();
 
+// When `variables` set boot-image-key: every place in memory where its bytes
+// stand now, apart from the configuration's own copy, with the memory type
+// ("platform: key copy at 0x<hex> type <n>"). These are the firmware's
+// copies; a copy found after a resume anywhere else is the loader's.
+void ReportKeyCopies(const ConfigEntryList &variables);
+
 // Wraps ReadDisk of every DiskIO interface and the runtime services'
 // ResetSystem: every read is logged, and a reset prints the log before it
 // goes to the firmware ("platform: reset cold", "platform: read ...",
@@ -30,10 +36,8 @@ void WatchDiskAndReset();
 // "platform: timed read B bytes, N extents, T ticks".
 void TimedRead(const ConfigBytes &request);
 
-inline UINT64 ReadTsc() {
-  UINT32 low, high;
-  __asm__ volatile("rdtsc" : "=a"(low), "=d"(high));
-  return static_cast<UINT64>(high) << 32 | low;
-}
+// "platform: tsc at start 0x<hex>": the counter just before the loader
+// starts, the beginning of the loader's time in the resume benchmark.
+void ReportLoaderStart();
 
 }  // namespace nimb::platform

@@ -1,6 +1,9 @@
 // The restart probe's run: everything the loader hands a restarted image is
 // checked against the record that mkresume filled in, then memory is
-// searched for the AES key. The report uses the reference kernel's lines
+// searched for the AES key: a round key anywhere fails the run, and each
+// place of the key itself is reported ("kernel: resume trace ...") for the
+// harness to judge against the firmware's own copies, which the platform
+// layer lists before the loader starts. The report uses the reference kernel's lines
 // ("kernel: check ...", "kernel: result ...") and its exit codes; lines of
 // its own are "kernel: resume <field>=<value> ...".
 #include "resume_probe.h"
@@ -64,7 +67,7 @@ constexpr uint32_t kSamplesPerCell = 38;
 
 constexpr uint32_t kMaxPatterns = 32;
 constexpr uint32_t kFilterBits = 20;
-constexpr uint32_t kMaxHitsShown = 12;
+constexpr uint32_t kMaxHitsShown = 32;
 
 uint32_t gFilter[(1u << kFilterBits) / 32];
 
@@ -363,10 +366,6 @@ void ScanForKey(const Handed &h, const ResumeExpect &expect, uint32_t ownStart, 
        hits.inArea, hits.copiedFrom, hits.elsewhere, end);
   Check("resume-no-round-key", hits.roundKeys == 0, "%u of %u round keys found in memory", hits.roundKeys,
         count - 1);
-  Check(
-      "resume-key-only-in-firmware", hits.elsewhere == 0,
-      "key found %u times outside the firmware's runtime data (%u in the area, %u where it was copied from)",
-      hits.elsewhere, hits.inArea, hits.copiedFrom);
 }
 
 }  // namespace
@@ -399,11 +398,27 @@ extern "C" [[noreturn]] void KernelMain(const nimb::guest::EntryState *state) {
     Line("resume header=0x%x scratch=0x%x firstStage=0x%x imageBytes=0x%llx restorePage=0x%x runtime=0x%x",
          h.header, h.scratch, h.firstStage, static_cast<unsigned long long>(Le64(header + kImageBytes)),
          Le32(header + kRestorePage), h.runtimeBase);
-    CheckHeader(h, expect);
-    CheckVideo(h, expect);
-    CheckBar(h, expect);
-    CheckFirstStage(h, expect);
-    CheckRuntime(h, expect);
+    // The other checks walk what the header describes: only a sane
+    // layout is walked.
+    const uint32_t ram = RamEnd();
+    const bool sane = Check(
+        "resume-layout",
+        h.firstStage == expect.firstStageBytes && h.scratch < h.header &&
+            h.codeCopy - h.header >= kHeaderBytes &&
+            Inside(h.codeCopy, h.restoreBytes, h.header, h.header + h.firstStage) &&
+            Inside(h.header, h.firstStage, 0, ram) && h.runtimeBase < h.runtimeEnd && h.runtimeEnd <= ram,
+        "first stage 0x%x (wanted 0x%x) at 0x%x, restart code copy at 0x%x, runtime [0x%x, 0x%x), RAM 0x%x",
+        h.firstStage, expect.firstStageBytes, h.header, h.codeCopy, h.runtimeBase, h.runtimeEnd, ram);
+    if (sane) {
+      CheckHeader(h, expect);
+      CheckVideo(h, expect);
+      CheckBar(h, expect);
+      CheckFirstStage(h, expect);
+      CheckRuntime(h, expect);
+    }
+    if (!sane) {
+      h.runtimeBase = h.runtimeEnd = 0;
+    }
     const uint32_t ownStart = state->imageStart & ~(kPageSize - 1);
     const uint32_t ownEnd = (state->imageEnd + kPageSize - 1) & ~(kPageSize - 1);
     ScanForKey(h, expect, ownStart, ownEnd);

@@ -806,6 +806,23 @@ def make_resume(resume, workdir, guest_dir, extra=()):
     return partition, keys
 
 
+KEY_COPY = re.compile(r"platform: key copy at 0x([0-9a-f]+) type (\d+)")
+KEY_TRACE = re.compile(r'resume trace kind=key address=0x([0-9a-f]+) where="([^"]*)"')
+
+
+def check_key_trace(log):
+    """Problems with the places where the restart probe found the key: each
+    must be the firmware's (the runtime area the runtime data was moved to,
+    the region it was copied from, or a copy that the platform layer found
+    before the loader started); anything else the loader left behind."""
+    firmware = {int(address, 16) for address, _ in KEY_COPY.findall(log)}
+    problems = []
+    for address, where in KEY_TRACE.findall(log):
+        if where == "elsewhere" and int(address, 16) not in firmware:
+            problems.append(f"key: the key's bytes at {address} are no copy of the firmware's")
+    return problems
+
+
 def check_boots(log, wanted):
     """Problems with the number of starts of the platform layer."""
     starts = log.count("platform: started")
@@ -928,6 +945,8 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
         problems += [t for t in trouble if t.startswith("boots:")] + check_boots(log, scenario.boots)
         trouble = [t for t in trouble if not t.startswith("boots:")]
     problems += check_resume_reads(log, scenario.reads)
+    if scenario.resume is not None:
+        problems += check_key_trace(log)
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
         problems += trouble + picture
