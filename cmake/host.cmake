@@ -32,9 +32,11 @@ target_link_libraries(nimbcore PUBLIC hostfw)
 
 # --- unit tests ----------------------------------------------------------------
 find_package(GTest REQUIRED)
+find_package(OpenSSL REQUIRED)
 file(GLOB NIMB_UNIT_TESTS CONFIGURE_DEPENDS ${CMAKE_SOURCE_DIR}/tests/unit/*.cpp)
 add_executable(unit_tests ${NIMB_UNIT_TESTS})
-target_link_libraries(unit_tests PRIVATE nimbcore hostfw GTest::gtest GTest::gtest_main)
+# OpenSSL is the reference that the loader's AES is checked against.
+target_link_libraries(unit_tests PRIVATE nimbcore hostfw GTest::gtest GTest::gtest_main OpenSSL::Crypto)
 include(GoogleTest)
 gtest_discover_tests(unit_tests DISCOVERY_MODE PRE_TEST PROPERTIES LABELS unit)
 

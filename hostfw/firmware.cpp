@@ -428,6 +428,9 @@ RunResult Firmware::Call(const std::function<void()> &body) {
 bool Firmware::BootServicesExited() const {
   return s_->exited;
 }
+void Firmware::SetGateReturns(bool returns) {
+  s_->gateReturns = returns;
+}
 const std::vector<std::string> &Firmware::ViolationsAfterExit() const {
   return s_->violations;
 }

@@ -331,6 +331,9 @@ class Firmware {
 
   // --- ExitBootServices ---------------------------------------------------
   bool BootServicesExited() const;
+  // Makes the call gate come back to the loader (after recording it) instead
+  // of ending the run, as a kernel that returns would.
+  void SetGateReturns(bool returns);
   // Calls into boot services, the console or any other boot-time protocol
   // after ExitBootServices, by name. Each is refused with EFI_UNSUPPORTED,
   // except Exit, which still ends the run. The system table keeps its console

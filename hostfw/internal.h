@@ -192,6 +192,7 @@ struct Firmware::State {
   std::vector<EFI_MEMORY_DESCRIPTOR> virtualMap;
   bool virtualMapSet = false;
   bool exited = false;
+  bool gateReturns = false;
   std::vector<std::string> violations;
 
   // Volumes and devices.

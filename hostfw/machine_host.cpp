@@ -12,12 +12,14 @@ void MachineDisableInterrupts() {
     s.runs.back()->result.interruptsDisabled = true;
 }
 
-void MachineCallGate(UINT64 gate, UINT64 argument, UINT64 target) {
+void MachineEnterGate(UINT64 gate, UINT64 argument, UINT64 target) {
   hostfw::State &s = hostfw::Services::Active();
   hostfw::RunResult &result = hostfw::CurrentRun(s, "the call gate").result;
   result.gateAddress = gate;
   result.gateArgument = argument;
   result.gateTarget = target;
+  if (s.gateReturns)
+    return;
   hostfw::EndRun(s, hostfw::RunEnd::KernelEntered, EFI_SUCCESS);
 }
 

@@ -24,11 +24,6 @@ static const char kAliasAcpi10[] = "ACPI";
 // Offsets in the MAC address node and in the ACPI tables read here.
 constexpr UINTN kMacAddressOffset = 4;
 constexpr UINTN kMacInterfaceTypeOffset = 36;
-constexpr UINTN kFacpLengthOffset = 4;
-constexpr UINTN kFacpRevisionOffset = 8;
-constexpr UINTN kFacpFirmwareCtrlOffset = 36;
-constexpr UINTN kFacpXFirmwareCtrlOffset = 132;
-constexpr UINTN kFacsHardwareSignatureOffset = 8;
 
 // Bounds the device properties' size loop, which a firmware that keeps
 // asking for the same size would never end.
@@ -145,24 +140,26 @@ static void AddDeviceProperties(DeviceTreeNode *efi) {
     return;
   }
   UINT32 size = 4096;
+  UINT32 asked = size;
   void *buffer = nullptr;
-  for (int tries = 0; tries < kDevicePropertiesTries; tries++) {
-    UINT32 asked = size;
+  EFI_STATUS status = EFI_BUFFER_TOO_SMALL;
+  for (int tries = 0; tries < kDevicePropertiesTries && status == EFI_BUFFER_TOO_SMALL; tries++) {
+    if (buffer != nullptr) {
+      TrackedFree(buffer);
+    }
+    asked = size;
     buffer = TrackedAllocatePool(size);
     if (buffer == nullptr) {
       Fatal("Could not allocate property buffer\n");
     }
-    EFI_STATUS status = properties->GetProperties(properties, buffer, &size);
-    if (status != EFI_BUFFER_TOO_SMALL || size <= asked || tries + 1 == kDevicePropertiesTries) {
-      if (status == EFI_BUFFER_TOO_SMALL && size > asked) {
-        size = asked;  // the buffer holds no more than was asked for
-      }
-      break;
-    }
-    TrackedFree(buffer);
-    buffer = nullptr;
+    status = properties->GetProperties(properties, buffer, &size);
   }
-  DeviceTreeAddProperty(efi, "device-properties", size, buffer, 1);
+  // A buffer the firmware could not fill holds nothing the kernel can use;
+  // what it did fill is never taken for more than the buffer.
+  if (status != EFI_BUFFER_TOO_SMALL) {
+    size = size < asked ? size : asked;
+    DeviceTreeAddProperty(efi, "device-properties", size, buffer, 1);
+  }
   TrackedFree(buffer);
 }
 
@@ -191,35 +188,15 @@ static void AddCommandLine(const char *options) {
   DeviceTreeAddProperty(chosen, "boot-args", strlen(bootArgs->commandLine) + 1, bootArgs->commandLine, 0);
 }
 
-static UINT32 ReadU32(const UINT8 *p) {
-  return static_cast<UINT32>(p[0]) | static_cast<UINT32>(p[1]) << 8 | static_cast<UINT32>(p[2]) << 16 |
-         static_cast<UINT32>(p[3]) << 24;
-}
-
-static UINT64 ReadU64(const UINT8 *p) {
-  return ReadU32(p) | static_cast<UINT64>(ReadU32(p + 4)) << 32;
-}
-
 // The hardware signature of the firmware's ACPI control structure, which
 // changes when the machine's hardware does.
 static void AddMachineSignature() {
-  const UINT8 *facp = FindFacp();
-  if (facp == nullptr) {
+  const UINT8 *facs = FindFacs();
+  if (facs == nullptr) {
     return;
   }
-  UINT32 length = ReadU32(facp + kFacpLengthOffset);
-  UINT64 facs = 0;
-  if (facp[kFacpRevisionOffset] > 2 && length >= kFacpXFirmwareCtrlOffset + 8) {
-    facs = ReadU64(facp + kFacpXFirmwareCtrlOffset);
-  }
-  if (facs == 0 && length >= kFacpFirmwareCtrlOffset + 4) {
-    facs = ReadU32(facp + kFacpFirmwareCtrlOffset);
-  }
-  if (facs == 0) {
-    return;
-  }
-  const UINT8 *signature = reinterpret_cast<const UINT8 *>(facs) + kFacsHardwareSignatureOffset;
-  DeviceTreeAddProperty(Chosen("no /chosen found"), "machine-signature", 4, signature, 0);
+  const UINT32 signature = FacsHardwareSignature(facs);
+  DeviceTreeAddProperty(Chosen("no /chosen found"), "machine-signature", 4, &signature, 1);
 }
 
 // The tree, flattened at the top of the kernel region. Nothing may be added
@@ -262,6 +239,19 @@ static void CheckStride(const MapShape &shape, const char *format) {
   }
 }
 
+// The runtime code and data regions of a map read into `map`, each of which
+// the runtime move adds a descriptor for.
+static UINTN CountRuntimeRegionsIn(const UINT8 *map, UINTN mapSize, UINTN descriptorSize) {
+  UINTN count = 0;
+  for (UINTN offset = 0; offset + descriptorSize <= mapSize; offset += descriptorSize) {
+    const EFI_MEMORY_DESCRIPTOR *descriptor = reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(map + offset);
+    if (descriptor->Type == EfiRuntimeServicesCode || descriptor->Type == EfiRuntimeServicesData) {
+      count++;
+    }
+  }
+  return count;
+}
+
 // Reads the map into pool once, only to count its runtime regions, which
 // the runtime move adds a descriptor for each.
 static UINTN CountRuntimeRegions(UINTN *mapKey, MapShape *shape, UINTN *mapBytes) {
@@ -291,14 +281,7 @@ static UINTN CountRuntimeRegions(UINTN *mapKey, MapShape *shape, UINTN *mapBytes
     }
   }
   CheckStride(*shape, "Can't get current memory map (4, %lx)\n");
-  UINTN runtimeCount = 0;
-  for (UINTN offset = 0; offset + shape->descriptorSize <= bufferSize; offset += shape->descriptorSize) {
-    const EFI_MEMORY_DESCRIPTOR *descriptor =
-        reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(buffer + offset);
-    if (descriptor->Type == EfiRuntimeServicesCode || descriptor->Type == EfiRuntimeServicesData) {
-      runtimeCount++;
-    }
-  }
+  UINTN runtimeCount = CountRuntimeRegionsIn(buffer, bufferSize, shape->descriptorSize);
   TrackedFree(buffer);
   *mapBytes = bufferSize;
   return runtimeCount;
@@ -328,38 +311,54 @@ EFI_STATUS FinishBootInfo(UINTN *mapKey, const char *options) {
   if (map == nullptr) {
     Fatal("Couldn't allocate memory map\n");
   }
+  // The firmware may fill the buffer only up to the room that the runtime
+  // descriptors of the move need behind the map; a read that finds more
+  // runtime regions than that room holds is made again.
   UINTN mapSize = 0;
   for (int tries = kMemoryMapTries;; tries--) {
     UINTN probeSize = ProbeMemoryMap(mapKey, &shape);
-    if (probeSize > bufferSize) {
+    UINT64 room = runtimeCount * shape.descriptorSize;
+    if (probeSize + room > bufferSize) {
       // The new pages lie right behind the map's last page: it grows in place.
-      UINT64 more = probeSize - bufferSize + kMemoryMapMargin;
+      UINT64 more = probeSize + room - bufferSize + kMemoryMapMargin;
       if (AllocateKernelRegion(&more) == 0) {
         Fatal("Couldn't allocate memory map (2)\n");
       }
       bufferSize += more;
     }
-    mapSize = bufferSize;
+    mapSize = static_cast<UINTN>(bufferSize - room);
     EFI_STATUS status = gBS->GetMemoryMap(&mapSize, reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map), mapKey,
                                           &shape.descriptorSize, &shape.descriptorVersion);
     if (!EFI_ERROR(status)) {
-      break;
+      CheckStride(shape, "Can't get current memory map (5, %lx)\n");
+      UINTN count = CountRuntimeRegionsIn(map, mapSize, shape.descriptorSize);
+      bool fits = mapSize + count * shape.descriptorSize <= bufferSize;
+      runtimeCount = count;
+      if (fits) {
+        break;
+      }
+      status = EFI_BUFFER_TOO_SMALL;
     }
     if (tries - 1 == 0) {
       Fatal("Can't get current memory map (5, %lx)\n", status);
     }
   }
-  CheckStride(shape, "Can't get current memory map (5, %lx)\n");
+  EFI_MEMORY_DESCRIPTOR *mapStart = reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map);
+  EFI_MEMORY_DESCRIPTOR *mapEnd = reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map + mapSize);
+  UINT64 runtimeStart = (gKernelRegionTop + EFI_PAGE_SIZE - 1) & ~(EFI_PAGE_SIZE - 1);
+  UINT64 nextVirtual = runtimeStart;
+  // The runtime move writes above the kernel region, where nothing was
+  // allocated: the whole area has to be free while a message can still say so.
+  if (!RuntimeAreaIsFree(mapStart, mapEnd, shape.descriptorSize, runtimeStart,
+                         kRuntimeSparePages * EFI_PAGE_SIZE)) {
+    Fatal("Runtime services area not free\n");
+  }
   // From here to ExitBootServices nothing allocates or frees: the key holds.
   bootArgs->memoryMap = static_cast<UINT32>(reinterpret_cast<UINT64>(map));
   bootArgs->memoryMapSize = static_cast<UINT32>(mapSize + runtimeCount * shape.descriptorSize);
   bootArgs->memoryDescriptorSize = static_cast<UINT32>(shape.descriptorSize);
   bootArgs->memoryDescriptorVersion = shape.descriptorVersion;
 
-  EFI_MEMORY_DESCRIPTOR *mapStart = reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map);
-  EFI_MEMORY_DESCRIPTOR *mapEnd = reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(map + mapSize);
-  UINT64 runtimeStart = (gKernelRegionTop + EFI_PAGE_SIZE - 1) & ~(EFI_PAGE_SIZE - 1);
-  UINT64 nextVirtual = runtimeStart;
   if (EFI_ERROR(gBS->ExitBootServices(gImageHandle, *mapKey))) {
     Fatal("Error exiting boot services\n");
   }

@@ -11,10 +11,17 @@ namespace nimb {
 void MachineDisableInterrupts();
 
 // Calls the copied call gate at `gate` with `argument` (RCX) and `target`
-// (RDX). The gate never returns.
-[[noreturn]] void MachineCallGate(UINT64 gate, UINT64 argument, UINT64 target);
+// (RDX). The gate does not return; should control ever come back, so does
+// this call, and the caller has the last word (StopAfterBootServices).
+void MachineEnterGate(UINT64 gate, UINT64 argument, UINT64 target);
 
 // Stops the processor for good: the last way out when nothing else is left.
 [[noreturn]] void MachineHalt();
+
+// MachineEnterGate for a caller with nothing to say should the gate come back.
+[[noreturn]] inline void MachineCallGate(UINT64 gate, UINT64 argument, UINT64 target) {
+  MachineEnterGate(gate, argument, target);
+  MachineHalt();
+}
 
 }  // namespace nimb

@@ -9,10 +9,8 @@ void MachineDisableInterrupts() {
 
 typedef void (*CallGateFunction)(UINT64 argument, UINT64 target);
 
-void MachineCallGate(UINT64 gate, UINT64 argument, UINT64 target) {
+void MachineEnterGate(UINT64 gate, UINT64 argument, UINT64 target) {
   reinterpret_cast<CallGateFunction>(gate)(argument, target);
-  // The gate never returns; if the processor ever came back here, stop.
-  MachineHalt();
 }
 
 void MachineHalt() {

@@ -129,24 +129,13 @@ EFI_DEVICE_PATH_PROTOCOL *GetDevicePathVariable(const CHAR16 *name, BOOLEAN want
     return nullptr;
   }
   // A path that does not end within the variable, or that has a node of
-  // length 0, is taken for no path at all.
+  // length 0, is taken for no path at all: the walk looks for a MAC address
+  // node, and every later walk of the path (which knows nothing of the
+  // variable's size) needs its end inside the variable, behind a MAC node
+  // as well.
   const EFI_DEVICE_PATH_PROTOCOL *path = reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(data);
-  bool mac = false;
-  bool wellFormed = false;
-  UINTN remaining = size;
-  for (const EFI_DEVICE_PATH_PROTOCOL *node = DevicePathFirstNode(path, &remaining); node != nullptr;
-       node = DevicePathNextNode(node, &remaining)) {
-    if (IsDevicePathEnd(node)) {
-      wellFormed = true;
-      break;
-    }
-    if (DevicePathNodeType(node) == MESSAGING_DEVICE_PATH && node->SubType == MSG_MAC_ADDR_DP) {
-      mac = true;
-      wellFormed = true;
-      break;
-    }
-  }
-  if (!wellFormed || mac != (wantMac != 0)) {
+  const bool mac = DevicePathFindNode(path, size, MESSAGING_DEVICE_PATH, MSG_MAC_ADDR_DP) != nullptr;
+  if (DevicePathSizeWithin(path, size) == 0 || mac != (wantMac != 0)) {
     TrackedFree(data);
     return nullptr;
   }

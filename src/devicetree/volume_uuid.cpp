@@ -56,6 +56,9 @@ static bool IsGuidPartitionNode(const EFI_DEVICE_PATH_PROTOCOL *node) {
 }
 
 EFI_STATUS GetVolumeUuid(EFI_HANDLE handle, UINTN size, char *text) {
+  if (size < kUuidTextSize) {
+    return EFI_BUFFER_TOO_SMALL;
+  }
   UINTN remaining = kMaxDevicePathSize;
   const EFI_DEVICE_PATH_PROTOCOL *node = DevicePathFirstNode(DevicePathFromHandle(handle), &remaining);
   for (; node != nullptr && !IsDevicePathEnd(node); node = DevicePathNextNode(node, &remaining)) {
@@ -120,7 +123,9 @@ EFI_STATUS GetVolumeUuidFromHeader(EFI_HANDLE handle, UINTN size, char *text) {
 }
 
 EFI_STATUS UuidFromVolumeId(const UINT8 *id, UINTN idLength, UINTN size, char *text) {
-  (void)size;
+  if (size < kUuidTextSize) {
+    return EFI_BUFFER_TOO_SMALL;
+  }
   Md5Context context;
   Md5Init(&context);
   Md5Update(&context, kVolumeUuidNameSpace, sizeof(kVolumeUuidNameSpace));

@@ -9,6 +9,8 @@ namespace nimb {
 // 36 characters and a NUL.
 constexpr UINTN kUuidTextSize = 37;
 
+// Each writes the text into `text` of `size` bytes; EFI_BUFFER_TOO_SMALL,
+// with nothing written, when it does not hold kUuidTextSize.
 EFI_STATUS GetVolumeUuid(EFI_HANDLE handle, UINTN size, char *text);
 EFI_STATUS GetVolumeUuidFromHeader(EFI_HANDLE handle, UINTN size, char *text);
 EFI_STATUS UuidFromVolumeId(const UINT8 *id, UINTN idLength, UINTN size, char *text);

@@ -18,6 +18,11 @@ EFI_MEMORY_DESCRIPTOR *Next(EFI_MEMORY_DESCRIPTOR *descriptor, UINT64 descriptor
   return reinterpret_cast<EFI_MEMORY_DESCRIPTOR *>(Bytes(descriptor) + descriptorSize);
 }
 
+const EFI_MEMORY_DESCRIPTOR *Next(const EFI_MEMORY_DESCRIPTOR *descriptor, UINT64 descriptorSize) {
+  return reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(reinterpret_cast<const UINT8 *>(descriptor) +
+                                                         descriptorSize);
+}
+
 void *Pointer(UINT64 address) {
   return reinterpret_cast<void *>(static_cast<UINTN>(address));
 }
@@ -36,6 +41,11 @@ bool IsRuntimeRegion(const EFI_MEMORY_DESCRIPTOR *descriptor) {
   return descriptor->Type == EfiRuntimeServicesCode || descriptor->Type == EfiRuntimeServicesData;
 }
 
+// A descriptor that gets an address in the runtime area.
+bool GetsRuntimeAddress(const EFI_MEMORY_DESCRIPTOR *descriptor) {
+  return descriptor->Type != EfiReservedMemoryType && (descriptor->Attribute & EFI_MEMORY_RUNTIME) != 0;
+}
+
 // The descriptor's own words; whatever a larger stride holds behind them is
 // left alone.
 void CopyDescriptor(const EFI_MEMORY_DESCRIPTOR *from, EFI_MEMORY_DESCRIPTOR *to) {
@@ -51,6 +61,68 @@ void CopyDescriptor(const EFI_MEMORY_DESCRIPTOR *from, EFI_MEMORY_DESCRIPTOR *to
 // `start` wraps round to a distance far beyond any size.
 bool InRange(UINT64 address, UINT64 start, UINT64 size) {
   return address - start < size;
+}
+
+bool Overlap(UINT64 a, UINT64 aSize, UINT64 b, UINT64 bSize) {
+  return a < b + bSize && b < a + aSize;
+}
+
+// Marks a region whose copy is still to come, in the descriptor's padding
+// word, which means nothing to the firmware or the kernel.
+constexpr UINT32 kCopyPending = 0x80000000;
+
+// Copies every runtime region of the list to its new place. A region goes
+// once no other region still waiting has its old place under the new one;
+// its own old place may overlap it. False when the regions that are left
+// wait on each other.
+bool CopyRegions(EFI_MEMORY_DESCRIPTOR *listStart, EFI_MEMORY_DESCRIPTOR *listEnd, UINT64 descriptorSize) {
+  UINTN waiting = 0;
+  for (EFI_MEMORY_DESCRIPTOR *d = listStart; d < listEnd; d = Next(d, descriptorSize)) {
+    d->Pad &= ~kCopyPending;
+    if (IsRuntimeRegion(d)) {
+      d->Pad |= kCopyPending;
+      waiting++;
+    }
+  }
+  while (waiting > 0) {
+    UINTN copied = 0;
+    for (EFI_MEMORY_DESCRIPTOR *d = listStart; d < listEnd; d = Next(d, descriptorSize)) {
+      if ((d->Pad & kCopyPending) == 0) {
+        continue;
+      }
+      bool blocked = false;
+      for (EFI_MEMORY_DESCRIPTOR *o = listStart; o < listEnd && !blocked; o = Next(o, descriptorSize)) {
+        blocked = o != d && (o->Pad & kCopyPending) != 0 &&
+                  Overlap(d->VirtualStart, ByteSize(d), o->PhysicalStart, ByteSize(o));
+      }
+      if (!blocked) {
+        memmove(Pointer(d->VirtualStart), Pointer(d->PhysicalStart), static_cast<UINTN>(ByteSize(d)));
+        d->Pad &= ~kCopyPending;
+        waiting--;
+        copied++;
+      }
+    }
+    if (copied == 0) {
+      return false;
+    }
+  }
+  return true;
+}
+
+// Zeroes the range from `start` of `size` bytes, except where it meets the
+// runtime area from `areaStart` up to `areaEnd`: what lies there has moved in.
+void ZeroOutside(UINT64 start, UINT64 size, UINT64 areaStart, UINT64 areaEnd) {
+  UINT64 end = start + size;
+  if (end <= areaStart || start >= areaEnd) {
+    bzero(Pointer(start), static_cast<UINTN>(size));
+    return;
+  }
+  if (start < areaStart) {
+    bzero(Pointer(start), static_cast<UINTN>(areaStart - start));
+  }
+  if (end > areaEnd) {
+    bzero(Pointer(areaEnd), static_cast<UINTN>(end - areaEnd));
+  }
 }
 
 // Moves the configuration table's entries and gST that lie in the old place
@@ -79,16 +151,55 @@ UINT64 LShiftU64(UINT64 value, UINTN count) {
   return count < 64 ? value << count : 0;
 }
 
+BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
+                          UINT64 descriptorSize, UINT64 areaStart, UINT64 spareBytes) {
+  constexpr UINT64 kAddressLimit = 0x100000000;
+  if (descriptorSize < sizeof(EFI_MEMORY_DESCRIPTOR) || areaStart >= kAddressLimit ||
+      spareBytes > kAddressLimit) {
+    return FALSE;
+  }
+  UINT64 areaEnd = areaStart + spareBytes;
+  for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
+    if (GetsRuntimeAddress(d)) {
+      areaEnd += ByteSize(d);
+      if (areaEnd > kAddressLimit || ByteSize(d) > kAddressLimit) {
+        return FALSE;
+      }
+    }
+  }
+  if (areaEnd > kAddressLimit) {
+    return FALSE;
+  }
+  // From the area's start, step from one conventional descriptor that holds
+  // the address to the end of that descriptor.
+  UINT64 at = areaStart;
+  while (at < areaEnd) {
+    UINT64 reached = at;
+    for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
+      if (d->Type == EfiConventionalMemory && InRange(at, d->PhysicalStart, ByteSize(d))) {
+        reached = d->PhysicalStart + ByteSize(d);
+        break;
+      }
+    }
+    if (reached == at) {
+      return FALSE;
+    }
+    at = reached;
+  }
+  return TRUE;
+}
+
 EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRIPTOR *mapEnd,
                               EFI_MEMORY_DESCRIPTOR **cursor, UINT64 descriptorSize, UINT32 descriptorVersion,
                               UINT64 *nextVirtual, BOOLEAN resume) {
   // Addresses, and in resume mode the compaction to the runtime descriptors.
-  UINT64 next = *nextVirtual;
+  const UINT64 areaStart = *nextVirtual;
+  UINT64 next = areaStart;
   EFI_MEMORY_DESCRIPTOR *write = *cursor;
   for (EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
     if (d->Type == EfiReservedMemoryType) {
       d->Attribute &= ~EFI_MEMORY_RUNTIME;
-    } else if ((d->Attribute & EFI_MEMORY_RUNTIME) != 0) {
+    } else if (GetsRuntimeAddress(d)) {
       d->VirtualStart = next;
       next += ByteSize(d);
       if (resume != 0) {
@@ -111,10 +222,8 @@ EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRI
     StopAfterBootServices("Error in SetVirtualAddressMap\n", resume);
   }
 
-  for (EFI_MEMORY_DESCRIPTOR *d = mapStart; d < listEnd; d = Next(d, descriptorSize)) {
-    if (IsRuntimeRegion(d)) {
-      bcopy(Pointer(d->PhysicalStart), Pointer(d->VirtualStart), static_cast<UINTN>(ByteSize(d)));
-    }
+  if (!CopyRegions(mapStart, listEnd, descriptorSize)) {
+    StopAfterBootServices("Runtime regions overlap\n", resume);
   }
 
   for (EFI_MEMORY_DESCRIPTOR *d = mapStart; d < listEnd; d = Next(d, descriptorSize)) {
@@ -135,7 +244,7 @@ EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRI
     CopyDescriptor(d, write);
     write->PhysicalStart = d->VirtualStart;
     write = Next(write, descriptorSize);
-    bzero(Pointer(d->PhysicalStart), static_cast<UINTN>(ByteSize(d)));
+    ZeroOutside(d->PhysicalStart, ByteSize(d), areaStart, next);
     d->Type = EfiConventionalMemory;
     d->Attribute &= ~EFI_MEMORY_RUNTIME;
   }

@@ -12,12 +12,22 @@ namespace nimb {
 // more.
 UINT64 LShiftU64(UINT64 value, UINTN count);
 
+// True when the area that MapRuntimeServices will fill from `areaStart` on
+// (the bytes of every runtime descriptor of the map, reserved memory apart,
+// then `spareBytes`) lies wholly in conventional memory of the map and below
+// 4 GiB, so that the move overwrites nothing that is in use and the kernel
+// can reach it with 32-bit addresses.
+BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
+                          UINT64 descriptorSize, UINT64 areaStart, UINT64 spareBytes);
+
 // Walks the memory map from `mapStart` to `mapEnd` by `descriptorSize`.
 // Each descriptor with EFI_MEMORY_RUNTIME (reserved memory apart, which
 // loses the bit) gets the next addresses from *nextVirtual on; *nextVirtual
 // comes back behind the last. The map goes to SetVirtualAddressMap, each
 // runtime code or data region is copied to its new address, and the
-// configuration table's entries and gST follow their regions.
+// configuration table's entries and gST follow their regions. The copies run
+// in an order in which none overwrites a region that has yet to move; a
+// region's new place may overlap its own old one.
 //
 // Normal boot (`resume` 0): *cursor starts at `mapEnd`, with room behind it
 // for one descriptor per runtime region; a descriptor of the region at its
@@ -26,8 +36,10 @@ UINT64 LShiftU64(UINT64 value, UINTN count);
 // place to the runtime descriptors alone, at their new addresses, and only
 // those are announced. Either way *cursor comes back at the end of the list.
 //
-// Returns 0. If the firmware refuses the map, the run stops here (boot
-// services are gone by then) and the call does not return.
+// Returns 0. If the firmware refuses the map, or the regions' new places lie
+// over each other's old ones in a ring that no order of copies can undo, the
+// run stops here (boot services are gone by then) and the call does not
+// return.
 EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRIPTOR *mapEnd,
                               EFI_MEMORY_DESCRIPTOR **cursor, UINT64 descriptorSize, UINT32 descriptorVersion,
                               UINT64 *nextVirtual, BOOLEAN resume);

@@ -20,8 +20,8 @@ UINT32 gScreenDepth;
 UINT64 gFrameBufferBase;
 UINT32 gFrameBufferRowBytes;
 
-// What the kernel finds at "Pict-FailedBoot": width, height and a zero word,
-// 20 bytes left as they are, then the failure picture's indexes.
+// What the kernel finds at "Pict-FailedBoot": width, height, then zeros up to
+// the failure picture's indexes, so that every boot hands the same record.
 constexpr UINT64 kFailedBootPixelsOffset = 32;
 constexpr UINT64 kFailedBootRecordSize = kFailedBootPixelsOffset + kPictureBytes;
 static_assert(kFailedBootRecordSize == 16416);
@@ -180,9 +180,9 @@ void FillVideoInfo(BootArgs *bootArgs) {
   }
   AddMemoryRange("Pict-FailedBoot", address, kFailedBootRecordSize, 0);
   UINT32 *header = reinterpret_cast<UINT32 *>(address);
+  bzero(header, kFailedBootPixelsOffset);
   header[0] = kPictureSize;
   header[1] = kPictureSize;
-  header[2] = 0;
   memcpy(reinterpret_cast<UINT8 *>(address) + kFailedBootPixelsOffset, kFailurePicture, kPictureBytes);
 }
 

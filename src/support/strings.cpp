@@ -36,6 +36,18 @@ void *memcpy(void *destination, const void *source, UINTN count) {
   return destination;
 }
 
+void *memmove(void *destination, const void *source, UINTN count) {
+  UINT8 *d = static_cast<UINT8 *>(destination);
+  const UINT8 *s = static_cast<const UINT8 *>(source);
+  if (d <= s || d >= s + count) {
+    return memcpy(destination, source, count);
+  }
+  while (count-- > 0) {
+    d[count] = s[count];
+  }
+  return destination;
+}
+
 void bzero(void *destination, UINTN count) {
   memset(destination, 0, count);
 }

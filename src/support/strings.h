@@ -12,6 +12,9 @@ namespace nimb {
 void *memset(void *destination, int value, UINTN count);
 // Byte loop upward; returns `destination`.
 void *memcpy(void *destination, const void *source, UINTN count);
+// Byte loop downward where the destination overlaps the source from above,
+// else upward: the copy is right for overlapping ranges.
+void *memmove(void *destination, const void *source, UINTN count);
 void bzero(void *destination, UINTN count);
 // Source first (the reverse of memcpy), byte loop upward, no overlap handling.
 void bcopy(const void *source, void *destination, UINTN count);

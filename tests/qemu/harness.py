@@ -35,8 +35,8 @@ from pathlib import Path
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
-    PARTITION_GUID,
     RESUME_PARTITION_GUID,
+    mkdisk,
     SCENARIOS,
     GuestFile,
     Scenario,
@@ -55,12 +55,6 @@ DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
-DISK_BYTES = 64 << 20
-PARTITION_OFFSET = 1 << 20  # first sector 2048
-# With a raw resume partition: the system partition takes 62 MiB, the raw
-# one follows at 63 MiB.
-ESP_SECTORS_BESIDE_RAW = 126976
-RAW_PARTITION_LBA = 129024
 RESUME_TOOL = REPO / "tools" / "mkresume" / "mkresume.py"
 RESUME_PROBE = "resume_probe.elf"
 
@@ -584,53 +578,6 @@ def render_config(keys):
     return "".join(f"{key}={config_value(value)}\n" for key, value in items)
 
 
-def run_tool(*args, env=None):
-    subprocess.run(args, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, env=env)
-
-
-def build_disk(image, files, directories=(), raw=None):
-    """A GPT disk of DISK_BYTES with one EFI system partition, of the GUID
-    PARTITION_GUID, holding `files` (ESP path with '/' -> bytes or host Path)
-    and `directories` (ESP paths). With `raw` (a partition image), a second
-    partition of RESUME_PARTITION_GUID behind a smaller system partition
-    holds its bytes."""
-    image = Path(image).resolve()
-    raw_bytes = (Path(raw).stat().st_size + 511) // 512 * 512 if raw else 0
-    with open(image, "wb") as disk:
-        disk.truncate(DISK_BYTES + raw_bytes)
-    # A fresh image has nothing to zap, and each of sgdisk's steps costs a
-    # second of waiting for the kernel to reread the table.
-    layout = ["-n", "1:2048:0"]
-    if raw:
-        end = RAW_PARTITION_LBA + raw_bytes // 512 - 1
-        layout = ["-n", f"1:2048:{RAW_PARTITION_LBA - 1}", "-n", f"2:{RAW_PARTITION_LBA}:{end}",
-                  "-u", f"2:{RESUME_PARTITION_GUID}"]  # fmt: skip
-    run_tool("sgdisk", "-o", *layout, "-t", "1:EF00", "-u", f"1:{PARTITION_GUID}", str(image))
-    volume = f"{image}@@{PARTITION_OFFSET}"
-    env = dict(os.environ, MTOOLS_SKIP_CHECK="1")
-    size = ["-T", str(ESP_SECTORS_BESIDE_RAW)] if raw else []
-    run_tool("mformat", "-i", volume, *size, "-F", "-v", "ESP", "::", env=env)
-    if raw:
-        with open(image, "r+b") as disk, open(raw, "rb") as source:
-            disk.seek(RAW_PARTITION_LBA * 512)
-            shutil.copyfileobj(source, disk)
-    needed = set()
-    for path in list(directories) + [str(Path(p).parent) for p in files]:
-        parts = Path(path.strip("/")).parts
-        needed.update("/".join(parts[: i + 1]) for i in range(len(parts)))
-    needed.discard("")
-    for directory in sorted(needed, key=lambda d: (d.count("/"), d)):
-        run_tool("mmd", "-i", volume, f"::/{directory}", env=env)
-    staging = image.parent / "files"
-    for path, content in files.items():
-        source = content
-        if not isinstance(content, Path):
-            source = staging / path.strip("/")
-            source.parent.mkdir(parents=True, exist_ok=True)
-            source.write_bytes(content.encode() if isinstance(content, str) else content)
-        run_tool("mcopy", "-i", volume, str(Path(source).resolve()), f"::/{path.strip('/')}", env=env)
-
-
 # --- QEMU -----------------------------------------------------------------------------
 
 
@@ -751,34 +698,53 @@ def scenario_config(scenario, override=None):
     return config
 
 
-def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
-    """Builds the scenario's disk in `workdir`; returns its path."""
-    efi_dir = Path(efi_dir)
-    raw, resume_keys = None, {}
-    if scenario.resume is not None:
-        raw, resume_keys = make_resume(scenario.resume, workdir, guest_dir)
-    files = {
-        "EFI/BOOT/BOOTX64.EFI": efi_dir / "BOOTX64.efi",
-        "EFI/BOOT/nimbboot.efi": Path(loader) if loader else efi_dir / "nimbboot.efi",
-    }
-    for path in files.values():
-        if not path.is_file():
-            raise FileNotFoundError(f"{path} is missing: build the EFI programs first")
-    config = scenario_config(scenario, config_override)
-    for key, value in resume_keys.items():
-        config.setdefault(key, value)
+def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
+    """Writes the scenario's files and directories (the extensions
+    directory's too) into the host directory `volume`, with platform.cfg
+    when `config` has keys or the scenario asks for the file, then gives
+    the paths of `scenario.times` their exact times."""
+    files = {**(scenario.extensions or {}), **scenario.files}
     if config or scenario.config_file:
-        files["EFI/BOOT/platform.cfg"] = render_config(config)
-    for path, content in scenario.files.items():
+        files[f"{mkdisk.BOOT_DIR}/{mkdisk.CONFIG_NAME}"] = render_config(config)
+    for path in scenario.remove:
+        files.pop(path, None)
+    for directory in scenario.directories:
+        (volume / directory.strip("/")).mkdir(parents=True, exist_ok=True)
+    for path, content in files.items():
+        target = volume / path.strip("/")
+        target.parent.mkdir(parents=True, exist_ok=True)
         if isinstance(content, GuestFile):
             content = Path(guest_dir) / content.name
             if not content.is_file():
                 raise FileNotFoundError(f"{content} is missing: build the target guest_kernel first")
-        files[path] = content
-    for path in scenario.remove:
-        files.pop(path, None)
+        if isinstance(content, Path):
+            shutil.copyfile(content, target)
+        else:
+            target.write_bytes(content.encode() if isinstance(content, str) else content)
+    # Deepest first: setting a directory's time after its children's.
+    for path, when in sorted(scenario.times.items(), key=lambda item: -item[0].count("/")):
+        mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
+
+
+def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
+    """Builds the scenario's disk in `workdir` with the disk tool; returns
+    its path."""
+    efi_dir = Path(efi_dir)
+    volume = workdir / "volume"
+    volume.mkdir()
+    raw, resume_keys = None, {}
+    if scenario.resume is not None:
+        raw, resume_keys = make_resume(scenario.resume, workdir, guest_dir)
+    config = scenario_config(scenario, config_override)
+    for key, value in resume_keys.items():
+        config.setdefault(key, value)
+    stage_volume(scenario, volume, config, guest_dir)
+    loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
     disk = workdir / "disk.img"
-    build_disk(disk, files, scenario.directories, raw)
+    try:
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, raw=raw, raw_guid=RESUME_PARTITION_GUID)
+    except mkdisk.DiskError as error:
+        raise OSError(str(error)) from error
     return disk
 
 
@@ -793,7 +759,7 @@ def make_resume(resume, workdir, guest_dir, extra=()):
     command = [
         sys.executable, str(RESUME_TOOL), "--restart", str(probe), "--partition", str(partition),
         "--partition-bytes", str(resume.partition_bytes), "--partition-number", "2",
-        "--partition-guid", RESUME_PARTITION_GUID, "--partition-start-lba", str(RAW_PARTITION_LBA),
+        "--partition-guid", RESUME_PARTITION_GUID, "--partition-start-lba", str(mkdisk.raw_partition_lba()),
         "--partition-lbas", str(resume.partition_bytes // 512), "--nvram-out", str(settings),
         *resume.args, *extra,
     ]  # fmt: skip

@@ -4,6 +4,11 @@ registers one ctest test per name."""
 
 import dataclasses
 import re
+import sys
+from pathlib import Path
+
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkdisk"))
+import mkdisk  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -20,7 +25,7 @@ BOOT_PLIST = "Library/Preferences/SystemConfiguration/com.quill.Boot.plist"
 # The GUID of the system partition on every disk the harness builds: the
 # root volume's UUID as the loader should find it. Its first three fields
 # read differently in either byte order.
-PARTITION_GUID = "0FAB1E5D-3C2B-4A19-8E7F-60C5D4B3A291"
+PARTITION_GUID = mkdisk.DEFAULT_PARTITION_GUID
 # The raw partition that holds a resume image, behind the system partition.
 RESUME_PARTITION_GUID = "6A1E1F10-2B3C-4D5E-8F90-A1B2C3D4E5F6"
 
@@ -165,6 +170,54 @@ class ResumeReads:
     first_stage: int = 1 << 20
 
 
+# --- the extensions directory ------------------------------------------------------------
+
+EXTENSIONS_DIR = "System/Library/Extensions"
+
+
+def driver_plist(identifier, required=None, executable=None, libraries=()):
+    """A driver bundle's Info.plist: its identifier, and the keys that the
+    loader reads when given (`required` a string, or another tag's text)."""
+    lines = [f"\t<key>VzBundleIdentifier</key>\n\t<string>{identifier}</string>\n"]
+    if executable is not None:
+        lines.append(f"\t<key>VzBundleExecutable</key>\n\t<string>{executable}</string>\n")
+    if required is not None:
+        tag = required if required.startswith("<") else f"<string>{required}</string>"
+        lines.append(f"\t<key>VzBundleRequired</key>\n\t{tag}\n")
+    if libraries:
+        entries = "".join(f"\t\t<key>{name}</key>\n\t\t<string>1.0</string>\n" for name in libraries)
+        lines.append(f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n")
+    body = "".join(lines)
+    return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
+
+
+def driver_code(seed, length):
+    """A small driver's code: bytes that differ from bundle to bundle."""
+    return bytes((seed * 131 + i * 7 + (i >> 5)) & 0xFF for i in range(length))
+
+
+def standard_extensions():
+    """The extensions directory that every volume carries unless its scenario
+    says otherwise: a flat bundle with code, a full-layout bundle whose code
+    is a fat file (tests/guest's driver.fat, whose x86 slice is the file
+    nimb_kernel) with a nested bundle that has no code, and a "Safe Boot"
+    bundle that the loader leaves out."""
+    root = EXTENSIONS_DIR
+    return {
+        f"{root}/Console.drvb/Info.plist": driver_plist("com.quill.driver.Console", "Root", "Console"),
+        f"{root}/Console.drvb/Console": driver_code(1, 1001),
+        f"{root}/Storage.drvb/Contents/Info.plist": driver_plist(
+            "com.quill.driver.Storage", "Local-Root", "Storage", libraries=("com.quill.driver.Console",)
+        ),
+        f"{root}/Storage.drvb/Contents/Tarnix/Storage": GuestFile("driver.fat"),
+        f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist": driver_plist(
+            "com.quill.driver.Partition", ""
+        ),
+        f"{root}/Network.drvb/Info.plist": driver_plist("com.quill.driver.Network", "Safe Boot", "Network"),
+        f"{root}/Network.drvb/Network": driver_code(3, 64),
+    }
+
+
 @dataclasses.dataclass(frozen=True)
 class Scenario:
     name: str
@@ -180,7 +233,13 @@ class Scenario:
     files: dict = dataclasses.field(default_factory=dict)
     # ESP paths to leave out (e.g. the loader itself).
     remove: tuple = ()
+    # The extensions directory's files (paths as in `files`), put on the
+    # volume with the others; None: no extensions directory at all.
+    extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
     directories: tuple = ()
+    # Exact modification times (UTC, "YYYY-MM-DD hh:mm:ss.nnnnnnnnn") of
+    # files or directories of the volume, as the platform layer serves them.
+    times: dict = dataclasses.field(default_factory=dict)
     # Texts that must appear in the serial log, in this order.
     expect: tuple = ()
     # Texts that must not appear.
@@ -301,7 +360,14 @@ _TABLE = [
         "kernel_plain",
         config={"console": "graphics", "options": "foo=1"},
         files=kernel_file(),
-        expect=(LOADING_KERNEL, f"{ROOT_UUID}{PARTITION_GUID}'", KERNEL_START),
+        # The boot device path that the disk tool computes for kernel caches
+        # is the one the firmware gives the loader.
+        expect=(
+            f"platform: boot device path {mkdisk.boot_device_path().hex()}\n",
+            LOADING_KERNEL,
+            f"{ROOT_UUID}{PARTITION_GUID}'",
+            KERNEL_START,
+        ),
         forbid=("platform: loader returned",),
         exit="KernelPass",
         kernel=KernelExpect(

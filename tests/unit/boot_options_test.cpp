@@ -333,6 +333,11 @@ TEST_F(BootOptionsTest, DevicePathVariablesOfTheRightKindOnly) {
   std::vector<uint8_t> network = net.FilePath(u"k");
   std::vector<uint8_t> zeroNode = {1, 1, 0, 0, 0x7F, 0xFF, 4, 0};
   std::vector<uint8_t> runsOff = {1, 1, 200, 0, 0, 0};
+  // A MAC node with no end behind it, or with a node behind it that runs off.
+  std::vector<uint8_t> macOnly(37, 0);
+  macOnly[0] = MESSAGING_DEVICE_PATH, macOnly[1] = MSG_MAC_ADDR_DP, macOnly[2] = 37;
+  std::vector<uint8_t> macRunsOff = macOnly;
+  macRunsOff.insert(macRunsOff.end(), runsOff.begin(), runsOff.end());
   struct Row {
     const char *name;
     std::vector<uint8_t> bytes;
@@ -345,6 +350,8 @@ TEST_F(BootOptionsTest, DevicePathVariablesOfTheRightKindOnly) {
       {"network path, disk boot", network, false, false},
       {"a node of length 0", zeroNode, false, false},
       {"a node past the variable", runsOff, false, false},
+      {"nothing but a MAC node", macOnly, true, false},
+      {"a MAC node, then a node past the variable", macRunsOff, true, false},
   };
   for (const Row &row : rows) {
     fw.PutVariable(u"efi-boot-file-data", gNimbVendorVariableGuid, 7, row.bytes);

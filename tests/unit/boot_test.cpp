@@ -12,6 +12,7 @@
 
 #include "boot/gate.h"
 #include "boot/volume.h"
+#include "kernel_images.h"
 #include "loader_fixture.h"
 #include "temp_dir.h"
 
@@ -254,6 +255,32 @@ TEST_F(BootTest, EveryFatalMessageOfTheBootSequence) {
       EXPECT_EQ(local.AllocatedPages(), 0u) << row.message;
       EXPECT_EQ(nimb::gMemoryTags, nullptr) << row.message;
     }
+  }
+  nimbtest::ResetLoaderState();
+  Attach();
+}
+
+// A whole boot into a small kernel; a kernel that comes back through the
+// gate stops the machine with its message, touching no boot service.
+TEST_F(BootTest, TheKernelIsEnteredAndAReturnStops) {
+  using nimbtest::Object;
+  const nimbtest::Bytes kernel = Object{0xFEEDFACE,
+                                        {nimbtest::Segment(0x200000, 0x10, nimbtest::kObjectDataStart, 0x10),
+                                         nimbtest::Thread(0x200004)},
+                                        nimbtest::Pattern(0x10)}
+                                     .Build();
+  for (bool returns : {false, true}) {
+    hostfw::Firmware local;
+    TempDir dir;
+    dir.File("nimb_kernel", kernel);
+    local.SetBootDevice(local.AddDirectoryVolume(dir.path()));
+    local.SetGateReturns(returns);
+    nimbtest::ResetLoaderState();
+    hostfw::RunResult result = local.Run(BootEntry);
+    EXPECT_EQ(result.end, returns ? hostfw::RunEnd::Halted : hostfw::RunEnd::KernelEntered);
+    EXPECT_EQ(result.gateTarget, 0x200004u);
+    EXPECT_TRUE(local.ViolationsAfterExit().empty());
+    EXPECT_STREQ(nimb::gStopMessage, returns ? "Kernel entry failed\n" : nullptr);
   }
   nimbtest::ResetLoaderState();
   Attach();

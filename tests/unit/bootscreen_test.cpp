@@ -368,7 +368,8 @@ TEST_F(VideoInfoTest, FillVideoInfoHandsOverTheFactsTheColourTableAndTheFailureP
     EXPECT_EQ(nimb::gKernelRegionTop, 0x206000u);
     EXPECT_EQ(std::memcmp(reinterpret_cast<void *>(0x200000), nimb::kBootColorTable, 768), 0);
     const auto *picture = reinterpret_cast<const UINT32 *>(0x201000);
-    EXPECT_EQ(std::vector<UINT32>(picture, picture + 3), std::vector<UINT32>({128, 128, 0}));
+    // Width, height and zeros (not what the pages held) up to the indexes.
+    EXPECT_EQ(std::vector<UINT32>(picture, picture + 8), std::vector<UINT32>({128, 128, 0, 0, 0, 0, 0, 0}));
     EXPECT_EQ(std::memcmp(picture + 8, nimb::kFailurePicture, 16384), 0);
     nimb::TrackedFreeAll();
   }

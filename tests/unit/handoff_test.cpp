@@ -250,6 +250,28 @@ TEST_F(HandOffTest, DevicePropertiesLargerThanTheFirstBuffer) {
   EXPECT_EQ(blob, std::string(properties.blob.begin(), properties.blob.end()));
 }
 
+// A firmware that never fills the buffer: it asks for the same size again,
+// or for more each time.
+EFI_STATUS EFIAPI NeverFillsDeviceProperties(NIMB_DEVICE_PROPERTIES_PROTOCOL *This, VOID *, UINT32 *Size) {
+  auto *self = reinterpret_cast<FakeDeviceProperties *>(This);
+  self->calls++;
+  *Size += static_cast<UINT32>(self->blob.size());
+  return EFI_BUFFER_TOO_SMALL;
+}
+
+class UnfilledPropertiesTest : public HandOffTest, public ::testing::WithParamInterface<size_t> {};
+
+TEST_P(UnfilledPropertiesTest, AreLeftOut) {
+  FakeDeviceProperties properties = {{{}, NeverFillsDeviceProperties}, std::vector<uint8_t>(GetParam()), 0};
+  fw.InstallProtocol(fw.NewHandle(), gNimbDevicePropertiesProtocolGuid, &properties);
+  Prepare();
+  ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
+  EXPECT_GT(properties.calls, 1);
+  EXPECT_EQ(ReadTree(bootArgs).nodes["/efi"].count("device-properties"), 0u);
+}
+
+INSTANTIATE_TEST_SUITE_P(Growth, UnfilledPropertiesTest, ::testing::Values(0u, 100u));
+
 TEST_F(HandOffTest, AMapThatGrowsBetweenTheReadsIsExtendedInPlace) {
   Prepare();
   // The first look is a probe and a read; the final loop's probe (the third
@@ -269,6 +291,63 @@ TEST_F(HandOffTest, AMapThatGrowsBetweenTheReadsIsExtendedInPlace) {
     types += reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(map + offset)->Type == EfiBootServicesCode;
   }
   EXPECT_GE(types, 100u);
+}
+
+// Whatever the final read finds, the descriptors that the runtime move
+// appends stay inside the map's own pages: the sweep of growths crosses the
+// point where the map alone still fits and the appended ones would not.
+TEST_F(HandOffTest, TheRoomForTheMovedRegionsSurvivesAMapThatGrows) {
+  for (unsigned grow = 0; grow < 100; grow++) {
+    SCOPED_TRACE(grow);
+    hostfw::Firmware local;
+    nimbtest::ResetLoaderState();
+    nimb::gST = local.SystemTable();
+    nimb::gBS = local.BootServices();
+    nimb::gRT = local.RuntimeServices();
+    nimb::gImageHandle = local.ImageHandle();
+    gLoadedImage = local.LoadedImage();
+    EFI_HANDLE device = local.NewHandle();
+    local.SetDevicePath(device, {1, 1, 6, 0, 0, 2, 0x7F, 0xFF, 4, 0});
+    local.SetBootDevice(device);
+    gBootDevicePath = local.DevicePathOf(device);
+    gKernelName = u"nimb_kernel";
+    ASSERT_EQ(local
+                  .Call([&] {
+                    InitPlatformDescription();
+                    UINT64 address = 0x200000, size = 0x3000;
+                    AllocateKernelPages(&address, &size);
+                    gKernelRegionBase = 0x200000;
+                    gKernelRegionTop = 0x203000;
+                    InitBootInfo(gLoadedImage, "");
+                  })
+                  .end,
+              hostfw::RunEnd::Returned)
+        << local.ConOutText();
+    local.GrowMemoryMapOnCall(3, grow);
+    UINTN key = 0;
+    ASSERT_EQ(local.Call([&] { FinishBootInfo(&key, ""); }).end, hostfw::RunEnd::Returned);
+    ASSERT_LE(bootArgs->memoryMap + bootArgs->memoryMapSize, bootArgs->runtimePageStart * EFI_PAGE_SIZE);
+    const uint8_t *map = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(bootArgs->memoryMap));
+    const auto *last = reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(map + bootArgs->memoryMapSize -
+                                                                       bootArgs->memoryDescriptorSize);
+    EXPECT_NE(last->Attribute & EFI_MEMORY_RUNTIME, 0u);
+  }
+  nimbtest::ResetLoaderState();
+  Attach();
+}
+
+// The runtime move needs free memory above the kernel region; what stands
+// there ends the boot while the console can still say so.
+TEST_F(HandOffTest, ARuntimeAreaOverUsedMemoryIsFatal) {
+  fw.AddMemoryRegion(EfiRuntimeServicesData, 0x30000000, 0x100, EFI_MEMORY_RUNTIME);
+  fw.AddMemoryRegion(EfiACPIMemoryNVS, 0x280000, 1, 0);
+  Prepare();
+  hostfw::RunResult result = Finish();
+  EXPECT_EQ(result.end, hostfw::RunEnd::Exited);
+  EXPECT_EQ(result.status, EFI_ABORTED);
+  EXPECT_FALSE(fw.BootServicesExited());
+  const std::string text = fw.ConOutText();
+  EXPECT_EQ(text.substr(text.rfind("Runtime")), "Runtime services area not free\r\n");
 }
 
 TEST_F(HandOffTest, BothAcpiTablesAndTheMachineSignature) {

@@ -69,7 +69,8 @@ std::string Describe(const EFI_MEMORY_DESCRIPTOR &d) {
 // declared and filled with kDestinationFill.
 class Scene {
  public:
-  Scene(const std::vector<Region> &regions, UINT64 next) : regions(regions), next(next) {
+  Scene(const std::vector<Region> &regions, UINT64 next, bool declareArea = true)
+      : regions(regions), next(next) {
     nimb::gST = fw.SystemTable();
     nimb::gBS = fw.BootServices();
     nimb::gRT = fw.RuntimeServices();
@@ -85,7 +86,7 @@ class Scene {
       EFI_MEMORY_DESCRIPTOR d = {r.type, 0, r.physical, r.virtualStart, r.pages, r.attribute};
       std::memcpy(Descriptor(i), &d, sizeof(d));
     }
-    if (pages != 0) {
+    if (pages != 0 && declareArea) {
       fw.AddMemoryRegion(EfiLoaderData, next, pages, 0);
       std::memset(At(next), kDestinationFill, pages * EFI_PAGE_SIZE);
     }
@@ -328,6 +329,113 @@ TEST_F(RuntimeMapTest, ARefusedMapStopsWithoutBootServices) {
     EXPECT_EQ(nimb::gST, table);
     EXPECT_TRUE(Filled(0x100000, 1, kDestinationFill));
     EXPECT_TRUE(Filled(0x200000, 1, Fill(0)));
+  }
+}
+
+// New places over old ones: each region arrives whole, and a normal boot
+// clears only what lies outside the runtime area; regions that would each
+// overwrite the other stop the run.
+TEST_F(RuntimeMapTest, OverlappingPlacesAreCopiedInASafeOrder) {
+  struct Row {
+    const char *what;
+    std::vector<Region> regions;
+    UINT64 next;
+    bool ring;
+  };
+  const Row rows[] = {
+      {"down over its own old place",
+       {{EfiRuntimeServicesCode, 0x102000, 4, kRt, 0, 0x100000}},
+       0x100000,
+       false},
+      {"up over its own old place",
+       {{EfiRuntimeServicesCode, 0x100000, 4, kRt, 0, 0x102000}},
+       0x102000,
+       false},
+      {"over the old place of the next region",
+       {{EfiRuntimeServicesData, 0x100000, 2, kRt, 0, 0x101000},
+        {EfiRuntimeServicesCode, 0x102000, 2, kRt, 0, 0x103000}},
+       0x101000,
+       false},
+      {"over the old place of the region before",
+       {{EfiRuntimeServicesData, 0x104000, 1, kRt, 0, 0x101000},
+        {EfiRuntimeServicesCode, 0x100000, 2, kRt, 0, 0x102000}},
+       0x101000,
+       false},
+      {"two regions trading places",
+       {{EfiRuntimeServicesData, 0x102000, 1, kRt, 0, 0x101000},
+        {EfiRuntimeServicesCode, 0x101000, 1, kRt, 0, 0x102000}},
+       0x101000,
+       true},
+  };
+  for (const Row &row : rows) {
+    for (bool resume : {false, true}) {
+      SCOPED_TRACE(std::string(row.what) + (resume ? ", resume" : ", normal boot"));
+      Scene scene(row.regions, row.next, /*declareArea=*/false);
+      hostfw::RunResult run = scene.Map(resume);
+      if (row.ring) {
+        EXPECT_EQ(run.end, resume ? hostfw::RunEnd::Reset : hostfw::RunEnd::Halted);
+        EXPECT_STREQ(nimb::gStopMessage, "Runtime regions overlap\n");
+        continue;
+      }
+      ASSERT_EQ(run.end, hostfw::RunEnd::Returned);
+      for (size_t i = 0; i < row.regions.size(); i++) {
+        const Region &r = row.regions[i];
+        EXPECT_EQ(scene.Descriptor(i)->VirtualStart, r.expected) << i;
+        EXPECT_TRUE(Filled(r.expected, r.pages, Fill(i))) << i;
+        if (!resume) {
+          for (UINT64 page = r.physical; page < r.physical + r.pages * EFI_PAGE_SIZE; page += EFI_PAGE_SIZE) {
+            if (page < row.next || page >= scene.next)
+              EXPECT_TRUE(Filled(page, 1, 0)) << std::hex << page;
+          }
+        }
+      }
+    }
+  }
+}
+
+TEST_F(RuntimeMapTest, TheRuntimeAreaMustLieInFreeMemoryBelow4GiB) {
+  const UINT64 kFree = 0x100000, kFreePages = 0x40;
+  struct Row {
+    const char *what;
+    std::vector<Region> extra;  // besides free memory from kFree on
+    UINT64 start;
+    UINT64 spare;
+    bool free;
+  };
+  const Row rows[] = {
+      {"runtime pages and spare fit",
+       {{EfiRuntimeServicesCode, 0x300000, 4, kRt, 0, 0}},
+       kFree,
+       0x2000,
+       true},
+      {"across two free descriptors",
+       {{EfiConventionalMemory, kFree + kFreePages * EFI_PAGE_SIZE, 8, 0, 0, 0}},
+       kFree + (kFreePages - 2) * EFI_PAGE_SIZE,
+       0x4000,
+       true},
+      {"the spare runs past the free memory", {}, kFree + (kFreePages - 1) * EFI_PAGE_SIZE, 0x2000, false},
+      {"the runtime pages run past it",
+       {{EfiRuntimeServicesData, 0x300000, kFreePages, kRt, 0, 0}},
+       kFree + EFI_PAGE_SIZE,
+       0,
+       false},
+      {"reserved and non-runtime pages take no room",
+       {{EfiReservedMemoryType, 0x300000, kFreePages, kRt, 0, 0},
+        {EfiBootServicesData, 0x400000, kFreePages, 0, 0, 0}},
+       kFree,
+       kFreePages * EFI_PAGE_SIZE,
+       true},
+      {"the area starts in used memory", {{EfiLoaderData, 0x80000, 0x80, 0, 0, 0}}, 0x90000, 0x1000, false},
+      {"beyond 4 GiB", {{EfiConventionalMemory, 0xFFFFF000, 0x100, 0, 0, 0}}, 0xFFFFF000, 0x2000, false},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.what);
+    std::vector<EFI_MEMORY_DESCRIPTOR> map = {{EfiConventionalMemory, 0, kFree, 0, kFreePages, 0xF}};
+    for (const Region &r : row.extra)
+      map.push_back({r.type, 0, r.physical, 0, r.pages, r.attribute});
+    EXPECT_EQ(nimb::RuntimeAreaIsFree(map.data(), map.data() + map.size(), sizeof(EFI_MEMORY_DESCRIPTOR),
+                                      row.start, row.spare),
+              row.free);
   }
 }
 

@@ -36,6 +36,11 @@ std::string UuidOf(const Bytes &id) {
 TEST(VolumeUuidTest, NameBasedUuidOfAnIdentifier) {
   EXPECT_EQ(UuidOf(kId), kIdText);
   EXPECT_EQ(UuidOf(kZeroId), kZeroIdText);
+  // A destination that cannot hold the text is not written.
+  char small[36];
+  std::memset(small, 'z', sizeof(small));
+  EXPECT_EQ(nimb::UuidFromVolumeId(kId.data(), kId.size(), sizeof(small), small), EFI_BUFFER_TOO_SMALL);
+  EXPECT_EQ(std::string(small, sizeof(small)), std::string(sizeof(small), 'z'));
 }
 
 TEST(VolumeUuidTest, GuidTextReversesTheFirstThreeFields) {

@@ -2,8 +2,9 @@
 # output. Called as
 #   cmake -DVOLUME=<dir> [-DKERNEL=<file>] -DEXIT=<status> -DEXPECT=<regexes>
 #         -P run_test.cmake -- <dryboot> [arguments...]
-# The volume directory is made empty, the kernel (when given) is copied into
-# it as nimb_kernel, and the directory is passed as dryboot's last argument.
+# The volume directory is made afresh with an empty extensions directory,
+# the kernel (when given) is copied into it as nimb_kernel, and the
+# directory is passed as dryboot's last argument.
 # Every regex of the list EXPECT must match the output.
 set(command)
 set(collect OFF)
@@ -21,7 +22,9 @@ if(DEFINED KERNEL AND NOT EXISTS "${KERNEL}")
   return()
 endif()
 file(REMOVE_RECURSE "${VOLUME}")
-file(MAKE_DIRECTORY "${VOLUME}")
+# An empty extensions directory: a plain kernel's drivers are scanned there,
+# and a volume without one cannot boot.
+file(MAKE_DIRECTORY "${VOLUME}/System/Library/Extensions")
 if(DEFINED KERNEL)
   file(COPY_FILE "${KERNEL}" "${VOLUME}/nimb_kernel")
 endif()
