@@ -43,6 +43,7 @@ UINT32 gDiskCount;
 LoggedRead gReads[kMaxLoggedReads];
 UINT64 gReadCount;
 UINT64 gReadBytes;
+UINT32 gReadDepth;
 ResetSystemFunction gOriginalReset;
 
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
@@ -56,7 +57,13 @@ EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UI
   if (original == nullptr) {
     return EFI_DEVICE_ERROR;
   }
+  // A partition's DiskIO reads through its disk's: only the outer call is
+  // the caller's.
+  gReadDepth++;
   const EFI_STATUS status = original(This, MediaId, Offset, BufferSize, Buffer);
+  if (--gReadDepth != 0) {
+    return status;
+  }
   if (gReadCount < kMaxLoggedReads) {
     gReads[gReadCount] = {Offset, BufferSize, reinterpret_cast<UINT64>(Buffer), status};
   }
