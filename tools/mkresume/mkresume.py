@@ -528,8 +528,11 @@ def parse_args(argv):
     parser.add_argument("--preview-depth", type=int, choices=(16, 32), default=32, help="bits per pixel (32)")
     parser.add_argument("--preview-picture-offset", type=number, default=16,
                         help="where the picture begins in the preview section (16)")
-    parser.add_argument("--runtime-page", type=number, default=0x500000, help="address of the runtime area")
-    parser.add_argument("--runtime-pages", type=number, default=0x100, help="pages of the runtime area (0x100)")
+    # OVMF (512 MiB) leaves 1 MiB to 8 MiB free and has 0x386 pages of
+    # runtime code and data: the area lies behind the restart probe.
+    parser.add_argument("--runtime-page", type=number, default=0x430000,
+                        help="address of the runtime area (0x430000)")
+    parser.add_argument("--runtime-pages", type=number, default=0x3D0, help="pages of the runtime area (0x3D0)")
     parser.add_argument("--machine-signature", type=number, default=0, help="machineSignature (0)")
     parser.add_argument("--screen", type=lambda t: tuple(int(v) for v in t.split("x")), default=(1280, 800),
                         help="WIDTHxHEIGHT of the screen, for the probe's expectations (1280x800)")
