@@ -2,6 +2,7 @@
 the extent walk from the first entry's start + 512, the decryption with
 OpenSSL, the preview's runs, and the NVRAM settings."""
 
+import os
 import struct
 import subprocess
 import sys
@@ -102,6 +103,14 @@ class MkresumeTest(unittest.TestCase):
         self.assertEqual(path[46 : 42 + text_length].decode("utf-16-le"), "0x20000\0")
         self.assertEqual(path[42 + text_length :], b"\x7f\xff\x04\x00")
         self.assertNotIn("nvram-hex.boot-image-key", settings)
+
+    @unittest.skipUnless(os.environ.get("MKRESUME_CHECK"), "MKRESUME_CHECK names no mkresume_check")
+    def test_the_loader_refuses_a_bad_magic_after_taking_the_key(self):
+        self.run_tool("--key-bytes", "16", "--set", "magic=0x73696D66")
+        result = subprocess.run([os.environ["MKRESUME_CHECK"], str(self.dir / "part.img"),
+                                 str(self.dir / "nvram.cfg")], capture_output=True, text=True)  # fmt: skip
+        self.assertEqual(result.returncode, 2, result.stdout + result.stderr)
+        self.assertIn("boot-signature no, boot-image yes, boot-image-key no", result.stdout)
 
     def test_refusals_are_said_in_words(self):
         (self.dir / "text.elf").write_text("not an ELF file")
