@@ -23,7 +23,7 @@ namespace nimb::guest {
 
 // Filled in by mkresume in the image; all zero but the marker otherwise.
 __attribute__((used)) ResumeExpect gResumeExpect = {
-    {'R', 'P', 'R', 'B', 'E', 'X', 'P', '1'}, 0, {}, 0, 0, 0, 0, 0, 0, 0, 0, {}, {}, {}, {}};
+    {'R', 'P', 'R', 'B', 'E', 'X', 'P', '1'}, 0, {}, 0, 0, 0, 0, 0, 0, 0, 0, {}, {}, 0, 0, {}};
 
 namespace {
 
@@ -247,7 +247,8 @@ void CheckRuntime(const Handed &h, const ResumeExpect &expect) {
 
 void CheckFirstStage(const Handed &h, const ResumeExpect &expect) {
   const uint8_t *chain = At(h.scratch + kChainBlockAt);
-  Check("resume-chain-block", FirstDifference(chain, expect.chainBlock, 16) == 16,
+  // Without encryption the loader's chain block has no meaning.
+  Check("resume-chain-block", expect.chainChecked == 0 || FirstDifference(chain, expect.chainBlock, 16) == 16,
         "0x%x%x..., wanted 0x%x%x...", chain[0], chain[1], expect.chainBlock[0], expect.chainBlock[1]);
   const uint32_t codeAt = h.codeCopy - h.header;
   uint32_t sum = Adler32(1, At(h.header + kHeaderBytes), codeAt - kHeaderBytes);

@@ -5,6 +5,7 @@
 // kernel's form and powers off.
 #pragma once
 
+#include <stddef.h>
 #include <stdint.h>
 
 #include "entry.h"
@@ -27,10 +28,15 @@ struct ResumeExpect {
   uint32_t firstStageBytes;
   uint8_t chainBlock[16];  // the first stage's last 16 bytes as on the disk
   uint8_t saveTable[722];  // the bar's background samples
-  uint8_t pad[2];
+  uint8_t chainChecked;    // 1: the first stage was encrypted; chainBlock is what the loader keeps
+  uint8_t pad;
   uint8_t header[512];  // the header as written
 };
 static_assert(sizeof(ResumeExpect) == 1328, "the layout that mkresume writes");
+static_assert(offsetof(ResumeExpect, firstStageSum) == 44 && offsetof(ResumeExpect, chainBlock) == 76 &&
+                  offsetof(ResumeExpect, saveTable) == 92 && offsetof(ResumeExpect, chainChecked) == 814 &&
+                  offsetof(ResumeExpect, header) == 816,
+              "the offsets that mkresume writes at");
 
 constexpr uint8_t kKeyMask = 0xA5;
 

@@ -471,6 +471,7 @@ def fill_chain_block(code, image, code_at, restore_bytes, encrypted):
     if encrypted and encrypted < code_at + restore_bytes:
         raise UsageError("with the restart probe, encryption must begin behind the restart code")
     code.data[at + 76 : at + 92] = image[-16:]
+    code.data[at + 814] = 1 if encrypted else 0
     image[code_at : code_at + restore_bytes] = code.data
 
 
