@@ -34,10 +34,9 @@ from scenarios import ResumeImage, Scenario  # noqa: E402
 
 FIRST_STAGE = 64 << 20
 TIMED_READ = re.compile(r"platform: timed read (\d+) bytes, (\d+) extents, (\d+) ticks \((\w+)\)")
-# The platform's moment before StartImage and the probe's at entry, in
-# either form that they print.
-LOADER_START = re.compile(r"platform: tsc (?:start-image=|at start )0x([0-9a-f]+)")
-PROBE_ENTRY = re.compile(r"kernel: (?:tsc entry=|resume tsc=)0x([0-9a-f]+)")
+# The platform's moment before StartImage and the probe's at its entry.
+LOADER_START = re.compile(r"platform: tsc start-image=0x([0-9a-f]+)")
+PROBE_ENTRY = re.compile(r"kernel: tsc entry=0x([0-9a-f]+)")
 
 BENCH = Scenario(
     "resume_vs_read",
@@ -52,7 +51,7 @@ BENCH = Scenario(
 
 def measure(efi_dir, guest_dir, keep):
     workdir = Path(tempfile.mkdtemp(prefix="nimb-bench-resume-"))
-    disk = harness.prepare(BENCH, efi_dir, workdir, guest_dir=guest_dir)
+    disk, _ = harness.prepare(BENCH, efi_dir, workdir, guest_dir=guest_dir)
     returncode, log, _, _ = harness.boot(disk, workdir, BENCH.timeout, extra=("-cpu", "max"))
     (workdir / "serial.txt").write_text(log)
     read, start, entry = TIMED_READ.search(log), LOADER_START.findall(log), PROBE_ENTRY.findall(log)

@@ -21,6 +21,14 @@ bool ApplyLoader(PlatformConfig *config, const char *, char *value) {
   return true;
 }
 
+bool ApplyTimedRead(PlatformConfig *config, const char *, char *value) {
+  if (*value == '\0' || !Utf8ToUcs2(value, nullptr, 0, nullptr)) {
+    return false;
+  }
+  config->timedReadPath = value;
+  return true;
+}
+
 bool ApplyOptions(PlatformConfig *config, const char *, char *value) {
   if (!Utf8ToUcs2(value, nullptr, 0, nullptr)) {
     return false;
@@ -279,8 +287,8 @@ bool ApplyBsdpResponse(PlatformConfig *config, const char *, char *value) {
   return ApplyBytes(&config->bsdpResponse, value);
 }
 
-bool ApplyTimedRead(PlatformConfig *config, const char *, char *value) {
-  return ApplyBytes(&config->timedRead, value);
+bool ApplyTimedExtents(PlatformConfig *config, const char *, char *value) {
+  return ApplyBytes(&config->timedExtents, value);
 }
 
 // A key whose name ends in '.' is a prefix: it takes every key that starts
@@ -304,7 +312,8 @@ constexpr ConfigKey kConfigKeys[] = {
     {"device-properties-hex", ApplyDeviceProperties},
     {"netboot.dhcp-hex", ApplyDhcpResponse},
     {"netboot.bsdp-hex", ApplyBsdpResponse},
-    {"timed-read-hex", ApplyTimedRead},
+    {"time-read", ApplyTimedRead},
+    {"time-read-extents-hex", ApplyTimedExtents},
 };
 
 // The name that `key` gives to the function of `entry`, or null when the
@@ -427,7 +436,8 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->deviceProperties = {};
   config->dhcpResponse = {};
   config->bsdpResponse = {};
-  config->timedRead = {};
+  config->timedReadPath = nullptr;
+  config->timedExtents = {};
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {

@@ -43,7 +43,11 @@
 //   netboot.bsdp-hex=<hex> its boot-service discovery answer (may be empty).
 //                          With either key the protocol is there, and it
 //                          answers EFI_NOT_FOUND for an answer not given
-//   timed-read-hex=<hex>   before the loader starts, the platform reads
+//   time-read=<path>       a file of this volume that the platform reads
+//                          whole through the firmware's file system before
+//                          starting the loader, timed with the time stamp
+//                          counter (platform: tsc read-start, read-end)
+//   time-read-extents-hex=<hex> before the loader starts, the platform reads
 //                          these extents of one partition through DiskIO
 //                          and prints the time in TSC ticks: u32 partition
 //                          number, then u64 start and u64 length pairs,
@@ -119,7 +123,9 @@ struct PlatformConfig {
   ConfigBytes deviceProperties;
   ConfigBytes dhcpResponse;
   ConfigBytes bsdpResponse;
-  ConfigBytes timedRead;
+  // The file to read timed before the loader starts; null: none.
+  const char *timedReadPath;
+  ConfigBytes timedExtents;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";

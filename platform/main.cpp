@@ -19,6 +19,7 @@
 #include "net_boot_info.h"
 #include "resume_watch.h"
 #include "serial.h"
+#include "tsc.h"
 
 namespace nimb::platform {
 
@@ -228,6 +229,44 @@ EFI_FILE_PROTOCOL *OpenOwnVolume(EFI_HANDLE *device) {
   return root;
 }
 
+// Reads the configured file whole through the firmware's own file system,
+// timed: the firmware's time for what the loader reads of it in the same
+// run. Nothing of it stays allocated.
+void TimeFirmwareRead(EFI_FILE_PROTOCOL *root, const char *path) {
+  UINTN units = 0;
+  CHAR16 *wide = WideCopyOrFail(path, "the timed file's path", &units);
+  EFI_FILE_PROTOCOL *file = nullptr;
+  EFI_STATUS status = root->Open(root, &file, wide, EFI_FILE_MODE_READ, 0);
+  gBS->FreePool(wide);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot open %s to time its read (%s)", path, StatusName(status));
+  }
+  UINT64 infoBuffer[kFileInfoBufferSize / sizeof(UINT64)];
+  UINTN size = sizeof(infoBuffer);
+  status = file->GetInfo(file, &gEfiFileInfoGuid, &size, infoBuffer);
+  const UINT64 fileSize = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer)->FileSize;
+  const UINTN pages = (fileSize + 0xFFF) >> 12;
+  EFI_PHYSICAL_ADDRESS buffer = 0;
+  if (!EFI_ERROR(status)) {
+    status = gBS->AllocatePages(AllocateAnyPages, EfiLoaderData, pages, &buffer);
+  }
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot ready the timed read of %s (%s)", path, StatusName(status));
+  }
+  size = fileSize;
+  const UINT64 start = ReadTsc();
+  status = file->Read(file, &size, reinterpret_cast<VOID *>(buffer));
+  const UINT64 end = ReadTsc();
+  file->Close(file);
+  gBS->FreePages(buffer, pages);
+  if (EFI_ERROR(status) || size != fileSize) {
+    Fail(kExitPlatformFailed, "the timed read of %s failed (%s)", path, StatusName(status));
+  }
+  SerialPrintf("platform: timed read of %s, %u bytes", path, fileSize);
+  ReportTsc("read-start", start);
+  ReportTsc("read-end", end);
+}
+
 // The device path of the loader's device, end node included, in hex: the
 // loader finds its kernel cache by a checksum over these bytes.
 void ReportBootDevicePath(EFI_HANDLE device) {
@@ -431,7 +470,7 @@ EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
   }
   // While the loader runs, its text stays off a graphics screen.
   ConsoleOfferScreenText(&gConsole, true);
-  ReportLoaderStart();
+  ReportTsc("start-image", ReadTsc());
   status = gBS->StartImage(loader, nullptr, nullptr);
   ConsoleOfferScreenText(&gConsole, false);
   return status;
@@ -455,6 +494,9 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   ReadConfig(root, &config);
   const LoaderLaunch launch = PrepareLoader(root, device, config);
   ReportBootDevicePath(device);
+  if (config.timedReadPath != nullptr) {
+    TimeFirmwareRead(root, config.timedReadPath);
+  }
   ServeExactTimes(root, device);
   const UINTN directories = MemoryWarmDirectoryCache(root);
   root->Close(root);
@@ -466,8 +508,8 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   if (boot == 1) {
     SetVariables(config.nvram);
   }
-  if (config.timedRead.bytes != nullptr) {
-    TimedRead(config.timedRead);
+  if (config.timedExtents.bytes != nullptr) {
+    TimedRead(config.timedExtents);
   }
   WatchDiskAndReset();
   MemoryStockPool();

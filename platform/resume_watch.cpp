@@ -4,6 +4,7 @@
 #include "firmware.h"
 #include "format.h"
 #include "serial.h"
+#include "tsc.h"
 
 namespace nimb::platform {
 
@@ -109,12 +110,6 @@ UINT32 PartitionNumberOf(EFI_HANDLE handle) {
     }
     bytes += length;
   }
-}
-
-UINT64 ReadTsc() {
-  UINT32 low, high;
-  __asm__ volatile("rdtsc" : "=a"(low), "=d"(high));
-  return static_cast<UINT64>(high) << 32 | low;
 }
 
 UINT64 ReadLe(const UINT8 *bytes, UINT32 count) {
@@ -243,10 +238,6 @@ void ReportKeyCopies(const ConfigEntryList &variables) {
   }
   gBS->FreePool(map);
   SerialPrintf("platform: key copies %u\n", static_cast<UINT64>(found));
-}
-
-void ReportLoaderStart() {
-  SerialPrintf("platform: tsc at start 0x%x\n", ReadTsc());
 }
 
 void TimedRead(const ConfigBytes &request) {

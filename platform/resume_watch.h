@@ -36,8 +36,4 @@ void WatchDiskAndReset();
 // "platform: timed read B bytes, N extents, T ticks".
 void TimedRead(const ConfigBytes &request);
 
-// "platform: tsc at start 0x<hex>": the counter just before the loader
-// starts, the beginning of the loader's time in the resume benchmark.
-void ReportLoaderStart();
-
 }  // namespace nimb::platform

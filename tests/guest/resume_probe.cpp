@@ -73,12 +73,6 @@ constexpr uint32_t kMaxHitsShown = 32;
 
 uint32_t gFilter[(1u << kFilterBits) / 32];
 
-inline uint64_t ReadTsc() {
-  uint32_t low, high;
-  __asm__ volatile("rdtsc" : "=a"(low), "=d"(high));
-  return static_cast<uint64_t>(high) << 32 | low;
-}
-
 inline uint8_t Cmos(uint8_t index) {
   uint8_t value;
   __asm__ volatile("outb %0, $0x70" : : "a"(index));
@@ -381,11 +375,9 @@ void ScanForKey(const Handed &h, const ResumeExpect &expect, uint32_t ownStart, 
 
 extern "C" [[noreturn]] void KernelMain(const nimb::guest::EntryState *state) {
   using namespace nimb::guest;
-  const uint64_t tsc = ReadTsc();
   SerialInit();
   ReportOutput('\n');
   Line("start");
-  Line("resume tsc=0x%llx", static_cast<unsigned long long>(tsc));
   CheckEntryState(*state);
   const ResumeExpect &expect = gResumeExpect;
   const uint8_t *header = At(state->eax);

@@ -503,7 +503,7 @@ def nvram_lines(args, key):
 
 def timed_read_line(args, extents):
     request = struct.pack("<I", args.partition_number) + b"".join(struct.pack("<QQ", s, n) for s, n in extents)
-    return "timed-read-hex=" + request.hex()
+    return "time-read-extents-hex=" + request.hex()
 
 
 def parse_args(argv):
@@ -547,7 +547,7 @@ def parse_args(argv):
     parser.add_argument("--no-boot-image", action="store_true", help="leave boot-image out of the settings")
     parser.add_argument("--no-key-variable", action="store_true", help="leave boot-image-key out of the settings")
     parser.add_argument("--nvram-out", help="write the settings there (default: standard output)")
-    parser.add_argument("--timed-read", action="store_true", help="add timed-read-hex for the first stage's extents")
+    parser.add_argument("--timed-read", action="store_true", help="add time-read-extents-hex: the platform reads the extents, timed")
     parser.add_argument("--plain-out", help="write the first stage as the loader should leave it")
     parser.add_argument("--seed", type=int, default=1, help="seed of the layout and the filler (1)")
     args = parser.parse_args(argv)
