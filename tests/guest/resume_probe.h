@@ -3,6 +3,14 @@
 // EAX at the image's header; the probe checks what it was handed, searches
 // memory for the AES key, reports on the serial port in the reference
 // kernel's form and powers off.
+//
+// Where the key may stand: OVMF's variable services (the build without SMM)
+// keep two copies of every variable's data in EfiRuntimeServicesData, their
+// caches of the variable store, and a deleted variable's bytes stay there.
+// The loader moves those regions into the image's runtime area, so after a
+// resume the key stands twice in the area and twice where the regions were
+// copied from; the store itself lies in flash, outside RAM. Anywhere else it
+// is a trace of the loader.
 #pragma once
 
 #include <stddef.h>
