@@ -581,17 +581,19 @@ def resumed(name, args, preview=None, screen=None, timeout=150.0):
 
 def reset_then_boot(name, args, after, reads=ResumeReads(), config=None):
     """The loader resets the machine without a restart; the second start,
-    on the same variable store, finds NVRAM as `after` says and makes a
-    normal boot (of a volume without a kernel: it ends in the loader's
-    message, the only way of the boot that depends on nothing else)."""
+    on the same variable store, finds NVRAM as `after` says and boots the
+    reference kernel."""
     return Scenario(
         name,
         config=config or {},
         resume=ResumeImage(args=args),
+        files=kernel_file(),
         boots=2,
-        expect=("platform: boot 1", "platform: starting", RESET, "platform: boot 2", after, KERNEL_ERROR,
-                "platform: loader returned"),
-        forbid=("kernel: start",),
+        expect=("platform: boot 1", "platform: starting", RESET, "platform: boot 2", after, LOADING_KERNEL,
+                KERNEL_START),
+        forbid=("platform: loader returned",),
+        exit="KernelPass",
+        kernel=KernelExpect(),
         reads=reads,
         timeout=180.0,
     )
