@@ -296,6 +296,10 @@ bool ApplyBsdpResponse(PlatformConfig *config, const char *, char *value) {
   return ApplyBytes(&config->bsdpResponse, value);
 }
 
+bool ApplyTimedExtents(PlatformConfig *config, const char *, char *value) {
+  return ApplyBytes(&config->timedExtents, value);
+}
+
 // A key whose name ends in '.' is a prefix: it takes every key that starts
 // with it, and its function gets the rest of the key as the name.
 struct ConfigKey {
@@ -319,6 +323,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"netboot.dhcp-hex", ApplyDhcpResponse},
     {"netboot.bsdp-hex", ApplyBsdpResponse},
     {"time-read", ApplyTimedRead},
+    {"time-read-extents-hex", ApplyTimedExtents},
 };
 
 // The name that `key` gives to the function of `entry`, or null when the
@@ -443,6 +448,7 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->dhcpResponse = {};
   config->bsdpResponse = {};
   config->timedReadPath = nullptr;
+  config->timedExtents = {};
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {

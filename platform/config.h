@@ -51,6 +51,11 @@
 //                          whole through the firmware's file system before
 //                          starting the loader, timed with the time stamp
 //                          counter (platform: tsc read-start, read-end)
+//   time-read-extents-hex=<hex> before the loader starts, the platform reads
+//                          these extents of one partition through DiskIO
+//                          and prints the time in TSC ticks: u32 partition
+//                          number, then u64 start and u64 length pairs,
+//                          little-endian
 // Hexadecimal values are any number of bytes: two digits each, blanks
 // allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
@@ -127,6 +132,7 @@ struct PlatformConfig {
   ConfigBytes bsdpResponse;
   // The file to read timed before the loader starts; null: none.
   const char *timedReadPath;
+  ConfigBytes timedExtents;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";

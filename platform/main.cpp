@@ -18,6 +18,7 @@
 #include "memory.h"
 #include "net_boot.h"
 #include "net_boot_info.h"
+#include "resume_watch.h"
 #include "serial.h"
 #include "tsc.h"
 
@@ -445,7 +446,8 @@ void InstallProtocols(const PlatformConfig &config) {
 }
 
 // The loader's variables that the configuration sets; the others stay as
-// they are.
+// they are. The values are wiped behind them: the variable store keeps the
+// only copy (a key among them is looked for in memory after a resume).
 void SetVariables(const ConfigEntryList &variables) {
   constexpr UINT32 kAttributes =
       EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
@@ -460,6 +462,13 @@ void SetVariables(const ConfigEntryList &variables) {
       Fail(kExitPlatformFailed, "cannot set NVRAM variable %s (%s)", variable.name, StatusName(status));
     }
     SerialPrintf("platform: nvram %s set, %u bytes\n", variable.name, static_cast<UINT64>(variable.size));
+  }
+  ReportKeyCopies(variables);
+  for (UINT32 i = 0; i < variables.count; i++) {
+    volatile UINT8 *bytes = const_cast<UINT8 *>(variables.entries[i].bytes);
+    for (UINT32 j = 0; j < variables.entries[i].size; j++) {
+      bytes[j] = 0;
+    }
   }
 }
 
@@ -666,7 +675,17 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
     launch = PrepareNetworkBoot(device, &config);
   }
   InstallProtocols(config);
-  SetVariables(config.nvram);
+  // A machine that resets starts again on the same variable store: the
+  // configured variables are set on the first start only.
+  const UINT32 boot = CountBoot();
+  ReportResumeVariables();
+  if (boot == 1) {
+    SetVariables(config.nvram);
+  }
+  if (config.timedExtents.bytes != nullptr) {
+    TimedRead(config.timedExtents);
+  }
+  WatchDiskAndReset();
   MemoryStockPool();
   const EFI_STATUS status = MemoryMeterInit(&gMeter);
   if (EFI_ERROR(status)) {

@@ -35,6 +35,7 @@ from pathlib import Path
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
+    RESUME_PARTITION_GUID,
     EXTENSIONS_DIR,
     KernelCache,
     mkdisk,
@@ -61,6 +62,8 @@ DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
+RESUME_TOOL = REPO / "tools" / "mkresume" / "mkresume.py"
+RESUME_PROBE = "resume_probe.elf"
 
 # The platform's report, on the serial port.
 REPORT_STATUS = re.compile(r"platform: loader returned 0x([0-9a-f]+) \((\w+)\)")
@@ -238,6 +241,7 @@ class KernelReport:
     drivers_from: str | None = None  # "loader", "cache" or "none"
     tsc: dict = dataclasses.field(default_factory=dict)  # moment -> time stamp counter
     unknown: list = dataclasses.field(default_factory=list)  # lines of no known kind
+    resume: list = dataclasses.field(default_factory=list)  # the restart probe's own lines
 
     def failed_checks(self):
         return [check for check in self.checks if not check.ok]
@@ -326,6 +330,8 @@ def parse_kernel_report(log):
         elif kind == "result" and KERNEL_RESULT.fullmatch(rest):
             verdict, checks, failed = KERNEL_RESULT.fullmatch(rest).groups()
             report.result = (verdict == "pass", int(checks), int(failed))
+        elif kind == "resume":
+            report.resume.append(rest)
         elif kind == "driver" and KERNEL_DRIVER.fullmatch(rest):
             identifier, source, _, plist, code, checksum = KERNEL_DRIVER.fullmatch(rest).groups()
             report.drivers.append((unquote(identifier)[0], source, int(plist, 16), int(code, 16), int(checksum, 16)))
@@ -661,6 +667,8 @@ def check_screen(image, expect, artwork=None):
     of a centred 128 x 128 picture (without artwork: anything there). The
     second: anything else on the screen, that is a box of all that isn't
     background larger than 128 x 128 or off the centre by more than a pixel."""
+    if expect.background is None:  # a screen of no fixed background: only taken
+        return [], []
     background = bytes(expect.background)
     if image.pixel(0, 0) != expect.background:
         return [f"screen: background {image.pixel(0, 0)}, wanted {expect.background}"], []
@@ -810,15 +818,17 @@ def network_arguments(tftp_dir, pcap=None):
     return arguments
 
 
-def qemu_command(workdir, disk, serial_log, qmp_socket=None, network=None):
-    """With `network` (the extra arguments of network_arguments) and no
-    `disk`, the machine boots over the network."""
+def qemu_command(workdir, disk, serial_log, qmp_socket=None, network=None, reboot=False, extra=()):
+    """QEMU's command line. With `network` (the extra arguments of
+    network_arguments) and no `disk`, the machine boots over the network;
+    with `reboot`, a reset starts the machine again (on the same variable
+    store) instead of ending QEMU; `extra` goes behind the accelerator."""
     code, variables = find_ovmf()
     private_vars = workdir / "OVMF_VARS.fd"
     shutil.copyfile(variables, private_vars)
     command = [
-        "qemu-system-x86_64", "-machine", "q35", "-m", "512M", "-accel", "tcg",
-        "-display", "none", "-no-reboot",
+        "qemu-system-x86_64", "-machine", "q35", "-m", "512M", "-accel", "tcg", *extra,
+        "-display", "none", *([] if reboot else ["-no-reboot"]),
         "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={code}",
         "-drive", f"if=pflash,format=raw,unit=1,file={private_vars}",
         *(["-drive", f"format=raw,file={disk}"] if disk is not None else []),
@@ -964,14 +974,21 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
     efi_dir = Path(efi_dir)
     volume = workdir / "volume"
     volume.mkdir()
-    stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
+    raw, resume_keys = None, {}
+    if scenario.resume is not None:
+        raw, resume_keys = make_resume(scenario.resume, workdir, guest_dir, scenario.disk_mib << 20)
+    config = scenario_config(scenario, config_override)
+    for key, value in resume_keys.items():
+        config.setdefault(key, value)
+    stage_volume(scenario, volume, config, guest_dir)
     cache_name = make_cache(scenario.cache, volume) if scenario.cache is not None else None
     loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
     if scenario.network:
         return serve_volume(volume, efi_dir / "BOOTX64.efi", loader), cache_name
     disk = workdir / "disk.img"
     try:
-        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20)
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20,
+                          raw=raw, raw_guid=RESUME_PARTITION_GUID)
     except mkdisk.DiskError as error:
         raise OSError(str(error)) from error
     return disk, cache_name
@@ -990,6 +1007,79 @@ def serve_volume(volume, platform, loader):
     if loader is not None:
         shutil.copyfile(loader, volume / mkdisk.LOADER_NAME)
     return volume
+
+
+def make_resume(resume, workdir, guest_dir, disk_bytes):
+    """Writes the scenario's resume image onto a partition image with
+    mkresume and the restart probe; returns its path and the platform.cfg
+    keys that ask for the restart."""
+    probe = Path(guest_dir) / RESUME_PROBE
+    if not probe.is_file():
+        raise FileNotFoundError(f"{probe} is missing: build the target guest_kernel first")
+    partition, settings = workdir / "resume.img", workdir / "resume.cfg"
+    command = [
+        sys.executable, str(RESUME_TOOL), "--restart", str(probe), "--partition", str(partition),
+        "--partition-bytes", str(resume.partition_bytes), "--partition-number", "2",
+        "--partition-guid", RESUME_PARTITION_GUID, "--partition-start-lba", str(mkdisk.raw_partition_lba(disk_bytes)),
+        "--partition-lbas", str(resume.partition_bytes // 512), "--nvram-out", str(settings),
+        *resume.args,
+    ]  # fmt: skip
+    if resume.preview is not None:
+        picture = workdir / "preview.ppm"
+        picture.write_bytes(resume.preview())
+        command += ["--preview", str(picture)]
+    subprocess.run(command, check=True, capture_output=True)
+    keys = dict(line.split("=", 1) for line in settings.read_text().splitlines() if "=" in line)
+    return partition, keys
+
+
+KEY_COPY = re.compile(r"platform: key copy at 0x([0-9a-f]+) type (\d+)")
+KEY_TRACE = re.compile(r'resume trace kind=key address=0x([0-9a-f]+) where="([^"]*)"')
+
+
+def check_key_trace(log):
+    """Problems with the places where the restart probe found the key: each
+    must be the firmware's (the runtime area the runtime data was moved to,
+    the region it was copied from, or a copy that the platform layer found
+    before the loader started); anything else the loader left behind."""
+    firmware = {int(address, 16) for address, _ in KEY_COPY.findall(log)}
+    problems = []
+    for address, where in KEY_TRACE.findall(log):
+        if where == "elsewhere" and int(address, 16) not in firmware:
+            problems.append(f"key: the key's bytes at {address} are no copy of the firmware's")
+    return problems
+
+
+def check_boots(log, wanted):
+    """Problems with the number of starts of the platform layer."""
+    starts = log.count("platform: started")
+    return [] if starts == wanted else [f"the machine started {starts} times, wanted {wanted}"]
+
+
+READ_LINE = re.compile(r"platform: read offset=0x([0-9a-f]+) size=0x([0-9a-f]+) to=0x([0-9a-f]+)")
+
+
+def check_resume_reads(log, expect):
+    """Problems with the loader's DiskIO reads that the platform logged at
+    the reset, against `expect` (ResumeReads): the header read first, then
+    at most `after_header` reads, each inside the first stage behind a
+    page-aligned header."""
+    if expect is None:
+        return []
+    reads = [tuple(int(v, 16) for v in m) for m in READ_LINE.findall(log)]
+    if not reads or reads[0][1] != 512:
+        return [f"reads: the first read is not the 512-byte header: {reads[:1]}"]
+    problems, later = [], reads[1:]
+    if expect.after_header is not None and len(later) > expect.after_header:
+        problems.append(f"reads: {len(later)} reads after the header, wanted at most {expect.after_header}")
+    if later:
+        header = later[0][2] - 512
+        if header % 4096:
+            problems.append(f"reads: the first read behind the header lands at {later[0][2]:#x}, no page + 512")
+        for offset, size, to in later:
+            if not (header + 512 <= to and to + size <= header + expect.first_stage):
+                problems.append(f"reads: {size:#x} bytes to {to:#x} leave the first stage at {header:#x}")
+    return problems
 
 
 class SerialFollower:
@@ -1017,27 +1107,30 @@ def second_path(path):
 
 
 def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False, network=False, actions=(),
-         second_shot=False, qemu_args=()):
+         second_shot=False, qemu_args=(), boots=1, extra=()):
     """Runs QEMU on `disk` until it ends, for at most `timeout` seconds. With
     `network`, `disk` is the directory served over TFTP and the machine
     boots from it (its packets go to workdir/net.pcap). With `screen_when`,
     takes a screenshot into `screen_path` over QMP as soon as a line of the
     serial log holds that text, and with `second_shot` another SPINNER_GAP
-    later (second_path); `qemu_args` go behind QEMU's own; `actions`
-    (Scenario.actions) are done in the
-    same way; with `echo`, prints the cleaned serial log as it comes.
-    Returns the exit status (None: timed out), the cleaned log, the
-    screenshot's path or None, and what went wrong with the screenshot or an
-    action."""
+    later (second_path); `qemu_args` go behind QEMU's own, `extra` behind
+    the accelerator; `actions` (Scenario.actions) are done in the same way;
+    with `echo`, prints the cleaned serial log as it comes. With `boots`
+    above 1, a reset starts the machine again on the same variable store,
+    and the run ends when the platform layer starts once more than that.
+    Returns the exit status (None: timed out or stopped), the cleaned log,
+    the screenshot's path or None, and what went wrong with the screenshot,
+    an action or the boots."""
     serial_log = workdir / "serial.log"
     qmp_socket = workdir / "qmp.sock" if screen_when or actions else None
     net = network_arguments(Path(disk).resolve(), workdir / "net.pcap") if network else None
-    command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, net) + list(qemu_args)
+    command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, net, reboot=boots > 1,
+                           extra=extra) + list(qemu_args)
     machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
-    shot, trouble, pending = None, [], list(actions)
+    shot, trouble, pending, starts = None, [], list(actions), 0
     try:
-        if screen_when or echo or actions:
+        if screen_when or echo or actions or boots > 1:
             qmp = Qmp(qmp_socket, deadline, machine) if qmp_socket else None
             follower = SerialFollower(serial_log)
             while True:
@@ -1054,6 +1147,11 @@ def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False,
                     for action in [action for action in pending if action[0] in line]:
                         pending.remove(action)
                         do_action(action[1], qmp, disk)
+                    starts += line.startswith("platform: started")
+                if starts > boots:
+                    trouble.append(f"boots: the machine started more than {boots} times; stopped")
+                    machine.kill()
+                    break
                 if not running or time.monotonic() > deadline:
                     break
                 time.sleep(0.05)
@@ -1091,7 +1189,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     returncode, log, shot, trouble = boot(
         disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None,
         network=scenario.network, actions=scenario.actions,
-        second_shot=bool(screen and screen.spinner == "turning"),
+        second_shot=bool(screen and screen.spinner == "turning"), boots=scenario.boots,
     )
     (workdir / "serial.txt").write_text(log)
     outcome = decode_exit(returncode, read_exit_codes())
@@ -1106,7 +1204,13 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
         problems += check_kernel(log, scenario.kernel, guest_dir)
     if scenario.capture:
         problems += check_capture(log, workdir / "net.pcap")
+    if scenario.boots > 1:
+        problems += [t for t in trouble if t.startswith("boots:")] + check_boots(log, scenario.boots)
+        trouble = [t for t in trouble if not t.startswith("boots:")]
     problems += trouble
+    problems += check_resume_reads(log, scenario.reads)
+    if scenario.resume is not None:
+        problems += check_key_trace(log)
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
         problems += picture + check_spinner([shot, shot and second_path(shot)], screen)

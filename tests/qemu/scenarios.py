@@ -28,6 +28,8 @@ BOOT_PLIST = "Library/Preferences/SystemConfiguration/com.quill.Boot.plist"
 # root volume's UUID as the loader should find it. Its first three fields
 # read differently in either byte order.
 PARTITION_GUID = mkdisk.DEFAULT_PARTITION_GUID
+# The raw partition that holds a resume image, behind the system partition.
+RESUME_PARTITION_GUID = "6A1E1F10-2B3C-4D5E-8F90-A1B2C3D4E5F6"
 
 # What a boot of the reference kernel prints, in this order.
 LOADING_KERNEL = "Loading 'nimb_kernel'..."
@@ -157,6 +159,43 @@ class ScreenExpect:
 def kernel_file(name="nimb_kernel"):
     """The volume's files for a boot of the reference kernel."""
     return {"nimb_kernel": GuestFile(name)}
+
+
+def test_picture(width, height):
+    """A binary PPM picture: colour bands, a gradient and a dark box in the
+    middle, so that the blurred grey has edges to show."""
+    rows = []
+    for y in range(height):
+        blocks = ((x * 255 // width, y * 255 // height, 255 - x * 255 // width) for x in range(0, width, 8))
+        row = b"".join(bytes(block) * 8 for block in blocks)[: 3 * width]
+        if height // 3 <= y < 2 * height // 3:
+            box = width // 4
+            row = row[: 3 * box] + bytes((20, 30, 40)) * (width - 2 * box) + row[3 * (width - box) :]
+        rows.append(row)
+    return f"P6\n{width} {height}\n255\n".encode() + b"".join(rows)
+
+
+@dataclasses.dataclass(frozen=True)
+class ResumeImage:
+    """A resume image on a raw partition, written by tools/mkresume with the
+    restart probe of tests/guest/ as its restart code; the NVRAM settings
+    that ask for it go into platform.cfg (a scenario's own keys win)."""
+
+    # mkresume's options beyond the partition's.
+    args: tuple = ()
+    # A function that gives the preview picture as PPM bytes, or None.
+    preview: object = None
+    partition_bytes: int = 8 << 20
+
+
+@dataclasses.dataclass(frozen=True)
+class ResumeReads:
+    """The loader's DiskIO reads before a reset, as the platform logs them:
+    the header first, then at most `after_header` reads (None: any), each
+    inside the `first_stage` bytes behind a page-aligned header."""
+
+    after_header: int | None = 0
+    first_stage: int = 1 << 20
 
 
 # --- the extensions directory ------------------------------------------------------------
@@ -308,6 +347,13 @@ class Scenario:
     # Check the kernel's network identity and DHCP answer against the
     # packets captured on the wire.
     capture: bool = False
+    # A resume image on a second partition, and the NVRAM settings for it.
+    resume: ResumeImage | None = None
+    # The starts of the machine on one variable store: above 1, a reset
+    # starts it again, and the run must end in exactly this many.
+    boots: int = 1
+    # The loader's reads up to a reset.
+    reads: ResumeReads | None = None
 
 
 _TABLE = [
@@ -660,6 +706,131 @@ _TABLE += [
                 f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
     ),
 ]
+
+# --- hibernation resume -----------------------------------------------------------------
+
+RESUME_OFFSET = 0x10000  # mkresume's default header offset
+RESET = "platform: reset type 0 status 0x0"
+
+
+def boot_image_bytes(offset_text):
+    """The size of boot-image: hard-drive node, file-path node, end node."""
+    return 42 + 4 + 2 * (len(offset_text) + 1) + 4
+
+
+def nvram_at_start(signature, image, key):
+    """The platform's line of the resume variables at a start."""
+    return f"platform: nvram at start: boot-signature={signature} boot-image={image} boot-image-key={key}"
+
+
+def resumed(name, args, preview=None, screen=None, timeout=150.0):
+    """The image restarts: the probe's checks all pass, and the machine never
+    resets."""
+    return Scenario(
+        name,
+        resume=ResumeImage(args=args, preview=preview),
+        expect=("platform: boot 1", "platform: starting", KERNEL_START, "kernel: result pass"),
+        forbid=(RESET, "platform: boot 2", "platform: loader returned"),
+        exit="KernelPass",
+        kernel=KernelExpect(),
+        screen=screen,
+        timeout=timeout,
+    )
+
+
+def reset_then_boot(name, args, after, reads=ResumeReads(), config=None):
+    """The loader resets the machine without a restart; the second start,
+    on the same variable store, finds NVRAM as `after` says and boots the
+    reference kernel."""
+    return Scenario(
+        name,
+        config=config or {},
+        resume=ResumeImage(args=args),
+        files=kernel_file(),
+        boots=2,
+        expect=("platform: boot 1", "platform: starting", RESET, "platform: boot 2", after, LOADING_KERNEL,
+                KERNEL_START),
+        forbid=("platform: loader returned",),
+        exit="KernelPass",
+        kernel=KernelExpect(),
+        reads=reads,
+        timeout=180.0,
+    )
+
+
+ACCEPTED_THEN_RESET = nvram_at_start("absent", boot_image_bytes(f"{RESUME_OFFSET:x}"), "absent")
+STAGE = 1 << 20
+
+_TABLE += [
+    # Each key size; the bar stops where the first stage ends in a larger
+    # image; the offset text with and without 0x.
+    resumed("resume_aes128", ("--key-bytes", "16", "--image-bytes", "3M", "--hex-prefix")),
+    resumed("resume_aes192", ("--key-bytes", "24", "--image-bytes", "2M", "--seed", "2")),
+    # With the preview: the screenshot shows it blurred in grey under the bar.
+    resumed(
+        "resume_aes256_preview",
+        ("--key-bytes", "32", "--image-bytes", "8M", "--first-stage", "6M", "--seed", "3"),
+        preview=lambda: test_picture(1280, 800),
+        screen=ScreenExpect(when="kernel: resume header=", picture=None, background=None, alone=False),
+    ),
+    # A preview of another size: the logo under the bar.
+    resumed(
+        "resume_preview_wrong_size",
+        ("--key-bytes", "32", "--first-stage", "2M", "--seed", "4"),
+        preview=lambda: test_picture(640, 480),
+        screen=ScreenExpect(when="kernel: resume header=", picture="logo", alone=False),
+    ),
+    # Nothing encrypted and no key at all.
+    resumed("resume_plain", ("--image-bytes", "4M", "--seed", "5")),
+    # Refused images: a reset, and a normal boot on the next start.
+    reset_then_boot("resume_bad_magic", ("--key-bytes", "16", "--set", "magic=0x73696D66"), ACCEPTED_THEN_RESET),
+    reset_then_boot(
+        "resume_wrong_machine", ("--key-bytes", "16", "--machine-signature", "0x5A5A"), ACCEPTED_THEN_RESET
+    ),
+    reset_then_boot(
+        "resume_no_boot_image",
+        ("--key-bytes", "16", "--no-boot-image"),
+        nvram_at_start("absent", "absent", "16"),
+        reads=None,
+    ),
+    # Headers that break a limit: nothing is read behind the header.
+    reset_then_boot("resume_limit_first_stage", ("--set", "firstStageBytes=256"), ACCEPTED_THEN_RESET),
+    reset_then_boot(
+        "resume_limit_preview_stage", ("--set", "previewBytes=0x200000"), ACCEPTED_THEN_RESET
+    ),
+    reset_then_boot("resume_limit_image_bytes", ("--set", "imageBytes=0x80000"), ACCEPTED_THEN_RESET),
+    reset_then_boot(
+        "resume_limit_encrypted_end",
+        ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE}"),
+        ACCEPTED_THEN_RESET,
+    ),
+    reset_then_boot(
+        "resume_limit_encrypted_step",
+        ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE - 0x1008}"),
+        ACCEPTED_THEN_RESET,
+    ),
+    reset_then_boot(
+        "resume_limit_first_extent", ("--set-extent", f"0:{RESUME_OFFSET:#x}:256"), ACCEPTED_THEN_RESET
+    ),
+    # The list holds fewer extents than the first stage needs: reads may
+    # begin, but none leaves the first stage.
+    reset_then_boot(
+        "resume_limit_extent_list",
+        ("--extent-bytes-field", "32"),
+        ACCEPTED_THEN_RESET,
+        reads=ResumeReads(after_header=None, first_stage=STAGE),
+    ),
+    reset_then_boot(
+        "resume_limit_no_key", ("--key-bytes", "16", "--no-key-variable"), ACCEPTED_THEN_RESET
+    ),
+    reset_then_boot(
+        "resume_limit_key_length",
+        ("--key-bytes", "16",),
+        ACCEPTED_THEN_RESET,
+        config={"nvram-hex.boot-image-key": "00112233445566778899aabbccddeeff0011223344"},
+    ),
+]
+
 
 # Kernel caches and drivers. Times are UTC; the platform serves them to the
 # loader exactly, nanoseconds included.
