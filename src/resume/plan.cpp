@@ -50,10 +50,12 @@ BOOLEAN ResumePlanImage(const ResumeHeader *header, UINT64 mapSize, ResumePlan *
     previewStage = previewEnd - kResumeHeaderBytes;
   }
   // The encrypted part is whole blocks up to the end of the first stage and
-  // leaves the header plain: it was read before anything is decrypted, and
-  // it goes back to the restart code patched.
+  // leaves the header and the extent list plain: both are used before
+  // anything is decrypted, and the header goes back to the restart code
+  // patched.
   const UINT64 encrypted = header->encryptedOffset;
-  if (encrypted != 0 && (encrypted < kResumeHeaderBytes || encrypted >= firstStage ||
+  const UINT64 plainBytes = codeOffset > kResumeHeaderBytes ? codeOffset : kResumeHeaderBytes;
+  if (encrypted != 0 && (encrypted < plainBytes || encrypted >= firstStage ||
                          (firstStage - encrypted) % kResumeBlockBytes != 0)) {
     return FALSE;
   }

@@ -2,6 +2,7 @@
 // firmware: the memory plan, the walk over the extents, every limit of the
 // header, and the restart with its record for the restart code.
 #include <gtest/gtest.h>
+#include <openssl/evp.h>
 
 #include <functional>
 #include <vector>
@@ -9,8 +10,11 @@
 #include "loader_fixture.h"
 #include "resume/image_read.h"
 #include "resume/plan.h"
+#include "resume/preview_encoder.h"
 #include "resume/restart.h"
 #include "resume_image.h"
+#include "screen/console.h"
+#include "screen/resume_display.h"
 
 namespace {
 
@@ -188,6 +192,100 @@ TEST_F(ResumeRunTest, AFailedReadIsReportedAndResets) {
   EXPECT_EQ(fw.ConOutText(), "!Read 800\r\n");
 }
 
+// OpenSSL's AES-CBC encryption without padding, with the image's IV.
+std::vector<uint8_t> Encrypt(const std::vector<uint8_t> &key, const uint8_t *plain, size_t size) {
+  const EVP_CIPHER *type = key.size() == 16   ? EVP_aes_128_cbc()
+                           : key.size() == 24 ? EVP_aes_192_cbc()
+                                              : EVP_aes_256_cbc();
+  EVP_CIPHER_CTX *context = EVP_CIPHER_CTX_new();
+  std::vector<uint8_t> out(size + 16);
+  int length = 0, tail = 0;
+  EVP_EncryptInit_ex(context, type, nullptr, key.data(), kResumeIv);
+  EVP_CIPHER_CTX_set_padding(context, 0);
+  EVP_EncryptUpdate(context, out.data(), &length, plain, static_cast<int>(size));
+  EVP_EncryptFinal_ex(context, out.data() + length, &tail);
+  EVP_CIPHER_CTX_free(context);
+  out.resize(size_t(length + tail));
+  return out;
+}
+
+// Each key size; with 16 bytes a preview on a screen, encrypted from behind
+// it; with the others no preview and all but the header encrypted, so that
+// the restart code is copied as decrypted.
+TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
+  constexpr UINT32 kWidth = 320, kHeight = 200;
+  for (size_t keySize : {16u, 24u, 32u}) {
+    SCOPED_TRACE(keySize);
+    const bool preview = keySize == 16;
+    hostfw::Firmware local;
+    nimbtest::ResetLoaderState();
+    gST = local.SystemTable();
+    gBS = local.BootServices();
+    gRT = local.RuntimeServices();
+    gImageHandle = local.ImageHandle();
+    gCallGate = kGate;
+    local.InstallAcpi({});
+    local.AddScreen({kWidth, kHeight, 32});
+
+    std::string error;
+    const std::vector<uint8_t> picture = previewenc::EncodePreview(
+        std::vector<uint32_t>(kWidth * kHeight, 0x00336699), kWidth, kHeight, 4, &error);
+    ResumeImageSpec spec;
+    spec.firstStageBytes = 0x8000;
+    spec.imageBytes = 0x20000;
+    if (preview) {
+      spec.previewBytes = uint32_t(picture.size() + 8);
+      spec.previewPictureOffset = 8;
+    }
+    ResumeImage image = nimbtest::BuildResumeImage(spec);
+    const size_t section = image.RestartCodeOffset() + 2 * 4096;
+    if (preview)
+      std::copy(picture.begin(), picture.end(), image.bytes.begin() + section + 8);
+    const size_t encrypted =
+        (preview ? section + spec.previewBytes : image.RestartCodeOffset()) + 15 & ~size_t(15);
+    image.Header().encryptedOffset = encrypted;
+    const std::vector<uint8_t> plain = image.bytes;
+    std::vector<uint8_t> key(keySize);
+    for (size_t i = 0; i < keySize; i++)
+      key[i] = uint8_t(0xA0 + i);
+    const std::vector<uint8_t> cipher = Encrypt(key, plain.data() + encrypted, plain.size() - encrypted);
+    std::copy(cipher.begin(), cipher.end(), image.bytes.begin() + encrypted);
+
+    HibernatedMachine machine;
+    machine.Install(local, image, key);
+    local.GuardFreeMemory();
+    hostfw::RunResult result = local.Call([] {
+      ASSERT_EQ(InitConsole(), EFI_SUCCESS);
+      TryResume();
+    });
+    ASSERT_EQ(result.end, hostfw::RunEnd::KernelEntered);
+    const UINT8 *header = reinterpret_cast<const UINT8 *>(result.gateArgument);
+    const ResumeHeader &h = *reinterpret_cast<const ResumeHeader *>(header);
+    EXPECT_EQ(std::memcmp(header + 512, plain.data() + 512, plain.size() - 512), 0) << "decrypted in place";
+    const UINT8 *scratch = header - h.videoDelta;
+    EXPECT_EQ(std::memcmp(scratch + kResumeChainBlockOffset, cipher.data() + cipher.size() - 16, 16), 0);
+    const size_t code = image.RestartCodeOffset();
+    EXPECT_EQ(h.restoreSum, nimbtest::PageSums(
+                                std::vector<uint8_t>(plain.begin() + code, plain.begin() + code + 2 * 4096)));
+    const ResumeVideoRecord &video = *reinterpret_cast<const ResumeVideoRecord *>(scratch);
+    EXPECT_EQ(video.width, kWidth);
+    EXPECT_EQ(video.height, kHeight);
+    EXPECT_EQ(video.depth, 32u);
+    EXPECT_NE(video.baseAddress, 0u);
+    // The preview, or the logo, and the bar's samples saved.
+    EXPECT_EQ(local.CallCount("UgaBlt") == 0, preview);
+    const UINT8 *table = scratch + kResumeSaveTableOffset;
+    EXPECT_TRUE(std::any_of(table, table + kProgressSaveTableBytes, [](UINT8 b) { return b != 0; }));
+    EXPECT_EQ(local.FindVariable(kResumeKeyVariable, gNimbVendorVariableGuid), nullptr);
+    // The key's bytes stand nowhere in the loader's pool any more.
+    for (const MemoryTag *tag = gMemoryTags; tag != nullptr; tag = tag->next) {
+      if (tag->poolAddress != nullptr && std::memcmp(tag->poolAddress, key.data(), 8) == 0)
+        ADD_FAILURE() << "key bytes left in pool";
+    }
+  }
+  nimbtest::ResetLoaderState();
+}
+
 // Every limit the header must keep: broken, the machine resets before it
 // leaves boot services, and nothing outside what the loader holds is
 // touched (the free memory is guarded).
@@ -233,6 +331,7 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
       {"encrypted from past the first stage", [](auto &s) { s.encryptedOffset = 0x6000; }, same},
       {"encrypted part not whole blocks", [](auto &s) { s.encryptedOffset = 0x1008; }, same},
       {"encrypted header", [](auto &s) { s.encryptedOffset = 0x100; }, same},
+      {"encrypted extent list", [](auto &s) { s.encryptedOffset = 0x200; }, same},
       {"encrypted without a key", [](auto &s) { s.encryptedOffset = 0x1000; }, same, {}},
       {"encrypted with a key of 20 bytes", [](auto &s) { s.encryptedOffset = 0x1000; }, same,
        std::vector<uint8_t>(20, 0x4B)},
