@@ -20,4 +20,28 @@ inline void AttachLoader(hostfw::Firmware &fw) {
   nimb::gMemoryTagBlocks = nullptr;
 }
 
+// The loader's tables cleared again at the end of an input.
+inline void DetachLoader() {
+  nimb::gST = nullptr;
+  nimb::gBS = nullptr;
+  nimb::gRT = nullptr;
+  nimb::gImageHandle = nullptr;
+}
+
+// Declares all free memory of the arena above its first `bytes` reserved,
+// so that an input asking for a gigabyte is refused at once instead of
+// being filled byte by byte on every run.
+inline void LimitUsableMemory(hostfw::Firmware &fw, UINT64 bytes) {
+  const UINT64 cut = hostfw::kArenaBase + bytes;
+  for (const EFI_MEMORY_DESCRIPTOR &d : fw.MemoryMap()) {
+    UINT64 start = d.PhysicalStart;
+    const UINT64 end = start + d.NumberOfPages * EFI_PAGE_SIZE;
+    if (d.Type != EfiConventionalMemory || end <= cut)
+      continue;
+    if (start < cut)
+      start = cut;
+    fw.AddMemoryRegion(EfiReservedMemoryType, start, (end - start) / EFI_PAGE_SIZE, 0);
+  }
+}
+
 }  // namespace nimbfuzz

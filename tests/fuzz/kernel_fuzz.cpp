@@ -31,16 +31,7 @@ hostfw::Firmware &TheFirmware() {
     // Messages would pile up in the firmware's records over millions of runs.
     made->SetConOutPresent(false);
     made->SetStdErrPresent(false);
-    UINT64 cut = hostfw::kArenaBase + kUsableMemory;
-    for (const EFI_MEMORY_DESCRIPTOR &d : made->MemoryMap()) {
-      UINT64 start = d.PhysicalStart;
-      UINT64 end = start + d.NumberOfPages * EFI_PAGE_SIZE;
-      if (d.Type != EfiConventionalMemory || end <= cut)
-        continue;
-      if (start < cut)
-        start = cut;
-      made->AddMemoryRegion(EfiReservedMemoryType, start, (end - start) / EFI_PAGE_SIZE, 0);
-    }
+    nimbfuzz::LimitUsableMemory(*made, kUsableMemory);
     return made;
   }();
   return *fw;
@@ -88,9 +79,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     Check(tag->poolAddress == nullptr);
   nimb::TrackedFreeAll();
   Check(fw.LivePoolBlocks() == 0 && fw.AllocatedPages() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
-  nimb::gImageHandle = nullptr;
+  nimbfuzz::DetachLoader();
   return 0;
 }

@@ -12,7 +12,7 @@
 #include "resume/plan.h"
 #include "resume/preview_encoder.h"
 #include "resume/restart.h"
-#include "resume_image.h"
+#include "resume_scene.h"
 #include "screen/console.h"
 #include "screen/resume_display.h"
 
@@ -217,13 +217,8 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
   for (size_t keySize : {16u, 24u, 32u}) {
     SCOPED_TRACE(keySize);
     const bool preview = keySize == 16;
-    hostfw::Firmware local;
-    nimbtest::ResetLoaderState();
-    gST = local.SystemTable();
-    gBS = local.BootServices();
-    gRT = local.RuntimeServices();
-    gImageHandle = local.ImageHandle();
-    gCallGate = kGate;
+    nimbtest::ResumeScene scene;
+    hostfw::Firmware &local = scene.fw;
     local.InstallAcpi({});
     local.AddScreen({kWidth, kHeight, 32});
 
@@ -251,8 +246,7 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
     const std::vector<uint8_t> cipher = Encrypt(key, plain.data() + encrypted, plain.size() - encrypted);
     std::copy(cipher.begin(), cipher.end(), image.bytes.begin() + encrypted);
 
-    HibernatedMachine machine;
-    machine.Install(local, image, key);
+    scene.Install(image, key);
     local.GuardFreeMemory();
     hostfw::RunResult result = local.Call([] {
       ASSERT_EQ(InitConsole(), EFI_SUCCESS);
@@ -283,7 +277,6 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
         ADD_FAILURE() << "key bytes left in pool";
     }
   }
-  nimbtest::ResetLoaderState();
 }
 
 // Every limit the header must keep: broken, the machine resets before it
@@ -351,13 +344,8 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
   };
   for (const Case &c : cases) {
     SCOPED_TRACE(c.name);
-    hostfw::Firmware local;
-    nimbtest::ResetLoaderState();
-    gST = local.SystemTable();
-    gBS = local.BootServices();
-    gRT = local.RuntimeServices();
-    gImageHandle = local.ImageHandle();
-    gCallGate = kGate;
+    nimbtest::ResumeScene scene;
+    hostfw::Firmware &local = scene.fw;
     local.InstallAcpi({});
     ResumeImageSpec spec;
     c.spec(spec);
@@ -366,8 +354,7 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
     // The list as changed goes back into the image's bytes.
     for (size_t i = 0; i < broken.extents.size() && 0x1E0 + 16 * i + 16 <= broken.bytes.size(); i++)
       std::memcpy(broken.bytes.data() + 0x1E0 + 16 * i, &broken.extents[i], 16);
-    HibernatedMachine hibernated;
-    hibernated.Install(local, broken, c.key);
+    scene.Install(broken, c.key);
     local.GuardFreeMemory();
     hostfw::RunResult result = local.Call([] { TryResume(); });
     EXPECT_EQ(result.end, hostfw::RunEnd::Reset);
@@ -378,7 +365,6 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
     TrackedFreeAll();
     EXPECT_EQ(local.AllocatedPages(), 0u);
   }
-  Attach();
 }
 
 }  // namespace
