@@ -64,7 +64,7 @@ if(NIMB_FUZZ)
     if(EXISTS ${CMAKE_SOURCE_DIR}/tests/fuzz/corpus/${corpus})
       set(seeds ${CMAKE_SOURCE_DIR}/tests/fuzz/corpus/${corpus})
     endif()
-    add_test(NAME fuzz.${corpus} COMMAND fuzz_${name} -max_total_time=15 -timeout=10 -rss_limit_mb=4096 ${work} ${seeds})
+    add_test(NAME fuzz.${corpus} COMMAND fuzz_${name} -max_total_time=6 -timeout=10 -rss_limit_mb=4096 ${work} ${seeds})
     set_tests_properties(fuzz.${corpus} PROPERTIES LABELS fuzz TIMEOUT 120)
   endforeach()
 endif()
@@ -102,6 +102,10 @@ if(NIMB_OBJDUMP)
                    "-DOBJECTS=${CMAKE_BINARY_DIR}/CMakeFiles/nimbcore.dir/src/boot/gate.S.o;${NIMB_EFI_DIR}/CMakeFiles/nimbboot.dir/src/boot/gate.S.obj"
                    -P ${CMAKE_SOURCE_DIR}/cmake/check-gate.cmake)
   set_tests_properties(gate.no-relocations PROPERTIES LABELS unit)
+  add_test(NAME efi.sse-only-in-aes
+           COMMAND ${CMAKE_COMMAND} -DOBJDUMP=${NIMB_OBJDUMP} -DOBJECT_DIR=${NIMB_EFI_DIR}/CMakeFiles/nimbboot.dir
+                   -P ${CMAKE_SOURCE_DIR}/cmake/check-sse.cmake)
+  set_tests_properties(efi.sse-only-in-aes PROPERTIES LABELS unit)
 endif()
 
 # --- QEMU scenarios ------------------------------------------------------------------

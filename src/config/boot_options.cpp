@@ -271,13 +271,13 @@ static PlistTag *ReadConfiguration(EFI_LOAD_FILE_INTERFACE *loadFile, EFI_FILE *
 }
 
 // Appends every word of `text` that is not in the option string yet.
-static char *AppendWords(char *base, char *end, const char *text) {
+static char *AppendWords(OptionKeyIndex *index, char *end, const char *text) {
   while (*text != 0) {
     const char *word = nullptr;
     UINT64 keyLength = 0;
     UINT64 wordLength = 0;
     text = NextOption(text, &word, &keyLength, &wordLength);
-    end = AppendOption(base, end, word, keyLength, wordLength);
+    end = AppendIndexedOption(index, end, word, keyLength, wordLength);
   }
   return end;
 }
@@ -299,22 +299,28 @@ static char *MergeOptions(const char *loadOptions, const char *nvram, const char
   }
   strcpy(merged, start);
   char *end = merged + strlen(merged);
+  // The words that may come: those of the three texts and the three flags.
+  OptionKeyIndex index;
+  OptionKeyIndexInit(&index, merged, size + 64,
+                     CountOptionWords(start) + (nvram != nullptr ? CountOptionWords(nvram) : 0) +
+                         (kernelFlags != nullptr ? CountOptionWords(kernelFlags) : 0) + 3);
   if (nvram != nullptr) {
-    end = AppendWords(merged, end, nvram);
+    end = AppendWords(&index, end, nvram);
   }
   if (kernelFlags != nullptr) {
-    end = AppendWords(merged, end, kernelFlags);
+    end = AppendWords(&index, end, kernelFlags);
   }
   if (snapshot & kBootSafeMode) {
     printf("Using Safe Mode\n");
-    end = AppendOption(merged, end, "-x", 2, 2);
+    end = AppendIndexedOption(&index, end, "-x", 2, 2);
   }
   if (snapshot & kBootSingleUser) {
-    end = AppendOption(merged, end, "-s", 2, 2);
+    end = AppendIndexedOption(&index, end, "-s", 2, 2);
   }
   if (snapshot & kBootVerbose) {
-    end = AppendOption(merged, end, "-v", 2, 2);
+    end = AppendIndexedOption(&index, end, "-v", 2, 2);
   }
+  OptionKeyIndexFree(&index);
   return merged;
 }
 

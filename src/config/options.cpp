@@ -2,6 +2,7 @@
 
 #include "config/boot_options.h"
 #include "config/plist.h"
+#include "memory/tracking.h"
 #include "support/strings.h"
 
 namespace nimb {
@@ -132,6 +133,104 @@ static BOOLEAN HasKey(const char *textWord, const char *key, UINT64 keyLength) {
   return behind == '\0' || behind == '=' || IsBlank(behind);
 }
 
+// `word` of `wordLength` bytes behind the string that ends at `end`, with a
+// blank in front when the string is not empty.
+static char *AppendWord(char *base, char *end, const char *word, UINT64 wordLength) {
+  if (base < end) {
+    *end++ = ' ';
+  }
+  memcpy(end, word, wordLength);
+  end[wordLength] = '\0';
+  return end + wordLength;
+}
+
+UINT64 CountOptionWords(const char *text) {
+  UINT64 count = 0;
+  while (*SkipBlanks(text) != '\0') {
+    const char *word = nullptr;
+    UINT64 keyLength = 0;
+    UINT64 wordLength = 0;
+    text = NextOption(text, &word, &keyLength, &wordLength);
+    count++;
+  }
+  return count;
+}
+
+// A word's key is what stands in front of its first '='; two words are
+// duplicates when their keys are the same non-empty bytes.
+static UINT64 KeyHash(const char *key, UINT64 keyLength) {
+  UINT64 hash = 0xCBF29CE484222325ULL;
+  for (UINT64 i = 0; i < keyLength; i++) {
+    hash = (hash ^ static_cast<UINT8>(key[i])) * 0x100000001B3ULL;
+  }
+  return hash;
+}
+
+// The slot that holds the key, or the free slot where it would go.
+static UINT32 *KeySlot(const OptionKeyIndex *index, const char *key, UINT64 keyLength) {
+  for (UINT64 i = KeyHash(key, keyLength);; i++) {
+    UINT32 *slot = &index->slots[i & index->mask];
+    if (*slot == 0 || HasKey(index->base + *slot - 1, key, keyLength)) {
+      return slot;
+    }
+  }
+}
+
+static void IndexKey(OptionKeyIndex *index, const char *word, UINT64 keyLength) {
+  if (keyLength != 0) {
+    UINT32 *slot = KeySlot(index, word, keyLength);
+    if (*slot == 0) {
+      *slot = static_cast<UINT32>(word - index->base) + 1;
+    }
+  }
+}
+
+void OptionKeyIndexInit(OptionKeyIndex *index, char *base, UINT64 bytes, UINT64 words) {
+  index->base = base;
+  index->slots = nullptr;
+  index->mask = 0;
+  if (bytes >= 0xFFFFFFFF || words > bytes) {
+    return;
+  }
+  UINT64 slots = 16;
+  while (slots < 2 * words) {
+    slots *= 2;
+  }
+  index->slots = static_cast<UINT32 *>(TrackedAllocatePool(slots * sizeof(UINT32)));
+  if (index->slots == nullptr) {
+    return;
+  }
+  bzero(index->slots, slots * sizeof(UINT32));
+  index->mask = slots - 1;
+  for (const char *text = base; *SkipBlanks(text) != '\0';) {
+    const char *word = nullptr;
+    UINT64 keyLength = 0;
+    UINT64 wordLength = 0;
+    text = NextOption(text, &word, &keyLength, &wordLength);
+    IndexKey(index, word, keyLength);
+  }
+}
+
+void OptionKeyIndexFree(OptionKeyIndex *index) {
+  if (index->slots != nullptr) {
+    TrackedFree(index->slots);
+    index->slots = nullptr;
+  }
+}
+
+char *AppendIndexedOption(OptionKeyIndex *index, char *end, const char *word, UINT64 keyLength,
+                          UINT64 wordLength) {
+  if (index->slots == nullptr) {
+    return AppendOption(index->base, end, word, keyLength, wordLength);
+  }
+  if (keyLength != 0 && *KeySlot(index, word, keyLength) != 0) {
+    return end;
+  }
+  char *appended = AppendWord(index->base, end, word, wordLength);
+  IndexKey(index, appended - wordLength, keyLength);
+  return appended;
+}
+
 char *AppendOption(char *base, char *end, const char *word, UINT64 keyLength, UINT64 wordLength) {
   if (keyLength != 0) {
     const char *p = base;
@@ -148,12 +247,7 @@ char *AppendOption(char *base, char *end, const char *word, UINT64 keyLength, UI
       }
     }
   }
-  if (base < end) {
-    *end++ = ' ';
-  }
-  memcpy(end, word, wordLength);
-  end[wordLength] = '\0';
-  return end + wordLength;
+  return AppendWord(base, end, word, wordLength);
 }
 
 }  // namespace nimb

@@ -13,6 +13,7 @@ namespace nimb {
 
 PlistTag *gPlistFreeTags;
 PlistSymbol *gPlistSymbols;
+PlistSymbolIndex gPlistSymbolIndex;
 
 namespace {
 
@@ -30,18 +31,92 @@ constexpr UINT64 kPlistMaxDepth = 256;
 UINT64 ParseTag(char *text, PlistTag **tag, UINT64 depth);
 UINT64 ParseList(char *text, PlistTag **tag, UINT64 type, BOOLEAN empty, UINT64 depth);
 
-// Drops one holder of an interned string; the last one frees the symbol.
-void ReleaseSymbol(const char *text) {
-  PlistSymbol **link = &gPlistSymbols;
-  for (PlistSymbol *symbol = *link; symbol != nullptr; link = &symbol->next, symbol = *link) {
-    if (strcmp(symbol->text, text) == 0) {
-      if (--symbol->refCount == 0) {
-        *link = symbol->next;
-        TrackedFree(symbol);
-      }
-      return;
+// The symbols' index. The bucket count is a power of two; the index grows
+// fourfold when the symbols outnumber the buckets twice.
+constexpr UINT64 kPlistFirstBuckets = 64;
+
+UINT64 HashText(const char *text) {
+  UINT64 hash = 0xCBF29CE484222325ULL;
+  for (const char *p = text; *p != '\0'; p++) {
+    hash = (hash ^ static_cast<UINT8>(*p)) * 0x100000001B3ULL;
+  }
+  return hash;
+}
+
+// The index, or null when there is none. An index whose list was set aside
+// from outside (all tracked memory given back at once) went with it.
+PlistSymbolIndex *Index() {
+  if (gPlistSymbolIndex.buckets != nullptr && gPlistSymbolIndex.list != gPlistSymbols) {
+    gPlistSymbolIndex = {};
+  }
+  return gPlistSymbolIndex.buckets != nullptr ? &gPlistSymbolIndex : nullptr;
+}
+
+// Builds the index anew over every symbol, with at least `buckets` buckets;
+// without memory for it, the old index (or none) stays.
+void Reindex(UINT64 buckets) {
+  UINT64 count = 0;
+  for (const PlistSymbol *symbol = gPlistSymbols; symbol != nullptr; symbol = symbol->next) {
+    count++;
+  }
+  while (buckets < count) {
+    buckets *= 2;
+  }
+  PlistSymbol **heads = static_cast<PlistSymbol **>(TrackedAllocatePool(buckets * sizeof(PlistSymbol *)));
+  if (heads == nullptr) {
+    return;
+  }
+  bzero(heads, buckets * sizeof(PlistSymbol *));
+  for (PlistSymbol *symbol = gPlistSymbols; symbol != nullptr; symbol = symbol->next) {
+    PlistSymbol **head = &heads[symbol->hash & (buckets - 1)];
+    symbol->chain = *head;
+    *head = symbol;
+  }
+  if (Index() != nullptr) {
+    TrackedFree(gPlistSymbolIndex.buckets);
+  }
+  gPlistSymbolIndex = {heads, buckets - 1, count, gPlistSymbols};
+}
+
+PlistSymbol *FindSymbol(const char *text, UINT64 hash, const PlistSymbolIndex *index) {
+  PlistSymbol *symbol = index != nullptr ? index->buckets[hash & index->mask] : gPlistSymbols;
+  for (; symbol != nullptr; symbol = index != nullptr ? symbol->chain : symbol->next) {
+    if (symbol->hash == hash && strcmp(symbol->text, text) == 0) {
+      return symbol;
     }
   }
+  return nullptr;
+}
+
+// Drops one holder of an interned string; the last one frees the symbol.
+void ReleaseSymbol(const char *text) {
+  PlistSymbolIndex *index = Index();
+  PlistSymbol *symbol = FindSymbol(text, HashText(text), index);
+  if (symbol == nullptr || --symbol->refCount != 0) {
+    return;
+  }
+  if (symbol->previous != nullptr) {
+    symbol->previous->next = symbol->next;
+  } else {
+    gPlistSymbols = symbol->next;
+  }
+  if (symbol->next != nullptr) {
+    symbol->next->previous = symbol->previous;
+  }
+  if (index != nullptr) {
+    PlistSymbol **link = &index->buckets[symbol->hash & index->mask];
+    while (*link != symbol) {
+      link = &(*link)->chain;
+    }
+    *link = symbol->chain;
+    index->count--;
+    index->list = gPlistSymbols;
+    if (gPlistSymbols == nullptr) {
+      TrackedFree(index->buckets);
+      gPlistSymbolIndex = {};
+    }
+  }
+  TrackedFree(symbol);
 }
 
 // A tag of `type` with no fields, or null when no record can be had.
@@ -289,21 +364,39 @@ void PlistFreeTag(PlistTag *tag) {
 }
 
 char *PlistInternSymbol(const char *text) {
-  for (PlistSymbol *symbol = gPlistSymbols; symbol != nullptr; symbol = symbol->next) {
-    if (strcmp(symbol->text, text) == 0) {
-      symbol->refCount++;
-      return symbol->text;
-    }
+  PlistSymbolIndex *index = Index();
+  const UINT64 hash = HashText(text);
+  PlistSymbol *symbol = FindSymbol(text, hash, index);
+  if (symbol != nullptr) {
+    symbol->refCount++;
+    return symbol->text;
   }
   UINTN size = strlen(text) + 1;
-  PlistSymbol *symbol = static_cast<PlistSymbol *>(TrackedAllocatePool(offsetof(PlistSymbol, text) + size));
+  symbol = static_cast<PlistSymbol *>(TrackedAllocatePool(offsetof(PlistSymbol, text) + size));
   if (symbol == nullptr) {
     Fatal("NULL symbol!");
   }
   memcpy(symbol->text, text, size);
   symbol->refCount = 1;
+  symbol->hash = hash;
+  symbol->previous = nullptr;
   symbol->next = gPlistSymbols;
+  if (symbol->next != nullptr) {
+    symbol->next->previous = symbol;
+  }
   gPlistSymbols = symbol;
+  if (index == nullptr) {
+    Reindex(kPlistFirstBuckets);
+  } else {
+    PlistSymbol **head = &index->buckets[hash & index->mask];
+    symbol->chain = *head;
+    *head = symbol;
+    index->count++;
+    index->list = gPlistSymbols;
+    if (index->count > 2 * (index->mask + 1)) {
+      Reindex(4 * (index->mask + 1));
+    }
+  }
   return symbol->text;
 }
 

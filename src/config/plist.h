@@ -28,10 +28,16 @@ struct PlistTag {
 };
 static_assert(sizeof(PlistTag) == 32, "four 64-bit fields");
 
-// One interned string; its text follows the two fields.
+// One interned string; its text follows the fields. `next` links the list
+// of all symbols, newest first; `previous` and `chain` (the next symbol of
+// the same hash bucket) serve the index, so that finding and releasing a
+// symbol take the same time however many there are.
 struct PlistSymbol {
   UINT64 refCount;
   PlistSymbol *next;
+  PlistSymbol *previous;
+  PlistSymbol *chain;
+  UINT64 hash;
   char text[1];
 };
 
@@ -40,6 +46,17 @@ constexpr UINT64 kPlistFailure = 0xFFFFFFFFFFFFFFFFULL;
 
 extern PlistTag *gPlistFreeTags;
 extern PlistSymbol *gPlistSymbols;
+
+// The symbols' hash index: a tracked pool array of bucket heads, a power of
+// two of them, kept while any symbol lives and grown as they multiply.
+// Without it (no memory), the list is searched.
+struct PlistSymbolIndex {
+  PlistSymbol **buckets;
+  UINT64 mask;        // bucket count - 1
+  UINT64 count;       // symbols held
+  PlistSymbol *list;  // gPlistSymbols when the index was last kept in step
+};
+extern PlistSymbolIndex gPlistSymbolIndex;
 
 // All routines that take a text cut it in place: it must be writable and end
 // with a zero byte. Offsets are counted from the text they are given.

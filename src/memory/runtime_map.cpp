@@ -146,6 +146,28 @@ NIMB_MAP_WALK void FollowRegion(const EFI_MEMORY_DESCRIPTOR *region) {
   }
 }
 
+// Whether [start, end) lies wholly in conventional memory of the map.
+bool IsConventional(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
+                    UINT64 descriptorSize, UINT64 start, UINT64 end) {
+  // From `start`, step from one conventional descriptor that holds the
+  // address to that descriptor's end.
+  UINT64 at = start;
+  while (at < end) {
+    UINT64 reached = at;
+    for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
+      if (d->Type == EfiConventionalMemory && InRange(at, d->PhysicalStart, ByteSize(d))) {
+        reached = d->PhysicalStart + ByteSize(d);
+        break;
+      }
+    }
+    if (reached == at) {
+      return false;
+    }
+    at = reached;
+  }
+  return true;
+}
+
 }  // namespace
 
 UINT64 LShiftU64(UINT64 value, UINTN count) {
@@ -160,35 +182,26 @@ NIMB_MAP_WALK BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart,
       spareBytes > kAddressLimit) {
     return FALSE;
   }
-  UINT64 areaEnd = areaStart + spareBytes;
+  // The addresses as the move gives them out. Only the regions that are
+  // copied need free memory at their new place: memory-mapped I/O only takes
+  // up addresses, and nothing is written there.
+  UINT64 next = areaStart;
   for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
-    if (GetsRuntimeAddress(d)) {
-      areaEnd += ByteSize(d);
-      if (areaEnd > kAddressLimit || ByteSize(d) > kAddressLimit) {
-        return FALSE;
-      }
+    if (!GetsRuntimeAddress(d)) {
+      continue;
     }
-  }
-  if (areaEnd > kAddressLimit) {
-    return FALSE;
-  }
-  // From the area's start, step from one conventional descriptor that holds
-  // the address to the end of that descriptor.
-  UINT64 at = areaStart;
-  while (at < areaEnd) {
-    UINT64 reached = at;
-    for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
-      if (d->Type == EfiConventionalMemory && InRange(at, d->PhysicalStart, ByteSize(d))) {
-        reached = d->PhysicalStart + ByteSize(d);
-        break;
-      }
-    }
-    if (reached == at) {
+    const UINT64 size = ByteSize(d);
+    if (size > kAddressLimit - next) {
       return FALSE;
     }
-    at = reached;
+    if (IsRuntimeRegion(d) && !IsConventional(mapStart, mapEnd, descriptorSize, next, next + size)) {
+      return FALSE;
+    }
+    next += size;
   }
-  return TRUE;
+  // The spare pages behind the area are only counted in the kernel region:
+  // nothing is written there, but the kernel reaches them in 32 bits.
+  return spareBytes <= kAddressLimit - next;
 }
 
 NIMB_MAP_WALK EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRIPTOR *mapEnd,

@@ -18,11 +18,11 @@ namespace nimb {
 // more.
 UINT64 LShiftU64(UINT64 value, UINTN count);
 
-// True when the area that MapRuntimeServices will fill from `areaStart` on
-// (the bytes of every runtime descriptor of the map, reserved memory apart,
-// then `spareBytes`) lies wholly in conventional memory of the map and below
-// 4 GiB, so that the move overwrites nothing that is in use and the kernel
-// can reach it with 32-bit addresses.
+// True when the places that MapRuntimeServices will copy runtime regions to,
+// from `areaStart` on, lie wholly in conventional memory of the map, so that
+// the move overwrites nothing that is in use, and when the whole area with
+// `spareBytes` behind it stays below 4 GiB, where the kernel reaches it with
+// 32-bit addresses. Memory-mapped I/O takes up addresses only.
 BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
                           UINT64 descriptorSize, UINT64 areaStart, UINT64 spareBytes);
 

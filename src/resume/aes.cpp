@@ -60,48 +60,88 @@ inline UINT32 ThroughTable(const UINT32 (*table)[256], UINT32 word) {
   "movl %[n1], %[s1]\n\t"                           \
   "movl %[n2], %[s2]\n\t"                           \
   "movl %[n3], %[s3]\n\t"
-#define AES_ROUND_OPERANDS                                                                  \
-  : [s0] "+a"(s0), [s1] "+b"(s1), [s2] "+c"(s2), [s3] "+d"(s3),                             \
-    [n0] "=&r"(n0), [n1] "=&r"(n1), [n2] "=&r"(n2), [n3] "=&r"(n3)                          \
-  : [k] "r"(schedule), [t] "r"(kAesInverseRoundTable), [l] "r"(kAesInverseLastRoundTable)   \
-  : "rsi", "rdi", "cc", "memory"
+// One round of the state (x0, x1, x2, x3).
+#define AES_ONE_ROUND(round, table, x0, x1, x2, x3)                                       \
+  __asm__(AES_ROUND(round, table)                                                         \
+          : [s0] "+a"(x0), [s1] "+b"(x1), [s2] "+c"(x2), [s3] "+d"(x3),                   \
+            [n0] "=&r"(n0), [n1] "=&r"(n1), [n2] "=&r"(n2), [n3] "=&r"(n3)                \
+          : [k] "r"(schedule), [t] "r"(kAesInverseRoundTable), [l] "r"(kAesInverseLastRoundTable) \
+          : "rsi", "rdi", "cc", "memory")
 // clang-format on
 
-// Block `i` of `input` through the tables into block `i` of `output`. The
-// ten rounds of a 128-bit key are unrolled; a 192-bit key has two more in
-// front, a 256-bit key four.
-__attribute__((always_inline)) inline void DecryptBlock(const UINT8 *input, const UINT8 *iv, UINTN i,
-                                                        UINT8 *output, const UINT32 *schedule,
-                                                        UINT32 rounds) {
+// Block `i` of `input` through the tables into block `i` of `output`, and
+// with `kPair` block i + 1 beside it: the two blocks' rounds alternate, so
+// that one runs while the other waits for its table loads. The four
+// registers of the round are the first block's; the compiler moves the
+// second block's state in and out around each of its rounds.
+//
+// The ten rounds of a 128-bit key are unrolled; a 192-bit key has two more
+// in front, a 256-bit key four.
+template <bool kPair>
+__attribute__((always_inline)) inline void DecryptBlocks(const UINT8 *input, const UINT8 *iv, UINTN i,
+                                                         UINT8 *output, const UINT32 *schedule,
+                                                         UINT32 rounds) {
   const UINT8 *block = input + 16 * i;
-  const UINT32 *last = schedule + 4 * rounds;
-  UINT32 s0 = LoadWord(block) ^ last[0], s1 = LoadWord(block + 4) ^ last[1],
-         s2 = LoadWord(block + 8) ^ last[2], s3 = LoadWord(block + 12) ^ last[3];
+  const UINT32 *k = schedule + 4 * rounds;
+  UINT32 a0 = LoadWord(block) ^ k[0], a1 = LoadWord(block + 4) ^ k[1], a2 = LoadWord(block + 8) ^ k[2],
+         a3 = LoadWord(block + 12) ^ k[3];
+  UINT32 b0 = 0, b1 = 0, b2 = 0, b3 = 0;
+  if (kPair) {
+    b0 = LoadWord(block + 16) ^ k[0];
+    b1 = LoadWord(block + 20) ^ k[1];
+    b2 = LoadWord(block + 24) ^ k[2];
+    b3 = LoadWord(block + 28) ^ k[3];
+  }
   UINT32 n0, n1, n2, n3;
-  // clang-format off
+#define AES_STEP(round, table)                   \
+  AES_ONE_ROUND(round, table, a0, a1, a2, a3);   \
+  if (kPair) {                                   \
+    AES_ONE_ROUND(round, table, b0, b1, b2, b3); \
+  }
   if (rounds > 10) {
     if (rounds > 12) {
-      __asm__(AES_ROUND(13, "t") AES_ROUND(12, "t") AES_ROUND_OPERANDS);
+      AES_STEP(13, "t");
+      AES_STEP(12, "t");
     }
-    __asm__(AES_ROUND(11, "t") AES_ROUND(10, "t") AES_ROUND_OPERANDS);
+    AES_STEP(11, "t");
+    AES_STEP(10, "t");
   }
-  __asm__(AES_ROUND(9, "t") AES_ROUND(8, "t") AES_ROUND(7, "t") AES_ROUND(6, "t") AES_ROUND(5, "t")
-          AES_ROUND(4, "t") AES_ROUND(3, "t") AES_ROUND(2, "t") AES_ROUND(1, "t")
-          AES_ROUND(0, "l") AES_ROUND_OPERANDS);
-  // clang-format on
-  // Block i - 1 of the input is still intact: it is decrypted next.
-  const UINT8 *chain = i != 0 ? block - 16 : iv;
+  AES_STEP(9, "t");
+  AES_STEP(8, "t");
+  AES_STEP(7, "t");
+  AES_STEP(6, "t");
+  AES_STEP(5, "t");
+  AES_STEP(4, "t");
+  AES_STEP(3, "t");
+  AES_STEP(2, "t");
+  AES_STEP(1, "t");
+  AES_STEP(0, "l");
+#undef AES_STEP
+  // Block i + 1 chains to block i, which is stored over only after it; block
+  // i chains to block i - 1 of the input, still intact: it comes next.
   UnalignedWord *out = reinterpret_cast<UnalignedWord *>(output + 16 * i);
-  out[0] = s0 ^ LoadWord(chain);
-  out[1] = s1 ^ LoadWord(chain + 4);
-  out[2] = s2 ^ LoadWord(chain + 8);
-  out[3] = s3 ^ LoadWord(chain + 12);
+  if (kPair) {
+    out[4] = b0 ^ LoadWord(block);
+    out[5] = b1 ^ LoadWord(block + 4);
+    out[6] = b2 ^ LoadWord(block + 8);
+    out[7] = b3 ^ LoadWord(block + 12);
+  }
+  const UINT8 *chain = i != 0 ? block - 16 : iv;
+  out[0] = a0 ^ LoadWord(chain);
+  out[1] = a1 ^ LoadWord(chain + 4);
+  out[2] = a2 ^ LoadWord(chain + 8);
+  out[3] = a3 ^ LoadWord(chain + 12);
 }
 
+// Two blocks at a time from the end; with an odd count, block 0 alone last.
 void DecryptWithTables(const UINT8 *input, const UINT8 *iv, UINT32 blockCount, UINT8 *output,
                        const AesDecryptContext *context) {
-  for (UINTN i = blockCount; i-- > 0;) {
-    DecryptBlock(input, iv, i, output, context->schedule, context->rounds);
+  UINTN i = blockCount;
+  for (; i >= 2; i -= 2) {
+    DecryptBlocks<true>(input, iv, i - 2, output, context->schedule, context->rounds);
+  }
+  if (i == 1) {
+    DecryptBlocks<false>(input, iv, 0, output, context->schedule, context->rounds);
   }
 }
 

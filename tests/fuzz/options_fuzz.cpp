@@ -15,6 +15,8 @@
 #include <vector>
 
 #include "config/options.h"
+#include "fuzz_firmware.h"
+#include "memory/tracking.h"
 #include "support/devicepath.h"
 
 namespace {
@@ -77,6 +79,24 @@ void AppendWords(const std::vector<Word> &words) {
     end = nimb::AppendOption(base, end, w.word, w.keyLength, w.wordLength);
     Check(end >= base && end < base + size && *end == '\0');
   }
+  // The indexed appends give the same string, from a first word on as the
+  // merge of the boot options starts.
+  std::unique_ptr<char[]> indexedBuffer(new char[size]);
+  char *indexedBase = indexedBuffer.get();
+  indexedBase[0] = '\0';
+  char *indexedEnd = indexedBase;
+  if (!words.empty()) {
+    memcpy(indexedBase, words[0].word, words[0].wordLength);
+    indexedBase[words[0].wordLength] = '\0';
+    indexedEnd += words[0].wordLength;
+  }
+  nimb::OptionKeyIndex index;
+  nimb::OptionKeyIndexInit(&index, indexedBase, size, words.size() + 1);
+  for (size_t i = 1; i < words.size(); i++)
+    indexedEnd =
+        nimb::AppendIndexedOption(&index, indexedEnd, words[i].word, words[i].keyLength, words[i].wordLength);
+  nimb::OptionKeyIndexFree(&index);
+  Check(strcmp(indexedBase, base) == 0 && indexedEnd == indexedBase + (end - base));
   // No word of the result has the key of a word behind it.
   std::vector<Word> kept = SplitWords(base, static_cast<size_t>(end - base));
   for (size_t j = 0; j < kept.size(); j++) {
@@ -114,8 +134,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   memcpy(text.get(), data, length);
   text[length] = '\0';
 
+  static hostfw::Firmware *fw = new hostfw::Firmware;
+  nimbfuzz::AttachLoader(*fw);
   LookUpKeys(text.get(), length);
   AppendWords(SplitWords(text.get(), length));
+  nimb::TrackedFreeAll();
+  Check(fw->LivePoolBlocks() == 0);
   WalkDevicePath(data, size);
   return 0;
 }

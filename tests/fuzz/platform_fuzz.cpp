@@ -90,13 +90,13 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     const uint64_t dsdtAt = Place(fw, dsdt);
     if (Get32(facp, 40) != 0)
       Put32(facp, 40, dsdtAt);
-    if (Get32(facp, 140) != 0)
+    if (Get32(facp, 140) != 0 || Get32(facp, 144) != 0)
       Put64(facp, 140, dsdtAt);
     const uint64_t facpAt = Place(fw, facp);
     const uint8_t revision = input.ConsumeIntegral<uint8_t>() % 4;
     const size_t entrySize = revision == 0 ? 4 : 8;
     for (size_t at = 36; at + entrySize <= Get32(root, 4); at += entrySize) {
-      const uint64_t entry = Get32(root, at);
+      const uint64_t entry = Get32(root, at) | (entrySize == 8 ? Get32(root, at + 4) : 0);
       const uint64_t target = entry == 0 ? 0 : (entry & 1) ? facpAt : dsdtAt;
       entrySize == 4 ? Put32(root, at, target) : Put64(root, at, target);
     }

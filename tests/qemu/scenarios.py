@@ -198,6 +198,29 @@ def standard_extensions():
     }
 
 
+def standard_drivers():
+    """The driver blocks that the standard extensions give, in the order of
+    discovery: each kept bundle, its nested ones right behind it; the
+    "Safe Boot" bundle is left out, in safe mode too."""
+    files = standard_extensions()
+    root = EXTENSIONS_DIR
+    return {
+        "com.quill.driver.Console": DriverExpect(files[f"{root}/Console.drvb/Info.plist"],
+                                                 files[f"{root}/Console.drvb/Console"]),
+        "com.quill.driver.Storage": DriverExpect(files[f"{root}/Storage.drvb/Contents/Info.plist"],
+                                                 GuestFile("nimb_kernel")),
+        "com.quill.driver.Partition": DriverExpect(
+            files[f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist"]),
+    }  # fmt: skip
+
+
+# The default driver package of a disk boot, and a fat one to put there: the
+# kernel must get its x86 slice, which is the file nimb_kernel.
+DRIVER_PACKAGE = "System/Library/Extensions.drvpk"
+PACKAGE_FILE = GuestFile("driver.fat")
+PACKAGE_SLICE = GuestFile("nimb_kernel")
+
+
 @dataclasses.dataclass(frozen=True)
 class KernelCache:
     """A kernel cache that the harness has kcache write on the volume, after
@@ -212,6 +235,9 @@ class KernelCache:
     shift: float = 0
     # Breaks the header's checksum, so that the cache decompresses but fails.
     break_checksum: bool = False
+    # Whether the loader is to look for it (and print its name): not in
+    # safe mode, nor with a package that the user named.
+    looked_for: bool = True
 
 
 @dataclasses.dataclass(frozen=True)
@@ -473,6 +499,98 @@ _TABLE = [
         config={"console": "graphics", "hold": 2},
         expect=(KERNEL_ERROR, "platform: loader returned"),
         screen=ScreenExpect(when="platform: memory", picture="failure"),
+    ),
+]
+
+# Kernel caches and drivers. Times are UTC; the platform serves them to the
+# loader exactly, nanoseconds included.
+DRIVERS_STAGED = KernelExpect(drivers_from="loader", drivers=standard_drivers())
+_TABLE += [
+    # A plain boot stages the bundles: libraries, a nested bundle, a fat
+    # code file, and a "Safe Boot" bundle left out.
+    Scenario(
+        "drivers_bundles",
+        files=kernel_file(),
+        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # A cache exactly one second after the kernel, across a year boundary,
+    # with the bundles prelinked: no drivers are loaded.
+    Scenario(
+        "cache_hit",
+        files=kernel_file(),
+        times={"nimb_kernel": "2006-12-31 23:59:59.500000000", EXTENSIONS_DIR: "2006-12-31 23:59:58.000000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}")),
+        expect=(KERNEL_START,),
+        forbid=("Loading drivers...", LOADING_KERNEL),
+        exit="KernelPass",
+        kernel=KernelExpect(drivers_from="cache", drivers=standard_drivers()),
+    ),
+    # The same cache two seconds off, here the extensions being the newer:
+    # the plain kernel and the bundles.
+    Scenario(
+        "cache_two_seconds_off",
+        files=kernel_file(),
+        times={"nimb_kernel": "2009-03-01 10:00:00.000000000", EXTENSIONS_DIR: "2009-03-01 10:00:05.700000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), shift=2),
+        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # A cache whose checksum is wrong falls back to the plain kernel.
+    Scenario(
+        "cache_bad_checksum",
+        files=kernel_file(),
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), break_checksum=True),
+        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # The driver package exactly one second after the extensions directory
+    # is used; its x86 slice reaches the kernel.
+    Scenario(
+        "package_used",
+        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"},
+        expect=("Loading drivers...", "Loading System\\Library\\Extensions.drvpk...", KERNEL_START),
+        exit="KernelPass",
+        kernel=KernelExpect(drivers_from="loader", drivers={}, package=PACKAGE_SLICE),
+    ),
+    # Two seconds after: stale, the bundles instead.
+    Scenario(
+        "package_stale",
+        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:01.250000000"},
+        expect=("Loading drivers...", KERNEL_START),
+        forbid=("Extensions.drvpk...",),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # A package that the configuration names is used whatever its time, and
+    # a valid cache is then not looked at.
+    Scenario(
+        "package_named",
+        files={**kernel_file(), "Custom/drivers.pk": PACKAGE_FILE, BOOT_PLIST: plist({"Drvpk Cache": "Custom/drivers.pk"})},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", "Custom/drivers.pk": "2001-01-01 00:00:00.000000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), looked_for=False),
+        expect=("Loading Custom\\drivers.pk...", KERNEL_START),
+        forbid=("Looking for kernel cache file",),
+        exit="KernelPass",
+        kernel=KernelExpect(drivers_from="loader", drivers={}, package=PACKAGE_SLICE),
+    ),
+    # Safe mode: neither the valid cache nor the valid package; the bundles,
+    # without the "Safe Boot" one.
+    Scenario(
+        "drivers_safe_mode",
+        config={"keys": "shift"},
+        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), looked_for=False),
+        expect=("Using Safe Mode", LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        forbid=("Extensions.drvpk...", "Looking for kernel cache file"),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
     ),
 ]
 

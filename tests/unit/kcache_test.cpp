@@ -1,20 +1,23 @@
-// The kernel cache writer: the key and the name it gives, the header and
-// the stream behind it read back with the loader's decoder and checksum, the
-// file's time, and prelinked drivers loaded back with the loader's LoadKernel.
+// The kernel cache writer: the key and the name it gives, the file's time,
+// prelinked drivers against the loader's own staging and loaded back with
+// its LoadKernel, and whole caches booted by the loader's LoadKernelCache.
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <string>
 #include <vector>
 
+#include "devicetree/devicetree.h"
 #include "kcache/cache_writer.h"
 #include "kcache/prelink.h"
 #include "kernel_images.h"
 #include "load/bootfile.h"
+#include "load/bundles.h"
 #include "load/kernel.h"
-#include "load/lzss.h"
+#include "load/kernel_cache.h"
 #include "loader_fixture.h"
-#include "support/checksum.h"
+#include "support/devicepath.h"
 
 namespace {
 
@@ -31,7 +34,10 @@ Bytes DevicePath(size_t size) {
   return path;
 }
 
-TEST(KcacheTest, KeyAsTheLoaderFillsIt) {
+// The key comes from the loader's own routine (its cuts are tested with
+// it); what the writer adds is the kernel's name in UTF-8, taken through
+// UCS-2 as the loader holds it.
+TEST(KcacheTest, KeyAndName) {
   struct Row {
     const char *name;
     std::string model;
@@ -42,13 +48,8 @@ TEST(KcacheTest, KeyAsTheLoaderFillsIt) {
   const std::string nul(1, '\0');
   const Row rows[] = {
       {"plain", "Box9,1", 24, "nimb_kernel", "nimb_kernel" + nul},
-      {"64-byte model", std::string(64, 'M'), 24, "k", "k" + nul},
-      {"model cut at 64", std::string(70, 'M'), 24, "k", "k" + nul},
-      {"250-byte path", "Box", 250, "nimb_kernel", "nimb_" + nul},
-      {"255-byte path", "Box", 255, "nimb_kernel", nul},
-      {"256-byte path", "Box", 256, "nimb_kernel", ""},
-      {"path cut at 256", "Box", 300, "nimb_kernel", ""},
-      {"two-byte characters", "Box", 24, "k\xC3\xA9rnel", "k\xC3\xA9rnel" + nul},
+      {"two- and three-byte characters", "Box", 24, "k\xC3\xA9rn\xE2\x82\xACl",
+       "k\xC3\xA9rn\xE2\x82\xACl" + nul},
       {"a character that does not fit", "Box", 252, "\xC3\xA9\xC3\xA9", "\xC3\xA9" + nul},
   };
   for (const Row &row : rows) {
@@ -72,6 +73,10 @@ TEST(KcacheTest, KeyAsTheLoaderFillsIt) {
               std::string("System/Library/Caches/com.quill.kernelcaches/kernelcache.") + suffix)
         << row.name;
   }
+  // The loader's globals are as they were.
+  EXPECT_EQ(nimb::gKernelName, nullptr);
+  EXPECT_EQ(nimb::gBootDevicePath, nullptr);
+  EXPECT_EQ(nimb::gModelName[0], '\0');
 }
 
 TEST(KcacheTest, DevicePathsThatAreNotOne) {
@@ -81,41 +86,13 @@ TEST(KcacheTest, DevicePathsThatAreNotOne) {
   } rows[] = {
       {DevicePath(24), true},
       {{0x7F, 0xFF, 0x04, 0x00}, true},
-      {{0xFF, 0xFF, 0x04, 0x00}, true},
       {{0x7F, 0x01, 0x04, 0x00}, false},  // the end of an instance only
       {{0x04, 0x03, 0x02, 0x00, 0x7F, 0xFF, 0x04, 0x00}, false},
-      {{0x04, 0x03, 0x40, 0x00, 0x7F, 0xFF, 0x04, 0x00}, false},
       {{0x7F, 0xFF, 0x04, 0x00, 0x00}, false},
       {{}, false},
   };
   for (const auto &row : rows)
     EXPECT_EQ(kcache::CheckDevicePath(row.path).empty(), row.good) << testing::PrintToString(row.path);
-}
-
-uint32_t GetBe32(const Bytes &bytes, size_t at) {
-  return static_cast<uint32_t>(bytes[at]) << 24 | bytes[at + 1] << 16 | bytes[at + 2] << 8 | bytes[at + 3];
-}
-
-TEST(KcacheTest, HeaderAndStreamReadBackWithTheLoadersCode) {
-  Bytes kernel = nimbtest::Pattern(70000);
-  kernel.insert(kernel.end(), 9000, 0);
-  const kcache::CacheKey key = kcache::MakeCacheKey("Box9,1", DevicePath(30), "nimb_kernel");
-  for (bool match : {true, false}) {
-    const Bytes file = kcache::WriteCache(kernel, key, match);
-    ASSERT_GT(file.size(), 384u);
-    EXPECT_EQ(std::string(file.begin(), file.begin() + 8), "complzss");
-    EXPECT_EQ(GetBe32(file, 12), kernel.size());
-    EXPECT_EQ(GetBe32(file, 16), file.size() - 384);
-    const Bytes fields(file.begin() + 64, file.begin() + 384);
-    EXPECT_EQ(fields, match ? Bytes(key.begin(), key.end()) : Bytes(320, 0));
-
-    Bytes out(kernel.size());
-    EXPECT_EQ(nimb::DecompressLzss(out.data(), out.size(), file.data() + 384, GetBe32(file, 16)),
-              kernel.size());
-    EXPECT_EQ(out, kernel);
-    const uint32_t sum = nimb::Adler32(out.data(), out.size());
-    EXPECT_EQ(std::memcmp(&file[8], &sum, 4), 0);
-  }
 }
 
 TEST(KcacheTest, TimeIsOneSecondAfterTheNewer) {
@@ -136,14 +113,31 @@ TEST(KcacheTest, TimeIsOneSecondAfterTheNewer) {
 
 // --- prelinked drivers ------------------------------------------------------------------
 
-class PrelinkTest : public nimbtest::LoaderTest {
- protected:
-  // Bytes of the host firmware's memory, at their physical address.
-  static Bytes Memory(uint64_t address, uint64_t size) {
-    const auto *at = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(address));
-    return Bytes(at, at + size);
+class PrelinkTest : public nimbtest::VolumeTest {};
+
+// Bytes of the host firmware's memory, at their physical address.
+Bytes Memory(uint64_t address, uint64_t size) {
+  const auto *at = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(address));
+  return Bytes(at, at + size);
+}
+
+// The drivers' blocks from `block` on, each on pages of its own, up to the
+// kernel region's top, as the loader stages them.
+void ExpectBlocks(uint64_t block, const std::vector<kcache::Driver> &drivers) {
+  for (const kcache::Driver &driver : drivers) {
+    const Bytes header = Memory(block, 16);
+    const uint32_t length = nimbtest::GetLe32(header, 4);
+    EXPECT_EQ(nimbtest::GetLe32(header, 0), block + 16) << driver.bundle;
+    EXPECT_EQ(nimbtest::GetLe32(header, 8), driver.code.empty() ? 0 : block + 16 + length) << driver.bundle;
+    EXPECT_EQ(nimbtest::GetLe32(header, 12), driver.code.size()) << driver.bundle;
+    Bytes text = driver.text;
+    text.push_back(0);
+    EXPECT_EQ(Memory(block + 16, length), text) << driver.bundle;
+    EXPECT_EQ(Memory(block + 16 + length, driver.code.size()), driver.code) << driver.bundle;
+    block = (block + 16 + length + driver.code.size() + 0xFFF) & ~uint64_t{0xFFF};
   }
-};
+  EXPECT_EQ(block, nimb::gKernelRegionTop);
+}
 
 std::string Plist(const std::string &entries) {
   return "<?xml version=\"1.0\"?>\n<plist version=\"1.0\">\n<dict>\n" + entries + "</dict>\n</plist>\n";
@@ -153,39 +147,52 @@ std::string Required(const std::string &value) {
   return "<key>VzBundleRequired</key><string>" + value + "</string>\n";
 }
 
-TEST_F(PrelinkTest, KeptBundlesLandBehindTheKernel) {
-  using nimbtest::Object;
-  const Bytes code = nimbtest::Pattern(5000, 3);
-  const Bytes fatCode =
-      nimbtest::Fat(true, {{18, 0x1000, 100}, {7, 0x2000, 5000}}, {{0x1000, Bytes(100, 1)}, {0x2000, code}});
-  nimbtest::TempDir extensions;
-  const std::string a = Plist(Required("Root") + "<key>VzBundleExecutable</key><string>A</string>\n");
-  extensions.File("A.drvb/Contents/Info.plist", a);
-  extensions.File("A.drvb/Contents/Tarnix/A", fatCode);
-  const std::string b = Plist(Required(""));
-  extensions.File("B.drvb/Info.plist", b);
-  extensions.File("C.drvb/Info.plist", Plist(Required("Safe Boot")));
-  const std::string d = Plist(Required("Network") + "<key>VzBundleExecutable</key><string>D</string>\n");
-  extensions.File("C.drvb/PlugIns/D.drvb/Info.plist", d);
-  extensions.File("C.drvb/PlugIns/D.drvb/D", "");
-  extensions.File("C.drvb/PlugIns/D.drvb/PlugIns/E.drvb/Info.plist", Plist(Required("Root")));
-  extensions.File("F.drvb/Info.plist", Plist("<key>VzBundleRequired</key><integer>1</integer>\n"));
-  extensions.File("G.drvb/Info.plist",
-                  Plist(Required("Root") + "<key>VzBundleExecutable</key><string>gone</string>\n"));
-  extensions.File("H.drvb2/Info.plist", Plist(Required("Root")));
-  extensions.File("x.drvb", Plist(Required("Root")));
+std::string Executable(const std::string &name) {
+  return "<key>VzBundleExecutable</key><string>" + name + "</string>\n";
+}
+
+// The bundles that the writer picks are those that the loader's own scan and
+// staging take from the same directory, in the same order, with the same
+// text and code; in the kernel they lie as the loader would stage them.
+TEST_F(PrelinkTest, TheLoadersBundlesLandBehindTheKernel) {
+  const std::string dir = "System/Library/Extensions/";
+  Put(dir + "A.drvb/Contents/Info.plist", Plist(Required("Root") + Executable("A")));
+  Put(dir + "A.drvb/Contents/Tarnix/A",
+      nimbtest::Fat(true, {{18, 0x1000, 100}, {7, 0x2000, 5000}},
+                    {{0x1000, Bytes(100, 1)}, {0x2000, nimbtest::Pattern(5000, 3)}}));
+  Put(dir + "B.drvb/Info.plist", Plist(Required("")));
+  Put(dir + "C.drvb/Info.plist", Plist(Required("Safe Boot")));
+  Put(dir + "C.drvb/PlugIns/D.drvb/Info.plist", Plist(Required("Network") + Executable("D")));
+  Put(dir + "C.drvb/PlugIns/D.drvb/D", "");
+  Put(dir + "C.drvb/PlugIns/D.drvb/PlugIns/E.drvb/Info.plist", Plist(Required("Root")));
+  Put(dir + "F.drvb/Info.plist", Plist("<key>VzBundleRequired</key><integer>1</integer>\n"));
+  Put(dir + "G.drvb/Info.plist", Plist(Required("Root") + Executable("gone")));
+  Put(dir + "H.drvb2/Info.plist", Plist(Required("Root")));
+  Put(dir + "I.drvb/Info.plist", Plist(Required("Root") + Executable("i")));
+  Put(dir + "I.drvb/i", nimbtest::Fat(false, {{7, 0x1000, 0x800}}, {{0x1000, nimbtest::Pattern(0x300, 2)}}));
+  Put(dir + "x.drvb", Plist(Required("Root")));
+  dir_->Directory(dir + "J.drvb");
 
   std::vector<kcache::Driver> drivers;
-  ASSERT_EQ(kcache::CollectDrivers(extensions.path(), &drivers), "");
-  // A with its code's x86 slice, B without code, D with an empty code file.
-  ASSERT_EQ(drivers.size(), 3u);
-  const std::string texts[] = {a, b, d};
-  const Bytes codes[] = {code, {}, {}};
+  ASSERT_EQ(kcache::CollectDrivers(dir_->path() + "/" + dir, &drivers), "");
+  EXPECT_EQ(drivers.size(), 4u);  // A, B, D and I
+
+  // The loader's blocks, from a region top of its own.
+  nimb::DeviceTreeInit();
+  nimb::gMemoryMapNode = nimb::DeviceTreeFindNode("/chosen/memory-map", 1);
+  nimb::gKernelRegionTop = 0x400000;
+  ASSERT_EQ(nimb::ScanDriverBundles(root_, u"System\\Library\\Extensions", 1), EFI_SUCCESS);
+  nimb::WalkDriverLibraries();
+  nimb::StageDrivers(root_);
+  ExpectBlocks(0x400000, drivers);
+  nimb::TrackedFreeAll();
+  nimb::gKernelRegionBase = 0xFFFFFFFF;
+  nimb::gKernelRegionTop = 0;
 
   // The kernel's data right behind its commands (the drivers' command moves
   // it back a page), or on a page of its own.
   for (bool roomy : {true, false}) {
-    Object object;
+    nimbtest::Object object;
     object.commands = {nimbtest::Segment(0x100000, 0x2345, 0x1000, 0x1000), nimbtest::Thread(0x100020)};
     object.data = nimbtest::Pattern(0x1000, 5);
     Bytes kernel = object.Build();
@@ -205,28 +212,86 @@ TEST_F(PrelinkTest, KeptBundlesLandBehindTheKernel) {
     ASSERT_EQ(nimb::LoadKernel(&file), EFI_SUCCESS) << roomy;
     EXPECT_EQ(nimb::gKernelEntry, 0x100020u);
     EXPECT_EQ(Memory(0x100000, 0x1000), object.data) << roomy;
-    const Bytes segment = Memory(base, nimb::gKernelRegionTop - base);
-    EXPECT_EQ(nimbtest::GetLe32(segment, 0), nimb::kPrelinkMagic);
-    EXPECT_EQ(nimbtest::GetLe32(segment, 4), 3u);
-    size_t block = 0x1000;
-    for (size_t i = 0; i < 3; i++) {
-      const uint32_t length = nimbtest::GetLe32(segment, block + 4);
-      EXPECT_EQ(nimbtest::GetLe32(segment, block), base + block + 16) << i;
-      EXPECT_EQ(length, texts[i].size() + 1) << i;
-      EXPECT_EQ(nimbtest::GetLe32(segment, block + 8), codes[i].empty() ? 0 : base + block + 16 + length)
-          << i;
-      EXPECT_EQ(nimbtest::GetLe32(segment, block + 12), codes[i].size()) << i;
-      EXPECT_EQ(std::string(segment.begin() + block + 16, segment.begin() + block + 16 + length),
-                texts[i] + '\0');
-      EXPECT_EQ(Bytes(segment.begin() + block + 16 + length,
-                      segment.begin() + block + 16 + length + codes[i].size()),
-                codes[i]);
-      block = (block + 16 + length + codes[i].size() + 0xFFF) & ~size_t{0xFFF};
-    }
-    EXPECT_EQ(base + block, nimb::gKernelRegionTop);
+    const Bytes head = Memory(base, 8);
+    EXPECT_EQ(nimbtest::GetLe32(head, 0), nimb::kPrelinkMagic);
+    EXPECT_EQ(nimbtest::GetLe32(head, 4), drivers.size());
+    ExpectBlocks(base + 0x1000, drivers);
     nimb::TrackedFreeAll();
     nimb::gKernelRegionBase = 0xFFFFFFFF;
     nimb::gKernelRegionTop = 0;
+  }
+}
+
+// --- through the loader ----------------------------------------------------------------
+
+class KcacheBootTest : public nimbtest::VolumeTest {};
+
+// Caches written by the writer into a volume, found, checked and loaded by
+// the loader's LoadKernelCache: compressed with and without the fields that
+// it compares, uncompressed, from a fat kernel, and with prelinked drivers.
+TEST_F(KcacheBootTest, TheLoaderTakesWhatTheWriterWrote) {
+  nimbtest::Object object;
+  object.commands = {nimbtest::Segment(0x100000, 0x3000, 0x1000, 0x2800), nimbtest::Thread(0x100040)};
+  object.data = nimbtest::Pattern(0x2800, 9);
+  object.data.insert(object.data.end() - 0x800, 0x800, 0);
+  object.data.resize(0x2800);
+  const Bytes kernel = object.Build();
+  const Bytes fat = nimbtest::Fat(true, {{18, 0x1000, 64}, {7, 0x2000, static_cast<uint32_t>(kernel.size())}},
+                                  {{0x1000, Bytes(64, 7)}, {0x2000, kernel}});
+  const std::string extensions = "System/Library/Extensions";
+  Put(extensions + "/A.drvb/Info.plist", Plist(Required("Root")));
+  strcpy(nimb::gModelName, "Box9,1");
+  nimb::gKernelName = u"nimb_kernel";
+  const auto *path = reinterpret_cast<const uint8_t *>(fw.DevicePathOf(device_));
+  const Bytes pathBytes(path, path + nimb::DevicePathSize(fw.DevicePathOf(device_)));
+  const kcache::CacheKey key = kcache::MakeCacheKey("Box9,1", pathBytes, "nimb_kernel");
+  std::string loaderName = kcache::CacheFileName(key);
+  std::replace(loaderName.begin(), loaderName.end(), '/', '\\');
+
+  const struct {
+    const char *name;
+    bool fatKernel, compressed, matchFields, drivers;
+  } rows[] = {
+      {"compressed", false, true, true, false},      {"no fields to compare", false, true, false, false},
+      {"uncompressed", false, false, true, false},   {"fat kernel", true, true, true, false},
+      {"prelinked drivers", true, true, true, true},
+  };
+  for (const auto &row : rows) {
+    SCOPED_TRACE(row.name);
+    Bytes content = row.fatKernel ? fat : kernel;
+    Put("nimb_kernel", content);
+    if (row.drivers) {
+      std::vector<kcache::Driver> drivers;
+      ASSERT_EQ(kcache::CollectDrivers(dir_->path() + "/" + extensions, &drivers), "");
+      ASSERT_EQ(kcache::AddPrelinkSegment(row.fatKernel ? fat : kernel, drivers, &content), "");
+    }
+    const Bytes file = row.compressed ? kcache::WriteCache(content, key, row.matchFields) : content;
+    if (row.compressed)  // the fields the loader compares, or zeros
+      EXPECT_EQ(Bytes(file.begin() + 64, file.begin() + 384),
+                row.matchFields ? Bytes(key.begin(), key.end()) : Bytes(320, 0));
+    Put(kcache::CacheFileName(key), file);
+    ASSERT_EQ(kcache::SetCacheTime(dir_->path() + "/" + kcache::CacheFileName(key),
+                                   dir_->path() + "/nimb_kernel", dir_->path() + "/" + extensions),
+              "");
+
+    const size_t mark = fw.ConOutText().size();
+    ASSERT_EQ(nimb::LoadKernelCache(nullptr, root_), EFI_SUCCESS) << fw.ConOutText().substr(mark);
+    // The file's name, then a dot for each chunk read.
+    EXPECT_EQ(
+        fw.ConOutText().substr(mark).rfind("Looking for kernel cache file '" + loaderName + "'\r\n.", 0), 0u);
+    EXPECT_EQ(nimb::gKernelEntry, 0x100040u);
+    EXPECT_EQ(Memory(0x100000, 0x2800), object.data);
+    // The drivers' segment on the page behind the kernel: its header page and
+    // one page for the one bundle.
+    EXPECT_EQ(nimb::gKernelRegionTop, row.drivers ? 0x105000u : 0x103000u);
+    if (row.drivers) {
+      EXPECT_EQ(nimbtest::GetLe32(Memory(0x103000, 8), 0), nimb::kPrelinkMagic);
+      EXPECT_EQ(nimbtest::GetLe32(Memory(0x103000, 8), 4), 1u);
+    }
+    nimb::TrackedFreeAll();
+    nimb::gKernelRegionBase = 0xFFFFFFFF;
+    nimb::gKernelRegionTop = 0;
+    nimb::gKernelEntry = 0;
   }
 }
 

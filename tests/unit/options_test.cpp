@@ -97,7 +97,10 @@ TEST(OptionsTest, NextOptionSplitsAtBlanksOnlyAndKeysEndAtTheFirstEquals) {
     EXPECT_EQ(Split(row.text), row.words) << row.text;
 }
 
-TEST(OptionsTest, AppendOptionDropsWordsWhoseKeyIsInTheTextAlready) {
+class OptionsAppendTest : public nimbtest::LoaderTest {};
+
+// The same rows with the plain search and with the key index.
+TEST_F(OptionsAppendTest, AppendOptionDropsWordsWhoseKeyIsInTheTextAlready) {
   struct Row {
     const char *base;
     std::vector<const char *> sources;  // each split into words with NextOption
@@ -120,18 +123,24 @@ TEST(OptionsTest, AppendOptionDropsWordsWhoseKeyIsInTheTextAlready) {
       {"-v foo=1", {"foo=2 bar=3 -v", "baz=4 bar=5"}, "-v foo=1 bar=3 baz=4"},
   };
   for (const Row &row : rows) {
-    SCOPED_TRACE(std::string("base \"") + row.base + "\"");
-    std::vector<char> buffer(256, '\x55');
-    std::strcpy(buffer.data(), row.base);
-    char *end = buffer.data() + strlen(row.base);
-    for (const char *source : row.sources) {
-      for (const auto &[word, key] : Split(source))
-        end = nimb::AppendOption(buffer.data(), end, word.c_str(), key.size(), word.size());
+    for (bool indexed : {false, true}) {
+      SCOPED_TRACE(std::string("base \"") + row.base + "\"" + (indexed ? ", indexed" : ""));
+      std::vector<char> buffer(256, '\x55');
+      std::strcpy(buffer.data(), row.base);
+      char *end = buffer.data() + strlen(row.base);
+      nimb::OptionKeyIndex index;
+      nimb::OptionKeyIndexInit(&index, buffer.data(), buffer.size(), indexed ? 16 : 0x7FFFFFFF);
+      ASSERT_EQ(index.slots != nullptr, indexed);
+      for (const char *source : row.sources) {
+        for (const auto &[word, key] : Split(source))
+          end = nimb::AppendIndexedOption(&index, end, word.c_str(), key.size(), word.size());
+      }
+      nimb::OptionKeyIndexFree(&index);
+      EXPECT_STREQ(buffer.data(), row.result);
+      EXPECT_EQ(end, buffer.data() + strlen(row.result));
+      // Nothing is written behind the terminator.
+      EXPECT_EQ(end[1], '\x55');
     }
-    EXPECT_STREQ(buffer.data(), row.result);
-    EXPECT_EQ(end, buffer.data() + strlen(row.result));
-    // Nothing is written behind the terminator.
-    EXPECT_EQ(end[1], '\x55');
   }
 }
 

@@ -260,11 +260,12 @@ TEST_F(PlistTest, SymbolsAreSharedAndGoWithTheirLastHolder) {
   const char *shared = nimb::PlistFindKey(first, "B")->text;
   EXPECT_EQ(nimb::PlistFindKey(first, "A")->text, shared);
   EXPECT_EQ(second->child->text, shared);
-  EXPECT_EQ(fw.LivePoolBlocks(), pools + 3);
+  // One block per symbol, and the index while any symbol lives.
+  EXPECT_EQ(fw.LivePoolBlocks(), pools + 4);
 
   nimb::PlistFreeTag(first);
   EXPECT_EQ(Symbols(), (List{{"x", 1}, {"A", 1}}));
-  EXPECT_EQ(fw.LivePoolBlocks(), pools + 2);
+  EXPECT_EQ(fw.LivePoolBlocks(), pools + 3);
 
   // A text that was never interned is passed over.
   PlistTag *stray = nimb::PlistNewTag();
@@ -282,6 +283,35 @@ TEST_F(PlistTest, SymbolsAreSharedAndGoWithTheirLastHolder) {
   EXPECT_EQ(Symbols().front(), std::make_pair(std::string("same"), uint64_t{2}));
   EXPECT_NE(nimb::PlistInternSymbol("sam"), a);
   EXPECT_STREQ(gPlistSymbols->text, "sam") << "newest first";
+}
+
+// Thousands of symbols, through every growth of the index: each is found
+// again, and each goes with its last holder, in any order.
+TEST_F(PlistTest, ManySymbolsAreFoundAndReleased) {
+  PrimePool();
+  std::vector<std::string> texts;
+  std::vector<char *> first;
+  for (int i = 0; i < 5000; i++) {
+    texts.push_back("key" + std::to_string(i * 7919 % 5000));
+    first.push_back(nimb::PlistInternSymbol(texts.back().c_str()));
+  }
+  for (size_t i = 0; i < texts.size(); i++)
+    ASSERT_EQ(nimb::PlistInternSymbol(texts[i].c_str()), first[i]) << texts[i];
+  EXPECT_EQ(Symbols().size(), 5000u);
+  for (int round = 0; round < 2; round++) {
+    for (size_t i = round; i < texts.size(); i += 2) {
+      PlistTag *holder = nimb::PlistNewTag();
+      holder->type = nimb::kPlistString;
+      holder->text = first[i];
+      nimb::PlistFreeTag(holder);
+      holder = nimb::PlistNewTag();
+      holder->type = nimb::kPlistString;
+      holder->text = first[i];
+      nimb::PlistFreeTag(holder);
+    }
+    EXPECT_EQ(Symbols().size(), round == 0 ? 2500u : 0u);
+  }
+  EXPECT_EQ(nimb::gPlistSymbolIndex.buckets, nullptr) << "the index goes with the last symbol";
 }
 
 TEST_F(PlistTest, TagsComeFromZeroedBlocksInAscendingOrder) {

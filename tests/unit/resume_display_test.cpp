@@ -343,4 +343,27 @@ TEST_F(ResumePreviewTest, BrokenOrMismatchedPicturesDrawNothing) {
   }
 }
 
+TEST(PreviewEncoderTest, RefusesWhatIsNoPictureAndSharesEqualRows) {
+  struct Row {
+    std::vector<uint32_t> pixels;
+    UINT32 width, height, bytes;
+    const char *error;
+  };
+  const Row rows[] = {
+      {{1, 2}, 2, 1, 3, "bytes per pixel must be 2 or 4, not 3"},
+      {{}, 0, 5, 4, "a picture needs at least one pixel"},
+      {{1, 2, 3}, 2, 2, 2, "3 pixels for 2 x 2"},
+  };
+  for (const Row &row : rows) {
+    std::string error;
+    EXPECT_TRUE(previewenc::EncodePreview(row.pixels, row.width, row.height, row.bytes, &error).empty());
+    EXPECT_EQ(error, row.error);
+  }
+  // A flat screen: one repeat run, which every row points to.
+  std::string error;
+  const std::vector<UINT8> flat =
+      previewenc::EncodePreview(std::vector<uint32_t>(kWidth * kHeight, 7), kWidth, kHeight, 2, &error);
+  EXPECT_EQ(flat.size(), 12 + 4 * kHeight + 4 + 2);
+}
+
 }  // namespace

@@ -48,9 +48,13 @@ namespace dryboot {
 
 // The kernel's report without the state at entry, which on the host is
 // nobody's: the processor never leaves this program.
-bool PrintKernelView(uint32_t bootArgs) {
+bool PrintKernelView(uint32_t bootArgs, uint32_t entry, const std::vector<KernelSegment> &segments) {
   using namespace nimb::guest;
   ReportReset();
+  bool inCode = false;
+  for (const KernelSegment &s : segments)
+    inCode |= s.fileSize != 0 && entry >= s.address && entry - s.address < s.fileSize;
+  Check("kernel-entry", entry != 0 && inCode, "entry=0x%x, wanted inside a segment's file bytes", entry);
   const BootArgs *args = CheckBootArgs(bootArgs);
   if (args != nullptr) {
     KernelRegion region = KernelRegionOf(*args);
@@ -64,6 +68,19 @@ bool PrintKernelView(uint32_t bootArgs) {
       CheckMemoryRanges(*args, region, areas, &count);
     }
     CheckLayout(region, areas, count, fixedCount);
+    // What the loader hands over lies outside every segment's memory, the
+    // zero-filled part and segments without file bytes included.
+    for (uint32_t i = 0; i < count; i++) {
+      for (const KernelSegment &s : segments) {
+        const uint64_t end = uint64_t{s.address} + s.memorySize;
+        const bool apart =
+            uint64_t{areas[i].address} + areas[i].length <= s.address || areas[i].address >= end;
+        if (!apart) {
+          Check("outside-kernel-segments", false, "%s at 0x%x lies in the segment at 0x%x of 0x%x bytes",
+                areas[i].name, areas[i].address, s.address, s.memorySize);
+        }
+      }
+    }
     CheckMemoryMap(*args, region, areas, count);
     CheckSystemTable(*args, region);
   }

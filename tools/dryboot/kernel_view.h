@@ -6,11 +6,17 @@
 #pragma once
 
 #include <cstdint>
+#include <vector>
+
+#include "kernel_image.h"
 
 namespace dryboot {
 
 // Prints the report for the record at `bootArgs` (an address inside the
-// host firmware's arena); true when every check passed.
-bool PrintKernelView(uint32_t bootArgs);
+// host firmware's arena), for a kernel entered at `entry` whose object has
+// `segments`; true when every check passed. Beyond the reference kernel's
+// own checks: the entry is not 0 and lies in a segment with file bytes, and
+// nothing the loader hands over lies in the memory of a segment.
+bool PrintKernelView(uint32_t bootArgs, uint32_t entry, const std::vector<KernelSegment> &segments);
 
 }  // namespace dryboot

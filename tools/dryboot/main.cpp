@@ -10,9 +10,11 @@
 #include <vector>
 
 #include "boot/boot.h"
+#include "config/boot_options.h"
 #include "efi/datahub.h"
 #include "efi/vendor.h"
 #include "hostfw/hostfw.h"
+#include "kernel_image.h"
 #include "kernel_view.h"
 
 namespace {
@@ -20,6 +22,7 @@ namespace {
 constexpr int kExitKernelEntered = 0;
 constexpr int kExitNoKernel = 1;
 constexpr int kExitUsage = 2;
+constexpr int kExitChecksFailed = 3;
 
 constexpr UINT32 kScreenWidth = 1280;
 constexpr UINT32 kScreenHeight = 800;
@@ -41,8 +44,10 @@ const char kUsage[] =
     "  --model TEXT        a \"Model\" record in the firmware's Data Hub\n"
     "  --help              this text\n"
     "\n"
-    "Exit status: 0 when the kernel was entered, 1 when it was not, 2 for a\n"
-    "wrong command line.\n";
+    "Exit status: 0 when the kernel was entered and every check of what it\n"
+    "was handed passed, 1 when it was not entered (with the status and the\n"
+    "step at which the kernel file was refused), 2 for a wrong command line,\n"
+    "3 when it was entered but a check failed.\n";
 
 struct HeldKeys {
   const char *name;
@@ -271,7 +276,7 @@ void Prepare(hostfw::Firmware &fw, const Settings &settings, KeyState *keyState)
 
 // --- the report ----------------------------------------------------------------------
 
-std::string StatusText(EFI_STATUS status) {
+std::string StatusText(uint64_t status) {
   static const struct {
     EFI_STATUS status;
     const char *name;
@@ -383,11 +388,23 @@ int main(int argc, char **argv) {
 
   PrintConsole(fw.ConOutText());
   PrintEnd(result);
+  std::string kernelName;
+  for (const CHAR16 *p = nimb::gKernelName; p != nullptr && *p != 0; p++)
+    kernelName.push_back(*p < 0x80 ? static_cast<char>(*p) : '?');
+  const dryboot::KernelImage image = dryboot::FindKernelImage(settings.volume, kernelName);
   if (result.end != hostfw::RunEnd::KernelEntered) {
+    // Why the kernel did not load, when it was the kernel.
+    if (fw.ConOutText().find("Error loading kernel") != std::string::npos) {
+      std::string why = image.path.empty() ? "no such file in the volume or its boot directories"
+                                           : dryboot::KernelLoadFailure(image.bytes, StatusText);
+      std::printf("kernel '%s': %s\n", kernelName.c_str(), why.empty() ? "loads here" : why.c_str());
+    }
     return kExitNoKernel;
   }
-  // The gate hands over a 32-bit address; the record lies below 4 GiB.
-  dryboot::PrintKernelView(static_cast<uint32_t>(result.gateArgument));
+  const std::vector<dryboot::KernelSegment> segments = dryboot::KernelSegments(image.bytes);
+  // The gate hands over 32-bit addresses; the record lies below 4 GiB.
+  const bool passed = dryboot::PrintKernelView(static_cast<uint32_t>(result.gateArgument),
+                                               static_cast<uint32_t>(result.gateTarget), segments);
   std::fflush(stdout);
-  return kExitKernelEntered;
+  return passed ? kExitKernelEntered : kExitChecksFailed;
 }

@@ -7,7 +7,11 @@
 #include <cstdio>
 #include <cstring>
 
+#include "boot/boot.h"
+#include "config/boot_options.h"
+#include "devicetree/platform.h"
 #include "kcache/lzss_encoder.h"
+#include "load/kernel_cache.h"
 #include "support/checksum.h"
 #include "support/text.h"
 
@@ -49,20 +53,29 @@ std::string CheckDevicePath(const std::vector<uint8_t> &bytes) {
 
 CacheKey MakeCacheKey(const std::string &model, const std::vector<uint8_t> &bootPath,
                       const std::string &kernelName) {
-  CacheKey key = {};
-  std::memcpy(key.data(), model.data(), std::min(model.size(), nimb::kCacheModelBytes));
-  uint8_t *path = key.data() + nimb::kCacheModelBytes;
-  const size_t pathBytes = std::min(bootPath.size(), nimb::kCacheBootPathBytes);
-  std::memcpy(path, bootPath.data(), pathBytes);
-  if (pathBytes < nimb::kCacheBootPathBytes) {
-    // The loader holds the name in UCS-2 and converts it back.
-    std::vector<UINT16> wide(kernelName.size() + 1);
-    UINT64 units = 0;
-    nimb::Utf8ToUcs(reinterpret_cast<const UINT8 *>(kernelName.c_str()), kernelName.size(), wide.data(),
-                    &units, wide.size() * sizeof(UINT16));
-    nimb::UcsToUtf8(wide.data(), static_cast<INT32>(units), path + pathBytes,
-                    static_cast<UINT32>(nimb::kCacheBootPathBytes - pathBytes), 1);
-  }
+  // The loader's own routine, over its globals, which are put back after.
+  char savedModel[sizeof(nimb::gModelName)];
+  std::memcpy(savedModel, nimb::gModelName, sizeof savedModel);
+  EFI_DEVICE_PATH_PROTOCOL *const savedPath = nimb::gBootDevicePath;
+  const CHAR16 *const savedName = nimb::gKernelName;
+
+  std::memset(nimb::gModelName, 0, sizeof(nimb::gModelName));
+  std::memcpy(nimb::gModelName, model.data(), std::min(model.size(), sizeof(nimb::gModelName)));
+  std::vector<uint8_t> path = bootPath;
+  nimb::gBootDevicePath = reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(path.data());
+  // The loader holds the name in UCS-2.
+  std::vector<CHAR16> wide(kernelName.size() + 1);
+  UINT64 units = 0;
+  nimb::Utf8ToUcs(reinterpret_cast<const UINT8 *>(kernelName.c_str()), kernelName.size(),
+                  reinterpret_cast<UINT16 *>(wide.data()), &units, wide.size() * sizeof(CHAR16));
+  nimb::gKernelName = wide.data();
+  nimb::MakeKernelCacheKey();
+  CacheKey key;
+  std::memcpy(key.data(), nimb::gKernelCacheKey, key.size());
+
+  std::memcpy(nimb::gModelName, savedModel, sizeof savedModel);
+  nimb::gBootDevicePath = savedPath;
+  nimb::gKernelName = savedName;
   return key;
 }
 

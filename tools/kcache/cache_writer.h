@@ -1,7 +1,7 @@
 // Making kernel cache files on the host: the key whose checksum names the
 // file, the 384-byte header and the compressed kernel behind it. The record
-// layouts are the loader's own (load/kernel_cache_format.h), and the key is
-// filled with the loader's own text conversion and checksum.
+// layouts are the loader's own (load/kernel_cache_format.h), and the key and
+// its checksum are the loader's own code's.
 #pragma once
 
 #include <time.h>
@@ -21,10 +21,11 @@ using CacheKey = std::array<uint8_t, nimb::kCacheKeyBytes>;
 // empty string, else what is wrong.
 std::string CheckDevicePath(const std::vector<uint8_t> &bytes);
 
-// The key as the loader builds it: the model name's bytes cut to 64, then
-// the boot device path's bytes cut to 256 and the kernel's name (UTF-8, as
-// far as it goes through the loader's UCS-2 form) with its terminator in
-// the bytes left; zeros elsewhere.
+// The key as the loader builds it, by the loader's own MakeKernelCacheKey:
+// the model name's bytes cut to 64, then the boot device path's bytes cut to
+// 256 and the kernel's name (UTF-8, as far as it goes through the loader's
+// UCS-2 form) with its terminator in the bytes left; zeros elsewhere. The
+// model must not be empty, and `bootPath` must pass CheckDevicePath.
 CacheKey MakeCacheKey(const std::string &model, const std::vector<uint8_t> &bootPath,
                       const std::string &kernelName);
 

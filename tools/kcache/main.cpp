@@ -154,6 +154,9 @@ Options ParseOptions(int argc, char **argv) {
   if (!options.haveBootPath) {
     UsageError("no --boot-path-hex given");
   }
+  if (options.model.empty()) {
+    UsageError("--model is empty");
+  }
   if (options.kernelName.empty()) {
     UsageError("--kernel-name is empty");
   }
@@ -225,6 +228,11 @@ int Run(int argc, char **argv) {
     }
     kernel = std::move(object);
     std::fprintf(stderr, "kcache: %zu driver%s prelinked\n", drivers.size(), drivers.size() == 1 ? "" : "s");
+  }
+  if (!options.compressed && kernel.size() < nimb::kCacheHeaderBytes) {
+    InputError(options.kernel +
+               ": under 384 bytes, too short for a cache without header (the loader reads a " +
+               "header's worth first)");
   }
   if (kernel.size() > 0xFFFFFFFFull - 4096) {
     InputError(options.kernel + ": too large for a cache");

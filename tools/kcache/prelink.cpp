@@ -48,13 +48,23 @@ bool ReadWhole(const fs::path &path, std::vector<uint8_t> *bytes) {
 }
 
 // The 32-bit x86 slice of a fat file, or the whole of any other file, found
-// by the loader's own code.
-bool FindSlice(const std::vector<uint8_t> &file, uint64_t *offset, uint64_t *size) {
+// by the loader's own code. A slice that runs past the file's end comes with
+// zeros for what is missing, as the loader stages it; `cut` tells.
+bool Slice(const std::vector<uint8_t> &file, std::vector<uint8_t> *slice, bool *cut) {
   std::vector<uint8_t> copy = file;
   nimb::BootFile memory = {};
   memory.buffer = copy.data();
   memory.size = copy.size();
-  return !copy.empty() && nimb::BootFileFindSlice(&memory, size, offset) == EFI_SUCCESS;
+  uint64_t offset = 0, size = 0;
+  if (copy.empty() || nimb::BootFileFindSlice(&memory, &size, &offset) != EFI_SUCCESS) {
+    return false;
+  }
+  const uint64_t start = std::min<uint64_t>(offset, file.size());
+  const uint64_t present = std::min<uint64_t>(size, file.size() - start);
+  slice->assign(file.begin() + start, file.begin() + start + present);
+  slice->resize(size, 0);
+  *cut = present != size;
+  return true;
 }
 
 // What the loader reads of a bundle's property list, read by its own parser.
@@ -114,12 +124,9 @@ void TakeBundle(const fs::path &bundle, bool full, std::vector<Driver> *drivers)
     if (!ReadWhole(code, &bytes)) {
       return;
     }
-    if (!bytes.empty()) {
-      uint64_t offset = 0, size = 0;
-      if (!FindSlice(bytes, &offset, &size)) {
-        return;
-      }
-      driver.code.assign(bytes.begin() + offset, bytes.begin() + offset + size);
+    bool cut = false;
+    if (!bytes.empty() && !Slice(bytes, &driver.code, &cut)) {
+      return;
     }
   }
   drivers->push_back(std::move(driver));
@@ -153,11 +160,14 @@ std::string CollectDrivers(const std::string &extensions, std::vector<Driver> *d
 
 std::string AddPrelinkSegment(const std::vector<uint8_t> &kernel, const std::vector<Driver> &drivers,
                               std::vector<uint8_t> *object, uint32_t *segmentAddress) {
-  uint64_t sliceOffset = 0, sliceSize = 0;
-  if (!FindSlice(kernel, &sliceOffset, &sliceSize)) {
+  std::vector<uint8_t> out;
+  bool cut = false;
+  if (!Slice(kernel, &out, &cut)) {
     return "no 32-bit x86 kernel object in it";
   }
-  std::vector<uint8_t> out(kernel.begin() + sliceOffset, kernel.begin() + sliceOffset + sliceSize);
+  if (cut) {
+    return "its 32-bit x86 slice runs past the end of the file";
+  }
   nimb::ObjectHeader header;
   if (out.size() < sizeof header) {
     return "too short for a kernel object";

@@ -19,7 +19,8 @@ struct Driver {
 // other than "Safe Boot"), in both layouts, with the bundles in their PlugIns
 // one level deep, each right behind its parent; entries in name order. A
 // bundle whose code is named but missing, or has no 32-bit x86 slice, is left
-// out as the loader leaves it out. Returns an empty string, else what is wrong.
+// out as the loader leaves it out; a slice cut short by its file's end is
+// filled up with zeros, as the loader stages it. Returns an empty string, else what is wrong.
 std::string CollectDrivers(const std::string &extensions, std::vector<Driver> *drivers);
 
 // The 32-bit x86 kernel object inside `kernel` (a kernel object or a fat

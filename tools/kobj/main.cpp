@@ -1,13 +1,14 @@
 // kobj: turns a 32-bit x86 ELF executable into a kernel object that the
 // loader places at its addresses, alone or wrapped in a fat file; `kobj fat`
 // wraps any files (a driver package, a driver's code) into a fat file.
+#include <sys/stat.h>
+
 #include <cerrno>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <fstream>
-#include <iterator>
 #include <string>
 #include <vector>
 
@@ -36,7 +37,8 @@ const char kUsage[] =
     "      --extra-slice TYPE:FILE\n"
     "                            add the bytes of FILE as a slice of processor type TYPE\n"
     "                            (decimal or 0x hex) in front of the kernel's slice;\n"
-    "                            may be repeated, slices keep their order (implies --fat)\n"
+    "                            may be repeated, slices keep their order (implies --fat);\n"
+    "                            not of the x86 type (7), which would hide the kernel\n"
     "      --append-slice TYPE:FILE\n"
     "                            the same, behind the kernel's slice\n"
     "  -v, --verbose             list the segments and the entry point\n"
@@ -95,12 +97,25 @@ struct Options {
   std::exit(kExitInput);
 }
 
-bool ReadFile(const std::string &path, std::vector<uint8_t> *bytes) {
-  std::ifstream in(path, std::ios::binary);
-  if (!in)
-    return false;
-  bytes->assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
-  return !in.bad();
+// The whole file; an input error naming the path when it cannot be read (a
+// directory among them).
+std::vector<uint8_t> ReadFile(const std::string &path) {
+  struct stat info;
+  if (stat(path.c_str(), &info) == 0 && S_ISDIR(info.st_mode))
+    InputError("cannot read '" + path + "': it is a directory");
+  std::FILE *file = std::fopen(path.c_str(), "rb");
+  if (file == nullptr)
+    InputError("cannot read '" + path + "': " + std::strerror(errno));
+  std::vector<uint8_t> bytes;
+  uint8_t buffer[65536];
+  size_t got;
+  while ((got = std::fread(buffer, 1, sizeof(buffer), file)) != 0)
+    bytes.insert(bytes.end(), buffer, buffer + got);
+  const bool failed = std::ferror(file) != 0;
+  std::fclose(file);
+  if (failed)
+    InputError("cannot read '" + path + "'");
+  return bytes;
 }
 
 ExtraSlice ParseSlice(const std::string &option, const std::string &value) {
@@ -122,6 +137,9 @@ ExtraSlice ParseSlice(const std::string &option, const std::string &value) {
   unsigned long long number = std::strtoull(type.c_str(), &end, 0);
   if (*end != '\0' || errno != 0 || number > UINT32_MAX || type[0] == '-')
     UsageError(option + ": '" + type + "' is no 32-bit processor type");
+  // The loader takes the first x86 slice: one in front would hide the kernel.
+  if (number == nimb::kCpuTypeX86 && option == "--extra-slice")
+    UsageError(option + ": a slice of the x86 type in front of the kernel's would hide it");
   return {static_cast<uint32_t>(number), value.substr(colon + 1), option == "--extra-slice"};
 }
 
@@ -205,8 +223,7 @@ kobj::FatEntry ReadSlice(const ExtraSlice &slice) {
   kobj::FatEntry entry;
   entry.cpuType = slice.cpuType;
   entry.cpuSubtype = slice.cpuType == nimb::kCpuTypeX86 ? kobj::kCpuSubtypeX86All : 0;
-  if (!ReadFile(slice.path, &entry.bytes))
-    InputError("cannot read '" + slice.path + "': " + std::strerror(errno));
+  entry.bytes = ReadFile(slice.path);
   return entry;
 }
 
@@ -265,9 +282,7 @@ int main(int argc, char **argv) {
     return FatMain(argc, argv);
   Options options = ParseCommandLine(argc, argv);
 
-  std::vector<uint8_t> elf;
-  if (!ReadFile(options.input, &elf))
-    InputError("cannot read '" + options.input + "': " + std::strerror(errno));
+  const std::vector<uint8_t> elf = ReadFile(options.input);
   kobj::Kernel kernel;
   std::string problem = kobj::ReadElf(elf, &kernel);
   if (!problem.empty())
