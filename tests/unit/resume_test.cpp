@@ -139,6 +139,22 @@ TEST_F(ResumeRunTest, RestartsTheImage) {
   EXPECT_FALSE(Has(kResumeKeyVariable));
 }
 
+// The header alone, without restart code: nothing is read behind it, nothing
+// copied, and the gate is entered all the same.
+TEST_F(ResumeRunTest, AFirstStageOfTheHeaderAloneEntersTheGate) {
+  ResumeImageSpec spec;
+  spec.firstStageBytes = 512;
+  spec.restorePageCount = 0;
+  spec.extentLengths = {512};
+  Install(spec);
+  RecordReads();
+  hostfw::RunResult result = Run();
+  ASSERT_EQ(result.end, hostfw::RunEnd::KernelEntered);
+  EXPECT_EQ(result.gateTarget, spec.restorePage * 4096ull + spec.restoreEntryOffset);
+  EXPECT_EQ(reinterpret_cast<const ResumeHeader *>(result.gateArgument)->restoreSum, 0u);
+  EXPECT_EQ(recorder.reads.size(), 1u);  // the header
+}
+
 TEST_F(ResumeRunTest, MainStageReadsAreOneStepOfTheBarAtMost) {
   ResumeImageSpec spec;
   spec.imageBytes = 1900000;
