@@ -175,6 +175,28 @@ TEST_F(ResumeRunTest, MainStageReadsAreOneStepOfTheBarAtMost) {
   EXPECT_EQ(recorder.reads[2].second, 0x30000u - 512 - 100000);
 }
 
+// Without a preview and with an image of 1900000 bytes, 250000 bytes read
+// behind the header leave the bar at step 2: cells 0 and 1 finished, cell 2
+// being worked on, the rest not reached.
+TEST_F(ResumeRunTest, TheBarStandsAtTheStepOfTheBytesRead) {
+  constexpr UINT32 kWidth = 320, kHeight = 200;
+  fw.AddScreen({kWidth, kHeight, 32});
+  ResumeImageSpec spec;
+  spec.imageBytes = 1900000;
+  spec.firstStageBytes = 512 + 250000;
+  spec.extentLengths = {0x10000, 0};
+  Install(spec);
+  ASSERT_EQ(fw.Call([] {
+                ASSERT_EQ(InitConsole(), EFI_SUCCESS);
+                TryResume();
+              }).end,
+            hostfw::RunEnd::KernelEntered);
+  const UINT32 left = (kWidth - 190) / 2, top = kHeight - 97;
+  const UINT32 levels[] = {230, 230, 174, 92, 92};
+  for (UINT32 cell = 0; cell < 5; cell++)  // a pixel of full alpha in each cell
+    EXPECT_EQ(fw.ScreenPixel(left + 10 * cell + 3, top + 5) & 0xFF, levels[cell]) << "cell " << cell;
+}
+
 TEST_F(ResumeRunTest, PreviewStageReadsWholeExtentsAndEndsAtTheSection) {
   ResumeImageSpec spec;
   spec.imageBytes = 1900000;
