@@ -13,21 +13,28 @@ namespace {
 
 constexpr UINT32 kAdlerModulus = 65521;
 constexpr UINTN kSumGroupBytes = 32;
+constexpr UINT64 kBelow4GPages = 0x100000;
 
 // The runtime map gives every runtime descriptor (reserved memory apart) the
-// next addresses of the area, one behind the other: the area must hold them
-// all, or the copy of a region would run past it.
+// next addresses from the area's start on, one behind the other. The regions
+// that are copied there, runtime code and data, must land inside the area;
+// others (memory-mapped I/O) only take address space, which may run past it.
 NIMB_MAP_WALK bool RuntimeAreaHolds(const UINT8 *map, UINTN mapSize, UINTN descriptorSize, UINT64 areaBytes) {
-  UINT64 taken = 0;
+  UINT64 offset = 0;
   for (UINTN at = 0; at < mapSize; at += descriptorSize) {
     const EFI_MEMORY_DESCRIPTOR *d = reinterpret_cast<const EFI_MEMORY_DESCRIPTOR *>(map + at);
     if (d->Type == EfiReservedMemoryType || (d->Attribute & EFI_MEMORY_RUNTIME) == 0) {
       continue;
     }
-    if (d->NumberOfPages > (areaBytes - taken) / kResumePageBytes) {
+    if (d->NumberOfPages > kBelow4GPages) {  // keeps the offsets from wrapping
       return false;
     }
-    taken += d->NumberOfPages * kResumePageBytes;
+    const UINT64 bytes = d->NumberOfPages * kResumePageBytes;
+    const bool copied = d->Type == EfiRuntimeServicesCode || d->Type == EfiRuntimeServicesData;
+    if (copied && (offset > areaBytes || bytes > areaBytes - offset)) {
+      return false;
+    }
+    offset += bytes;
   }
   return true;
 }
