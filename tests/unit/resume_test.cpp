@@ -123,8 +123,7 @@ TEST_F(ResumeRunTest, RestartsTheImage) {
   EXPECT_TRUE(std::all_of(zeros, zeros + 16, [](UINT8 b) { return b == 0; }));
 
   // The runtime map: only runtime descriptors, the copied ones inside the
-  // image's area, and
-  // the system table found there by its offset.
+  // image's area, and the system table found there by its offset.
   const UINT64 area = spec.runtimePage * 4096ull;
   ASSERT_GT(h.memoryMapBytes, 0u);
   EXPECT_EQ(h.memoryMapBytes % hostfw::kDescriptorSize, 0u);
