@@ -373,9 +373,11 @@ EFI_STATUS FinishBootInfo(UINTN *mapKey, const char *options) {
   UINT64 runtimeStart = (gKernelRegionTop + EFI_PAGE_SIZE - 1) & ~(EFI_PAGE_SIZE - 1);
   UINT64 nextVirtual = runtimeStart;
   // The runtime move writes above the kernel region, where nothing was
-  // allocated: the whole area has to be free while a message can still say so.
+  // allocated: what it writes has to land in memory that is free behind
+  // ExitBootServices, clear of this thread's stack, checked while a message
+  // can still say otherwise.
   if (!RuntimeAreaIsFree(mapStart, mapEnd, shape.descriptorSize, runtimeStart,
-                         kRuntimeSparePages * EFI_PAGE_SIZE)) {
+                         reinterpret_cast<UINT64>(&shape))) {
     Fatal("Runtime services area not free\n");
   }
   // From here to ExitBootServices nothing allocates or frees: the key holds.

@@ -151,40 +151,53 @@ UINT64 LShiftU64(UINT64 value, UINTN count) {
   return count < 64 ? value << count : 0;
 }
 
-BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
-                          UINT64 descriptorSize, UINT64 areaStart, UINT64 spareBytes) {
-  constexpr UINT64 kAddressLimit = 0x100000000;
-  if (descriptorSize < sizeof(EFI_MEMORY_DESCRIPTOR) || areaStart >= kAddressLimit ||
-      spareBytes > kAddressLimit) {
-    return FALSE;
-  }
-  UINT64 areaEnd = areaStart + spareBytes;
-  for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
-    if (GetsRuntimeAddress(d)) {
-      areaEnd += ByteSize(d);
-      if (areaEnd > kAddressLimit || ByteSize(d) > kAddressLimit) {
-        return FALSE;
-      }
-    }
-  }
-  if (areaEnd > kAddressLimit) {
-    return FALSE;
-  }
-  // From the area's start, step from one conventional descriptor that holds
-  // the address to the end of that descriptor.
-  UINT64 at = areaStart;
-  while (at < areaEnd) {
+// True when the range from `start` of `size` bytes lies wholly in
+// descriptors that are free behind ExitBootServices, none of them the one
+// that holds `inUse`: from the start, step from a free descriptor that holds
+// the address to that descriptor's end.
+static bool RangeIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
+                        UINT64 descriptorSize, UINT64 start, UINT64 size, UINT64 inUse) {
+  const UINT64 end = start + size;
+  for (UINT64 at = start; at < end;) {
     UINT64 reached = at;
     for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
-      if (d->Type == EfiConventionalMemory && InRange(at, d->PhysicalStart, ByteSize(d))) {
+      const bool free = d->Type == EfiConventionalMemory || d->Type == EfiBootServicesCode ||
+                        d->Type == EfiBootServicesData;
+      if (free && InRange(at, d->PhysicalStart, ByteSize(d)) &&
+          !InRange(inUse, d->PhysicalStart, ByteSize(d))) {
         reached = d->PhysicalStart + ByteSize(d);
         break;
       }
     }
     if (reached == at) {
-      return FALSE;
+      return false;
     }
     at = reached;
+  }
+  return true;
+}
+
+BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
+                          UINT64 descriptorSize, UINT64 areaStart, UINT64 inUse) {
+  constexpr UINT64 kAddressLimit = 0x100000000;
+  if (descriptorSize < sizeof(EFI_MEMORY_DESCRIPTOR) || areaStart >= kAddressLimit) {
+    return FALSE;
+  }
+  // Addresses as MapRuntimeServices gives them; only the regions it copies
+  // need memory: the others only take address space.
+  UINT64 next = areaStart;
+  for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
+    if (!GetsRuntimeAddress(d)) {
+      continue;
+    }
+    const UINT64 size = ByteSize(d);
+    if (size > kAddressLimit || next + size > kAddressLimit) {
+      return FALSE;
+    }
+    if (IsRuntimeRegion(d) && !RangeIsFree(mapStart, mapEnd, descriptorSize, next, size, inUse)) {
+      return FALSE;
+    }
+    next += size;
   }
   return TRUE;
 }
