@@ -1,5 +1,6 @@
-// The loader's checksums and memory routines behind the plain signatures of
+// The loader's checksums, memory routines and LZSS decoder behind the plain signatures of
 // routines.h. LOADER_ROUTINES names the table this compilation defines.
+#include "load/lzss.h"
 #include "routines.h"
 #include "support/checksum.h"
 #include "support/strings.h"
@@ -25,6 +26,10 @@ int Memcmp(const void *a, const void *b, size_t count) {
   return nimb::memcmp(a, b, count);
 }
 
+uint64_t DecompressLzss(uint8_t *destination, uint64_t capacity, const uint8_t *source, uint32_t length) {
+  return nimb::DecompressLzss(destination, capacity, source, length);
+}
+
 }  // namespace
 
-extern const LoaderRoutines LOADER_ROUTINES = {Adler32, Md5, Memcpy, Memcmp};
+extern const LoaderRoutines LOADER_ROUTINES = {Adler32, Md5, Memcpy, Memcmp, DecompressLzss};

@@ -32,9 +32,11 @@ target_link_libraries(nimbcore PUBLIC hostfw)
 
 # --- unit tests ----------------------------------------------------------------
 find_package(GTest REQUIRED)
+find_package(OpenSSL REQUIRED)
 file(GLOB NIMB_UNIT_TESTS CONFIGURE_DEPENDS ${CMAKE_SOURCE_DIR}/tests/unit/*.cpp)
 add_executable(unit_tests ${NIMB_UNIT_TESTS})
-target_link_libraries(unit_tests PRIVATE nimbcore hostfw GTest::gtest GTest::gtest_main)
+# OpenSSL is the reference that the loader's AES is checked against.
+target_link_libraries(unit_tests PRIVATE nimbcore hostfw GTest::gtest GTest::gtest_main OpenSSL::Crypto)
 include(GoogleTest)
 gtest_discover_tests(unit_tests DISCOVERY_MODE PRE_TEST PROPERTIES LABELS unit)
 
@@ -100,6 +102,10 @@ if(NIMB_OBJDUMP)
                    "-DOBJECTS=${CMAKE_BINARY_DIR}/CMakeFiles/nimbcore.dir/src/boot/gate.S.o;${NIMB_EFI_DIR}/CMakeFiles/nimbboot.dir/src/boot/gate.S.obj"
                    -P ${CMAKE_SOURCE_DIR}/cmake/check-gate.cmake)
   set_tests_properties(gate.no-relocations PROPERTIES LABELS unit)
+  add_test(NAME efi.sse-only-in-aes
+           COMMAND ${CMAKE_COMMAND} -DOBJDUMP=${NIMB_OBJDUMP} -DOBJECT_DIR=${NIMB_EFI_DIR}/CMakeFiles/nimbboot.dir
+                   -P ${CMAKE_SOURCE_DIR}/cmake/check-sse.cmake)
+  set_tests_properties(efi.sse-only-in-aes PROPERTIES LABELS unit)
 endif()
 
 # --- QEMU scenarios ------------------------------------------------------------------

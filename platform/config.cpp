@@ -21,6 +21,14 @@ bool ApplyLoader(PlatformConfig *config, const char *, char *value) {
   return true;
 }
 
+bool ApplyTimedRead(PlatformConfig *config, const char *, char *value) {
+  if (*value == '\0' || !Utf8ToUcs2(value, nullptr, 0, nullptr)) {
+    return false;
+  }
+  config->timedReadPath = value;
+  return true;
+}
+
 bool ApplyOptions(PlatformConfig *config, const char *, char *value) {
   if (!Utf8ToUcs2(value, nullptr, 0, nullptr)) {
     return false;
@@ -300,6 +308,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"device-properties-hex", ApplyDeviceProperties},
     {"netboot.dhcp-hex", ApplyDhcpResponse},
     {"netboot.bsdp-hex", ApplyBsdpResponse},
+    {"time-read", ApplyTimedRead},
 };
 
 // The name that `key` gives to the function of `entry`, or null when the
@@ -422,6 +431,7 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->deviceProperties = {};
   config->dhcpResponse = {};
   config->bsdpResponse = {};
+  config->timedReadPath = nullptr;
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {

@@ -43,6 +43,10 @@
 //   netboot.bsdp-hex=<hex> its boot-service discovery answer (may be empty).
 //                          With either key the protocol is there, and it
 //                          answers EFI_NOT_FOUND for an answer not given
+//   time-read=<path>       a file of this volume that the platform reads
+//                          whole through the firmware's file system before
+//                          starting the loader, timed with the time stamp
+//                          counter (platform: tsc read-start, read-end)
 // Hexadecimal values are any number of bytes: two digits each, blanks
 // allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
@@ -114,6 +118,8 @@ struct PlatformConfig {
   ConfigBytes deviceProperties;
   ConfigBytes dhcpResponse;
   ConfigBytes bsdpResponse;
+  // The file to read timed before the loader starts; null: none.
+  const char *timedReadPath;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";

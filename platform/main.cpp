@@ -10,6 +10,7 @@
 #include "device_properties.h"
 #include "efi/vendor.h"
 #include "exitcodes.h"
+#include "file_times.h"
 #include "firmware.h"
 #include "format.h"
 #include "graphics.h"
@@ -17,6 +18,7 @@
 #include "memory.h"
 #include "net_boot_info.h"
 #include "serial.h"
+#include "tsc.h"
 
 namespace nimb::platform {
 
@@ -25,6 +27,8 @@ namespace {
 constexpr UINT16 kDebugExitPort = 0xF4;
 constexpr const CHAR16 *kConfigPath = u"\\EFI\\BOOT\\platform.cfg";
 constexpr const char *kConfigName = "platform.cfg";
+constexpr const CHAR16 *kTimesPath = u"\\EFI\\BOOT\\platform.times";
+constexpr const char *kTimesName = "platform.times";
 
 PlatformConsole gConsole;
 PlatformKeyState gKeyState;
@@ -33,6 +37,7 @@ PlatformDataHub gDataHub;
 PlatformDeviceProperties gDeviceProperties;
 PlatformNetBootInfo gNetBootInfo;
 MemoryMeter gMeter;
+FileTimeTable gTimes;
 
 // The debug-exit device ends the machine with the code; without one the
 // write goes nowhere and the firmware powers off instead.
@@ -88,35 +93,71 @@ void ReportConfigIssue(const ConfigIssue &issue, void *) {
   }
 }
 
-// Reads the configuration file into `config`; a volume without one leaves
-// the defaults.
-void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
-  ConfigSetDefaults(config);
+// The whole of a file of the platform's volume, with room for a NUL behind
+// it; null when the file is not there. Other failures end the run with
+// `code`.
+char *ReadWholeFile(EFI_FILE_PROTOCOL *root, const CHAR16 *path, const char *name, UINT8 code, UINTN *size) {
   EFI_FILE_PROTOCOL *file = nullptr;
-  EFI_STATUS status = root->Open(root, &file, kConfigPath, EFI_FILE_MODE_READ, 0);
+  EFI_STATUS status = root->Open(root, &file, path, EFI_FILE_MODE_READ, 0);
   if (status == EFI_NOT_FOUND) {
-    SerialPrintf("platform: no %s, defaults used\n", kConfigName);
-    return;
+    return nullptr;
   }
   if (EFI_ERROR(status)) {
-    Fail(kExitConfigInvalid, "cannot open %s (%s)", kConfigName, StatusName(status));
+    Fail(code, "cannot open %s (%s)", name, StatusName(status));
   }
   UINT64 infoBuffer[kFileInfoBufferSize / sizeof(UINT64)];
   UINTN infoSize = sizeof(infoBuffer);
   status = file->GetInfo(file, &gEfiFileInfoGuid, &infoSize, infoBuffer);
   if (EFI_ERROR(status)) {
-    Fail(kExitConfigInvalid, "cannot size %s (%s)", kConfigName, StatusName(status));
+    Fail(code, "cannot size %s (%s)", name, StatusName(status));
   }
-  UINTN size = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer)->FileSize;
-  char *text = static_cast<char *>(AllocateOrFail(size + 1, kConfigName));
-  status = file->Read(file, &size, text);
+  *size = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer)->FileSize;
+  char *text = static_cast<char *>(AllocateOrFail(*size + 1, name));
+  status = file->Read(file, size, text);
   file->Close(file);
   if (EFI_ERROR(status)) {
-    Fail(kExitConfigInvalid, "cannot read %s (%s)", kConfigName, StatusName(status));
+    Fail(code, "cannot read %s (%s)", name, StatusName(status));
+  }
+  return text;
+}
+
+// Reads the configuration file into `config`; a volume without one leaves
+// the defaults.
+void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
+  ConfigSetDefaults(config);
+  UINTN size = 0;
+  char *text = ReadWholeFile(root, kConfigPath, kConfigName, kExitConfigInvalid, &size);
+  if (text == nullptr) {
+    SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    return;
   }
   if (ConfigParse(text, size, config, ReportConfigIssue, nullptr) != 0) {
     Fail(kExitConfigInvalid, "%s has errors", kConfigName);
   }
+}
+
+// The exact times of the volume's files, when the disk tool listed them,
+// served to the loader from its device's file system.
+void ServeExactTimes(EFI_FILE_PROTOCOL *root, EFI_HANDLE device) {
+  UINTN size = 0;
+  char *text = ReadWholeFile(root, kTimesPath, kTimesName, kExitConfigInvalid, &size);
+  if (text == nullptr) {
+    SerialPrintf("platform: no %s, the firmware's own file times\n", kTimesName);
+    return;
+  }
+  FileTimeTable table = {nullptr, 0, FileTimesCapacity(text, size)};
+  table.entries =
+      static_cast<FileTimeEntry *>(AllocateOrFail(table.capacity * sizeof(FileTimeEntry), kTimesName));
+  const UINT32 line = FileTimesParse(text, size, &table);
+  if (line != 0) {
+    Fail(kExitConfigInvalid, "%s line %u is no time and path", kTimesName, static_cast<UINT64>(line));
+  }
+  gTimes = table;
+  const EFI_STATUS status = FileTimesInstall(device, &gTimes);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot serve exact file times (%s)", StatusName(status));
+  }
+  SerialPrintf("platform: exact times of %u paths\n", static_cast<UINT64>(gTimes.count));
 }
 
 UINTN DevicePathNodeLength(const EFI_DEVICE_PATH_PROTOCOL *node) {
@@ -185,6 +226,70 @@ EFI_FILE_PROTOCOL *OpenOwnVolume(EFI_HANDLE *device) {
     Fail(kExitPlatformFailed, "cannot open the boot volume (%s)", StatusName(status));
   }
   return root;
+}
+
+// Reads the configured file whole through the firmware's own file system,
+// timed: the firmware's time for what the loader reads of it in the same
+// run. Nothing of it stays allocated.
+void TimeFirmwareRead(EFI_FILE_PROTOCOL *root, const char *path) {
+  UINTN units = 0;
+  CHAR16 *wide = WideCopyOrFail(path, "the timed file's path", &units);
+  EFI_FILE_PROTOCOL *file = nullptr;
+  EFI_STATUS status = root->Open(root, &file, wide, EFI_FILE_MODE_READ, 0);
+  gBS->FreePool(wide);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot open %s to time its read (%s)", path, StatusName(status));
+  }
+  UINT64 infoBuffer[kFileInfoBufferSize / sizeof(UINT64)];
+  UINTN size = sizeof(infoBuffer);
+  status = file->GetInfo(file, &gEfiFileInfoGuid, &size, infoBuffer);
+  const UINT64 fileSize = reinterpret_cast<EFI_FILE_INFO *>(infoBuffer)->FileSize;
+  const UINTN pages = (fileSize + 0xFFF) >> 12;
+  EFI_PHYSICAL_ADDRESS buffer = 0;
+  if (!EFI_ERROR(status)) {
+    status = gBS->AllocatePages(AllocateAnyPages, EfiLoaderData, pages, &buffer);
+  }
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot ready the timed read of %s (%s)", path, StatusName(status));
+  }
+  size = fileSize;
+  const UINT64 start = ReadTsc();
+  status = file->Read(file, &size, reinterpret_cast<VOID *>(buffer));
+  const UINT64 end = ReadTsc();
+  file->Close(file);
+  gBS->FreePages(buffer, pages);
+  if (EFI_ERROR(status) || size != fileSize) {
+    Fail(kExitPlatformFailed, "the timed read of %s failed (%s)", path, StatusName(status));
+  }
+  SerialPrintf("platform: timed read of %s, %u bytes", path, fileSize);
+  ReportTsc("read-start", start);
+  ReportTsc("read-end", end);
+}
+
+// The device path of the loader's device, end node included, in hex: the
+// loader finds its kernel cache by a checksum over these bytes.
+void ReportBootDevicePath(EFI_HANDLE device) {
+  static const char kHexDigits[] = "0123456789abcdef";
+  void *interface = nullptr;
+  if (EFI_ERROR(gBS->HandleProtocol(device, &gEfiDevicePathProtocolGuid, &interface)) ||
+      interface == nullptr) {
+    SerialPrintf("platform: boot device path none\n");
+    return;
+  }
+  const UINT8 *bytes = static_cast<const UINT8 *>(interface);
+  SerialPrintf("platform: boot device path ");
+  for (UINTN at = 0;;) {
+    const EFI_DEVICE_PATH_PROTOCOL *node = reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(bytes + at);
+    const UINTN length = DevicePathNodeLength(node);
+    for (UINTN i = 0; i < length; i++) {
+      SerialPrintf("%c%c", kHexDigits[bytes[at + i] >> 4], kHexDigits[bytes[at + i] & 15]);
+    }
+    at += length;
+    if (node->Type == END_DEVICE_PATH_TYPE || length < sizeof(EFI_DEVICE_PATH_PROTOCOL)) {
+      break;
+    }
+  }
+  SerialPrintf("\n");
 }
 
 // What StartImage needs of the loader, made ready before any measurement.
@@ -356,6 +461,7 @@ EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
   }
   // While the loader runs, its text stays off a graphics screen.
   ConsoleOfferScreenText(&gConsole, true);
+  ReportTsc("start-image", ReadTsc());
   status = gBS->StartImage(loader, nullptr, nullptr);
   ConsoleOfferScreenText(&gConsole, false);
   return status;
@@ -378,6 +484,11 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   PlatformConfig config;
   ReadConfig(root, &config);
   const LoaderLaunch launch = PrepareLoader(root, device, config);
+  ReportBootDevicePath(device);
+  if (config.timedReadPath != nullptr) {
+    TimeFirmwareRead(root, config.timedReadPath);
+  }
+  ServeExactTimes(root, device);
   const UINTN directories = MemoryWarmDirectoryCache(root);
   root->Close(root);
   InstallProtocols(config);
@@ -395,6 +506,9 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   const UINT64 pagesAfter = FreePagesOrFail("after the loader");
 
   SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));
+  if (gTimes.entries != nullptr) {
+    SerialPrintf("platform: exact times served %u times\n", FileTimesServed());
+  }
   const bool changed = pagesAfter != pagesBefore;
   if (changed) {
     SerialPrintf("platform: memory changed (before %u pages, after %u pages)\n", pagesBefore, pagesAfter);

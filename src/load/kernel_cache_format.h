@@ -14,7 +14,7 @@
 namespace nimb {
 
 // The four characters of `signature` and `compressType`, as big-endian words.
-constexpr uint32_t kCacheSignature = 0x636F6D70;  // "comp"
+constexpr uint32_t kCacheSignature = 0x636F6D70;     // "comp"
 constexpr uint32_t kCacheCompressLzss = 0x6C7A7373;  // "lzss"
 
 constexpr size_t kCacheHeaderBytes = 384;
@@ -27,14 +27,14 @@ constexpr size_t kCacheKeyBytes = kCacheModelBytes + kCacheBootPathBytes;
 
 // Every number big-endian.
 struct CacheHeader {
-  uint8_t signature[4];         // "comp"
-  uint8_t compressType[4];      // "lzss"
-  uint8_t adler32[4];           // of the uncompressed data
+  uint8_t signature[4];     // "comp"
+  uint8_t compressType[4];  // "lzss"
+  uint8_t adler32[4];       // of the uncompressed data
   uint8_t uncompressedSize[4];
-  uint8_t compressedSize[4];    // bytes behind the header
+  uint8_t compressedSize[4];  // bytes behind the header
   uint8_t reserved[44];
-  uint8_t modelName[kCacheModelBytes];        // first byte 0: not compared
-  uint8_t bootPath[kCacheBootPathBytes];      // first byte 0: not compared
+  uint8_t modelName[kCacheModelBytes];    // first byte 0: not compared
+  uint8_t bootPath[kCacheBootPathBytes];  // first byte 0: not compared
 };
 static_assert(sizeof(CacheHeader) == kCacheHeaderBytes, "the header is 384 bytes");
 static_assert(offsetof(CacheHeader, modelName) == 64 && offsetof(CacheHeader, bootPath) == 128,

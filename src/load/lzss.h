@@ -15,7 +15,9 @@ constexpr UINT32 kLzssMaxMatch = 18;
 
 // Decodes the `length` bytes at `source` into `destination`, writing at most
 // `capacity` bytes: a stream that would produce more stops there. Returns the
-// number of bytes written. One pass, no allocation.
+// number of bytes decoded. The ring starts afresh at every call. One pass,
+// no allocation; bytes of the destination behind the count returned may
+// have been written too.
 UINT64 DecompressLzss(UINT8 *destination, UINT64 capacity, const UINT8 *source, UINT32 length);
 
 }  // namespace nimb

@@ -11,11 +11,20 @@ UINT64 gKernelRegionTop = 0;
 UINT64 gKernelRegionBase = 0xFFFFFFFF;
 DeviceTreeNode *gMemoryMapNode = nullptr;
 
+// The region lies below 4 GiB: its addresses cross to the kernel as 32-bit
+// words.
+constexpr UINT64 kKernelRegionLimit = 0x100000000ULL;
+
 UINT64 AllocateKernelPages(UINT64 *address, UINT64 *size) {
-  UINT64 pages = EFI_SIZE_TO_PAGES(*size);
+  // Counted so that no size overflows.
+  UINT64 pages = (*size >> EFI_PAGE_SHIFT) + ((*size & (EFI_PAGE_SIZE - 1)) != 0 ? 1 : 0);
+  // A range that would reach past the limit is refused as the firmware
+  // refuses memory it has not.
+  const bool fits = *size <= kKernelRegionLimit && *address <= kKernelRegionLimit - *size;
   EFI_PHYSICAL_ADDRESS placed = *address;
   EFI_STATUS status =
-      TrackedAllocatePages(AllocateAddress, EfiLoaderData, static_cast<UINTN>(pages), &placed);
+      fits ? TrackedAllocatePages(AllocateAddress, EfiLoaderData, static_cast<UINTN>(pages), &placed)
+           : EFI_OUT_OF_RESOURCES;
   if (EFI_ERROR(status)) {
     printf("Error allocating 0x%x pages at 0x%x alloc type %d\n", static_cast<UINT32>(pages),
            static_cast<UINT32>(*address), static_cast<INT32>(AllocateAddress));

@@ -145,26 +145,16 @@ void FollowRegion(const EFI_MEMORY_DESCRIPTOR *region) {
   }
 }
 
-}  // namespace
-
-UINT64 LShiftU64(UINT64 value, UINTN count) {
-  return count < 64 ? value << count : 0;
-}
-
-// True when the range from `start` of `size` bytes lies wholly in
-// descriptors that are free behind ExitBootServices, none of them the one
-// that holds `inUse`: from the start, step from a free descriptor that holds
-// the address to that descriptor's end.
-static bool RangeIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
-                        UINT64 descriptorSize, UINT64 start, UINT64 size, UINT64 inUse) {
-  const UINT64 end = start + size;
-  for (UINT64 at = start; at < end;) {
+// Whether [start, end) lies wholly in conventional memory of the map.
+bool IsConventional(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
+                    UINT64 descriptorSize, UINT64 start, UINT64 end) {
+  // From `start`, step from one conventional descriptor that holds the
+  // address to that descriptor's end.
+  UINT64 at = start;
+  while (at < end) {
     UINT64 reached = at;
     for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
-      const bool free = d->Type == EfiConventionalMemory || d->Type == EfiBootServicesCode ||
-                        d->Type == EfiBootServicesData;
-      if (free && InRange(at, d->PhysicalStart, ByteSize(d)) &&
-          !InRange(inUse, d->PhysicalStart, ByteSize(d))) {
+      if (d->Type == EfiConventionalMemory && InRange(at, d->PhysicalStart, ByteSize(d))) {
         reached = d->PhysicalStart + ByteSize(d);
         break;
       }
@@ -177,29 +167,39 @@ static bool RangeIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_
   return true;
 }
 
+}  // namespace
+
+UINT64 LShiftU64(UINT64 value, UINTN count) {
+  return count < 64 ? value << count : 0;
+}
+
 BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
-                          UINT64 descriptorSize, UINT64 areaStart, UINT64 inUse) {
+                          UINT64 descriptorSize, UINT64 areaStart, UINT64 spareBytes) {
   constexpr UINT64 kAddressLimit = 0x100000000;
-  if (descriptorSize < sizeof(EFI_MEMORY_DESCRIPTOR) || areaStart >= kAddressLimit) {
+  if (descriptorSize < sizeof(EFI_MEMORY_DESCRIPTOR) || areaStart >= kAddressLimit ||
+      spareBytes > kAddressLimit) {
     return FALSE;
   }
-  // Addresses as MapRuntimeServices gives them; only the regions it copies
-  // need memory: the others only take address space.
+  // The addresses as the move gives them out. Only the regions that are
+  // copied need free memory at their new place: memory-mapped I/O only takes
+  // up addresses, and nothing is written there.
   UINT64 next = areaStart;
   for (const EFI_MEMORY_DESCRIPTOR *d = mapStart; d < mapEnd; d = Next(d, descriptorSize)) {
     if (!GetsRuntimeAddress(d)) {
       continue;
     }
     const UINT64 size = ByteSize(d);
-    if (size > kAddressLimit || next + size > kAddressLimit) {
+    if (size > kAddressLimit - next) {
       return FALSE;
     }
-    if (IsRuntimeRegion(d) && !RangeIsFree(mapStart, mapEnd, descriptorSize, next, size, inUse)) {
+    if (IsRuntimeRegion(d) && !IsConventional(mapStart, mapEnd, descriptorSize, next, next + size)) {
       return FALSE;
     }
     next += size;
   }
-  return TRUE;
+  // The spare pages behind the area are only counted in the kernel region:
+  // nothing is written there, but the kernel reaches them in 32 bits.
+  return spareBytes <= kAddressLimit - next;
 }
 
 EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRIPTOR *mapEnd,

@@ -12,17 +12,13 @@ namespace nimb {
 // more.
 UINT64 LShiftU64(UINT64 value, UINTN count);
 
-// True when what MapRuntimeServices will write from `areaStart` on (each
-// runtime code or data region at the address it will get) lies below 4 GiB
-// in memory that is free once boot services have ended (conventional memory,
-// boot services code and data), and not in the descriptor that holds
-// `inUse` (the boot thread's stack): the move overwrites nothing that is
-// still needed, and the kernel reaches it with 32-bit addresses. The address
-// space given to other runtime descriptors (memory-mapped I/O) is not
-// written, and neither are the spare pages behind the area: they need not be
-// free.
+// True when the places that MapRuntimeServices will copy runtime regions to,
+// from `areaStart` on, lie wholly in conventional memory of the map, so that
+// the move overwrites nothing that is in use, and when the whole area with
+// `spareBytes` behind it stays below 4 GiB, where the kernel reaches it with
+// 32-bit addresses. Memory-mapped I/O takes up addresses only.
 BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
-                          UINT64 descriptorSize, UINT64 areaStart, UINT64 inUse);
+                          UINT64 descriptorSize, UINT64 areaStart, UINT64 spareBytes);
 
 // Walks the memory map from `mapStart` to `mapEnd` by `descriptorSize`.
 // Each descriptor with EFI_MEMORY_RUNTIME (reserved memory apart, which

@@ -14,15 +14,20 @@ constexpr UINT32 kProgressSaveTableBytes = kProgressCells * kProgressSamplesPerC
 // Sets the screen up once per resume: graphics, then the preview at
 // `preview` (null: none) if it fits the screen, else the logo; then the bar
 // at its start, its background samples saved in `saveTable`. The preview is
-// read only between `preview` and `previewEnd`.
+// read only between `preview` and `previewEnd`. Without a frame buffer
+// nothing is drawn; the bar needs 16- or 32-bit pixels and a screen of at
+// least 190 x 97 pixels.
 void DrawResumeScreen(const UINT8 *preview, const UINT8 *previewEnd, UINT8 *saveTable);
 
-// Repaints the cells from `firstCell` to `lastCell` (18 at most): those
-// below `lastCell` as finished, the rest as the one being worked on.
+// Repaints the cells from `firstCell` (0 at the least) to `lastCell` (18 at
+// the most): those below `lastCell` as finished, the rest as the one being
+// worked on, blended over the backgrounds that `saveTable` keeps. Keeps no
+// state: a repaint at the same step gives the same pixels.
 void DrawResumeProgress(const UINT8 *saveTable, INT32 firstCell, INT32 lastCell);
 
-// Decodes, greys and blurs the preview into the frame buffer; false (and
-// nothing drawn) when it does not fit the screen or its data is broken.
+// Decodes, greys and blurs the preview into `frameBuffer` in one pass; false
+// (and nothing drawn) when it does not fit the screen, its data is broken
+// (a run of 0 pixels, a row or run outside the section) or the pool is dry.
 BOOLEAN DrawResumePreview(const UINT8 *preview, const UINT8 *previewEnd, UINT8 *frameBuffer, UINT32 width,
                           UINT32 height, UINT32 bytesPerPixel, INT32 rowBytes);
 

@@ -4,6 +4,11 @@
 // of each input.
 #pragma once
 
+#include <stdlib.h>
+
+#include <string>
+#include <vector>
+
 #include "boot/boot.h"
 #include "hostfw/hostfw.h"
 #include "memory/tracking.h"
@@ -18,6 +23,59 @@ inline void AttachLoader(hostfw::Firmware &fw) {
   nimb::gMemoryTags = nullptr;
   nimb::gFreeMemoryTags = nullptr;
   nimb::gMemoryTagBlocks = nullptr;
+}
+
+// Declares all of the arena above its first `usable` bytes reserved, so that
+// a segment or block of a gigabyte is refused at once instead of being
+// filled byte by byte on every run.
+inline void LimitUsableMemory(hostfw::Firmware &fw, UINT64 usable) {
+  UINT64 cut = hostfw::kArenaBase + usable;
+  for (const EFI_MEMORY_DESCRIPTOR &d : fw.MemoryMap()) {
+    UINT64 start = d.PhysicalStart;
+    UINT64 end = start + d.NumberOfPages * EFI_PAGE_SIZE;
+    if (d.Type != EfiConventionalMemory || end <= cut)
+      continue;
+    if (start < cut)
+      start = cut;
+    fw.AddMemoryRegion(EfiReservedMemoryType, start, (end - start) / EFI_PAGE_SIZE, 0);
+  }
+}
+
+// A firmware for targets that read files: quiet (messages would pile up in
+// its records over millions of runs), with the usable memory limited, and
+// a directory volume over a fresh host directory whose root stays open.
+struct VolumeMachine {
+  hostfw::Firmware fw;
+  std::string directory;
+  EFI_HANDLE device = nullptr;
+  EFI_FILE *root = nullptr;
+
+  VolumeMachine() {
+    fw.SetConOutPresent(false);
+    fw.SetStdErrPresent(false);
+    LimitUsableMemory(fw, 32ull << 20);
+    char pattern[] = "/tmp/nimb-fuzz-XXXXXX";
+    directory = mkdtemp(pattern);
+    device = fw.AddDirectoryVolume(directory);
+    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
+    fw.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
+                                      reinterpret_cast<void **>(&fileSystem));
+    if (fileSystem == nullptr || EFI_ERROR(fileSystem->OpenVolume(fileSystem, &root)))
+      abort();
+  }
+};
+
+// For a target whose firmware records every file name opened: each input
+// then leaves heap behind it, and libFuzzer would scan the whole arena for
+// leaks after each. The loader's own memory is checked by the firmware's
+// counts instead. Called from LLVMFuzzerInitialize.
+inline void WithoutLeakScan(int *argc, char ***argv) {
+  static std::vector<char *> arguments(*argv, *argv + *argc);
+  static char noLeaks[] = "-detect_leaks=0";
+  arguments.push_back(noLeaks);
+  arguments.push_back(nullptr);
+  *argc += 1;
+  *argv = arguments.data();
 }
 
 }  // namespace nimbfuzz

@@ -1,6 +1,7 @@
 #include "checks.h"
 
 #include "devicetree.h"
+#include "drivers.h"
 #include "memory.h"
 #include "memorymap.h"
 #include "report.h"
@@ -39,6 +40,9 @@ void CheckEntryState(const EntryState &s) {
   Line("entry cs=0x%x ds=0x%x es=0x%x fs=0x%x gs=0x%x ss=0x%x", s.cs, s.ds, s.es, s.fs, s.gs, s.ss);
   Line("entry cr0=0x%x cr3=0x%x cr4=0x%x efer=0x%llx gdt=0x%x limit=0x%x", s.cr0, s.cr3, s.cr4,
        static_cast<unsigned long long>(s.eferHigh) << 32 | s.eferLow, s.gdtBase, s.gdtLimit);
+  // The time stamp counter at entry: the end of timings that the platform
+  // layer starts (platform: tsc ... lines) in the same run.
+  Line("tsc entry=0x%llx", static_cast<unsigned long long>(s.tscHigh) << 32 | s.tscLow);
 
   Check("entry-eax-ebx", s.eax == s.ebx, "eax=0x%x ebx=0x%x", s.eax, s.ebx);
   Check("entry-edi", s.edi == s.entryAddress, "edi=0x%x, entry at 0x%x", s.edi, s.entryAddress);
@@ -299,6 +303,7 @@ bool ReportBoot(const EntryState &state) {
     uint32_t fixedCount = count;
     if (CheckDeviceTree(*args)) {
       CheckMemoryRanges(*args, region, areas, &count);
+      CheckDrivers(region, state.imageEnd, areas, fixedCount, count);
     }
     CheckLayout(region, areas, count, fixedCount);
     CheckMemoryMap(*args, region, areas, count);

@@ -22,6 +22,9 @@ KernelEntry:
   movl %edi, gEntryState + ENTRY_EDI
   movl %ebp, gEntryState + ENTRY_EBP
   movl %esp, gEntryState + ENTRY_ESP
+  rdtsc
+  movl %eax, gEntryState + ENTRY_TSC_LOW
+  movl %edx, gEntryState + ENTRY_TSC_HIGH
   movw %cs, gEntryState + ENTRY_CS
   movw %ds, gEntryState + ENTRY_DS
   movw %es, gEntryState + ENTRY_ES

@@ -28,7 +28,9 @@
 #define ENTRY_ENTRY_ADDRESS 88
 #define ENTRY_IMAGE_START 92
 #define ENTRY_IMAGE_END 96
-#define ENTRY_SIZE 100
+#define ENTRY_TSC_LOW 100
+#define ENTRY_TSC_HIGH 104
+#define ENTRY_SIZE 108
 
 #ifndef __ASSEMBLER__
 
@@ -50,6 +52,9 @@ struct EntryState {
   uint32_t entryAddress;  // where the stub starts: EDI should hold this
   uint32_t imageStart;    // the kernel's own image in memory
   uint32_t imageEnd;
+  // The time stamp counter right after the general registers were saved:
+  // the moment of entry, for timings that end in the kernel.
+  uint32_t tscLow, tscHigh;
 };
 
 static_assert(offsetof(EntryState, edi) == ENTRY_EDI);
@@ -61,6 +66,7 @@ static_assert(offsetof(EntryState, gdtLimit) == ENTRY_GDT_LIMIT);
 static_assert(offsetof(EntryState, gdtBase) == ENTRY_GDT_BASE);
 static_assert(offsetof(EntryState, entryAddress) == ENTRY_ENTRY_ADDRESS);
 static_assert(offsetof(EntryState, imageEnd) == ENTRY_IMAGE_END);
+static_assert(offsetof(EntryState, tscHigh) == ENTRY_TSC_HIGH);
 static_assert(sizeof(EntryState) == ENTRY_SIZE);
 
 constexpr uint32_t kEntryEcx = 0xC0000080;  // IA32_EFER's number, left by the gate

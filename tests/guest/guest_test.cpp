@@ -19,6 +19,7 @@
 #include "bootargs.h"
 #include "checks.h"
 #include "devicetree.h"
+#include "drivers.h"
 #include "entry.h"
 #include "hold.h"
 #include "memory.h"
@@ -453,6 +454,15 @@ struct FakeBoot {
   uint64_t runtimeServicesPointer = kRuntimeServices;
   uint64_t runtimeServicesSignature = g::kRuntimeServicesSignature;
   Bytes picture = Words({128, 128, 0});
+  // The staged driver of Driver-10c000: 0x800 bytes, its code behind the text.
+  Bytes driver = [] {
+    Bytes text = Text("<key>VzBundleIdentifier</key><string>fake</string>");
+    const uint32_t textLength = static_cast<uint32_t>(text.size());
+    Bytes block = Words({kDriver + 16, textLength, kDriver + 16 + textLength, 0x800 - 16 - textLength});
+    block.insert(block.end(), text.begin(), text.end());
+    block.resize(0x800, 0x90);
+    return block;
+  }();
 
   FakeBoot() {
     entry.eax = entry.ebx = kBootArgsAddress;
@@ -558,6 +568,7 @@ struct FakeBoot {
     std::memcpy(At(kBootArgsAddress), &args, sizeof(args));
     std::memcpy(At(kGate), gdt, sizeof(gdt));
     std::memcpy(At(kPicture), picture.data(), picture.size());
+    std::memcpy(At(kDriver), driver.data(), driver.size());
     Bytes table;
     Put64(table, systemTableSignature);
     table.resize(g::kSystemTableRuntimeServices);
@@ -710,7 +721,7 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
        [](FakeBoot &b) {
          b.tree.Find("/chosen/memory-map")->Add("Driver-180000", Words({0x180000, 0x100}));
        },
-       {"ranges-inside", "memmap-loader-data"}},
+       {"ranges-inside", "memmap-loader-data", "driver-blocks"}},
       {"range in the runtime area",
        [](FakeBoot &b) {
          b.tree.Find("/chosen/memory-map")->Add("Extra", Words({kRuntimeStart + 0x3000, 0x100}));
@@ -720,12 +731,12 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
        [](FakeBoot &b) {
          *b.tree.Find("/chosen/memory-map")->Property("Driver-10c000") = Words({kDriver + 0x100, 8});
        },
-       {"ranges-names"}},
+       {"ranges-names", "driver-blocks"}},
       {"driver package named for another address",
        [](FakeBoot &b) {
          b.tree.Find("/chosen/memory-map")->Add("DriversPackage-10c900", Words({kDriver + 0x800, 8}));
        },
-       {"ranges-names"}},
+       {"ranges-names", "drivers-one-way"}},
       {"colour table of 0x200 bytes",
        [](FakeBoot &b) {
          *b.tree.Find("/chosen/memory-map")->Property("BootCLUT") = Words({kClut, 0x200});
@@ -745,7 +756,7 @@ TEST(GuestBoot, EachBrokenPromiseFailsItsCheck) {
        [](FakeBoot &b) {
          b.tree.Find("/chosen/memory-map")->Add("Driver-106100", Words({kClut + 0x100, 8}));
        },
-       {"region-layout"}},
+       {"region-layout", "driver-blocks"}},
       {"memory map outside the region",
        [](FakeBoot &b) { b.args.memoryMap = 0x120000; },
        {"region-layout", "memmap-loader-data"}},
@@ -814,6 +825,96 @@ TEST(GuestHold, ReadsTheFirstHoldWord) {
   for (const Row &row : rows) {
     uint32_t length = row.length != 0 ? row.length : static_cast<uint32_t>(row.line.size());
     EXPECT_EQ(g::HoldSeconds(row.line.data(), length), row.seconds) << row.name;
+  }
+}
+
+}  // namespace
+
+// --- drivers -------------------------------------------------------------------------
+
+namespace {
+
+// A staged block at `address`: header, text with its zero, code.
+Bytes DriverBlock(uint32_t address, const std::string &plist, const Bytes &code) {
+  Bytes text = Text(plist);
+  Bytes block = Words({address + 16, static_cast<uint32_t>(text.size()),
+                       code.empty() ? 0 : address + 16 + static_cast<uint32_t>(text.size()),
+                       static_cast<uint32_t>(code.size())});
+  block.insert(block.end(), text.begin(), text.end());
+  block.insert(block.end(), code.begin(), code.end());
+  return block;
+}
+
+TEST(GuestDrivers, BlocksPackageAndPrelinkedSegment) {
+  constexpr uint32_t kImageEnd = 0x180123;  // the segment would be at 0x181000
+  constexpr uint32_t kBlock = 0x190000;
+  const std::string plist = "<dict><key>VzBundleIdentifier</key>\n<string>com.x.Disk</string></dict>";
+  const Bytes code = {1, 2, 3, 4, 5};
+  const Bytes good = DriverBlock(kBlock, plist, code);
+  const uint32_t length = static_cast<uint32_t>(good.size());
+  struct Row {
+    const char *name;
+    std::function<void()> setUp;  // on zeroed memory
+    std::vector<g::Area> areas;
+    const char *line;  // a line the report must hold
+    std::set<std::string> failed;
+  };
+  auto put = [](uint32_t address, const Bytes &bytes) { std::copy(bytes.begin(), bytes.end(), At(address)); };
+  auto staged = [&] { put(kBlock, good); };
+  auto prelinked = [&] {
+    put(0x181000, Words({0x4B4C504E, 2}));
+    put(0x182000, DriverBlock(0x182000, plist, code));
+    put(0x183000, DriverBlock(0x183000, "<key>x</key>", {}));
+  };
+  const Row rows[] = {
+      {"a staged block",
+       staged,
+       {{"Driver-190000", kBlock, length}},
+       "driver \"com.x.Disk\" from=loader address=0x190000 plist=0x47 code=0x5 sum=0x280010",
+       {}},
+      {"range one byte long",
+       staged,
+       {{"Driver-190000", kBlock, length + 1}},
+       "drivers from=loader",
+       {"driver-blocks"}},
+      {"text without its zero",
+       [&] {
+         staged();
+         At(kBlock + 16 + 0x46)[0] = '>';
+       },
+       {{"Driver-190000", kBlock, length}},
+       "drivers from=loader",
+       {"driver-blocks"}},
+      {"a package",
+       [&] { put(kBlock, code); },
+       {{"DriversPackage-190000", kBlock, 5}},
+       "package address=0x190000 length=0x5 sum=0x280010",
+       {}},
+      {"prelinked", prelinked, {}, "drivers from=cache blocks=2 package=0", {}},
+      {"prelinked and staged",
+       [&] {
+         prelinked();
+         staged();
+       },
+       {{"Driver-190000", kBlock, length}},
+       "drivers from=cache blocks=3",
+       {"drivers-one-way"}},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    std::fill(gMemory.begin(), gMemory.end(), 0);
+    row.setUp();
+    g::ReportReset();
+    const g::KernelRegion region = {kMemoryBase, kMemoryBase + kMemorySize - 0x1000,
+                                    kMemoryBase + kMemorySize};
+    std::string text = Capture([&] {
+      g::CheckDrivers(region, kImageEnd, row.areas.data(), 0, static_cast<uint32_t>(row.areas.size()));
+    });
+    EXPECT_NE(text.find(row.line), std::string::npos) << text;
+    for (const char *check : {"driver-blocks", "drivers-one-way"}) {
+      bool failed = text.find(std::string("check ") + check + " FAIL") != std::string::npos;
+      EXPECT_EQ(failed, row.failed.count(check) == 1) << check << "\n" << text;
+    }
   }
 }
 

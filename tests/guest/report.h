@@ -3,6 +3,7 @@
 //
 //   kernel: start
 //   kernel: entry <register>=0x<hex> ...              the state at entry
+//   kernel: tsc entry=0x<hex>                          time stamp counter at entry
 //   kernel: check <name> ok|FAIL[ <detail>]            one per check
 //   kernel: bootargs <field>=<value>                   one per BootArgs field
 //   kernel: tree <indent><line>                        the device tree
@@ -11,6 +12,7 @@
 //   kernel: efi <field>=<value> ...                    the firmware's tables
 //   kernel: result pass|fail (<n> checks, <m> failed)  the end of the report
 //   kernel: hold <n> s                                  guest.hold=<n>: waiting
+//   kernel: driver ..., package ..., drivers ...       what came of drivers (drivers.h)
 //
 // Numbers are C literals: hexadecimal with 0x, or decimal. Text values stand
 // between double quotes, with \" and \\ escaped and any byte outside

@@ -35,7 +35,9 @@ from pathlib import Path
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
-    PARTITION_GUID,
+    EXTENSIONS_DIR,
+    KernelCache,
+    mkdisk,
     SCENARIOS,
     GuestFile,
     Scenario,
@@ -49,13 +51,13 @@ REPO = Path(__file__).resolve().parents[2]
 # table, no code in both.
 EXIT_CODE_HEADERS = (REPO / "platform" / "exitcodes.h", REPO / "tests" / "guest" / "exitcodes.h")
 GUEST_DIR = REPO / "build" / "tests" / "guest"
+# The host tools (kcache); --tools-dir changes it.
+TOOLS_DIR = REPO / "build" / "tools"
 ARTWORK = REPO / "src" / "screen" / "artwork.cpp"
 DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
-DISK_BYTES = 64 << 20
-PARTITION_OFFSET = 1 << 20  # first sector 2048
 
 # The platform's report, on the serial port.
 REPORT_STATUS = re.compile(r"platform: loader returned 0x([0-9a-f]+) \((\w+)\)")
@@ -196,6 +198,7 @@ KERNEL_RESULT = re.compile(r"(pass|fail) \((\d+) checks?, (\d+) failed\)")
 KERNEL_RANGE = re.compile(r"(.+) address=(0x[0-9a-f]+) length=(0x[0-9a-f]+)")
 KERNEL_MEMMAP_TYPE = re.compile(r"type (\S+) count=(\d+) pages=(0x[0-9a-f]+)")
 KERNEL_HOLD = re.compile(r"(\d+) s")
+KERNEL_DRIVER = re.compile(r'(".*") from=(\w+) address=(0x[0-9a-f]+) plist=(0x[0-9a-f]+) code=(0x[0-9a-f]+) sum=(0x[0-9a-f]+)')
 TREE_NODE = re.compile(r"( *)([^=]*)/ \((\d+) propert(?:y|ies), (\d+) child(?:ren)?\)")
 TREE_PROPERTY = re.compile(r"( *)(\S.*?) = (.*)")
 ROOT_UUID_MESSAGE = re.compile(r"root device uuid is '(.*)'")
@@ -225,6 +228,10 @@ class KernelReport:
     efi: dict = dataclasses.field(default_factory=dict)  # field -> number
     result: tuple | None = None  # (passed, checks, failed) of the result line
     hold: int | None = None  # seconds of a hold line
+    drivers: list = dataclasses.field(default_factory=list)  # (identifier, from, plist, code, sum), in order
+    package: tuple | None = None  # (length, sum) of the driver package
+    drivers_from: str | None = None  # "loader", "cache" or "none"
+    tsc: dict = dataclasses.field(default_factory=dict)  # moment -> time stamp counter
     unknown: list = dataclasses.field(default_factory=list)  # lines of no known kind
 
     def failed_checks(self):
@@ -311,6 +318,16 @@ def parse_kernel_report(log):
         elif kind == "result" and KERNEL_RESULT.fullmatch(rest):
             verdict, checks, failed = KERNEL_RESULT.fullmatch(rest).groups()
             report.result = (verdict == "pass", int(checks), int(failed))
+        elif kind == "driver" and KERNEL_DRIVER.fullmatch(rest):
+            identifier, source, _, plist, code, checksum = KERNEL_DRIVER.fullmatch(rest).groups()
+            report.drivers.append((unquote(identifier)[0], source, int(plist, 16), int(code, 16), int(checksum, 16)))
+        elif kind == "package":
+            numbers = fields(rest)
+            report.package = (numbers.get("length"), numbers.get("sum"))
+        elif kind == "tsc":
+            report.tsc.update(fields(rest))
+        elif kind == "drivers":
+            report.drivers_from = fields(rest).get("from")
         elif kind == "hold" and KERNEL_HOLD.fullmatch(rest):
             report.hold = int(KERNEL_HOLD.fullmatch(rest).group(1))
         else:
@@ -336,7 +353,42 @@ def describe(wanted):
     return repr(wanted)
 
 
-def check_kernel(log, expect):
+def content_bytes(content, guest_dir=GUEST_DIR):
+    """The bytes of a file's content as scenarios give it: bytes, text, a
+    host Path or a GuestFile."""
+    if isinstance(content, GuestFile):
+        content = Path(guest_dir) / content.name
+    if isinstance(content, Path):
+        return content.read_bytes()
+    return content.encode() if isinstance(content, str) else bytes(content)
+
+
+def check_drivers(report, expect, guest_dir=GUEST_DIR):
+    """Problems with the drivers that the kernel reported against `expect`:
+    where they came from, the driver blocks in order (identifier, length of
+    the text with its zero, length and Adler-32 of the code) and the
+    package (length and Adler-32)."""
+    problems = []
+    if expect.drivers_from is not None and report.drivers_from != expect.drivers_from:
+        problems.append(f"kernel: drivers from {report.drivers_from}, wanted {expect.drivers_from}")
+    if expect.drivers is not None:
+        wanted = []
+        for identifier, driver in expect.drivers.items():
+            code = content_bytes(driver.code, guest_dir)
+            wanted.append((identifier, len(content_bytes(driver.plist)) + 1, len(code), zlib.adler32(code)))
+        got = [(identifier, plist, code, checksum) for identifier, _, plist, code, checksum in report.drivers]
+        if got != wanted:
+            show = lambda rows: [f"{i} plist={p:#x} code={c:#x} sum={s:#x}" for i, p, c, s in rows]  # noqa: E731
+            problems.append(f"kernel: drivers {show(got)}, wanted {show(wanted)}")
+    if expect.package is not None:
+        package = content_bytes(expect.package, guest_dir)
+        wanted = (len(package), zlib.adler32(package))
+        if report.package != wanted:
+            problems.append(f"kernel: package (length, sum) {report.package}, wanted {wanted}")
+    return problems
+
+
+def check_kernel(log, expect, guest_dir=GUEST_DIR):
     """Problems with the kernel's report against `expect` (KernelExpect), and
     with what holds in any report: one start, a result line that agrees
     with the checks, no broken tree, a "boot-uuid" that is the text the
@@ -384,6 +436,8 @@ def check_kernel(log, expect):
             problems.append(f"kernel: no range {name}")
         elif length is not None and report.ranges[name][1] != length:
             problems.append(f"kernel: range {name} length {report.ranges[name][1]:#x}, wanted {length:#x}")
+
+    problems += check_drivers(report, expect, guest_dir)
 
     printed = ROOT_UUID_MESSAGE.findall(log)
     uuid = report.tree.get("/chosen", {}).get("boot-uuid")
@@ -572,40 +626,6 @@ def render_config(keys):
     return "".join(f"{key}={config_value(value)}\n" for key, value in items)
 
 
-def run_tool(*args, env=None):
-    subprocess.run(args, check=True, stdout=subprocess.DEVNULL, stderr=subprocess.PIPE, env=env)
-
-
-def build_disk(image, files, directories=()):
-    """A GPT disk of DISK_BYTES with one EFI system partition, of the GUID
-    PARTITION_GUID, holding `files` (ESP path with '/' -> bytes or host Path)
-    and `directories` (ESP paths)."""
-    image = Path(image).resolve()
-    with open(image, "wb") as disk:
-        disk.truncate(DISK_BYTES)
-    # A fresh image has nothing to zap, and each of sgdisk's steps costs a
-    # second of waiting for the kernel to reread the table.
-    run_tool("sgdisk", "-o", "-n", "1:2048:0", "-t", "1:EF00", "-u", f"1:{PARTITION_GUID}", str(image))
-    volume = f"{image}@@{PARTITION_OFFSET}"
-    env = dict(os.environ, MTOOLS_SKIP_CHECK="1")
-    run_tool("mformat", "-i", volume, "-F", "-v", "ESP", "::", env=env)
-    needed = set()
-    for path in list(directories) + [str(Path(p).parent) for p in files]:
-        parts = Path(path.strip("/")).parts
-        needed.update("/".join(parts[: i + 1]) for i in range(len(parts)))
-    needed.discard("")
-    for directory in sorted(needed, key=lambda d: (d.count("/"), d)):
-        run_tool("mmd", "-i", volume, f"::/{directory}", env=env)
-    staging = image.parent / "files"
-    for path, content in files.items():
-        source = content
-        if not isinstance(content, Path):
-            source = staging / path.strip("/")
-            source.parent.mkdir(parents=True, exist_ok=True)
-            source.write_bytes(content.encode() if isinstance(content, str) else content)
-        run_tool("mcopy", "-i", volume, str(Path(source).resolve()), f"::/{path.strip('/')}", env=env)
-
-
 # --- QEMU -----------------------------------------------------------------------------
 
 
@@ -724,30 +744,68 @@ def scenario_config(scenario, override=None):
     return config
 
 
-def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
-    """Builds the scenario's disk in `workdir`; returns its path."""
-    efi_dir = Path(efi_dir)
-    files = {
-        "EFI/BOOT/BOOTX64.EFI": efi_dir / "BOOTX64.efi",
-        "EFI/BOOT/nimbboot.efi": Path(loader) if loader else efi_dir / "nimbboot.efi",
-    }
-    for path in files.values():
-        if not path.is_file():
-            raise FileNotFoundError(f"{path} is missing: build the EFI programs first")
-    config = scenario_config(scenario, config_override)
+def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
+    """Writes the scenario's files and directories (the extensions
+    directory's too) into the host directory `volume`, with platform.cfg
+    when `config` has keys or the scenario asks for the file, then gives
+    the paths of `scenario.times` their exact times."""
+    files = {**(scenario.extensions or {}), **scenario.files}
     if config or scenario.config_file:
-        files["EFI/BOOT/platform.cfg"] = render_config(config)
-    for path, content in scenario.files.items():
-        if isinstance(content, GuestFile):
-            content = Path(guest_dir) / content.name
-            if not content.is_file():
-                raise FileNotFoundError(f"{content} is missing: build the target guest_kernel first")
-        files[path] = content
+        files[f"{mkdisk.BOOT_DIR}/{mkdisk.CONFIG_NAME}"] = render_config(config)
     for path in scenario.remove:
         files.pop(path, None)
+    for directory in scenario.directories:
+        (volume / directory.strip("/")).mkdir(parents=True, exist_ok=True)
+    for path, content in files.items():
+        target = volume / path.strip("/")
+        target.parent.mkdir(parents=True, exist_ok=True)
+        if isinstance(content, GuestFile) and not (Path(guest_dir) / content.name).is_file():
+            raise FileNotFoundError(f"{Path(guest_dir) / content.name} is missing: build the target guest_kernel first")
+        target.write_bytes(content_bytes(content, guest_dir))
+    # Deepest first: setting a directory's time after its children's.
+    for path, when in sorted(scenario.times.items(), key=lambda item: -item[0].count("/")):
+        mkdisk.set_time(volume / path.strip("/"), mkdisk.parse_time(when))
+
+
+def make_cache(cache, volume):
+    """Writes the kernel cache of `cache` (KernelCache) on the staged
+    volume with kcache, for the machine the harness boots (model and boot
+    device path), then shifts its time or breaks its checksum as asked.
+    Returns the name the loader will look for, as kcache printed it."""
+    kcache = Path(TOOLS_DIR) / "kcache"
+    if not kcache.is_file():
+        raise FileNotFoundError(f"{kcache} is missing: build the target kcache first")
+    args = [str(kcache), str(volume / cache.kernel), "--model", cache.model,
+            "--boot-path-hex", mkdisk.boot_device_path().hex(), "--volume", str(volume)]
+    for arg in cache.args:
+        args.append(str(volume / arg[len("volume:"):]) if arg.startswith("volume:") else arg)
+    done = subprocess.run(args, check=True, capture_output=True, text=True)
+    name = done.stdout.strip().splitlines()[-1]
+    path = volume / name.replace("\\", "/")
+    when = path.stat().st_mtime_ns
+    if cache.break_checksum:
+        data = bytearray(path.read_bytes())
+        data[8] ^= 0xFF  # the header's Adler-32
+        path.write_bytes(data)
+    mkdisk.set_time(path, when + int(cache.shift * 1_000_000_000))
+    return name
+
+
+def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest_dir=GUEST_DIR):
+    """Builds the scenario's disk in `workdir` with the disk tool. Returns
+    its path and the name of the kernel cache on it, or None."""
+    efi_dir = Path(efi_dir)
+    volume = workdir / "volume"
+    volume.mkdir()
+    stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
+    cache_name = make_cache(scenario.cache, volume) if scenario.cache is not None else None
+    loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
     disk = workdir / "disk.img"
-    build_disk(disk, files, scenario.directories)
-    return disk
+    try:
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20)
+    except mkdisk.DiskError as error:
+        raise OSError(str(error)) from error
+    return disk, cache_name
 
 
 class SerialFollower:
@@ -811,7 +869,7 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     start = time.monotonic()
     workdir = Path(tempfile.mkdtemp(prefix=f"nimb-qemu-{scenario.name}-"))
     try:
-        disk = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
+        disk, cache_name = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
     except BaseException:
         shutil.rmtree(workdir, ignore_errors=True)
         raise
@@ -824,9 +882,13 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     outcome = decode_exit(returncode, read_exit_codes())
     problems = check_report(log, outcome, scenario.status, scenario.memory, scenario.exit)
     problems += check_log(log, scenario.expect, scenario.forbid)
+    if cache_name is not None and scenario.cache.looked_for:
+        # The name that kcache gave the cache, from the boot device path the
+        # disk tool computes, is the one the loader looks for.
+        problems += check_log(log, [f"Looking for kernel cache file '{cache_name}'"])
     problems += check_console_modes(log, scenario.console_modes)
     if scenario.kernel is not None:
-        problems += check_kernel(log, scenario.kernel)
+        problems += check_kernel(log, scenario.kernel, guest_dir)
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
         problems += trouble + picture
@@ -909,12 +971,14 @@ class Qmp:
         self.sock.close()
 
 
-# The demo's volume: the reference kernel under its default name, booted in
+# The demo's volume: the reference kernel under its default name with the
+# test driver bundles, and a kernel cache that kcache made of both, booted in
 # graphics mode; the kernel holds the machine a while after its report.
 DEMO = Scenario(
     "demo",
     config={"console": "graphics", "options": "guest.hold=4"},
     files=kernel_file(),
+    cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}")),
 )
 DEMO_SCREEN_EXPECT = ScreenExpect(when="kernel: result", picture="logo")
 
@@ -925,7 +989,7 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
     and lets the kernel power off. True when the kernel passed and the
     screenshot was taken."""
     workdir = Path(tempfile.mkdtemp(prefix="nimb-qemu-demo-"))
-    disk = prepare(DEMO, efi_dir, workdir, loader, guest_dir=guest_dir)
+    disk, cache_name = prepare(DEMO, efi_dir, workdir, loader, guest_dir=guest_dir)
     DEMO_SCREEN.parent.mkdir(parents=True, exist_ok=True)
     if DEMO_SCREEN.exists():
         DEMO_SCREEN.unlink()
@@ -942,6 +1006,13 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
         print(f"demo: kernel {'pass' if passed else 'FAIL'}: {checks} checks, {failed} failed (exit {outcome.name})")
         for check in kernel.failed_checks():
             print(f"demo:   check {check.name} FAIL {check.detail}")
+    looked = f"Looking for kernel cache file '{cache_name}'" in log
+    if kernel.drivers_from == "cache" and looked:
+        print(f"demo: booted from the kernel cache {cache_name}, made by kcache, with "
+              f"{len(kernel.drivers)} drivers prelinked: {', '.join(d[0] for d in kernel.drivers)}")
+    else:
+        print(f"demo: NOT booted from the kernel cache {cache_name} (drivers from {kernel.drivers_from}, "
+              f"looked for it: {looked})")
     for problem in trouble:
         print(f"demo: {problem}")
     if shot is None:
@@ -959,7 +1030,7 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
     for problem in picture + stray:
         print(f"demo:   {problem}")
     print(f"demo: screenshot in {DEMO_SCREEN} (and {DOCS_SCREEN})")
-    ok = outcome.name == "KernelPass"
+    ok = outcome.name == "KernelPass" and kernel.drivers_from == "cache"
     if ok:
         shutil.rmtree(workdir, ignore_errors=True)
     else:
@@ -971,10 +1042,12 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
 
 
 def main(argv=None):
+    global TOOLS_DIR
     parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"), help="where BOOTX64.efi and nimbboot.efi are")
     parser.add_argument("--loader", help="another EFI program to start in place of nimbboot.efi")
     parser.add_argument("--guest-dir", default=str(GUEST_DIR), help="where the reference kernel's files are")
+    parser.add_argument("--tools-dir", default=str(TOOLS_DIR), help="where the host tools (kcache) are")
     parser.add_argument("--scenario", action="append", help="run this scenario (repeatable; default all)")
     parser.add_argument("--timeout", type=float, help="seconds per run, instead of the scenario's own")
     parser.add_argument("--show-log", action="store_true", help="print the serial log of passing runs too")
@@ -983,6 +1056,7 @@ def main(argv=None):
     args = parser.parse_args(argv)
     for number in (signal.SIGTERM, signal.SIGINT, signal.SIGHUP):
         signal.signal(number, Machine.kill_all)
+    TOOLS_DIR = Path(args.tools_dir)
 
     if args.list:
         print("\n".join(SCENARIOS))

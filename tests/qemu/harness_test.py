@@ -14,6 +14,7 @@ from scenarios import (
     BASE_CONFIG,
     SCENARIOS,
     AtLeast,
+    DriverExpect,
     KernelExpect,
     Scenario,
     ScreenExpect,
@@ -241,6 +242,10 @@ kernel: tree       name = "platform"
 kernel: tree       Model = u"QEMU1,1"
 kernel: check tree-walk ok 5 nodes, 11 properties, 0x200 of 0x200 bytes
 kernel: range BootCLUT address=0x10b000 length=0x300
+kernel: driver "com.x.A" from=loader address=0x120000 plist=0x6 code=0x3 sum=0x24d0127
+kernel: driver "com.x.B" from=loader address=0x121000 plist=0x1 code=0x0 sum=0x1
+kernel: package address=0x122000 length=0x3 sum=0x24d0127
+kernel: drivers from=loader blocks=2 package=1
 kernel: memmap address=0x112000 size=0x1950 descriptorSize=48 descriptorVersion=1 descriptors=135
 kernel: memmap type EfiLoaderData count=3 pages=0x1c
 kernel: efi systemTable=0x315018 revision=0x20046
@@ -292,6 +297,8 @@ class KernelReport(unittest.TestCase):
         self.assertEqual(report.efi, {"systemTable": 0x315018, "revision": 0x20046})
         self.assertEqual(report.result, (True, 3, 0))
         self.assertEqual(report.hold, 4)
+        self.assertEqual(report.drivers, [("com.x.A", "loader", 6, 3, 0x24D0127), ("com.x.B", "loader", 1, 0, 1)])
+        self.assertEqual((report.package, report.drivers_from), ((3, 0x24D0127), "loader"))
         self.assertEqual(report.unknown, [])
 
     def test_check_rows(self):
@@ -302,6 +309,7 @@ class KernelReport(unittest.TestCase):
                   "/chosen/memory-map": {}},
             ranges={"BootCLUT": 0x300},
         )  # fmt: skip
+        drivers = {"com.x.A": DriverExpect("plist", b"abc"), "com.x.B": DriverExpect("")}
         failing_check = KERNEL_LOG.replace("check tree-walk ok", "check tree-walk FAIL").replace(
             "(3 checks, 0 failed)", "(3 checks, 1 failed)"
         ).replace("result pass", "result fail")
@@ -332,6 +340,13 @@ class KernelReport(unittest.TestCase):
             ("broken tree", KERNEL_LOG.replace("kernel: range", "kernel: tree error truncated at 0x10\nkernel: range"),
              good, ["tree error truncated"]),
             ("line of no known kind", KERNEL_LOG + "kernel: frobnicate 1\n", good, ["no known kind"]),
+            ("drivers as wanted", KERNEL_LOG, KernelExpect(drivers_from="loader", drivers=drivers, package=b"abc"), []),
+            ("drivers from elsewhere", KERNEL_LOG, KernelExpect(drivers_from="cache"), ["drivers from loader"]),
+            ("drivers in another order", KERNEL_LOG, KernelExpect(drivers=dict(reversed(drivers.items()))),
+             ["kernel: drivers"]),
+            ("driver code differs", KERNEL_LOG, KernelExpect(drivers={**drivers, "com.x.A": DriverExpect("plist", b"abd")}),
+             ["kernel: drivers"]),
+            ("package differs", KERNEL_LOG, KernelExpect(package=b"abcd"), ["package (length, sum)"]),
         ]  # fmt: skip
         for name, log, expect, wanted in rows:
             with self.subTest(name):

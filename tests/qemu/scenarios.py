@@ -4,6 +4,11 @@ registers one ctest test per name."""
 
 import dataclasses
 import re
+import sys
+from pathlib import Path
+
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkdisk"))
+import mkdisk  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -20,7 +25,7 @@ BOOT_PLIST = "Library/Preferences/SystemConfiguration/com.quill.Boot.plist"
 # The GUID of the system partition on every disk the harness builds: the
 # root volume's UUID as the loader should find it. Its first three fields
 # read differently in either byte order.
-PARTITION_GUID = "0FAB1E5D-3C2B-4A19-8E7F-60C5D4B3A291"
+PARTITION_GUID = mkdisk.DEFAULT_PARTITION_GUID
 
 # What a boot of the reference kernel prints, in this order.
 LOADING_KERNEL = "Loading 'nimb_kernel'..."
@@ -104,6 +109,25 @@ class KernelExpect:
     tree: dict = dataclasses.field(default_factory=dict)
     # Range of /chosen/memory-map -> its length, or None for any.
     ranges: dict = dataclasses.field(default_factory=dict)
+    # Where the drivers came from: "loader" (staged or a package), "cache"
+    # (prelinked in a kernel cache) or "none"; None: not checked.
+    drivers_from: str | None = None
+    # The driver blocks, in order: identifier -> DriverExpect; None: not
+    # checked.
+    drivers: dict | None = None
+    # The driver package's bytes (its x86 slice), as content; None: not
+    # checked.
+    package: object = None
+
+
+@dataclasses.dataclass(frozen=True)
+class DriverExpect:
+    """A driver block as the kernel must find it: the text of the bundle's
+    Info.plist and the code (its x86 slice), as content (bytes, text, a host
+    Path or a GuestFile)."""
+
+    plist: object
+    code: object = b""
 
 
 @dataclasses.dataclass(frozen=True)
@@ -126,6 +150,96 @@ def kernel_file(name="nimb_kernel"):
     return {"nimb_kernel": GuestFile(name)}
 
 
+# --- the extensions directory ------------------------------------------------------------
+
+EXTENSIONS_DIR = "System/Library/Extensions"
+
+
+def driver_plist(identifier, required=None, executable=None, libraries=()):
+    """A driver bundle's Info.plist: its identifier, and the keys that the
+    loader reads when given (`required` a string, or another tag's text)."""
+    lines = [f"\t<key>VzBundleIdentifier</key>\n\t<string>{identifier}</string>\n"]
+    if executable is not None:
+        lines.append(f"\t<key>VzBundleExecutable</key>\n\t<string>{executable}</string>\n")
+    if required is not None:
+        tag = required if required.startswith("<") else f"<string>{required}</string>"
+        lines.append(f"\t<key>VzBundleRequired</key>\n\t{tag}\n")
+    if libraries:
+        entries = "".join(f"\t\t<key>{name}</key>\n\t\t<string>1.0</string>\n" for name in libraries)
+        lines.append(f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n")
+    body = "".join(lines)
+    return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
+
+
+def driver_code(seed, length):
+    """A small driver's code: bytes that differ from bundle to bundle."""
+    return bytes((seed * 131 + i * 7 + (i >> 5)) & 0xFF for i in range(length))
+
+
+def standard_extensions():
+    """The extensions directory that every volume carries unless its scenario
+    says otherwise: a flat bundle with code, a full-layout bundle whose code
+    is a fat file (tests/guest's driver.fat, whose x86 slice is the file
+    nimb_kernel) with a nested bundle that has no code, and a "Safe Boot"
+    bundle that the loader leaves out."""
+    root = EXTENSIONS_DIR
+    return {
+        f"{root}/Console.drvb/Info.plist": driver_plist("com.quill.driver.Console", "Root", "Console"),
+        f"{root}/Console.drvb/Console": driver_code(1, 1001),
+        f"{root}/Storage.drvb/Contents/Info.plist": driver_plist(
+            "com.quill.driver.Storage", "Local-Root", "Storage", libraries=("com.quill.driver.Console",)
+        ),
+        f"{root}/Storage.drvb/Contents/Tarnix/Storage": GuestFile("driver.fat"),
+        f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist": driver_plist(
+            "com.quill.driver.Partition", ""
+        ),
+        f"{root}/Network.drvb/Info.plist": driver_plist("com.quill.driver.Network", "Safe Boot", "Network"),
+        f"{root}/Network.drvb/Network": driver_code(3, 64),
+    }
+
+
+def standard_drivers():
+    """The driver blocks that the standard extensions give, in the order of
+    discovery: each kept bundle, its nested ones right behind it; the
+    "Safe Boot" bundle is left out, in safe mode too."""
+    files = standard_extensions()
+    root = EXTENSIONS_DIR
+    return {
+        "com.quill.driver.Console": DriverExpect(files[f"{root}/Console.drvb/Info.plist"],
+                                                 files[f"{root}/Console.drvb/Console"]),
+        "com.quill.driver.Storage": DriverExpect(files[f"{root}/Storage.drvb/Contents/Info.plist"],
+                                                 GuestFile("nimb_kernel")),
+        "com.quill.driver.Partition": DriverExpect(
+            files[f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist"]),
+    }  # fmt: skip
+
+
+# The default driver package of a disk boot, and a fat one to put there: the
+# kernel must get its x86 slice, which is the file nimb_kernel.
+DRIVER_PACKAGE = "System/Library/Extensions.drvpk"
+PACKAGE_FILE = GuestFile("driver.fat")
+PACKAGE_SLICE = GuestFile("nimb_kernel")
+
+
+@dataclasses.dataclass(frozen=True)
+class KernelCache:
+    """A kernel cache that the harness has kcache write on the volume, after
+    the files and their times, for the machine it boots. kcache gives it the
+    time one second after the newer of the kernel and the extensions
+    directory; `shift` seconds are added to that. Arguments of `args` that
+    start with "volume:" are paths on the volume."""
+
+    args: tuple = ()
+    kernel: str = "nimb_kernel"
+    model: str = "QEMU1,1"
+    shift: float = 0
+    # Breaks the header's checksum, so that the cache decompresses but fails.
+    break_checksum: bool = False
+    # Whether the loader is to look for it (and print its name): not in
+    # safe mode, nor with a package that the user named.
+    looked_for: bool = True
+
+
 @dataclasses.dataclass(frozen=True)
 class Scenario:
     name: str
@@ -141,7 +255,17 @@ class Scenario:
     files: dict = dataclasses.field(default_factory=dict)
     # ESP paths to leave out (e.g. the loader itself).
     remove: tuple = ()
+    # The extensions directory's files (paths as in `files`), put on the
+    # volume with the others; None: no extensions directory at all.
+    extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
     directories: tuple = ()
+    # A kernel cache made for the volume, or None.
+    cache: KernelCache | None = None
+    # The disk's size in MiB.
+    disk_mib: int = 64
+    # Exact modification times (UTC, "YYYY-MM-DD hh:mm:ss.nnnnnnnnn") of
+    # files or directories of the volume, as the platform layer serves them.
+    times: dict = dataclasses.field(default_factory=dict)
     # Texts that must appear in the serial log, in this order.
     expect: tuple = ()
     # Texts that must not appear.
@@ -255,7 +379,14 @@ _TABLE = [
         "kernel_plain",
         config={"console": "graphics", "options": "foo=1"},
         files=kernel_file(),
-        expect=(LOADING_KERNEL, f"{ROOT_UUID}{PARTITION_GUID}'", KERNEL_START),
+        # The boot device path that the disk tool computes for kernel caches
+        # is the one the firmware gives the loader.
+        expect=(
+            f"platform: boot device path {mkdisk.boot_device_path().hex()}\n",
+            LOADING_KERNEL,
+            f"{ROOT_UUID}{PARTITION_GUID}'",
+            KERNEL_START,
+        ),
         forbid=("platform: loader returned",),
         exit="KernelPass",
         kernel=KernelExpect(
@@ -368,6 +499,98 @@ _TABLE = [
         config={"console": "graphics", "hold": 2},
         expect=(KERNEL_ERROR, "platform: loader returned"),
         screen=ScreenExpect(when="platform: memory", picture="failure"),
+    ),
+]
+
+# Kernel caches and drivers. Times are UTC; the platform serves them to the
+# loader exactly, nanoseconds included.
+DRIVERS_STAGED = KernelExpect(drivers_from="loader", drivers=standard_drivers())
+_TABLE += [
+    # A plain boot stages the bundles: libraries, a nested bundle, a fat
+    # code file, and a "Safe Boot" bundle left out.
+    Scenario(
+        "drivers_bundles",
+        files=kernel_file(),
+        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # A cache exactly one second after the kernel, across a year boundary,
+    # with the bundles prelinked: no drivers are loaded.
+    Scenario(
+        "cache_hit",
+        files=kernel_file(),
+        times={"nimb_kernel": "2006-12-31 23:59:59.500000000", EXTENSIONS_DIR: "2006-12-31 23:59:58.000000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}")),
+        expect=(KERNEL_START,),
+        forbid=("Loading drivers...", LOADING_KERNEL),
+        exit="KernelPass",
+        kernel=KernelExpect(drivers_from="cache", drivers=standard_drivers()),
+    ),
+    # The same cache two seconds off, here the extensions being the newer:
+    # the plain kernel and the bundles.
+    Scenario(
+        "cache_two_seconds_off",
+        files=kernel_file(),
+        times={"nimb_kernel": "2009-03-01 10:00:00.000000000", EXTENSIONS_DIR: "2009-03-01 10:00:05.700000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), shift=2),
+        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # A cache whose checksum is wrong falls back to the plain kernel.
+    Scenario(
+        "cache_bad_checksum",
+        files=kernel_file(),
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), break_checksum=True),
+        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # The driver package exactly one second after the extensions directory
+    # is used; its x86 slice reaches the kernel.
+    Scenario(
+        "package_used",
+        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"},
+        expect=("Loading drivers...", "Loading System\\Library\\Extensions.drvpk...", KERNEL_START),
+        exit="KernelPass",
+        kernel=KernelExpect(drivers_from="loader", drivers={}, package=PACKAGE_SLICE),
+    ),
+    # Two seconds after: stale, the bundles instead.
+    Scenario(
+        "package_stale",
+        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:01.250000000"},
+        expect=("Loading drivers...", KERNEL_START),
+        forbid=("Extensions.drvpk...",),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
+    ),
+    # A package that the configuration names is used whatever its time, and
+    # a valid cache is then not looked at.
+    Scenario(
+        "package_named",
+        files={**kernel_file(), "Custom/drivers.pk": PACKAGE_FILE, BOOT_PLIST: plist({"Drvpk Cache": "Custom/drivers.pk"})},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", "Custom/drivers.pk": "2001-01-01 00:00:00.000000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), looked_for=False),
+        expect=("Loading Custom\\drivers.pk...", KERNEL_START),
+        forbid=("Looking for kernel cache file",),
+        exit="KernelPass",
+        kernel=KernelExpect(drivers_from="loader", drivers={}, package=PACKAGE_SLICE),
+    ),
+    # Safe mode: neither the valid cache nor the valid package; the bundles,
+    # without the "Safe Boot" one.
+    Scenario(
+        "drivers_safe_mode",
+        config={"keys": "shift"},
+        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
+        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"},
+        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), looked_for=False),
+        expect=("Using Safe Mode", LOADING_KERNEL, "Loading drivers...", KERNEL_START),
+        forbid=("Extensions.drvpk...", "Looking for kernel cache file"),
+        exit="KernelPass",
+        kernel=DRIVERS_STAGED,
     ),
 ]
 

@@ -273,6 +273,7 @@ TEST_F(BootTest, TheKernelIsEnteredAndAReturnStops) {
     hostfw::Firmware local;
     TempDir dir;
     dir.File("nimb_kernel", kernel);
+    dir.Directory("System/Library/Extensions");  // a plain kernel's drivers, none
     local.SetBootDevice(local.AddDirectoryVolume(dir.path()));
     local.SetGateReturns(returns);
     nimbtest::ResetLoaderState();

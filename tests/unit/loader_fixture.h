@@ -14,6 +14,7 @@
 #include "config/plist.h"
 #include "devicetree/devicetree.h"
 #include "devicetree/platform.h"
+#include "load/bundles.h"
 #include "hostfw/hostfw.h"
 #include "memory/kernel_region.h"
 #include "memory/tracking.h"
@@ -70,6 +71,8 @@ inline void ResetLoaderState() {
   nimb::gKernelRegionTop = 0;
   nimb::gKernelRegionBase = 0xFFFFFFFF;
   nimb::gMemoryMapNode = nullptr;
+  nimb::gDriverRecords = nullptr;
+  nimb::gLastDriverRecord = nullptr;
   for (char &c : nimb::gModelName)
     c = '\0';
 }

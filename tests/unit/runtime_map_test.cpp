@@ -393,57 +393,62 @@ TEST_F(RuntimeMapTest, OverlappingPlacesAreCopiedInASafeOrder) {
   }
 }
 
-// Where the move writes: each region it copies, at its new address.
 TEST_F(RuntimeMapTest, TheRuntimeAreaMustLieInFreeMemoryBelow4GiB) {
   const UINT64 kFree = 0x100000, kFreePages = 0x40;
   struct Row {
     const char *what;
-    std::vector<Region> extra;  // besides free memory from kFree on and the region that moves
+    std::vector<Region> extra;  // besides free memory from kFree on
     UINT64 start;
-    UINT64 pages;  // of the runtime data region that moves
+    UINT64 spare;
     bool free;
-    UINT64 inUse = 0;
   };
   const Row rows[] = {
-      {"the region fits", {}, kFree, kFreePages, true},
-      {"one page too many", {}, kFree + EFI_PAGE_SIZE, kFreePages, false},
+      {"runtime pages and spare fit",
+       {{EfiRuntimeServicesCode, 0x300000, 4, kRt, 0, 0}},
+       kFree,
+       0x2000,
+       true},
       {"across two free descriptors",
        {{EfiConventionalMemory, kFree + kFreePages * EFI_PAGE_SIZE, 8, 0, 0, 0}},
        kFree + (kFreePages - 2) * EFI_PAGE_SIZE,
-       4,
+       0x4000,
        true},
-      {"reserved memory takes no room",
-       {{EfiReservedMemoryType, 0x30000000, kFreePages, kRt, 0, 0}},
+      {"the spare is not written: it may lie in used memory",
+       {},
+       kFree + (kFreePages - 1) * EFI_PAGE_SIZE,
+       0x2000,
+       true},
+      {"the runtime pages run past it",
+       {{EfiRuntimeServicesData, 0x300000, kFreePages, kRt, 0, 0}},
+       kFree + EFI_PAGE_SIZE,
+       0,
+       false},
+      {"reserved and non-runtime pages take no room",
+       {{EfiReservedMemoryType, 0x300000, kFreePages, kRt, 0, 0},
+        {EfiBootServicesData, 0x400000, kFreePages, 0, 0, 0}},
        kFree,
-       kFreePages,
+       kFreePages * EFI_PAGE_SIZE,
        true},
-      {"the area starts in used memory", {{EfiLoaderData, 0x80000, 0x80, 0, 0, 0}}, 0x90000, 1, false},
-      {"memory-mapped I/O takes address space only",
-       {{EfiLoaderData, 0x80000, 0x80, 0, 0, 0}, {EfiMemoryMappedIO, 0xFEC00000, 0x10, kRt, 0, 0}},
-       0xF0000,
-       1,
+      {"memory-mapped I/O takes addresses, not memory",
+       {{EfiRuntimeServicesCode, 0x300000, 4, kRt, 0, 0},
+        {EfiMemoryMappedIO, 0xFEC00000, 4 * kFreePages, kRt, 0, 0}},
+       kFree,
+       0,
        true},
-      {"boot services memory is free behind ExitBootServices",
-       {{EfiBootServicesData, 0x80000, 0x80, 0, 0, 0}},
+      {"a region's new place is in used memory",
+       {{EfiLoaderData, 0x80000, 0x80, 0, 0, 0}, {EfiRuntimeServicesCode, 0x300000, 1, kRt, 0, 0}},
        0x90000,
-       1,
-       true},
-      {"but not where the stack is",
-       {{EfiBootServicesData, 0x80000, 0x80, 0, 0, 0}},
-       0x90000,
-       1,
-       false,
-       0xFF000},
-      {"beyond 4 GiB", {{EfiConventionalMemory, 0xFFFFF000, 0x100, 0, 0, 0}}, 0xFFFFF000, 2, false},
+       0,
+       false},
+      {"beyond 4 GiB", {{EfiConventionalMemory, 0xFFFFF000, 0x100, 0, 0, 0}}, 0xFFFFF000, 0x2000, false},
   };
   for (const Row &row : rows) {
     SCOPED_TRACE(row.what);
     std::vector<EFI_MEMORY_DESCRIPTOR> map = {{EfiConventionalMemory, 0, kFree, 0, kFreePages, 0xF}};
     for (const Region &r : row.extra)
       map.push_back({r.type, 0, r.physical, 0, r.pages, r.attribute});
-    map.push_back({EfiRuntimeServicesData, 0, 0x20000000, 0, row.pages, kRt});
     EXPECT_EQ(nimb::RuntimeAreaIsFree(map.data(), map.data() + map.size(), sizeof(EFI_MEMORY_DESCRIPTOR),
-                                      row.start, row.inUse),
+                                      row.start, row.spare),
               row.free);
   }
 }

@@ -2,8 +2,9 @@
 # output. Called as
 #   cmake -DVOLUME=<dir> [-DKERNEL=<file>] -DEXIT=<status> -DEXPECT=<regexes>
 #         -P run_test.cmake -- <dryboot> [arguments...]
-# The volume directory is made empty, the kernel (when given) is copied into
-# it as nimb_kernel, and the directory is passed as dryboot's last argument.
+# The volume directory is made afresh with an extensions directory, the
+# kernel (when given) is copied into it as nimb_kernel with one driver
+# bundle beside it, and the directory is passed as dryboot's last argument.
 # Every regex of the list EXPECT must match the output.
 set(command)
 set(collect OFF)
@@ -21,9 +22,14 @@ if(DEFINED KERNEL AND NOT EXISTS "${KERNEL}")
   return()
 endif()
 file(REMOVE_RECURSE "${VOLUME}")
-file(MAKE_DIRECTORY "${VOLUME}")
+# An empty extensions directory: a plain kernel's drivers are scanned there,
+# and a volume without one cannot boot.
+file(MAKE_DIRECTORY "${VOLUME}/System/Library/Extensions")
 if(DEFINED KERNEL)
   file(COPY_FILE "${KERNEL}" "${VOLUME}/nimb_kernel")
+  # One driver bundle without code, which the plain kernel gets staged.
+  file(WRITE "${VOLUME}/System/Library/Extensions/A.drvb/Info.plist"
+       "<plist version=\"1.0\"><dict><key>VzBundleRequired</key><string>Root</string></dict></plist>\n")
 endif()
 
 execute_process(COMMAND ${command} "${VOLUME}" RESULT_VARIABLE status OUTPUT_VARIABLE output ERROR_VARIABLE output)

@@ -5,6 +5,10 @@
 // Usage: kobj_check INPUT.elf KERNEL
 // Exit status 0 when every segment's bytes, the zeroes behind them, the
 // kernel region and the entry point are as the ELF file says.
+//
+// Usage: kobj_check --slice FAT SLICE
+// Exit status 0 when the loader's BootFileFindSlice finds in FAT exactly the
+// bytes of SLICE (a fat file made by `kobj fat`, read back).
 #include <algorithm>
 #include <cstdio>
 #include <cstring>
@@ -18,6 +22,7 @@
 #include "config/boot_options.h"
 #include "hostfw/hostfw.h"
 #include "kobj/writer.h"
+#include "load/bootfile.h"
 #include "load/kernel.h"
 #include "load/kernel_format.h"
 #include "memory/kernel_region.h"
@@ -37,9 +42,41 @@ std::vector<uint8_t> ReadFile(const std::string &path) {
   return std::vector<uint8_t>(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
 
+// The slice that the loader finds in the fat file, against the file it was
+// made from.
+int CheckSlice(const std::string &fatPath, const std::string &slicePath) {
+  std::vector<uint8_t> fat = ReadFile(fatPath);
+  std::vector<uint8_t> wanted = ReadFile(slicePath);
+  nimb::BootFile file = {};
+  file.buffer = fat.data();
+  file.size = fat.size();
+  UINT64 size = 0;
+  UINT64 offset = 0;
+  EFI_STATUS status = nimb::BootFileFindSlice(&file, &size, &offset);
+  if (status != EFI_SUCCESS) {
+    std::fprintf(stderr, "kobj_check: BootFileFindSlice gave 0x%llx for %s\n",
+                 static_cast<unsigned long long>(status), fatPath.c_str());
+    return 1;
+  }
+  std::vector<uint8_t> slice(size);
+  UINT64 count = size;
+  status = nimb::BootFileRead(&file, &count, slice.data());
+  if (status != EFI_SUCCESS || count != size || slice != wanted) {
+    std::fprintf(stderr, "kobj_check: the slice at 0x%llx, 0x%llx bytes, is not %s\n",
+                 static_cast<unsigned long long>(offset), static_cast<unsigned long long>(size),
+                 slicePath.c_str());
+    return 1;
+  }
+  std::printf("%s: the x86 slice at 0x%llx is %s\n", fatPath.c_str(), static_cast<unsigned long long>(offset),
+              slicePath.c_str());
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char **argv) {
+  if (argc == 4 && std::strcmp(argv[1], "--slice") == 0)
+    return CheckSlice(argv[2], argv[3]);
   if (argc != 3) {
     std::fprintf(stderr, "Usage: kobj_check INPUT.elf KERNEL\n");
     return 2;

@@ -1,5 +1,6 @@
 // kobj: turns a 32-bit x86 ELF executable into a kernel object that the
-// loader places at its addresses, alone or wrapped in a fat file.
+// loader places at its addresses, alone or wrapped in a fat file; `kobj fat`
+// wraps any files (a driver package, a driver's code) into a fat file.
 #include <sys/stat.h>
 
 #include <cerrno>
@@ -44,7 +45,31 @@ const char kUsage[] =
     "  -h, --help                show this text\n"
     "\n"
     "Exit status: 0 on success, 1 when the input cannot be made into a kernel object,\n"
-    "2 for a wrong command line.\n";
+    "2 for a wrong command line.\n"
+    "\n"
+    "  kobj fat --help           wrapping any files into a fat file\n";
+
+const char kFatUsage[] =
+    "Usage: kobj fat [options] [X86-FILE] [--slice TYPE:FILE]... -o OUTPUT\n"
+    "\n"
+    "Wraps files as they stand (a driver package, a driver's code, a kernel object)\n"
+    "into a fat file, one slice each, in the order given, each at a 4096-byte\n"
+    "boundary. The loader takes the first 32-bit x86 slice of a fat file.\n"
+    "\n"
+    "Options:\n"
+    "  -o, --output FILE         write the result to FILE (required)\n"
+    "      --slice TYPE:FILE     a slice with the bytes of FILE for processor TYPE: x86\n"
+    "                            (32-bit), x86_64, arm, arm64, ppc, or a number (decimal\n"
+    "                            or 0x hex); may be repeated\n"
+    "  X86-FILE                  the same as --slice x86:X86-FILE\n"
+    "      --big-endian          big-endian records (the default)\n"
+    "      --little-endian       little-endian records\n"
+    "      --no-x86              allow a result without a 32-bit x86 slice\n"
+    "  -h, --help                show this text\n"
+    "\n"
+    "A fat file without a 32-bit x86 slice is refused unless --no-x86 is given.\n"
+    "Exit status: 0 on success, 1 when an input cannot be read or the result cannot be\n"
+    "written, 2 for a wrong command line.\n";
 
 struct ExtraSlice {
   uint32_t cpuType;
@@ -98,6 +123,15 @@ ExtraSlice ParseSlice(const std::string &option, const std::string &value) {
   if (colon == std::string::npos || colon == 0 || colon + 1 == value.size())
     UsageError(option + " wants TYPE:FILE, not '" + value + "'");
   std::string type = value.substr(0, colon);
+  static const struct {
+    const char *name;
+    uint32_t type;
+  } kNamedTypes[] = {
+      {"x86", nimb::kCpuTypeX86}, {"x86_64", 0x1000007}, {"arm", 12}, {"arm64", 0x100000C}, {"ppc", 18}};
+  for (const auto &named : kNamedTypes) {
+    if (type == named.name)
+      return {named.type, value.substr(colon + 1), option == "--extra-slice"};
+  }
   char *end = nullptr;
   errno = 0;
   unsigned long long number = std::strtoull(type.c_str(), &end, 0);
@@ -117,21 +151,23 @@ void SetOrder(Options *options, kobj::ByteOrder order) {
   options->fat = true;
 }
 
+// The value of the option `arg` that takes one: what follows '=' in the long
+// form, or the next word (moving `*i` on).
+std::string OptionValue(const std::string &arg, const std::string &name, int argc, char **argv, int *i) {
+  if (arg.size() > name.size() && arg.compare(0, name.size() + 1, name + "=") == 0)
+    return arg.substr(name.size() + 1);
+  if (*i + 1 >= argc)
+    UsageError(name + " needs a value");
+  return argv[++*i];
+}
+
 Options ParseCommandLine(int argc, char **argv) {
   Options options;
   bool outputGiven = false;
   bool optionsEnded = false;
   for (int i = 1; i < argc; i++) {
     std::string arg = argv[i];
-    // The value of an option that takes one: the next word, or what follows
-    // '=' in the long form.
-    auto value = [&](const std::string &name) -> std::string {
-      if (arg.size() > name.size() && arg.compare(0, name.size() + 1, name + "=") == 0)
-        return arg.substr(name.size() + 1);
-      if (i + 1 >= argc)
-        UsageError(name + " needs a value");
-      return argv[++i];
-    };
+    auto value = [&](const std::string &name) { return OptionValue(arg, name, argc, argv, &i); };
     auto is = [&](const std::string &name) {
       return arg == name || (name.size() > 2 && arg.compare(0, name.size() + 1, name + "=") == 0);
     };
@@ -172,9 +208,78 @@ Options ParseCommandLine(int argc, char **argv) {
   return options;
 }
 
+void WriteOutput(const std::string &path, const std::vector<uint8_t> &out) {
+  // Offsets in the records are 32-bit words.
+  if (out.size() > UINT32_MAX)
+    InputError("the result would exceed 4 GiB");
+  std::ofstream file(path, std::ios::binary | std::ios::trunc);
+  file.write(reinterpret_cast<const char *>(out.data()), static_cast<std::streamsize>(out.size()));
+  file.close();
+  if (!file)
+    InputError("cannot write '" + path + "'");
+}
+
+kobj::FatEntry ReadSlice(const ExtraSlice &slice) {
+  kobj::FatEntry entry;
+  entry.cpuType = slice.cpuType;
+  entry.cpuSubtype = slice.cpuType == nimb::kCpuTypeX86 ? kobj::kCpuSubtypeX86All : 0;
+  entry.bytes = ReadFile(slice.path);
+  return entry;
+}
+
+// kobj fat: the slices of the command line, in order, in one fat file.
+int FatMain(int argc, char **argv) {
+  std::vector<ExtraSlice> slices;
+  std::string output;
+  Options order;
+  bool needX86 = true;
+  for (int i = 2; i < argc; i++) {
+    std::string arg = argv[i];
+    auto value = [&](const std::string &name) { return OptionValue(arg, name, argc, argv, &i); };
+    if (arg == "-h" || arg == "--help") {
+      std::fputs(kFatUsage, stdout);
+      return 0;
+    } else if (arg == "-o" || arg.compare(0, 8, "--output") == 0) {
+      if (!output.empty())
+        UsageError("one output file only");
+      output = value(arg == "-o" ? "-o" : "--output");
+    } else if (arg.compare(0, 7, "--slice") == 0) {
+      slices.push_back(ParseSlice("--slice", value("--slice")));
+    } else if (arg == "--big-endian") {
+      SetOrder(&order, kobj::ByteOrder::kBig);
+    } else if (arg == "--little-endian") {
+      SetOrder(&order, kobj::ByteOrder::kLittle);
+    } else if (arg == "--no-x86") {
+      needX86 = false;
+    } else if (!arg.empty() && arg[0] == '-' && arg != "-") {
+      UsageError("fat: unknown option '" + arg + "'");
+    } else {
+      slices.push_back({nimb::kCpuTypeX86, arg, false});
+    }
+  }
+  if (slices.empty())
+    UsageError("fat: no slices");
+  if (output.empty())
+    UsageError("fat: no output file (-o OUTPUT)");
+  std::vector<kobj::FatEntry> entries;
+  bool hasX86 = false;
+  for (const ExtraSlice &slice : slices) {
+    entries.push_back(ReadSlice(slice));
+    hasX86 |= slice.cpuType == nimb::kCpuTypeX86;
+    if (entries.back().bytes.empty())
+      InputError("fat: '" + slice.path + "' is empty: the loader takes an empty slice for none");
+  }
+  if (needX86 && !hasX86)
+    UsageError("fat: no 32-bit x86 slice, which is the one the loader takes (--no-x86 to make it anyway)");
+  WriteOutput(output, kobj::WriteFat(entries, order.order));
+  return 0;
+}
+
 }  // namespace
 
 int main(int argc, char **argv) {
+  if (argc > 1 && std::strcmp(argv[1], "fat") == 0)
+    return FatMain(argc, argv);
   Options options = ParseCommandLine(argc, argv);
 
   const std::vector<uint8_t> elf = ReadFile(options.input);
@@ -195,12 +300,8 @@ int main(int argc, char **argv) {
   if (options.fat) {
     std::vector<kobj::FatEntry> slices;
     std::vector<kobj::FatEntry> after;
-    for (const ExtraSlice &extra : options.extras) {
-      kobj::FatEntry entry;
-      entry.cpuType = extra.cpuType;
-      entry.bytes = ReadFile(extra.path);
-      (extra.before ? slices : after).push_back(std::move(entry));
-    }
+    for (const ExtraSlice &extra : options.extras)
+      (extra.before ? slices : after).push_back(ReadSlice(extra));
     kobj::FatEntry own;
     own.cpuType = nimb::kCpuTypeX86;
     own.cpuSubtype = kobj::kCpuSubtypeX86All;
@@ -209,14 +310,6 @@ int main(int argc, char **argv) {
     slices.insert(slices.end(), after.begin(), after.end());
     out = kobj::WriteFat(slices, options.order);
   }
-  // Offsets in the records are 32-bit words.
-  if (out.size() > UINT32_MAX)
-    InputError("the result would exceed 4 GiB");
-
-  std::ofstream file(options.output, std::ios::binary | std::ios::trunc);
-  file.write(reinterpret_cast<const char *>(out.data()), static_cast<std::streamsize>(out.size()));
-  file.close();
-  if (!file)
-    InputError("cannot write '" + options.output + "'");
+  WriteOutput(options.output, out);
   return 0;
 }

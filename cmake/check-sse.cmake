@@ -1,0 +1,27 @@
+# The EFI build is compiled without SSE; only the AES instruction path
+# (src/resume/aes.cpp: DecryptEight, DecryptOne, ClearVectorRegisters) turns
+# it on for itself. Checked on every object of the loader: a vector register
+# anywhere else fails.
+file(GLOB_RECURSE objects ${OBJECT_DIR}/*.obj)
+if(NOT objects)
+  message(FATAL_ERROR "no objects under ${OBJECT_DIR}")
+endif()
+foreach(object ${objects})
+  execute_process(COMMAND ${OBJDUMP} -d --no-show-raw-insn ${object} OUTPUT_VARIABLE out RESULT_VARIABLE rc)
+  if(NOT rc EQUAL 0)
+    message(FATAL_ERROR "${OBJDUMP} failed on ${object}")
+  endif()
+  string(REPLACE "\n" ";" lines "${out}")
+  set(function "")
+  foreach(line IN LISTS lines)
+    if(line MATCHES "^[0-9a-f]+ <(.*)>:$")
+      set(function "${CMAKE_MATCH_1}")
+    elseif(line MATCHES "%[xyz]mm[0-9]")
+      if(NOT function MATCHES "DecryptEight|DecryptOne|ClearVectorRegisters")
+        message(FATAL_ERROR "vector registers in ${function} (${object}):\n${line}")
+      endif()
+    endif()
+  endforeach()
+endforeach()
+list(LENGTH objects count)
+message(STATUS "${count} objects: vector registers only in the AES instruction path")

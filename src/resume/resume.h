@@ -1,0 +1,44 @@
+// Hibernation resume: a hibernated system asks through NVRAM for its image
+// to be restarted; TryResume finds the image, checks it, reads and decrypts
+// its first stage, leaves the firmware and enters the image's restart code.
+//
+// Once `boot-signature` has been seen there is no way back into the normal
+// boot: every failure is a cold reset, and as the variable is deleted first,
+// the boot after the reset is a normal one.
+#pragma once
+
+#include "efi/efi.h"
+#include "resume/resume_format.h"
+
+namespace nimb {
+
+// The variables that ask for a restart, under the vendor's variable GUID.
+inline constexpr CHAR16 kResumeSignatureVariable[] = u"boot-signature";  // its existence counts
+inline constexpr CHAR16 kResumeImageVariable[] = u"boot-image";          // partition and offset
+inline constexpr CHAR16 kResumeKeyVariable[] = u"boot-image-key";        // the raw AES key
+
+// Returns only when no restart was asked for, or when the reset that ends a
+// failed restart comes back.
+void TryResume();
+
+// What the three stretches of a resume hand on to each other.
+struct ResumeState {
+  // Discovery.
+  ResumeHeader *poolHeader;  // the header as read, in tracked pool; null once moved
+  EFI_DISK_IO_PROTOCOL *diskIo;
+  UINT32 mediaId;
+  UINT8 *key;           // tracked pool, or null
+  UINTN keyBufferSize;  // bytes of `key`'s buffer
+  UINTN keyLength;      // the key's length as the variable gave it
+  // The read.
+  UINT8 *scratch;
+  ResumeHeader *header;  // in the scratch area, page-aligned
+  UINT32 mapCapacity;
+  UINTN descriptorSize;
+  UINT32 descriptorVersion;
+};
+
+// Overwrites the key's buffer with zeros (when there is one).
+void ResumeWipeKey(ResumeState *state);
+
+}  // namespace nimb

@@ -1,0 +1,67 @@
+// Any bytes as the preview section: the decoder must read nothing outside
+// the section (it is copied into a buffer of exactly its size, which the
+// sanitizer guards), write nothing outside the frame buffer, draw either
+// everything or nothing, and give its working memory back.
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <vector>
+
+#include "fuzz_firmware.h"
+#include "hostfw/hostfw.h"
+#include "memory/tracking.h"
+#include "screen/resume_display.h"
+
+namespace {
+
+void Check(bool condition) {
+  if (!condition)
+    std::abort();
+}
+
+uint32_t Word(const std::vector<uint8_t> &bytes, size_t at) {
+  uint32_t value = 0;
+  if (bytes.size() >= at + 4)
+    std::memcpy(&value, &bytes[at], 4);
+  return value;
+}
+
+}  // namespace
+
+extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
+  static hostfw::Firmware fw;
+  nimbfuzz::AttachLoader(fw);
+  Check(fw.LivePoolBlocks() == 0);
+
+  // The screen takes the picture's own size where that is small, so that
+  // the runs are reached; otherwise a small screen that it doesn't fit.
+  const std::vector<uint8_t> section(data, data + size);
+  uint32_t bytes = Word(section, 0), width = Word(section, 4), height = Word(section, 8);
+  if (bytes != 2 && bytes != 4)
+    bytes = 4;
+  if (width == 0 || width > 96 || height == 0 || height > 96) {
+    width = 5;
+    height = 3;
+  }
+  const uint32_t rowBytes = width * bytes + 8;
+  std::vector<uint8_t> frame(static_cast<size_t>(rowBytes) * height + 8, 0xA5);
+  const bool drawn = nimb::DrawResumePreview(section.data(), section.data() + section.size(), frame.data(),
+                                             width, height, bytes, static_cast<INT32>(rowBytes));
+  for (uint32_t y = 0; y < height; y++) {
+    for (uint32_t x = 0; x < rowBytes; x++) {
+      const uint8_t value = frame[static_cast<size_t>(y) * rowBytes + x];
+      if (x >= width * bytes || !drawn)
+        Check(value == 0xA5);
+    }
+  }
+  for (size_t i = static_cast<size_t>(rowBytes) * height; i < frame.size(); i++)
+    Check(frame[i] == 0xA5);
+
+  nimb::TrackedFreeAll();
+  Check(fw.LivePoolBlocks() == 0);
+  nimb::gST = nullptr;
+  nimb::gBS = nullptr;
+  nimb::gRT = nullptr;
+  nimb::gImageHandle = nullptr;
+  return 0;
+}

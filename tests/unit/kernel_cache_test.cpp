@@ -1,0 +1,488 @@
+// The kernel cache: the one-second rule with the calendar's carries, the key
+// and the file name it gives, and every way a cache is taken or refused.
+#include "load/kernel_cache.h"
+
+#include <gtest/gtest.h>
+
+#include <ctime>
+#include <functional>
+#include <string>
+#include <vector>
+
+#include "hostfw/network.h"
+#include "kernel_images.h"
+#include "load/bootfile.h"
+#include "loader_fixture.h"
+
+namespace {
+
+using nimbtest::Bytes;
+
+struct Date {
+  int year, month, day, hour, minute, second;
+  uint32_t nanosecond = 0;
+};
+
+EFI_FILE_INFO InfoAt(const Date &d) {
+  EFI_FILE_INFO info = {};
+  info.ModificationTime.Year = static_cast<UINT16>(d.year);
+  info.ModificationTime.Month = static_cast<UINT8>(d.month);
+  info.ModificationTime.Day = static_cast<UINT8>(d.day);
+  info.ModificationTime.Hour = static_cast<UINT8>(d.hour);
+  info.ModificationTime.Minute = static_cast<UINT8>(d.minute);
+  info.ModificationTime.Second = static_cast<UINT8>(d.second);
+  info.ModificationTime.Nanosecond = d.nanosecond;
+  info.ModificationTime.TimeZone = 0x7FF;
+  return info;
+}
+
+// Seconds since 1970 in UTC, as SetFileTime takes them.
+int64_t Seconds(const Date &d) {
+  std::tm tm = {};
+  tm.tm_year = d.year - 1900;
+  tm.tm_mon = d.month - 1;
+  tm.tm_mday = d.day;
+  tm.tm_hour = d.hour;
+  tm.tm_min = d.minute;
+  tm.tm_sec = d.second;
+  return timegm(&tm);
+}
+
+// The standard checksum, written out here so as not to share the loader's
+// faults.
+uint32_t StandardAdler32(const uint8_t *data, size_t length) {
+  uint32_t a = 1, b = 0;
+  for (size_t i = 0; i < length; i++) {
+    a = (a + data[i]) % 65521;
+    b = (b + a) % 65521;
+  }
+  return b << 16 | a;
+}
+
+TEST(KernelCacheTime, OneSecondLaterWithTheCalendarsCarries) {
+  struct Row {
+    Date earlier, later;
+    bool after;
+  };
+  const Row rows[] = {
+      {{2006, 12, 31, 23, 59, 59}, {2007, 1, 1, 0, 0, 0}, true},
+      {{2008, 2, 28, 23, 59, 59}, {2008, 2, 29, 0, 0, 0}, true},
+      {{2007, 2, 28, 23, 59, 59}, {2007, 3, 1, 0, 0, 0}, true},
+      {{1900, 2, 28, 23, 59, 59}, {1900, 3, 1, 0, 0, 0}, true},
+      {{2000, 2, 28, 23, 59, 59}, {2000, 2, 29, 0, 0, 0}, true},
+      {{2007, 4, 30, 23, 59, 59}, {2007, 5, 1, 0, 0, 0}, true},
+      {{2007, 1, 30, 23, 59, 59}, {2007, 1, 31, 0, 0, 0}, true},
+      {{2007, 5, 5, 10, 59, 59}, {2007, 5, 5, 11, 0, 0}, true},
+      {{2007, 5, 5, 10, 20, 30}, {2007, 5, 5, 10, 20, 31}, true},
+      {{2007, 5, 5, 10, 20, 30}, {2007, 5, 5, 10, 20, 32}, false},
+      {{2007, 5, 5, 10, 20, 30}, {2007, 5, 5, 10, 20, 30}, false},
+      {{2007, 5, 5, 10, 20, 31}, {2007, 5, 5, 10, 20, 30}, false},
+      // All 16 bytes count: a nanosecond apart is no match.
+      {{2006, 12, 31, 23, 59, 59, 5}, {2007, 1, 1, 0, 0, 0, 5}, true},
+      {{2006, 12, 31, 23, 59, 59}, {2007, 1, 1, 0, 0, 0, 1}, false},
+  };
+  for (const Row &row : rows) {
+    EFI_FILE_INFO earlier = InfoAt(row.earlier), later = InfoAt(row.later);
+    EXPECT_EQ(nimb::IsOneSecondAfter(&earlier, &later), row.after)
+        << row.earlier.year << "-" << row.earlier.month << "-" << row.earlier.day << " " << row.earlier.hour
+        << ":" << row.earlier.minute << ":" << row.earlier.second;
+  }
+  // The zone and daylight bytes count too.
+  EFI_FILE_INFO earlier = InfoAt({2007, 5, 5, 10, 20, 30}), later = InfoAt({2007, 5, 5, 10, 20, 31});
+  later.ModificationTime.Daylight = 1;
+  EXPECT_FALSE(nimb::IsOneSecondAfter(&earlier, &later));
+}
+
+TEST(KernelCacheTime, TheNewerRecordToTheSecond) {
+  struct Row {
+    Date a, b;
+    bool bIsNewer;
+  };
+  const Row rows[] = {
+      {{2007, 1, 1, 0, 0, 0}, {2006, 12, 31, 23, 59, 59}, false},
+      {{2006, 12, 31, 23, 59, 59}, {2007, 1, 1, 0, 0, 0}, true},
+      {{2007, 3, 1, 0, 0, 0}, {2007, 2, 28, 0, 0, 0}, false},
+      {{2007, 3, 1, 0, 0, 5}, {2007, 3, 1, 0, 0, 6}, true},
+      // A tie to the second goes to the first, the nanoseconds aside.
+      {{2007, 3, 1, 0, 0, 5, 1}, {2007, 3, 1, 0, 0, 5, 9}, false},
+  };
+  for (const Row &row : rows) {
+    EFI_FILE_INFO a = InfoAt(row.a), b = InfoAt(row.b), out;
+    a.FileSize = 1;
+    b.FileSize = 2;
+    nimb::PickNewerFileInfo(&a, &b, &out);
+    EXPECT_EQ(out.FileSize, row.bIsNewer ? 2u : 1u) << row.a.second << " " << row.b.second;
+    nimb::PickNewerFileInfo(&a, &b, &a);
+    EXPECT_EQ(a.FileSize, row.bIsNewer ? 2u : 1u);
+  }
+}
+
+class KernelCacheTest : public nimbtest::VolumeTest {
+ protected:
+  void SetUp() override {
+    VolumeTest::SetUp();
+    strcpy(nimb::gModelName, "TestBox1,1");
+    nimb::gKernelName = u"nimb_kernel";
+  }
+  // The cache file's name for the key as it stands.
+  static std::string CacheName() {
+    nimb::MakeKernelCacheKey();
+    char digits[9];
+    snprintf(digits, sizeof(digits), "%08X",
+             __builtin_bswap32(StandardAdler32(nimb::gKernelCacheKey, sizeof(nimb::gKernelCacheKey))));
+    return std::string("System/Library/Caches/com.quill.kernelcaches/kernelcache.") + digits;
+  }
+  size_t TrackedPoolBlocks() const {
+    size_t count = 0;
+    for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
+      count += tag->poolAddress != nullptr;
+    return count;
+  }
+};
+
+TEST_F(KernelCacheTest, TheKeyAndTheNameItGives) {
+  // A device path of `size` bytes: one vendor node and the end node.
+  auto pathOf = [](size_t size) {
+    Bytes path(size, 0xA5);
+    path[0] = 1;
+    path[1] = 4;
+    nimbtest::PutLe16(path, 2, static_cast<uint32_t>(size - 4));
+    const uint8_t end[] = {0x7F, 0xFF, 4, 0};
+    std::copy(end, end + 4, path.end() - 4);
+    return path;
+  };
+  struct Row {
+    const char *name;
+    std::string model;  // written into the model's 64 bytes, unterminated when 64 long
+    size_t pathBytes;
+    std::u16string kernel;
+    std::string keptModel;  // of the key
+    std::string keptName;   // of the key, behind the path, with its zero
+  };
+  const std::string m64(64, 'M');
+  const std::u16string longName(300, u'k');
+  const Row rows[] = {
+      {"short model and path", "Box1,1", 40, u"nimb_kernel", "Box1,1", std::string("nimb_kernel") + '\0'},
+      {"a model of exactly 64 bytes", m64, 40, u"k", m64, std::string("k") + '\0'},
+      {"a path of 250 bytes leaves 6 for the name", "B", 250, u"nimb_kernel", "B",
+       std::string("nimb_") + '\0'},
+      {"a path of 256 bytes leaves none", "B", 256, u"nimb_kernel", "B", ""},
+      {"a longer path is cut at 256", "B", 300, u"nimb_kernel", "B", ""},
+      {"a long name is cut", "B", 100, longName, "B", std::string(155, 'k') + '\0'},
+      // A character that does not fit is left out whole.
+      {"a wide character at the end", "B", 250, u"abcd\u00e9", "B", std::string("abcd") + '\0' + '\0'},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    memset(nimb::gModelName, 0, sizeof(nimb::gModelName));
+    memcpy(nimb::gModelName, row.model.data(), row.model.size());
+    Bytes path = pathOf(row.pathBytes);
+    nimb::gBootDevicePath = reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(path.data());
+    nimb::gKernelName = row.kernel.c_str();
+    Bytes expected(320, 0);
+    std::copy(row.keptModel.begin(), row.keptModel.end(), expected.begin());
+    const size_t kept = std::min<size_t>(row.pathBytes, 256);
+    std::copy(path.begin(), path.begin() + kept, expected.begin() + 64);
+    std::copy(row.keptName.begin(), row.keptName.end(), expected.begin() + 64 + kept);
+    nimb::MakeKernelCacheKey();
+    EXPECT_EQ(Bytes(nimb::gKernelCacheKey, nimb::gKernelCacheKey + 320), expected);
+  }
+  nimb::gBootDevicePath = fw.DevicePathOf(device_);
+  nimb::gKernelName = u"nimb_kernel";
+  strcpy(nimb::gModelName, "TestBox1,1");
+
+  // The name carries the reversed checksum in eight upper-case digits; a
+  // name from the configuration takes the place of the default.
+  std::string expected = CacheName();
+  std::replace(expected.begin(), expected.end(), '/', '\\');
+  EXPECT_NE(nimb::LoadKernelCache(nullptr, root_), EFI_SUCCESS);
+  EXPECT_EQ(fw.ConOutText(), "Looking for kernel cache file '" + expected + "'\r\n");
+  char config[] = "<dict><key>Kernel Cache</key><string>my\\cache</string></dict>";
+  ASSERT_EQ(nimb::PlistParseDocument(config, &nimb::gConfigDict), EFI_SUCCESS);
+  nimb::LoadKernelCache(nullptr, root_);
+  EXPECT_NE(fw.ConOutText().find("'my\\cache." + expected.substr(expected.size() - 8) + "'"),
+            std::string::npos);
+}
+
+// A cache of the kernel in `kernel` as the header says: "comp", "lzss", the
+// checksum, the sizes, model and path fields, then the stream (literals
+// only, each group a flags byte of 0xFF and eight bytes).
+struct CacheFile {
+  Bytes kernel;
+  std::string signature = "comp";
+  std::string compressType = "lzss";
+  int64_t adlerDelta = 0;
+  int64_t uncompressedDelta = 0;
+  size_t cutStream = 0;  // bytes taken off the end of the stream
+  Bytes model;           // the header's model field; empty: zero
+  Bytes bootPath;        // the header's boot path field; empty: zero
+
+  Bytes Build() const {
+    Bytes stream;
+    for (size_t i = 0; i < kernel.size(); i += 8) {
+      stream.push_back(0xFF);
+      stream.insert(stream.end(), kernel.begin() + i, kernel.begin() + std::min(i + 8, kernel.size()));
+    }
+    Bytes out(384, 0);
+    std::copy(signature.begin(), signature.end(), out.begin());
+    std::copy(compressType.begin(), compressType.end(), out.begin() + 4);
+    nimbtest::PutBe32(out, 8,
+                      static_cast<uint32_t>(StandardAdler32(kernel.data(), kernel.size()) + adlerDelta));
+    nimbtest::PutBe32(out, 12, static_cast<uint32_t>(kernel.size() + uncompressedDelta));
+    nimbtest::PutBe32(out, 16, static_cast<uint32_t>(stream.size()));
+    std::copy(model.begin(), model.end(), out.begin() + 64);
+    std::copy(bootPath.begin(), bootPath.end(), out.begin() + 128);
+    out.insert(out.end(), stream.begin(), stream.end() - cutStream);
+    return out;
+  }
+};
+
+TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
+  const Bytes kernel =
+      nimbtest::Object{0xFEEDFACE,
+                       {nimbtest::Segment(0x200000, 0x1000, nimbtest::kObjectDataStart, 0x1000),
+                        nimbtest::Thread(0x200010)},
+                       nimbtest::Pattern(0x1000)}
+          .Build();
+  const std::string cacheName = CacheName();
+  const Bytes key(nimb::gKernelCacheKey, nimb::gKernelCacheKey + 320);
+  const Date kernelTime = {2006, 12, 31, 23, 59, 59};
+
+  struct Setup {
+    CacheFile cache;
+    Bytes file;  // when not empty: the cache file's bytes as they stand
+    Date kernel, extensions, cacheTime;
+    bool extensionsDirectory = true, noExtensions = false, cacheDirectory = false;
+    UINT64 flags = 0;
+    UINT8 customPackage = 0;
+  };
+  struct Row {
+    const char *name;
+    std::function<void(Setup &)> change;
+    EFI_STATUS status;
+  };
+  const Row rows[] = {
+      {"valid, over the year's end", [](Setup &) {}, EFI_SUCCESS},
+      {"model and boot path as in the key",
+       [&](Setup &s) {
+         s.cache.model.assign(key.begin(), key.begin() + 64);
+         s.cache.bootPath.assign(key.begin() + 64, key.end());
+       },
+       EFI_SUCCESS},
+      {"extensions newer than the kernel count",
+       [](Setup &s) {
+         s.kernel = {2006, 5, 1, 0, 0, 0};
+         s.extensions = {2006, 12, 31, 23, 59, 59};
+       },
+       EFI_SUCCESS},
+      {"an uncompressed plain kernel", [&](Setup &s) { s.file = kernel; }, EFI_SUCCESS},
+      {"two seconds after", [](Setup &s) { s.cacheTime = {2007, 1, 1, 0, 0, 1}; }, EFI_NOT_FOUND},
+      {"as old as the kernel", [](Setup &s) { s.cacheTime = s.kernel; }, EFI_NOT_FOUND},
+      {"one second after the older of the two", [](Setup &s) { s.extensions = {2007, 1, 1, 0, 0, 0}; },
+       EFI_NOT_FOUND},
+      {"no extensions directory", [](Setup &s) { s.noExtensions = true; }, EFI_NOT_FOUND},
+      {"extensions is a file", [](Setup &s) { s.extensionsDirectory = false; }, EFI_NOT_FOUND},
+      {"the cache is a directory", [](Setup &s) { s.cacheDirectory = true; }, EFI_NOT_FOUND},
+      {"shorter than the header, though a plain kernel",
+       [&](Setup &s) { s.file.assign(kernel.begin(), kernel.begin() + 383); }, EFI_NOT_FOUND},
+      {"another compression", [](Setup &s) { s.cache.compressType = "lzvn"; }, EFI_NOT_FOUND},
+      {"another model",
+       [&](Setup &s) {
+         s.cache.model.assign(key.begin(), key.begin() + 64);
+         s.cache.model[63] ^= 1;
+       },
+       EFI_NOT_FOUND},
+      {"another boot path",
+       [&](Setup &s) {
+         s.cache.bootPath.assign(key.begin() + 64, key.end());
+         s.cache.bootPath[255] ^= 1;
+       },
+       EFI_NOT_FOUND},
+      {"compressed data cut short", [](Setup &s) { s.cache.cutStream = 1; }, EFI_NOT_FOUND},
+      {"a wrong checksum", [](Setup &s) { s.cache.adlerDelta = 1; }, EFI_DEVICE_ERROR},
+      {"a stream shorter than the size", [](Setup &s) { s.cache.uncompressedDelta = 1; }, EFI_DEVICE_ERROR},
+      // The stream stops at the size: what it gives then fails the checksum.
+      {"a stream longer than the size", [](Setup &s) { s.cache.uncompressedDelta = -1; }, EFI_DEVICE_ERROR},
+      {"safe mode", [](Setup &s) { s.flags = nimb::kBootSafeMode; }, EFI_ACCESS_DENIED},
+      {"network", [](Setup &s) { s.flags = nimb::kBootNetwork; }, EFI_ACCESS_DENIED},
+      {"another kernel", [](Setup &s) { s.flags = nimb::kBootOtherKernel; }, EFI_ACCESS_DENIED},
+      {"a package named by the user", [](Setup &s) { s.customPackage = 1; }, EFI_ACCESS_DENIED},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    nimbtest::TempDir dir;
+    Setup s{CacheFile{kernel}, {}, kernelTime, {2006, 1, 1, 0, 0, 0}, {2007, 1, 1, 0, 0, 0}};
+    row.change(s);
+    dir.File("nimb_kernel", kernel);
+    const std::string extensions = "System/Library/Extensions";
+    if (s.extensionsDirectory && !s.noExtensions)
+      dir.Directory(extensions);
+    if (!s.extensionsDirectory)
+      dir.File(extensions, "not a directory");
+    if (s.cacheDirectory)
+      dir.Directory(cacheName);
+    else
+      dir.File(cacheName, s.file.empty() ? s.cache.Build() : s.file);
+    hostfw::Firmware local;
+    nimbtest::ResetLoaderState();
+    nimb::gST = local.SystemTable();
+    nimb::gBS = local.BootServices();
+    local.SetFileTime(dir.path() + "/nimb_kernel", Seconds(s.kernel));
+    local.SetFileTime(dir.path() + "/" + extensions, Seconds(s.extensions));
+    local.SetFileTime(dir.path() + "/" + cacheName, Seconds(s.cacheTime));
+    EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
+    nimb::gBootDevicePath = local.DevicePathOf(device);
+    strcpy(nimb::gModelName, "TestBox1,1");
+    nimb::gKernelName = u"nimb_kernel";
+    nimb::gBootFlags = s.flags;
+    nimb::gCustomDriverPackage = s.customPackage;
+    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
+    local.BootServices()->HandleProtocol(device, &gEfiSimpleFileSystemProtocolGuid,
+                                         reinterpret_cast<void **>(&fileSystem));
+    EFI_FILE *root = nullptr;
+    ASSERT_EQ(fileSystem->OpenVolume(fileSystem, &root), EFI_SUCCESS);
+
+    EXPECT_EQ(nimb::LoadKernelCache(nullptr, root), row.status);
+    EXPECT_EQ(nimb::gKernelEntry, row.status == EFI_SUCCESS ? 0x200010u : 0u);
+    EXPECT_EQ(local.AllocatedPages(), row.status == EFI_SUCCESS ? 1u : 0u);
+    EXPECT_EQ(TrackedPoolBlocks(), 0u) << "everything but the kernel's pages is given back";
+    EXPECT_EQ(local.OpenFiles(), 1u) << "only the root stays open";
+    if (row.status == EFI_ACCESS_DENIED) {
+      EXPECT_EQ(local.ConOutText(), "");
+      EXPECT_TRUE(local.OpenedNames().empty());
+    }
+    if (row.status == EFI_SUCCESS) {
+      // The three records come before any byte of the cache is read.
+      const std::vector<std::string> expected = {local.OpenedNames()[0], "nimb_kernel",
+                                                 "System\\Library\\Extensions", local.OpenedNames()[0]};
+      EXPECT_EQ(local.OpenedNames(), expected);
+    }
+    nimb::TrackedFreeAll();
+  }
+  nimbtest::ResetLoaderState();
+  Attach();
+}
+
+TEST_F(KernelCacheTest, FirmwareFailuresGiveTheirStatusAndHoldNothing) {
+  const Bytes kernel = nimbtest::Object{0xFEEDFACE, {nimbtest::Thread(0x200010)}, {}}.Build();
+  const std::string cacheName = CacheName();
+  Put("nimb_kernel", kernel);
+  dir_->Directory("System/Library/Extensions");
+  Put(cacheName, CacheFile{kernel}.Build());
+  fw.SetFileTime(dir_->path() + "/nimb_kernel", Seconds({2007, 6, 1, 12, 0, 0}));
+  fw.SetFileTime(dir_->path() + "/System/Library/Extensions", Seconds({2007, 6, 1, 12, 0, 0}));
+  fw.SetFileTime(dir_->path() + "/" + cacheName, Seconds({2007, 6, 1, 12, 0, 1}));
+  ASSERT_EQ(nimb::LoadKernelCache(nullptr, root_), EFI_SUCCESS);
+  const size_t streamBytes = CacheFile{kernel}.Build().size() - 384;
+  struct Row {
+    const char *service;
+    unsigned nth;
+    size_t poolSize;  // for AllocatePool: the size refused
+    EFI_STATUS status;
+  };
+  const Row rows[] = {
+      {"Open", 2, 0, EFI_DEVICE_ERROR},     // the kernel
+      {"GetInfo", 3, 0, EFI_DEVICE_ERROR},  // the extensions directory
+      {"Read", 2, 0, EFI_DEVICE_ERROR},     // the compressed data
+      {"AllocatePool", 1, streamBytes, EFI_OUT_OF_RESOURCES},
+      {"AllocatePool", 1, kernel.size(), EFI_OUT_OF_RESOURCES},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::string(row.service) + " " + std::to_string(row.nth) + " " +
+                 std::to_string(row.poolSize));
+    nimb::TrackedFreeAll();
+    if (row.poolSize != 0)
+      fw.FailPoolAllocationOfSize(row.poolSize, row.nth, row.status);
+    else
+      fw.FailCall(row.service, row.nth, row.status);
+    EXPECT_EQ(nimb::LoadKernelCache(nullptr, root_), row.status);
+    EXPECT_EQ(TrackedPoolBlocks(), 0u);
+    EXPECT_EQ(fw.OpenFiles(), 1u);
+  }
+}
+
+// The boot takes a valid cache and no drivers; without one the plain kernel
+// and its drivers; over LoadFile never a cache. A failed boot gives back
+// every byte.
+TEST_F(KernelCacheTest, TheBootUsesTheCacheOrThePlainKernelWithDrivers) {
+  const Bytes kernel =
+      nimbtest::Object{0xFEEDFACE,
+                       {nimbtest::Segment(0x200000, 0x1000, nimbtest::kObjectDataStart, 0x1000),
+                        nimbtest::Thread(0x200010)},
+                       nimbtest::Pattern(0x1000)}
+          .Build();
+  const std::string bundle = "<dict><key>VzBundleRequired</key><string>Root</string></dict>";
+  struct Row {
+    const char *name;
+    bool network, cache, staleCache, extensions, package;
+    bool entered;
+    std::vector<std::string> said, unsaid;
+  };
+  const std::string looking = "Looking for kernel cache file", plain = "Loading 'nimb",
+                    drivers = "Loading drivers";
+  const Row rows[] = {
+      {"a valid cache", false, true, false, true, false, true, {looking}, {plain, drivers}},
+      {"a stale cache", false, true, true, true, false, true, {looking, plain, drivers}, {}},
+      {"no extensions directory",
+       false,
+       false,
+       false,
+       false,
+       false,
+       false,
+       {"Error loading drivers\r\n"},
+       {}},
+      {"over LoadFile", true, false, false, false, true, true, {plain, drivers}, {looking}},
+      {"over LoadFile without a package",
+       true,
+       false,
+       false,
+       false,
+       false,
+       false,
+       {"Error loading drivers\r\n"},
+       {looking}},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    nimbtest::TempDir dir;
+    hostfw::Firmware local;
+    hostfw::NetworkDevice network(local);
+    EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
+    dir.File("nimb_kernel", kernel);
+    network.PutFile(u"EFI\\BOOT\\nimb.tarnix", kernel);
+    if (row.package)
+      network.PutFile(u"EFI\\BOOT\\nimb.tarnix.drvpk", nimbtest::Pattern(0x100));
+    if (row.extensions)
+      dir.File("System/Library/Extensions/A.drvb/Info.plist", bundle);
+    const int64_t time = 1199145599;  // 2007-12-31 23:59:59
+    local.SetFileTime(dir.path() + "/nimb_kernel", time);
+    local.SetFileTime(dir.path() + "/System/Library/Extensions", time);
+    if (row.cache) {
+      nimbtest::ResetLoaderState();
+      strcpy(nimb::gModelName, "ACPI");
+      nimb::gBootDevicePath = local.DevicePathOf(device);
+      nimb::gKernelName = u"nimb_kernel";
+      const std::string name = CacheName();
+      dir.File(name, CacheFile{kernel}.Build());
+      local.SetFileTime(dir.path() + "/" + name, time + (row.staleCache ? 2 : 1));
+    }
+    local.SetBootDevice(row.network ? network.Handle() : device);
+    nimbtest::ResetLoaderState();
+    const hostfw::RunResult result = local.Run(BootEntry);
+    const std::string text = local.ConOutText();
+    EXPECT_EQ(result.end, row.entered ? hostfw::RunEnd::KernelEntered : hostfw::RunEnd::Exited) << text;
+    for (const std::string &said : row.said)
+      EXPECT_NE(text.find(said), std::string::npos) << said;
+    for (const std::string &unsaid : row.unsaid)
+      EXPECT_EQ(text.find(unsaid), std::string::npos) << unsaid;
+    if (!row.entered) {
+      EXPECT_EQ(local.AllocatedPages(), 0u);
+      EXPECT_EQ(local.LivePoolBlocks(), 0u);
+    }
+  }
+  nimbtest::ResetLoaderState();
+  Attach();
+}
+
+}  // namespace

@@ -1,0 +1,151 @@
+// The kernel cache's LZSS stream: fixed streams with known output, round
+// trips through the cache writer's encoder, and the decoder against a plain
+// ring decoder of the tests, on random streams and destinations of any size.
+#include "load/lzss.h"
+
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <random>
+#include <string>
+#include <vector>
+
+#include "kcache/lzss_encoder.h"
+#include "tests/unit/lzss_reference.h"
+
+namespace {
+
+using Bytes = nimbtest::Bytes;
+
+// Decodes into a destination of exactly `capacity` bytes (on the heap, so
+// that a write past it shows) and returns what came out.
+Bytes Decode(const Bytes &stream, size_t capacity) {
+  Bytes destination(capacity);
+  const UINT64 count =
+      nimb::DecompressLzss(destination.data(), capacity, stream.data(), static_cast<UINT32>(stream.size()));
+  EXPECT_LE(count, capacity);
+  destination.resize(count);
+  return destination;
+}
+
+TEST(LzssTest, FixedStreams) {
+  struct Row {
+    const char *name;
+    Bytes stream;
+    size_t capacity;
+    std::string output;
+  };
+  const std::string zeros(3, '\0');
+  const Row rows[] = {
+      {"18 spaces from ring position 0", {0x00, 0x00, 0x0F}, 100, std::string(18, ' ')},
+      {"a reference reading what it writes", {0x01, 'A', 0xEE, 0xF0}, 100, "AAAA"},
+      {"cut after a reference's first byte", {0x01, 'A', 0xEE}, 100, "A"},
+      {"a literal with no byte left", {0xFF}, 100, ""},
+      {"the zeros behind the spaces", {0x00, 0xEE, 0xF0}, 100, zeros},
+      {"spaces, then what it writes", {0x00, 0xEC, 0xF1}, 100, std::string(4, ' ')},
+      {"across the ring's end", {0x00, 0xFF, 0xF0}, 100, std::string("\0  ", 3)},
+      {"a reference cut by the destination", {0x00, 0x00, 0x0F}, 5, std::string(5, ' ')},
+      {"a literal cut by the destination", {0x03, 'a', 'b', 0x00, 0x00}, 1, "a"},
+      {"nothing", {}, 100, ""},
+  };
+  for (const Row &row : rows) {
+    const Bytes out = Decode(row.stream, row.capacity);
+    EXPECT_EQ(std::string(out.begin(), out.end()), row.output) << row.name;
+  }
+}
+
+// Real x86 code: this test program's own bytes.
+Bytes OwnCode(size_t size) {
+  std::ifstream in("/proc/self/exe", std::ios::binary);
+  Bytes bytes(size);
+  in.read(reinterpret_cast<char *>(bytes.data()), static_cast<std::streamsize>(size));
+  bytes.resize(static_cast<size_t>(in.gcount()));
+  return bytes;
+}
+
+TEST(LzssTest, RoundTripsThroughTheEncoder) {
+  std::mt19937 random(7);
+  auto randomBytes = [&](size_t size, unsigned range) {
+    Bytes bytes(size);
+    for (uint8_t &byte : bytes)
+      byte = static_cast<uint8_t>(random() % range);
+    return bytes;
+  };
+  auto runs = [&](size_t size) {
+    Bytes bytes;
+    while (bytes.size() < size)
+      bytes.insert(bytes.end(), 1 + random() % 40, static_cast<uint8_t>(random() % 3));
+    bytes.resize(size);
+    return bytes;
+  };
+  std::string text;
+  while (text.size() < 30000)
+    text +=
+        "The loader reads the cache, decodes it and checks its sum. " + std::to_string(text.size()) + "\n";
+  struct Row {
+    const char *name;
+    Bytes data;
+  };
+  std::vector<Row> rows = {
+      {"empty", {}},
+      {"spaces only", Bytes(5000, ' ')},
+      {"zeros only", Bytes(70000, 0)},
+      {"text", Bytes(text.begin(), text.end())},
+      {"x86 code", OwnCode(32768)},
+  };
+  for (size_t size : {1, 2, 17, 18, 19, 4077, 4078, 4079, 4095, 4096, 4097, 20000})
+    rows.push_back({"random", randomBytes(size, 256)});
+  for (size_t size : {19, 4078, 4097, 9000}) {
+    rows.push_back({"four symbols", randomBytes(size, 4)});
+    rows.push_back({"runs", runs(size)});
+  }
+  for (const Row &row : rows) {
+    const Bytes optimal = kcache::CompressLzss(row.data.data(), row.data.size());
+    const Bytes greedy = kcache::CompressLzss(row.data.data(), row.data.size(), kcache::LzssParse::kGreedy);
+    EXPECT_EQ(Decode(optimal, row.data.size()), row.data) << row.name << " of " << row.data.size();
+    EXPECT_EQ(Decode(greedy, row.data.size()), row.data) << row.name << " of " << row.data.size();
+    EXPECT_EQ(nimbtest::LzssReferenceDecode(optimal, row.data.size()), row.data)
+        << row.name << " of " << row.data.size();
+    // One flags byte more at most, from where the last group ends.
+    EXPECT_LE(optimal.size(), greedy.size() + 1) << row.name << " of " << row.data.size();
+  }
+}
+
+// Random streams, mostly references (they reach anywhere in the ring, overlap
+// what they write, and run far past the destination), decoded into
+// destinations from empty to larger than the output.
+TEST(LzssTest, AgreesWithThePlainRingDecoderOnRandomStreams) {
+  std::mt19937 random(11);
+  for (int round = 0; round < 600; round++) {
+    const unsigned literalShare = random() % 9;  // literals in eight items
+    Bytes stream;
+    for (unsigned groups = random() % 300; groups > 0; groups--) {
+      unsigned flags = 0;
+      for (unsigned item = 0; item < 8; item++)
+        flags |= (random() % 8 < literalShare) << item;
+      stream.push_back(static_cast<uint8_t>(flags));
+      for (unsigned item = 0; item < 8; item++)
+        for (unsigned byte = flags >> item & 1 ? 1 : 2; byte > 0; byte--)
+          stream.push_back(static_cast<uint8_t>(random()));
+    }
+    stream.resize(stream.size() - random() % 3 * (stream.size() > 2));
+    const size_t capacity = round % 4 == 0 ? 1 << 20 : random() % 30000;
+    const Bytes want = nimbtest::LzssReferenceDecode(stream, capacity);
+    ASSERT_EQ(Decode(stream, capacity), want) << "round " << round;
+  }
+}
+
+// A corrupt stream that would produce far more than the destination holds
+// fills it and stops, with nothing written behind it.
+TEST(LzssTest, StopsAtTheDestinationsEnd) {
+  const Bytes stream(5000, 0x00);  // references of 3 bytes, nothing else
+  for (size_t capacity : {0, 1, 4095, 4096, 5000, 6000}) {
+    Bytes destination(capacity + 64, 0xA5);
+    EXPECT_EQ(
+        nimb::DecompressLzss(destination.data(), capacity, stream.data(), static_cast<UINT32>(stream.size())),
+        capacity);
+    EXPECT_EQ(Bytes(destination.begin() + capacity, destination.end()), Bytes(64, 0xA5)) << capacity;
+  }
+}
+
+}  // namespace
