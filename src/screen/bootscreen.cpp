@@ -64,6 +64,7 @@ EFI_STATUS ExpandIndexedImage(UINT32 width, UINT32 height, const UINT8 *indexes,
     buffer[i].Blue = entry[2];
     buffer[i].Green = entry[1];
     buffer[i].Red = entry[0];
+    buffer[i].Reserved = 0;  // the same pixels on every boot, whatever the pool held
   }
   *pixels = buffer;
   return EFI_SUCCESS;

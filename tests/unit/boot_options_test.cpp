@@ -48,8 +48,11 @@ struct FakeBootPolicy {
   UINT64 answer;
 };
 
+// An answer of ~0 stands for a policy that writes nothing.
 EFI_STATUS EFIAPI KeysIgnored(NIMB_BOOT_POLICY_PROTOCOL *This, UINT64 *ignored) {
-  *ignored = reinterpret_cast<FakeBootPolicy *>(This)->answer;
+  const UINT64 answer = reinterpret_cast<FakeBootPolicy *>(This)->answer;
+  if (answer != ~0ull)
+    *ignored = answer;
   return EFI_SUCCESS;
 }
 
@@ -235,6 +238,14 @@ TEST_F(BootOptionsTest, TheBootPolicyCanSilenceTheKeys) {
   ASSERT_EQ(Process(u""), EFI_SUCCESS);
   EXPECT_EQ(keys_.calls, 1);
   EXPECT_EQ(gBootFlags, 0u);
+
+  // A policy that writes no answer ignores nothing.
+  nimbtest::ResetLoaderState();
+  Attach();
+  nimb::gLoadedImage = fw.LoadedImage();
+  policy.answer = ~0ull;
+  ASSERT_EQ(Process(u""), EFI_SUCCESS);
+  EXPECT_EQ(gBootFlags & kBootKeysIgnored, 0u);
 }
 
 TEST_F(BootOptionsTest, TheConfigurationFileByName) {

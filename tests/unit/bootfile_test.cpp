@@ -189,6 +189,16 @@ TEST_F(BootFileTest, LoadFileFailures) {
   EXPECT_EQ(nimb::BootFileRead(&file, &count, out), EFI_NOT_FOUND);
   nimb::BootFileClose(&file);
 
+  // No name: a record without a path, closed without a trace. No pool for
+  // the path: the firmware's refusal, nothing held.
+  const size_t pools = fw.LivePoolBlocks();
+  ASSERT_EQ(nimb::BootFileOpen(net.Protocol(), nullptr, nullptr, &file), EFI_SUCCESS);
+  EXPECT_EQ(file.devicePath, nullptr);
+  nimb::BootFileClose(&file);
+  fw.FailCall("AllocatePool");
+  EXPECT_EQ(nimb::BootFileOpen(net.Protocol(), nullptr, u"q", &file), EFI_OUT_OF_RESOURCES);
+  EXPECT_EQ(fw.LivePoolBlocks(), pools);
+
   // A device that answers the size query with success: an empty file.
   net.PutFile(u"q", Pattern(10));
   net.AnswerSizeQueryWithSuccess(true);

@@ -94,7 +94,9 @@ TEST_F(BootScreenTest, ExpandIndexedImageTakesBlueGreenRedFromTheTable) {
   EFI_UGA_PIXEL *pixels = nullptr;
   ASSERT_EQ(nimb::ExpandIndexedImage(5, 1, indexes, &pixels), EFI_SUCCESS);
   for (size_t i = 0; i < sizeof(indexes); i++)
-    EXPECT_EQ(UINT32(pixels[i].Red) << 16 | UINT32(pixels[i].Green) << 8 | pixels[i].Blue, Rgb(indexes[i]))
+    EXPECT_EQ(UINT32(pixels[i].Reserved) << 24 | UINT32(pixels[i].Red) << 16 | UINT32(pixels[i].Green) << 8 |
+                  pixels[i].Blue,
+              Rgb(indexes[i]))
         << i;
   nimb::TrackedFree(pixels);
 

@@ -104,7 +104,7 @@ class HandOffTest : public nimbtest::LoaderTest {
     gKernelName = u"nimb_kernel";
   }
   // The boot as far as the hand-off: tree, a kernel at 0x200000, the record.
-  void Prepare(const char *options = "-v a=1") {
+  void Prepare(const char *options = "-v a=1", const char *recordOptions = "rd") {
     options_ = options;
     ASSERT_EQ(fw.Call([&] {
                   InitPlatformDescription();
@@ -112,7 +112,7 @@ class HandOffTest : public nimbtest::LoaderTest {
                   ASSERT_NE(AllocateKernelPages(&address, &size), 0u);
                   gKernelRegionBase = 0x200000;
                   gKernelRegionTop = 0x203000;
-                  InitBootInfo(gLoadedImage, "rd");
+                  InitBootInfo(gLoadedImage, recordOptions);
                 }).end,
               hostfw::RunEnd::Returned);
   }
@@ -348,6 +348,15 @@ TEST_F(HandOffTest, ARuntimeAreaOverUsedMemoryIsFatal) {
   EXPECT_FALSE(fw.BootServicesExited());
   const std::string text = fw.ConOutText();
   EXPECT_EQ(text.substr(text.rfind("Runtime")), "Runtime services area not free\r\n");
+}
+
+// Boot options that could not be settled leave no option string: the record
+// and the hand-off take it for an empty one.
+TEST_F(HandOffTest, NoOptionStringIsAnEmptyOne) {
+  Prepare("", nullptr);
+  ASSERT_EQ(fw.Call([&] { FinishBootInfo(&mapKey_, nullptr); }).end, hostfw::RunEnd::Returned);
+  EXPECT_STREQ(bootArgs->commandLine, "");
+  EXPECT_EQ(ReadTree(bootArgs).nodes["/chosen"].find("boot-args")->second, std::string(1, '\0'));
 }
 
 TEST_F(HandOffTest, BothAcpiTablesAndTheMachineSignature) {
