@@ -162,21 +162,26 @@ class FigureReporter : public benchmark::ConsoleReporter {
   void ReportRuns(const std::vector<Run> &runs) override {
     ConsoleReporter::ReportRuns(runs);
     for (const Run &run : runs) {
-      if (run.run_type != Run::RT_Iteration || run.error_occurred) {
+      // Single runs, or the medians where only aggregates are reported.
+      const bool median = run.run_type == Run::RT_Aggregate && run.aggregate_name == "median";
+      if ((run.run_type != Run::RT_Iteration && !median) || run.error_occurred) {
         continue;
       }
       const auto found = run.counters.find("bytes_per_second");
       if (found != run.counters.end()) {
-        rates_[run.run_name.str()].push_back(found->second.value);
+        (median ? medians_ : rates_)[run.run_name.str()].push_back(found->second.value);
       }
     }
   }
 
   // The median rate of a benchmark, or a negative number when it did not run.
   double Rate(const std::string &name) const {
-    const auto found = rates_.find(name);
+    auto found = rates_.find(name);
     if (found == rates_.end() || found->second.empty()) {
-      return -1;
+      found = medians_.find(name);
+      if (found == medians_.end() || found->second.empty()) {
+        return -1;
+      }
     }
     std::vector<double> values = found->second;
     std::sort(values.begin(), values.end());
@@ -184,7 +189,7 @@ class FigureReporter : public benchmark::ConsoleReporter {
   }
 
  private:
-  std::map<std::string, std::vector<double>> rates_;
+  std::map<std::string, std::vector<double>> rates_, medians_;
 };
 
 std::string RateText(double rate) {
@@ -201,6 +206,9 @@ std::string RateText(double rate) {
 
 // One line per figure whose two benchmarks both ran (a filter may leave some out).
 void PrintFigures(const FigureReporter &reporter) {
+  // The table's last line may end in a colour code: the figures start on
+  // lines of their own.
+  std::printf("\n");
   for (const Figure &figure : Figures()) {
     const double loader = reporter.Rate(figure.loader), peer = reporter.Rate(figure.peer);
     if (loader <= 0 || peer <= 0) {

@@ -363,8 +363,11 @@ Firmware::~Firmware() {
   gInstances.erase(self);
   if (active) {
     ClearArena();
-    if (!gInstances.empty())
+    if (!gInstances.empty()) {
       RestoreArena(*gInstances.back()->s_);
+      if (gInstances.back()->s_->guarded)
+        ApplyGuard(*gInstances.back()->s_);
+    }
   }
 }
 

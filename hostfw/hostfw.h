@@ -207,6 +207,12 @@ class Firmware {
   unsigned FreePoolCalls() const;
   unsigned AllocatePagesCalls() const;
   unsigned FreePagesCalls() const;
+  // From now on, free pages of the arena and regions declared reserved can
+  // be neither read nor written: a stray access by the loader faults and
+  // ends the test program. Pages taken later are opened, pages given back
+  // are closed again. For tests and fuzz targets that must show that nothing
+  // touches memory the loader does not hold.
+  void GuardFreeMemory();
   // The key that the next GetMemoryMap returns; changes with every change of
   // the map, pool allocations and frees included.
   UINTN MapKey() const;

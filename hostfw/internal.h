@@ -159,6 +159,7 @@ struct Firmware::State {
   unsigned growthCountdown = 0;  // GetMemoryMap calls until growthLater applies
   unsigned growthLater = 0;
   std::vector<SavedRange> saved;
+  bool guarded = false;  // GuardFreeMemory
 
   // Tables.
   RuntimeData *tables = nullptr;
@@ -283,8 +284,10 @@ EFI_GUID PartitionSignature(unsigned disk, UINT32 partition);
 // --- Memory (memory.cpp) --------------------------------------------------------
 
 void MapArena();
-// Empties the arena's pages (its bookkeeping is the caller's).
+// Empties the arena's pages and opens them all (its bookkeeping is the caller's).
 void ClearArena();
+// Closes the free and the reserved pages of `s` (GuardFreeMemory).
+void ApplyGuard(State &s);
 // Takes pages top-down for the firmware itself, filled with `fill`.
 UINT64 AllocateFirmwarePages(State &s, EFI_MEMORY_TYPE type, UINT64 pages, uint8_t fill);
 // A pool block that the firmware hands to the caller (it counts as the loader's).

@@ -86,9 +86,24 @@ bool FindTopDown(const State &s, UINT64 pages, UINT64 limit, UINT64 *base) {
   return false;
 }
 
+// Under the guard, free memory and declared reserved memory can be neither
+// read nor written.
+bool Closed(const PageRange &range) {
+  return range.owner == Owner::Declared && range.type == EfiReservedMemoryType;
+}
+
+void Protect(UINT64 base, UINT64 pages, bool open) {
+  if (mprotect(reinterpret_cast<void *>(base), pages * EFI_PAGE_SIZE,
+               open ? PROT_READ | PROT_WRITE : PROT_NONE) != 0) {
+    Misuse("cannot protect %#llx: %s", static_cast<unsigned long long>(base), std::strerror(errno));
+  }
+}
+
 void Occupy(State &s, UINT64 base, UINT64 pages, EFI_MEMORY_TYPE type, UINT64 attribute, Owner owner) {
   s.ranges[base] = {pages, type, attribute, owner};
   s.mapKey++;
+  if (s.guarded && !Closed(s.ranges[base]))
+    Protect(base, pages, true);
 }
 
 EFI_STATUS FindPages(const State &s, EFI_ALLOCATE_TYPE type, UINT64 pages, UINT64 request, UINT64 *base) {
@@ -201,6 +216,8 @@ EFI_STATUS EFIAPI FreePages(EFI_PHYSICAL_ADDRESS Memory, UINTN Pages) {
   s.ranges.erase(it);
   s.mapKey++;
   madvise(reinterpret_cast<void *>(Memory), Pages * EFI_PAGE_SIZE, MADV_DONTNEED);
+  if (s.guarded)
+    Protect(Memory, Pages, false);
   return EFI_SUCCESS;
 }
 
@@ -304,7 +321,18 @@ void MapArena() {
 }
 
 void ClearArena() {
+  Protect(kArenaBase, kArenaBytes / EFI_PAGE_SIZE, true);
   madvise(reinterpret_cast<void *>(kArenaBase), kArenaBytes, MADV_DONTNEED);
+}
+
+void ApplyGuard(State &s) {
+  s.guarded = true;
+  for (const Stretch &free : FreeStretches(s))
+    Protect(free.start, (free.end - free.start) / EFI_PAGE_SIZE, false);
+  for (const auto &[base, range] : s.ranges) {
+    if (Closed(range))
+      Protect(base, range.pages, false);
+  }
 }
 
 UINT64 AllocateFirmwarePages(State &s, EFI_MEMORY_TYPE type, UINT64 pages, uint8_t fill) {
@@ -321,6 +349,8 @@ void *AllocateLoaderPool(State &s, size_t size, EFI_MEMORY_TYPE type) {
 }
 
 void SaveArena(State &s) {
+  if (s.guarded)
+    Protect(kArenaBase, kArenaBytes / EFI_PAGE_SIZE, true);
   for (const auto &[base, range] : s.ranges) {
     const auto *bytes = reinterpret_cast<const uint8_t *>(base);
     s.saved.push_back({base, std::vector<uint8_t>(bytes, bytes + range.pages * EFI_PAGE_SIZE)});
@@ -412,6 +442,10 @@ void Firmware::GrowMemoryMapOnCall(unsigned nth, unsigned extraDescriptors) {
     Misuse("GrowMemoryMapOnCall counts from 1");
   s_->growthCountdown = nth;
   s_->growthLater = extraDescriptors;
+}
+
+void Firmware::GuardFreeMemory() {
+  ApplyGuard(*s_);
 }
 
 void Firmware::GrowMemoryMapOnNextCall(unsigned extraDescriptors) {

@@ -177,13 +177,22 @@ bool ApplyKeys(PlatformConfig *config, const char *, char *value) {
   return true;
 }
 
-bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
-  UINT64 flag = 0;
-  if (!ParseDecimal(value, 1, &flag) || value[1] != '\0') {
+// A flag: 0 or 1.
+bool ApplyFlag(bool *flag, const char *value) {
+  UINT64 number = 0;
+  if (!ParseDecimal(value, 1, &number) || value[1] != '\0') {
     return false;
   }
-  config->keysIgnored = flag != 0;
+  *flag = number != 0;
   return true;
+}
+
+bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
+  return ApplyFlag(&config->keysIgnored, value);
+}
+
+bool ApplyTimePxe(PlatformConfig *config, const char *, char *value) {
+  return ApplyFlag(&config->timePxeDownload, value);
 }
 
 // Variables and records.
@@ -287,6 +296,10 @@ bool ApplyBsdpResponse(PlatformConfig *config, const char *, char *value) {
   return ApplyBytes(&config->bsdpResponse, value);
 }
 
+bool ApplyTimedExtents(PlatformConfig *config, const char *, char *value) {
+  return ApplyBytes(&config->timedExtents, value);
+}
+
 // A key whose name ends in '.' is a prefix: it takes every key that starts
 // with it, and its function gets the rest of the key as the name.
 struct ConfigKey {
@@ -299,6 +312,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"options", ApplyOptions},
     {"console", ApplyConsole},
     {"hold", ApplyHold},
+    {"net.time-pxe", ApplyTimePxe},
     {"keys", ApplyKeys},
     {"keys-ignored", ApplyKeysIgnored},
     {"nvram.", ApplyNvramText},
@@ -309,6 +323,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"netboot.dhcp-hex", ApplyDhcpResponse},
     {"netboot.bsdp-hex", ApplyBsdpResponse},
     {"time-read", ApplyTimedRead},
+    {"time-read-extents-hex", ApplyTimedExtents},
 };
 
 // The name that `key` gives to the function of `entry`, or null when the
@@ -424,6 +439,7 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->options = nullptr;
   config->consoleMode = EfiConsoleControlScreenGraphics;
   config->holdSeconds = 0;
+  config->timePxeDownload = false;
   config->keys = {};
   config->keysIgnored = false;
   config->nvram.count = 0;
@@ -432,6 +448,7 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->dhcpResponse = {};
   config->bsdpResponse = {};
   config->timedReadPath = nullptr;
+  config->timedExtents = {};
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {

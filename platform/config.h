@@ -14,6 +14,10 @@
 //   console=text|graphics  the console mode the loader finds; graphics
 //   hold=<seconds>         wait between the report and the power-off, 0 to
 //                          3600; 0
+//   net.time-pxe=0|1       on a network boot, 1 times the firmware's own
+//                          download of the boot file before the loader
+//                          starts, then fetches it over the network's own
+//                          LoadFile; 0
 //   keys=<key>+<key>...    the keys held down at start, as the key state
 //                          protocol reports them. Modifiers: ctrl, shift,
 //                          alt, gui (left ones; also lctrl, lshift, lalt,
@@ -47,6 +51,11 @@
 //                          whole through the firmware's file system before
 //                          starting the loader, timed with the time stamp
 //                          counter (platform: tsc read-start, read-end)
+//   time-read-extents-hex=<hex> before the loader starts, the platform reads
+//                          these extents of one partition through DiskIO
+//                          and prints the time in TSC ticks: u32 partition
+//                          number, then u64 start and u64 length pairs,
+//                          little-endian
 // Hexadecimal values are any number of bytes: two digits each, blanks
 // allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
@@ -111,6 +120,9 @@ struct PlatformConfig {
   EFI_CONSOLE_CONTROL_SCREEN_MODE consoleMode;
   // Seconds to wait between the report and the power-off.
   UINT32 holdSeconds;
+  // On a network boot: time the firmware's own download of the boot file
+  // before the loader starts (net.time-pxe=1).
+  bool timePxeDownload;
   HeldKeys keys;
   bool keysIgnored;
   ConfigEntryList nvram;
@@ -120,9 +132,12 @@ struct PlatformConfig {
   ConfigBytes bsdpResponse;
   // The file to read timed before the loader starts; null: none.
   const char *timedReadPath;
+  ConfigBytes timedExtents;
 };
 
 constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";
+// On a network boot: the loader's name on the TFTP server.
+constexpr const char *kDefaultNetLoaderName = "nimbboot.efi";
 constexpr UINT32 kMaxHoldSeconds = 3600;
 
 enum ConfigProblem : UINT32 {

@@ -16,7 +16,9 @@
 #include "graphics.h"
 #include "key_state.h"
 #include "memory.h"
+#include "net_boot.h"
 #include "net_boot_info.h"
+#include "resume_watch.h"
 #include "serial.h"
 #include "tsc.h"
 
@@ -36,6 +38,7 @@ PlatformBootPolicy gBootPolicy;
 PlatformDataHub gDataHub;
 PlatformDeviceProperties gDeviceProperties;
 PlatformNetBootInfo gNetBootInfo;
+PlatformNetBoot gNetBoot;
 MemoryMeter gMeter;
 FileTimeTable gTimes;
 
@@ -93,6 +96,13 @@ void ReportConfigIssue(const ConfigIssue &issue, void *) {
   }
 }
 
+// `size` bytes of the configuration file, with room for one more behind.
+void ParseConfig(char *text, UINTN size, PlatformConfig *config) {
+  if (ConfigParse(text, size, config, ReportConfigIssue, nullptr) != 0) {
+    Fail(kExitConfigInvalid, "%s has errors", kConfigName);
+  }
+}
+
 // The whole of a file of the platform's volume, with room for a NUL behind
 // it; null when the file is not there. Other failures end the run with
 // `code`.
@@ -131,9 +141,7 @@ void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
     SerialPrintf("platform: no %s, defaults used\n", kConfigName);
     return;
   }
-  if (ConfigParse(text, size, config, ReportConfigIssue, nullptr) != 0) {
-    Fail(kExitConfigInvalid, "%s has errors", kConfigName);
-  }
+  ParseConfig(text, size, config);
 }
 
 // The exact times of the volume's files, when the disk tool listed them,
@@ -207,7 +215,8 @@ UINT64 FreePagesOrFail(const char *when) {
   return pages;
 }
 
-// The root of the volume that the platform layer was started from.
+// The root of the volume that the platform layer was started from; null when
+// its device has no file system.
 EFI_FILE_PROTOCOL *OpenOwnVolume(EFI_HANDLE *device) {
   void *interface = nullptr;
   EFI_STATUS status = gBS->HandleProtocol(gImageHandle, &gEfiLoadedImageProtocolGuid, &interface);
@@ -217,7 +226,7 @@ EFI_FILE_PROTOCOL *OpenOwnVolume(EFI_HANDLE *device) {
   *device = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface)->DeviceHandle;
   status = gBS->HandleProtocol(*device, &gEfiSimpleFileSystemProtocolGuid, &interface);
   if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "no file system on the boot device (%s)", StatusName(status));
+    return nullptr;  // a network boot
   }
   EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *volume = static_cast<EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *>(interface);
   EFI_FILE_PROTOCOL *root = nullptr;
@@ -297,7 +306,20 @@ struct LoaderLaunch {
   EFI_DEVICE_PATH_PROTOCOL *devicePath;
   CHAR16 *options;  // null: the loader gets none
   UINT32 optionsSize;
+  // A loader fetched over the network: its bytes, and the handle that it is
+  // to see as its device. Null when it comes from the volume.
+  void *source;
+  UINTN sourceSize;
+  EFI_HANDLE device;
 };
+
+void SetLoadOptions(LoaderLaunch *launch, const PlatformConfig &config) {
+  if (config.options != nullptr) {
+    UINTN units = 0;
+    launch->options = WideCopyOrFail(config.options, "the load options", &units);
+    launch->optionsSize = static_cast<UINT32>((units + 1) * sizeof(CHAR16));
+  }
+}
 
 LoaderLaunch PrepareLoader(EFI_FILE_PROTOCOL *root, EFI_HANDLE device, const PlatformConfig &config) {
   UINTN pathUnits = 0;
@@ -308,12 +330,8 @@ LoaderLaunch PrepareLoader(EFI_FILE_PROTOCOL *root, EFI_HANDLE device, const Pla
     Fail(kExitLoaderMissing, "loader %s not found (%s)", config.loaderPath, StatusName(status));
   }
   file->Close(file);
-  LoaderLaunch launch = {FileDevicePath(device, path, pathUnits), nullptr, 0};
-  if (config.options != nullptr) {
-    UINTN units = 0;
-    launch.options = WideCopyOrFail(config.options, "the load options", &units);
-    launch.optionsSize = static_cast<UINT32>((units + 1) * sizeof(CHAR16));
-  }
+  LoaderLaunch launch = {FileDevicePath(device, path, pathUnits), nullptr, 0, nullptr, 0, nullptr};
+  SetLoadOptions(&launch, config);
   return launch;
 }
 
@@ -375,8 +393,10 @@ void ReportBytes(const char *what, const ConfigBytes &bytes) {
 // configuration gives what it answers with.
 void InstallAnswerProtocols(const PlatformConfig &config) {
   ReportBytes("platform: device properties:", config.deviceProperties);
-  ReportBytes("\nplatform: net boot: dhcp", config.dhcpResponse);
-  ReportBytes(", bsdp", config.bsdpResponse);
+  if (gNetBoot.pxe == nullptr) {
+    ReportBytes("\nplatform: net boot: dhcp", config.dhcpResponse);
+    ReportBytes(", bsdp", config.bsdpResponse);
+  }
   SerialPrintf("\n");
   if (config.deviceProperties.bytes != nullptr) {
     const EFI_STATUS status = DevicePropertiesInstall(&gDeviceProperties, config.deviceProperties);
@@ -385,7 +405,8 @@ void InstallAnswerProtocols(const PlatformConfig &config) {
     }
     gDeviceProperties.onGetProperties = ReportGetProperties;
   }
-  if (config.dhcpResponse.bytes != nullptr || config.bsdpResponse.bytes != nullptr) {
+  if (gNetBoot.pxe == nullptr &&
+      (config.dhcpResponse.bytes != nullptr || config.bsdpResponse.bytes != nullptr)) {
     const EFI_STATUS status = NetBootInfoInstall(&gNetBootInfo, config.dhcpResponse, config.bsdpResponse);
     if (EFI_ERROR(status)) {
       Fail(kExitPlatformFailed, "cannot install the network boot information (%s)", StatusName(status));
@@ -425,7 +446,8 @@ void InstallProtocols(const PlatformConfig &config) {
 }
 
 // The loader's variables that the configuration sets; the others stay as
-// they are.
+// they are. The values are wiped behind them: the variable store keeps the
+// only copy (a key among them is looked for in memory after a resume).
 void SetVariables(const ConfigEntryList &variables) {
   constexpr UINT32 kAttributes =
       EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
@@ -441,11 +463,78 @@ void SetVariables(const ConfigEntryList &variables) {
     }
     SerialPrintf("platform: nvram %s set, %u bytes\n", variable.name, static_cast<UINT64>(variable.size));
   }
+  ReportKeyCopies(variables);
+  for (UINT32 i = 0; i < variables.count; i++) {
+    volatile UINT8 *bytes = const_cast<UINT8 *>(variables.entries[i].bytes);
+    for (UINT32 j = 0; j < variables.entries[i].size; j++) {
+      bytes[j] = 0;
+    }
+  }
+}
+
+// A read's moments go to the log as TSC values, taken on either side of the
+// transfer alone.
+void ReportReadStart(const char *name, UINT64 room) {
+  SerialPrintf("\nplatform: net read of %s into %u bytes starts\n", name, room);
+  ReportTsc("net-read-start", ReadTsc());
+}
+
+// The firmware's own PXE download of the boot file again, timed, to set the
+// network file loader's transfers against.
+void TimePxeDownload(EFI_HANDLE device) {
+  void *interface = nullptr;
+  EFI_STATUS status = gBS->HandleProtocol(device, &gEfiLoadFileProtocolGuid, &interface);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no firmware LoadFile to time (%s)", StatusName(status));
+  }
+  EFI_LOAD_FILE_PROTOCOL *firmware = static_cast<EFI_LOAD_FILE_PROTOCOL *>(interface);
+  EFI_DEVICE_PATH_PROTOCOL end = {END_DEVICE_PATH_TYPE, END_ENTIRE_DEVICE_PATH_SUBTYPE, {4, 0}};
+  UINTN size = 0;
+  status = firmware->LoadFile(firmware, &end, TRUE, &size, nullptr);
+  if (status != EFI_BUFFER_TOO_SMALL) {
+    Fail(kExitPlatformFailed, "the firmware's PXE gave no boot file size (%s)", StatusName(status));
+  }
+  EFI_PHYSICAL_ADDRESS buffer = 0;
+  status = gBS->AllocatePages(AllocateAnyPages, EfiLoaderData, EFI_SIZE_TO_PAGES(size), &buffer);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no memory for the boot file (%s)", StatusName(status));
+  }
+  const UINT64 start = ReadTsc();
+  status = firmware->LoadFile(firmware, &end, TRUE, &size, reinterpret_cast<void *>(buffer));
+  const UINT64 stop = ReadTsc();
+  SerialPrintf("platform: net firmware download of the boot file: %s, %u bytes\n", StatusName(status), size);
+  ReportTsc("pxe-download-start", start);
+  ReportTsc("pxe-download-end", stop);
+  // The same file through the network's own LoadFile, here in the platform,
+  // where no loader and no spinner run: what the loader's fetch costs beyond
+  // the transfer itself shows against it.
+  const char *name = reinterpret_cast<const char *>(gNetBoot.pxe->Mode->DhcpAck.Dhcpv4.BootpBootFile);
+  UINTN units = 0;
+  const CHAR16 *wide = WideCopyOrFail(name, "the boot file's name", &units);
+  EFI_DEVICE_PATH_PROTOCOL *path = FileDevicePath(gNetBoot.handle, wide, units);
+  UINTN room = size;
+  status = gNetBoot.loadFile.protocol.LoadFile(&gNetBoot.loadFile.protocol, path, FALSE, &room,
+                                               reinterpret_cast<void *>(buffer));
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "the network's LoadFile didn't fetch the boot file (%s)", StatusName(status));
+  }
+  gBS->FreePages(buffer, EFI_SIZE_TO_PAGES(size));
+}
+
+// The firmware picks the loader's device by its path, and the NIC's own
+// handle has the same path as the network handle: the loader is to see the
+// network handle, which alone serves its files.
+void SetLoaderDevice(EFI_LOADED_IMAGE_PROTOCOL *image, EFI_HANDLE device) {
+  if (image->DeviceHandle != device) {
+    SerialPrintf("platform: net: the loader's device set to the network handle\n");
+    image->DeviceHandle = device;
+  }
 }
 
 EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
   EFI_HANDLE loader = nullptr;
-  EFI_STATUS status = gBS->LoadImage(FALSE, gImageHandle, launch.devicePath, nullptr, 0, &loader);
+  EFI_STATUS status =
+      gBS->LoadImage(FALSE, gImageHandle, launch.devicePath, launch.source, launch.sourceSize, &loader);
   if (EFI_ERROR(status)) {
     Fail(kExitLoadImageFailed, "cannot load %s (%s)", config.loaderPath, StatusName(status));
   }
@@ -454,8 +543,11 @@ EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
   if (EFI_ERROR(status)) {
     Fail(kExitLoadImageFailed, "no loaded image for %s (%s)", config.loaderPath, StatusName(status));
   }
+  EFI_LOADED_IMAGE_PROTOCOL *image = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface);
+  if (launch.device != nullptr) {
+    SetLoaderDevice(image, launch.device);
+  }
   if (launch.options != nullptr) {
-    EFI_LOADED_IMAGE_PROTOCOL *image = static_cast<EFI_LOADED_IMAGE_PROTOCOL *>(interface);
     image->LoadOptions = launch.options;
     image->LoadOptionsSize = launch.optionsSize;
   }
@@ -465,6 +557,91 @@ EFI_STATUS RunLoader(const LoaderLaunch &launch, const PlatformConfig &config) {
   status = gBS->StartImage(loader, nullptr, nullptr);
   ConsoleOfferScreenText(&gConsole, false);
   return status;
+}
+
+// --- a network boot -----------------------------------------------------------
+
+// One byte more than asked, for the configuration parser.
+void *AllocateForFetch(UINTN size) {
+  void *buffer = nullptr;
+  return EFI_ERROR(gBS->AllocatePool(EfiLoaderData, size + 1, &buffer)) ? nullptr : buffer;
+}
+
+// Every TFTP transfer shows in the log, on a line of its own.
+void ReportTransfer(const char *name, const char *what, UINT64 room, EFI_STATUS status, UINT64 size) {
+  const UINT64 end = ReadTsc();
+  if (room == 0) {
+    SerialPrintf("\nplatform: net %s of %s: %s, %u bytes\n", what, name, StatusName(status), size);
+  } else {
+    SerialPrintf("\nplatform: net %s of %s into %u bytes: %s, %u bytes\n", what, name, room,
+                 StatusName(status), size);
+  }
+  if (room != 0) {
+    ReportTsc("net-read-end", end);
+  }
+}
+
+// Started by the firmware's PXE: installs the file loader, reads the
+// configuration and the loader from the TFTP server and gives the network
+// boot information protocol the server's real answers.
+LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
+  EFI_STATUS status = NetBootStart(device, &gNetBoot);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "no file system and no network on the boot device (%s)", StatusName(status));
+  }
+  gNetBoot.loadFile.onTransfer = ReportTransfer;
+  gNetBoot.loadFile.onReadStart = ReportReadStart;
+  const EFI_PXE_BASE_CODE_MODE *mode = gNetBoot.pxe->Mode;
+  const UINT8 *server = gNetBoot.loadFile.server.v4;
+  SerialPrintf("platform: net boot: station %u.%u.%u.%u, server %u.%u.%u.%u\n",
+               static_cast<UINT64>(mode->StationIp.v4[0]), static_cast<UINT64>(mode->StationIp.v4[1]),
+               static_cast<UINT64>(mode->StationIp.v4[2]), static_cast<UINT64>(mode->StationIp.v4[3]),
+               static_cast<UINT64>(server[0]), static_cast<UINT64>(server[1]), static_cast<UINT64>(server[2]),
+               static_cast<UINT64>(server[3]));
+
+  ConfigSetDefaults(config);
+  config->loaderPath = kDefaultNetLoaderName;
+  void *bytes = nullptr;
+  UINT64 size = 0;
+  status = NetLoadFileFetch(&gNetBoot.loadFile, kConfigName, AllocateForFetch, &bytes, &size);
+  if (status == EFI_NOT_FOUND) {
+    SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+  } else if (EFI_ERROR(status)) {
+    Fail(kExitConfigInvalid, "cannot fetch %s (%s)", kConfigName, StatusName(status));
+  } else {
+    ParseConfig(static_cast<char *>(bytes), size, config);
+  }
+  if (config->timePxeDownload) {
+    TimePxeDownload(device);
+  }
+  status = NetLoadFileFetch(&gNetBoot.loadFile, config->loaderPath, AllocateForFetch, &bytes, &size);
+  if (EFI_ERROR(status)) {
+    Fail(status == EFI_NOT_FOUND ? kExitLoaderMissing : kExitLoadImageFailed, "loader %s not fetched (%s)",
+         config->loaderPath, StatusName(status));
+  }
+  UINTN units = 0;
+  const CHAR16 *path = WideCopyOrFail(config->loaderPath, "the loader's path", &units);
+  LoaderLaunch launch = {
+      FileDevicePath(gNetBoot.handle, path, units), nullptr, 0, bytes, size, gNetBoot.handle};
+  SetLoadOptions(&launch, *config);
+
+  // The server's answers as the base code kept them.
+  const ConfigBytes dhcp = {mode->DhcpAck.Raw, static_cast<UINT32>(DhcpMessageLength(
+                                                   mode->DhcpAck.Raw, sizeof(mode->DhcpAck.Raw)))};
+  ConfigBytes discovery = {nullptr, 0};
+  if (mode->PxeReplyReceived) {
+    discovery = {mode->PxeReply.Raw,
+                 static_cast<UINT32>(DhcpMessageLength(mode->PxeReply.Raw, sizeof(mode->PxeReply.Raw)))};
+  }
+  ReportBytes("platform: net boot answers: dhcp", dhcp);
+  ReportBytes(", bsdp", discovery);
+  SerialPrintf("\n");
+  status = NetBootInfoInstall(&gNetBootInfo, dhcp, discovery);
+  if (EFI_ERROR(status)) {
+    Fail(kExitPlatformFailed, "cannot install the network boot information (%s)", StatusName(status));
+  }
+  gNetBootInfo.onGetResponse = ReportGetResponse;
+  return launch;
 }
 
 }  // namespace
@@ -482,17 +659,33 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   EFI_HANDLE device = nullptr;
   EFI_FILE_PROTOCOL *root = OpenOwnVolume(&device);
   PlatformConfig config;
-  ReadConfig(root, &config);
-  const LoaderLaunch launch = PrepareLoader(root, device, config);
-  ReportBootDevicePath(device);
-  if (config.timedReadPath != nullptr) {
-    TimeFirmwareRead(root, config.timedReadPath);
+  LoaderLaunch launch;
+  UINTN directories = 0;
+  if (root != nullptr) {
+    ReadConfig(root, &config);
+    launch = PrepareLoader(root, device, config);
+    ReportBootDevicePath(device);
+    if (config.timedReadPath != nullptr) {
+      TimeFirmwareRead(root, config.timedReadPath);
+    }
+    ServeExactTimes(root, device);
+    directories = MemoryWarmDirectoryCache(root);
+    root->Close(root);
+  } else {
+    launch = PrepareNetworkBoot(device, &config);
   }
-  ServeExactTimes(root, device);
-  const UINTN directories = MemoryWarmDirectoryCache(root);
-  root->Close(root);
   InstallProtocols(config);
-  SetVariables(config.nvram);
+  // A machine that resets starts again on the same variable store: the
+  // configured variables are set on the first start only.
+  const UINT32 boot = CountBoot();
+  ReportResumeVariables();
+  if (boot == 1) {
+    SetVariables(config.nvram);
+  }
+  if (config.timedExtents.bytes != nullptr) {
+    TimedRead(config.timedExtents);
+  }
+  WatchDiskAndReset();
   MemoryStockPool();
   const EFI_STATUS status = MemoryMeterInit(&gMeter);
   if (EFI_ERROR(status)) {

@@ -11,10 +11,11 @@ namespace nimb {
 //
 // Every flags byte opens a group of eight items. A group runs on the fast
 // path when it can neither reach in front of the output, nor run out of
-// input, nor come near the destination's end: there a reference copies 24
-// bytes in three words whatever its count (the bytes behind it are written
-// again by what follows), and eight literals move as one word. Any other
-// group takes the careful path, item by item with every bound checked.
+// input, nor come near the destination's end: there a reference at a
+// distance of 8 or more copies 24 bytes in three words whatever its count
+// (the bytes behind it are written again by what follows), a nearer one goes
+// byte by byte, and a run of literals moves as one word. Any other group
+// takes the careful path, item by item with every bound checked.
 
 namespace {
 

@@ -31,24 +31,24 @@ UINT64 Address(const void *pointer) {
   return reinterpret_cast<UINTN>(pointer);
 }
 
-UINT64 ByteSize(const EFI_MEMORY_DESCRIPTOR *descriptor) {
+NIMB_MAP_WALK UINT64 ByteSize(const EFI_MEMORY_DESCRIPTOR *descriptor) {
   return LShiftU64(descriptor->NumberOfPages, EFI_PAGE_SHIFT);
 }
 
 // Code and data of the runtime services: the regions that move. Other
 // descriptors with the runtime bit (memory-mapped I/O) only get an address.
-bool IsRuntimeRegion(const EFI_MEMORY_DESCRIPTOR *descriptor) {
+NIMB_MAP_WALK bool IsRuntimeRegion(const EFI_MEMORY_DESCRIPTOR *descriptor) {
   return descriptor->Type == EfiRuntimeServicesCode || descriptor->Type == EfiRuntimeServicesData;
 }
 
 // A descriptor that gets an address in the runtime area.
-bool GetsRuntimeAddress(const EFI_MEMORY_DESCRIPTOR *descriptor) {
+NIMB_MAP_WALK bool GetsRuntimeAddress(const EFI_MEMORY_DESCRIPTOR *descriptor) {
   return descriptor->Type != EfiReservedMemoryType && (descriptor->Attribute & EFI_MEMORY_RUNTIME) != 0;
 }
 
 // The descriptor's own words; whatever a larger stride holds behind them is
 // left alone.
-void CopyDescriptor(const EFI_MEMORY_DESCRIPTOR *from, EFI_MEMORY_DESCRIPTOR *to) {
+NIMB_MAP_WALK void CopyDescriptor(const EFI_MEMORY_DESCRIPTOR *from, EFI_MEMORY_DESCRIPTOR *to) {
   to->Type = from->Type;
   to->Pad = from->Pad;
   to->PhysicalStart = from->PhysicalStart;
@@ -75,7 +75,8 @@ constexpr UINT32 kCopyPending = 0x80000000;
 // once no other region still waiting has its old place under the new one;
 // its own old place may overlap it. False when the regions that are left
 // wait on each other.
-bool CopyRegions(EFI_MEMORY_DESCRIPTOR *listStart, EFI_MEMORY_DESCRIPTOR *listEnd, UINT64 descriptorSize) {
+NIMB_MAP_WALK bool CopyRegions(EFI_MEMORY_DESCRIPTOR *listStart, EFI_MEMORY_DESCRIPTOR *listEnd,
+                               UINT64 descriptorSize) {
   UINTN waiting = 0;
   for (EFI_MEMORY_DESCRIPTOR *d = listStart; d < listEnd; d = Next(d, descriptorSize)) {
     d->Pad &= ~kCopyPending;
@@ -128,7 +129,7 @@ void ZeroOutside(UINT64 start, UINT64 size, UINT64 areaStart, UINT64 areaEnd) {
 // Moves the configuration table's entries and gST that lie in the old place
 // of `region` by the distance of its move. The table is reached through gST,
 // so that it is found where an earlier region's move left it.
-void FollowRegion(const EFI_MEMORY_DESCRIPTOR *region) {
+NIMB_MAP_WALK void FollowRegion(const EFI_MEMORY_DESCRIPTOR *region) {
   UINT64 start = region->PhysicalStart;
   UINT64 size = ByteSize(region);
   UINT64 delta = region->VirtualStart - start;
@@ -173,8 +174,9 @@ UINT64 LShiftU64(UINT64 value, UINTN count) {
   return count < 64 ? value << count : 0;
 }
 
-BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMORY_DESCRIPTOR *mapEnd,
-                          UINT64 descriptorSize, UINT64 areaStart, UINT64 spareBytes) {
+NIMB_MAP_WALK BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart,
+                                        const EFI_MEMORY_DESCRIPTOR *mapEnd, UINT64 descriptorSize,
+                                        UINT64 areaStart, UINT64 spareBytes) {
   constexpr UINT64 kAddressLimit = 0x100000000;
   if (descriptorSize < sizeof(EFI_MEMORY_DESCRIPTOR) || areaStart >= kAddressLimit ||
       spareBytes > kAddressLimit) {
@@ -202,9 +204,9 @@ BOOLEAN RuntimeAreaIsFree(const EFI_MEMORY_DESCRIPTOR *mapStart, const EFI_MEMOR
   return spareBytes <= kAddressLimit - next;
 }
 
-EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRIPTOR *mapEnd,
-                              EFI_MEMORY_DESCRIPTOR **cursor, UINT64 descriptorSize, UINT32 descriptorVersion,
-                              UINT64 *nextVirtual, BOOLEAN resume) {
+NIMB_MAP_WALK EFI_STATUS MapRuntimeServices(EFI_MEMORY_DESCRIPTOR *mapStart, EFI_MEMORY_DESCRIPTOR *mapEnd,
+                                            EFI_MEMORY_DESCRIPTOR **cursor, UINT64 descriptorSize,
+                                            UINT32 descriptorVersion, UINT64 *nextVirtual, BOOLEAN resume) {
   // Addresses, and in resume mode the compaction to the runtime descriptors.
   const UINT64 areaStart = *nextVirtual;
   UINT64 next = areaStart;

@@ -6,6 +6,12 @@
 
 #include "efi/efi.h"
 
+// A memory map may lie only 4-byte aligned: the resume's lies at offset 788
+// of its scratch area, a layout the restart code relies on. The processor
+// reads descriptors there as they stand; the routines that walk a map say so
+// to the host build's alignment check.
+#define NIMB_MAP_WALK __attribute__((no_sanitize("alignment")))
+
 namespace nimb {
 
 // `value` shifted left by `count` bits, in 64 bits; 0 for a count of 64 or

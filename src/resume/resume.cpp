@@ -2,6 +2,8 @@
 
 #include "boot/boot.h"
 #include "resume/discovery.h"
+#include "resume/image_read.h"
+#include "resume/restart.h"
 #include "support/strings.h"
 
 namespace nimb {
@@ -17,9 +19,10 @@ void TryResume() {
     return;
   }
   ResumeState state = {};
-  ResumeFindImage(&state);
-  // The image's read and restart are not part of this build yet: an
-  // accepted image ends like a refused one.
+  if (ResumeFindImage(&state) && ResumeReadImage(&state)) {
+    // Comes back only when it fails before boot services end.
+    ResumeRestart(&state);
+  }
   ResumeWipeKey(&state);
   gRT->ResetSystem(EfiResetCold, EFI_SUCCESS, 0, nullptr);
 }

@@ -21,6 +21,29 @@ inline constexpr CHAR16 kResumeKeyVariable[] = u"boot-image-key";        // the 
 // failed restart comes back.
 void TryResume();
 
+// The memory plan: the header's numbers, checked against every limit before
+// any of them is used, and what follows from them. The restart works from
+// these, not from the header, which the decryption may rewrite behind the
+// header's own 512 bytes only.
+struct ResumePlan {
+  UINT32 mapCapacity;   // room for the memory map: twice the size first reported
+  UINT32 headerOffset;  // of the header in the scratch area, a multiple of 4096
+  UINT32 scratchPages;
+  UINT32 firstStageBytes;
+  UINT64 imageBytes;
+  UINT64 restoreBase;  // home of the restart code
+  UINT32 restorePageCount;
+  UINT32 restoreEntryOffset;
+  UINT64 runtimeBase;  // area for the runtime regions
+  UINT32 runtimePageCount;
+  UINT32 restartCodeOffset;  // of the restart code in the image
+  UINT32 previewStageBytes;  // bytes read before the preview is drawn; 0: no preview
+  UINT32 previewOffset;      // of the preview section in the image
+  UINT32 previewBytes;
+  UINT32 previewPictureOffset;
+  UINT64 encryptedOffset;
+};
+
 // What the three stretches of a resume hand on to each other.
 struct ResumeState {
   // Discovery.
@@ -33,9 +56,7 @@ struct ResumeState {
   // The read.
   UINT8 *scratch;
   ResumeHeader *header;  // in the scratch area, page-aligned
-  UINT32 mapCapacity;
-  UINTN descriptorSize;
-  UINT32 descriptorVersion;
+  ResumePlan plan;
 };
 
 // Overwrites the key's buffer with zeros (when there is one).

@@ -25,6 +25,14 @@ inline void AttachLoader(hostfw::Firmware &fw) {
   nimb::gMemoryTagBlocks = nullptr;
 }
 
+// The loader's tables cleared again at the end of an input.
+inline void DetachLoader() {
+  nimb::gST = nullptr;
+  nimb::gBS = nullptr;
+  nimb::gRT = nullptr;
+  nimb::gImageHandle = nullptr;
+}
+
 // Declares all of the arena above its first `usable` bytes reserved, so that
 // a segment or block of a gigabyte is refused at once instead of being
 // filled byte by byte on every run.

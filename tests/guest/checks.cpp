@@ -254,11 +254,15 @@ bool CheckDeviceTree(const BootArgs &args) {
 // --- the firmware's tables -------------------------------------------------------------
 
 void CheckSystemTable(const BootArgs &args, const KernelRegion &region) {
-  const uint8_t *table = GuestMemory(args.systemTable, kSystemTableSize);
+  CheckSystemTableAt(args.systemTable, region);
+}
+
+void CheckSystemTableAt(uint32_t systemTable, const KernelRegion &region) {
+  const uint8_t *table = GuestMemory(systemTable, kSystemTableSize);
   uint64_t signature = table != nullptr ? Le64(table) : 0;
-  bool inArea = Inside(args.systemTable, kSystemTableSize, region.runtimeStart, region.end);
+  bool inArea = Inside(systemTable, kSystemTableSize, region.runtimeStart, region.end);
   if (!Check("efi-system-table", signature == kSystemTableSignature,
-             "at 0x%x%s: signature 0x%llx, wanted 0x%llx", args.systemTable,
+             "at 0x%x%s: signature 0x%llx, wanted 0x%llx", systemTable,
              inArea ? " (in the runtime area)" : "", static_cast<unsigned long long>(signature),
              static_cast<unsigned long long>(kSystemTableSignature))) {
     return;
@@ -267,7 +271,7 @@ void CheckSystemTable(const BootArgs &args, const KernelRegion &region) {
   Line(
       "efi systemTable=0x%x revision=0x%x runtimeServices=0x%llx bootServices=0x%llx "
       "numberOfTableEntries=%u configurationTable=0x%llx",
-      args.systemTable, Le32(table + kTableRevision), static_cast<unsigned long long>(runtime),
+      systemTable, Le32(table + kTableRevision), static_cast<unsigned long long>(runtime),
       static_cast<unsigned long long>(Le64(table + kSystemTableBootServices)),
       static_cast<uint32_t>(Le64(table + kSystemTableNumberOfTableEntries)),
       static_cast<unsigned long long>(Le64(table + kSystemTableConfigurationTable)));

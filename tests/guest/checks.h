@@ -49,6 +49,9 @@ void CheckMemoryRanges(const BootArgs &args, const KernelRegion &region, Area *a
 void CheckLayout(const KernelRegion &region, const Area *areas, uint32_t count, uint32_t fixedCount);
 
 void CheckSystemTable(const BootArgs &args, const KernelRegion &region);
+// The same for a system table at `systemTable`, its runtime services
+// expected in [region.runtimeStart, region.end).
+void CheckSystemTableAt(uint32_t systemTable, const KernelRegion &region);
 
 // The whole report, from "kernel: start" to the result line; true for pass.
 bool ReportBoot(const EntryState &state);

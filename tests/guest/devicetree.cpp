@@ -292,6 +292,16 @@ void PrintVisitProperty(void *, const TreeNode &node, const TreeProperty &proper
     Print(" (0x%x)", Le32(property.value));
   }
   LineEnd();
+  // A value cut short above comes whole on a line of its own, so that it can
+  // be compared byte for byte.
+  if (bytes && property.length > kValueBytesShown) {
+    LineStart();
+    Print("value %s %s ", node.path, property.name);
+    for (uint32_t i = 0; i < property.length; i++) {
+      Print("%02x", property.value[i]);
+    }
+    LineEnd();
+  }
 }
 
 }  // namespace

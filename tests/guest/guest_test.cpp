@@ -24,6 +24,7 @@
 #include "hold.h"
 #include "memory.h"
 #include "report.h"
+#include "resume_probe.h"
 
 namespace g = nimb::guest;
 
@@ -829,6 +830,51 @@ TEST(GuestHold, ReadsTheFirstHoldWord) {
 }
 
 }  // namespace
+
+// --- the restart probe's key search and sums ------------------------------------------
+
+// FIPS-197 appendix A: the last round key of each key size, and for 256
+// bits the second round key in the equivalent inverse cipher's form, which
+// is no byte of the key.
+TEST(GuestResumeProbe, RoundKeysOfEachKeySize) {
+  struct Row {
+    const char *key, *wanted;
+  };
+  const Row rows[] = {
+      {"2b7e151628aed2a6abf7158809cf4f3c", "d014f9a8c9ee2589e13f0cc8b6630ca6"},
+      {"8e73b0f7da0e6452c810f32b809079e562f8ead2522c6b7b", "e98ba06f448c773c8ecc720401002202"},
+      {"603deb1015ca71be2b73aef0857d77811f352c073b6108d72d9810a30914dff4",
+       "fe4890d1e6188d0b046df344706c631e"},
+  };
+  auto bytes = [](const char *hex) {
+    std::vector<uint8_t> out;
+    for (; *hex != 0; hex += 2)
+      out.push_back(static_cast<uint8_t>(std::stoi(std::string(hex, 2), nullptr, 16)));
+    return out;
+  };
+  for (const Row &row : rows) {
+    std::vector<uint8_t> key = bytes(row.key), wanted = bytes(row.wanted);
+    uint8_t rounds[30][16];
+    uint32_t count = g::AesRoundKeys(key.data(), static_cast<uint32_t>(key.size()), rounds);
+    bool found = false, keyItself = false;
+    for (uint32_t i = 0; i < count; i++) {
+      found = found || std::memcmp(rounds[i], wanted.data(), 16) == 0;
+      keyItself = keyItself || std::memcmp(rounds[i], key.data(), 16) == 0;
+    }
+    EXPECT_TRUE(found) << row.key;
+    EXPECT_FALSE(keyItself) << row.key << ": the key's own bytes are searched as the key";
+    EXPECT_EQ(count, 2 * (key.size() / 4 + 6) - key.size() / 16) << row.key;
+  }
+  EXPECT_EQ(g::AesRoundKeys(bytes("00").data(), 1, nullptr), 0u);
+}
+
+TEST(GuestResumeProbe, PageSumsAsTheLoaderMakesThem) {
+  std::vector<uint8_t> pages(2 * 4096, 0);
+  EXPECT_EQ(g::Adler32Pages(pages.data(), 1), 0x10000001u);
+  std::fill(pages.begin() + 4096, pages.end(), 0xFF);
+  EXPECT_EQ(g::Adler32Pages(pages.data() + 4096, 1), 0x8161F0E2u);
+  EXPECT_EQ(g::Adler32Pages(pages.data(), 2), 0x10000001u + 0x8161F0E2u);
+}
 
 // --- drivers -------------------------------------------------------------------------
 

@@ -35,14 +35,18 @@ from pathlib import Path
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
+    RESUME_PARTITION_GUID,
     EXTENSIONS_DIR,
     KernelCache,
     mkdisk,
     SCENARIOS,
+    NET_MAC,
     GuestFile,
+    NetScenario,
     Scenario,
     ScreenExpect,
     kernel_file,
+    net_kernel_files,
     quoted,
 )
 
@@ -58,6 +62,8 @@ DEMO_SCREEN = REPO / "out" / "demo-screen.png"
 DOCS_SCREEN = REPO / "docs" / "demo-screen.png"
 
 OVMF_DIRS = ("/usr/share/OVMF", "/usr/share/ovmf", "/usr/share/qemu")
+RESUME_TOOL = REPO / "tools" / "mkresume" / "mkresume.py"
+RESUME_PROBE = "resume_probe.elf"
 
 # The platform's report, on the serial port.
 REPORT_STATUS = re.compile(r"platform: loader returned 0x([0-9a-f]+) \((\w+)\)")
@@ -198,6 +204,7 @@ KERNEL_RESULT = re.compile(r"(pass|fail) \((\d+) checks?, (\d+) failed\)")
 KERNEL_RANGE = re.compile(r"(.+) address=(0x[0-9a-f]+) length=(0x[0-9a-f]+)")
 KERNEL_MEMMAP_TYPE = re.compile(r"type (\S+) count=(\d+) pages=(0x[0-9a-f]+)")
 KERNEL_HOLD = re.compile(r"(\d+) s")
+KERNEL_VALUE = re.compile(r"(\S+) (.+) ([0-9a-f]*)")
 KERNEL_DRIVER = re.compile(r'(".*") from=(\w+) address=(0x[0-9a-f]+) plist=(0x[0-9a-f]+) code=(0x[0-9a-f]+) sum=(0x[0-9a-f]+)')
 TREE_NODE = re.compile(r"( *)([^=]*)/ \((\d+) propert(?:y|ies), (\d+) child(?:ren)?\)")
 TREE_PROPERTY = re.compile(r"( *)(\S.*?) = (.*)")
@@ -222,6 +229,7 @@ class KernelReport:
     tree_lines: list = dataclasses.field(default_factory=list)  # as printed, indent kept
     tree: dict = dataclasses.field(default_factory=dict)  # node path -> {property: value as printed}
     tree_errors: list = dataclasses.field(default_factory=list)
+    values: dict = dataclasses.field(default_factory=dict)  # (node path, property) -> whole value, bytes
     ranges: dict = dataclasses.field(default_factory=dict)  # name -> (address, length)
     memmap: list = dataclasses.field(default_factory=list)  # the memmap lines
     memmap_types: dict = dataclasses.field(default_factory=dict)  # type -> (count, pages)
@@ -233,6 +241,7 @@ class KernelReport:
     drivers_from: str | None = None  # "loader", "cache" or "none"
     tsc: dict = dataclasses.field(default_factory=dict)  # moment -> time stamp counter
     unknown: list = dataclasses.field(default_factory=list)  # lines of no known kind
+    resume: list = dataclasses.field(default_factory=list)  # the restart probe's own lines
 
     def failed_checks(self):
         return [check for check in self.checks if not check.ok]
@@ -305,6 +314,9 @@ def parse_kernel_report(log):
                 report.tree.setdefault(path, {}).setdefault(prop.group(2), prop.group(3))
             else:
                 report.unknown.append(match.group(0))
+        elif kind == "value" and KERNEL_VALUE.fullmatch(rest):
+            path, name, value = KERNEL_VALUE.fullmatch(rest).groups()
+            report.values[(path, name)] = bytes.fromhex(value)
         elif kind == "range" and KERNEL_RANGE.fullmatch(rest):
             name, address, length = KERNEL_RANGE.fullmatch(rest).groups()
             report.ranges[name] = (int(address, 16), int(length, 16))
@@ -318,6 +330,8 @@ def parse_kernel_report(log):
         elif kind == "result" and KERNEL_RESULT.fullmatch(rest):
             verdict, checks, failed = KERNEL_RESULT.fullmatch(rest).groups()
             report.result = (verdict == "pass", int(checks), int(failed))
+        elif kind == "resume":
+            report.resume.append(rest)
         elif kind == "driver" and KERNEL_DRIVER.fullmatch(rest):
             identifier, source, _, plist, code, checksum = KERNEL_DRIVER.fullmatch(rest).groups()
             report.drivers.append((unquote(identifier)[0], source, int(plist, 16), int(code, 16), int(checksum, 16)))
@@ -357,7 +371,8 @@ def content_bytes(content, guest_dir=GUEST_DIR):
     """The bytes of a file's content as scenarios give it: bytes, text, a
     host Path or a GuestFile."""
     if isinstance(content, GuestFile):
-        content = Path(guest_dir) / content.name
+        data = (Path(guest_dir) / content.name).read_bytes()
+        return data + bytes(max(0, content.pad_to - len(data)))
     if isinstance(content, Path):
         return content.read_bytes()
     return content.encode() if isinstance(content, str) else bytes(content)
@@ -432,6 +447,9 @@ def check_kernel(log, expect, guest_dir=GUEST_DIR):
             elif not matches(wanted, got):
                 problems.append(f"kernel: tree {path} {name} = {got}, wanted {describe(wanted)}")
     for name, length in expect.ranges.items():
+        if isinstance(name, re.Pattern):
+            found = [known for known in report.ranges if name.fullmatch(known)]
+            name = found[0] if len(found) == 1 else describe(name)
         if name not in report.ranges:
             problems.append(f"kernel: no range {name}")
         elif length is not None and report.ranges[name][1] != length:
@@ -446,10 +464,105 @@ def check_kernel(log, expect, guest_dir=GUEST_DIR):
     return problems
 
 
+# --- the wire -------------------------------------------------------------------------
+
+DHCP_MAGIC = bytes([99, 130, 83, 99])
+ROOT_MATCHING = (
+    "<dict><key>ZoryaProviderClass</key><string>ZoryaNetworkInterface</string><key>ZoryaParentMatch</key>"
+    '<dict><key>ZoryaPropertyMatch</key><dict><key>ZoryaMACAddress</key><data format="hex">{}</data>'
+    "</dict></dict></dict>"
+)
+
+
+def read_pcap(data):
+    """The frames of a classic pcap file (what QEMU's filter-dump writes)."""
+    magic = data[:4]
+    order = "<" if magic == b"\xd4\xc3\xb2\xa1" else ">" if magic == b"\xa1\xb2\xc3\xd4" else None
+    if order is None:
+        raise ValueError("not a pcap file")
+    frames, offset = [], 24
+    while offset + 16 <= len(data):
+        length = struct.unpack(order + "I", data[offset + 8 : offset + 12])[0]
+        frames.append(data[offset + 16 : offset + 16 + length])
+        offset += 16 + length
+    return frames
+
+
+def dhcp_messages(frames):
+    """(client MAC, server's DHCP messages) of the captured frames: the
+    Ethernet source of the client's first message and the UDP payloads
+    that left port 67, in order."""
+    client, answers = None, []
+    for frame in frames:
+        if frame[12:14] != b"\x08\x00" or len(frame) < 34 or frame[23] != 17:
+            continue
+        ip = frame[14:]
+        header = (ip[0] & 15) * 4
+        source, destination, length = struct.unpack(">HHH", ip[header : header + 6])
+        payload = ip[header + 8 : header + length]
+        if source == 68 and destination == 67 and client is None:
+            client = frame[6:12]
+        elif source == 67:
+            answers.append(payload)
+    return client, answers
+
+
+def dhcp_type(message):
+    """The DHCP message type (option 53) of a message, or None."""
+    if message[236:240] != DHCP_MAGIC:
+        return None
+    offset = 240
+    while offset + 1 < len(message) and message[offset] != 255:
+        if message[offset] == 0:
+            offset += 1
+            continue
+        if message[offset] == 53:
+            return message[offset + 2]
+        offset += 2 + message[offset + 1]
+    return None
+
+
+def check_capture(log, pcap):
+    """Problems with the kernel's network identity and answers against the
+    packets on the wire: "dhcp-response" must be the server's DHCP ACK byte
+    for byte (the firmware keeps no length, so what follows the end option
+    may be left off, and must then be padding of zeros), "root-matching"
+    the client's MAC."""
+    try:
+        client, answers = dhcp_messages(read_pcap(Path(pcap).read_bytes()))
+    except (OSError, ValueError) as error:
+        return [f"capture: {error}"]
+    acks = [message for message in answers if dhcp_type(message) == 5]
+    if client is None or not acks:
+        return ["capture: no DHCP exchange on the wire"]
+    report = parse_kernel_report(log)
+    problems = []
+    wanted = quoted(ROOT_MATCHING.format(client.hex()))
+    got = report.tree.get("/chosen", {}).get("root-matching")
+    if got != wanted:
+        problems.append(f"capture: root-matching {got}, wanted the client's MAC {client.hex()}")
+    ack = acks[-1]
+    dhcp = report.values.get(("/chosen", "dhcp-response"))
+    if dhcp is None:
+        problems.append("capture: no whole dhcp-response in the kernel's report")
+    elif dhcp != ack[: len(dhcp)] or any(ack[len(dhcp) :]) or len(dhcp) > len(ack):
+        first = next((i for i, (a, b) in enumerate(zip(dhcp, ack)) if a != b), min(len(dhcp), len(ack)))
+        problems.append(
+            f"capture: dhcp-response of {len(dhcp)} bytes differs from the ACK of {len(ack)} on the wire "
+            f"at byte {first}"
+        )
+    return problems
+
+
 # --- the screen -----------------------------------------------------------------------
 
 PNG_SIGNATURE = b"\x89PNG\r\n\x1a\n"
 PICTURE_SIZE = 128  # the logo and the failure picture
+SPINNER_SIZE = 32  # a frame of the spinner, centred 200 pixels below the middle
+SPINNER_DROP = 200
+# Between the two screenshots that show the spinner turning: a few of its
+# 100 ms ticks.
+SPINNER_GAP = 0.5
 
 
 @dataclasses.dataclass
@@ -527,7 +640,8 @@ def unfilter(kind, row, previous, step):
 
 def read_artwork(source=ARTWORK):
     """The loader's pictures, as they should appear on the screen: name ->
-    128 x 128 (red, green, blue) tuples, row by row."""
+    (red, green, blue) tuples, row by row: "logo" and "failure" of 128 x 128,
+    "spinner0" to "spinner17" of 32 x 32."""
     text = Path(source).read_text()
 
     def array(name):
@@ -540,6 +654,9 @@ def read_artwork(source=ARTWORK):
     runs = array("kLogoRuns")
     logo = [index for count, index in zip(runs[::2], runs[1::2]) for _ in range(count)]
     pictures = {"logo": logo, "failure": array("kFailurePicture")}
+    strip = array("kSpinnerStrip")
+    frame = SPINNER_SIZE * SPINNER_SIZE
+    pictures.update({f"spinner{i}": strip[i * frame : (i + 1) * frame] for i in range(len(strip) // frame)})
     return {name: [tuple(table[3 * i : 3 * i + 3]) for i in indexes] for name, indexes in pictures.items()}
 
 
@@ -550,6 +667,8 @@ def check_screen(image, expect, artwork=None):
     of a centred 128 x 128 picture (without artwork: anything there). The
     second: anything else on the screen, that is a box of all that isn't
     background larger than 128 x 128 or off the centre by more than a pixel."""
+    if expect.background is None:  # a screen of no fixed background: only taken
+        return [], []
     background = bytes(expect.background)
     if image.pixel(0, 0) != expect.background:
         return [f"screen: background {image.pixel(0, 0)}, wanted {expect.background}"], []
@@ -589,6 +708,40 @@ def check_screen(image, expect, artwork=None):
         if abs(left + right + 1 - image.width) > 2 or abs(top + bottom + 1 - image.height) > 2:
             stray.append(f"{spans}, not centred on {image.width} x {image.height}")
     return problems, stray
+
+
+def spinner_frame(image, artwork):
+    """The number of the spinner's frame in its square of the screen; None
+    when the square is all background, -1 when it holds anything else."""
+    x0 = (image.width - SPINNER_SIZE) >> 1
+    y0 = ((image.height - SPINNER_SIZE) >> 1) + SPINNER_DROP
+    square = [image.pixel(x0 + x, y0 + y) for y in range(SPINNER_SIZE) for x in range(SPINNER_SIZE)]
+    if all(pixel == square[0] for pixel in square) and square[0] == image.pixel(0, 0):
+        return None
+    for name, pixels in artwork.items():
+        if name.startswith("spinner") and pixels == square:
+            return int(name[len("spinner") :])
+    return -1
+
+
+def check_spinner(paths, expect):
+    """Problems with the spinner in the screenshots of a scenario: "turning"
+    wants a frame of the spinner in each of two, and two different frames;
+    "gone" wants its square all background in the first."""
+    if expect.spinner is None:
+        return []
+    try:
+        artwork = read_artwork()
+        frames = [spinner_frame(read_png(Path(p).read_bytes()), artwork) for p in paths if p and Path(p).is_file()]
+    except (OSError, ValueError, zlib.error) as error:
+        return [f"spinner: {error}"]
+    if expect.spinner == "gone":
+        return [] if frames and frames[0] is None else [f"spinner: frames {frames}, wanted its square empty"]
+    if len(frames) < 2 or None in frames or -1 in frames:
+        return [f"spinner: frames {frames} in the screenshots, wanted a frame of the spinner in two"]
+    if frames[0] == frames[1]:
+        return [f"spinner: frame {frames[0]} in both screenshots {SPINNER_GAP} s apart: it doesn't turn"]
+    return []
 
 
 def check_screenshot(path, expect):
@@ -646,18 +799,42 @@ def find_ovmf():
     raise FileNotFoundError("OVMF_CODE_4M.fd and OVMF_VARS_4M.fd not found (package ovmf)")
 
 
-def qemu_command(workdir, disk, serial_log, qmp_socket=None):
+# The boot file that QEMU's DHCP server names on a network boot: the
+# platform layer, at the root of the served directory.
+NET_BOOT_FILE = "BOOTX64.efi"
+NET_ID = "n0"
+
+
+def network_arguments(tftp_dir, pcap=None):
+    """QEMU's user network with its TFTP server on `tftp_dir` and a virtio NIC
+    without option ROM, so that the firmware's own PXE boots from it; with
+    `pcap`, every packet of the NIC is written there."""
+    arguments = [
+        "-netdev", f"user,id={NET_ID},tftp={tftp_dir},bootfile={NET_BOOT_FILE}",
+        "-device", f"virtio-net-pci,netdev={NET_ID},mac={NET_MAC},romfile=",
+    ]
+    if pcap is not None:
+        arguments += ["-object", f"filter-dump,id=dump0,netdev={NET_ID},file={pcap}"]
+    return arguments
+
+
+def qemu_command(workdir, disk, serial_log, qmp_socket=None, network=None, reboot=False, extra=()):
+    """QEMU's command line. With `network` (the extra arguments of
+    network_arguments) and no `disk`, the machine boots over the network;
+    with `reboot`, a reset starts the machine again (on the same variable
+    store) instead of ending QEMU; `extra` goes behind the accelerator."""
     code, variables = find_ovmf()
     private_vars = workdir / "OVMF_VARS.fd"
     shutil.copyfile(variables, private_vars)
     command = [
-        "qemu-system-x86_64", "-machine", "q35", "-m", "512M", "-accel", "tcg",
-        "-display", "none", "-no-reboot",
+        "qemu-system-x86_64", "-machine", "q35", "-m", "512M", "-accel", "tcg", *extra,
+        "-display", "none", *([] if reboot else ["-no-reboot"]),
         "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={code}",
         "-drive", f"if=pflash,format=raw,unit=1,file={private_vars}",
-        "-drive", f"format=raw,file={disk}",
+        *(["-drive", f"format=raw,file={disk}"] if disk is not None else []),
         "-device", "isa-debug-exit,iobase=0xf4,iosize=0x04",
-        "-nic", "none", "-serial", f"file:{serial_log}", "-monitor", "none",
+        *(network if network is not None else ["-nic", "none"]),
+        "-serial", f"file:{serial_log}", "-monitor", "none",
     ]
     if qmp_socket is not None:
         command += ["-qmp", f"unix:{qmp_socket},server=on,wait=off"]
@@ -797,15 +974,112 @@ def prepare(scenario, efi_dir, workdir, loader=None, config_override=None, guest
     efi_dir = Path(efi_dir)
     volume = workdir / "volume"
     volume.mkdir()
-    stage_volume(scenario, volume, scenario_config(scenario, config_override), guest_dir)
+    raw, resume_keys = None, {}
+    if scenario.resume is not None:
+        raw, resume_keys = make_resume(scenario.resume, workdir, guest_dir, scenario.disk_mib << 20)
+    config = scenario_config(scenario, config_override)
+    for key, value in resume_keys.items():
+        config.setdefault(key, value)
+    stage_volume(scenario, volume, config, guest_dir)
     cache_name = make_cache(scenario.cache, volume) if scenario.cache is not None else None
     loader = None if f"{mkdisk.BOOT_DIR}/{mkdisk.LOADER_NAME}" in scenario.remove else loader or efi_dir / "nimbboot.efi"
+    if scenario.network:
+        return serve_volume(volume, efi_dir / "BOOTX64.efi", loader), cache_name
     disk = workdir / "disk.img"
     try:
-        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20)
+        mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=scenario.disk_mib << 20,
+                          raw=raw, raw_guid=RESUME_PARTITION_GUID)
     except mkdisk.DiskError as error:
         raise OSError(str(error)) from error
     return disk, cache_name
+
+
+def serve_volume(volume, platform, loader):
+    """The staged volume as the directory served on a network boot: the
+    platform as the boot file, the loader and platform.cfg at its root."""
+    boot = volume / mkdisk.BOOT_DIR
+    if (boot / mkdisk.CONFIG_NAME).is_file():
+        (boot / mkdisk.CONFIG_NAME).rename(volume / mkdisk.CONFIG_NAME)
+    for directory in (boot, boot.parent):
+        if directory.is_dir() and not any(directory.iterdir()):
+            directory.rmdir()
+    shutil.copyfile(platform, volume / NET_BOOT_FILE)
+    if loader is not None:
+        shutil.copyfile(loader, volume / mkdisk.LOADER_NAME)
+    return volume
+
+
+def make_resume(resume, workdir, guest_dir, disk_bytes):
+    """Writes the scenario's resume image onto a partition image with
+    mkresume and the restart probe; returns its path and the platform.cfg
+    keys that ask for the restart."""
+    probe = Path(guest_dir) / RESUME_PROBE
+    if not probe.is_file():
+        raise FileNotFoundError(f"{probe} is missing: build the target guest_kernel first")
+    partition, settings = workdir / "resume.img", workdir / "resume.cfg"
+    command = [
+        sys.executable, str(RESUME_TOOL), "--restart", str(probe), "--partition", str(partition),
+        "--partition-bytes", str(resume.partition_bytes), "--partition-number", "2",
+        "--partition-guid", RESUME_PARTITION_GUID, "--partition-start-lba", str(mkdisk.raw_partition_lba(disk_bytes)),
+        "--partition-lbas", str(resume.partition_bytes // 512), "--nvram-out", str(settings),
+        *resume.args,
+    ]  # fmt: skip
+    if resume.preview is not None:
+        picture = workdir / "preview.ppm"
+        picture.write_bytes(resume.preview())
+        command += ["--preview", str(picture)]
+    subprocess.run(command, check=True, capture_output=True)
+    keys = dict(line.split("=", 1) for line in settings.read_text().splitlines() if "=" in line)
+    return partition, keys
+
+
+KEY_COPY = re.compile(r"platform: key copy at 0x([0-9a-f]+) type (\d+)")
+KEY_TRACE = re.compile(r'resume trace kind=key address=0x([0-9a-f]+) where="([^"]*)"')
+
+
+def check_key_trace(log):
+    """Problems with the places where the restart probe found the key: each
+    must be the firmware's (the runtime area the runtime data was moved to,
+    the region it was copied from, or a copy that the platform layer found
+    before the loader started); anything else the loader left behind."""
+    firmware = {int(address, 16) for address, _ in KEY_COPY.findall(log)}
+    problems = []
+    for address, where in KEY_TRACE.findall(log):
+        if where == "elsewhere" and int(address, 16) not in firmware:
+            problems.append(f"key: the key's bytes at {address} are no copy of the firmware's")
+    return problems
+
+
+def check_boots(log, wanted):
+    """Problems with the number of starts of the platform layer."""
+    starts = log.count("platform: started")
+    return [] if starts == wanted else [f"the machine started {starts} times, wanted {wanted}"]
+
+
+READ_LINE = re.compile(r"platform: read offset=0x([0-9a-f]+) size=0x([0-9a-f]+) to=0x([0-9a-f]+)")
+
+
+def check_resume_reads(log, expect):
+    """Problems with the loader's DiskIO reads that the platform logged at
+    the reset, against `expect` (ResumeReads): the header read first, then
+    at most `after_header` reads, each inside the first stage behind a
+    page-aligned header."""
+    if expect is None:
+        return []
+    reads = [tuple(int(v, 16) for v in m) for m in READ_LINE.findall(log)]
+    if not reads or reads[0][1] != 512:
+        return [f"reads: the first read is not the 512-byte header: {reads[:1]}"]
+    problems, later = [], reads[1:]
+    if expect.after_header is not None and len(later) > expect.after_header:
+        problems.append(f"reads: {len(later)} reads after the header, wanted at most {expect.after_header}")
+    if later:
+        header = later[0][2] - 512
+        if header % 4096:
+            problems.append(f"reads: the first read behind the header lands at {later[0][2]:#x}, no page + 512")
+        for offset, size, to in later:
+            if not (header + 512 <= to and to + size <= header + expect.first_stage):
+                problems.append(f"reads: {size:#x} bytes to {to:#x} leave the first stage at {header:#x}")
+    return problems
 
 
 class SerialFollower:
@@ -828,41 +1102,78 @@ class SerialFollower:
         return [clean_log(line) for line in complete]
 
 
-def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False):
+def second_path(path):
+    return Path(path).with_name(Path(path).stem + "-2.png")
+
+
+def boot(disk, workdir, timeout, screen_when=None, screen_path=None, echo=False, network=False, actions=(),
+         second_shot=False, qemu_args=(), boots=1, extra=()):
     """Runs QEMU on `disk` until it ends, for at most `timeout` seconds. With
-    `screen_when`, takes a screenshot into `screen_path` over QMP as soon as
-    a line of the serial log holds that text; with `echo`, prints the
-    cleaned serial log as it comes. Returns the exit status (None: timed
-    out), the cleaned log, the screenshot's path or None, and what went
-    wrong with the screenshot."""
+    `network`, `disk` is the directory served over TFTP and the machine
+    boots from it (its packets go to workdir/net.pcap). With `screen_when`,
+    takes a screenshot into `screen_path` over QMP as soon as a line of the
+    serial log holds that text, and with `second_shot` another SPINNER_GAP
+    later (second_path); `qemu_args` go behind QEMU's own, `extra` behind
+    the accelerator; `actions` (Scenario.actions) are done in the same way;
+    with `echo`, prints the cleaned serial log as it comes. With `boots`
+    above 1, a reset starts the machine again on the same variable store,
+    and the run ends when the platform layer starts once more than that.
+    Returns the exit status (None: timed out or stopped), the cleaned log,
+    the screenshot's path or None, and what went wrong with the screenshot,
+    an action or the boots."""
     serial_log = workdir / "serial.log"
-    qmp_socket = workdir / "qmp.sock" if screen_when else None
-    machine = Machine(qemu_command(workdir, disk, serial_log, qmp_socket), workdir / "qemu.log")
+    qmp_socket = workdir / "qmp.sock" if screen_when or actions else None
+    net = network_arguments(Path(disk).resolve(), workdir / "net.pcap") if network else None
+    command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, net, reboot=boots > 1,
+                           extra=extra) + list(qemu_args)
+    machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
-    shot, trouble = None, []
+    shot, trouble, pending, starts = None, [], list(actions), 0
     try:
-        if screen_when or echo:
-            qmp = Qmp(qmp_socket, deadline, machine) if screen_when else None
+        if screen_when or echo or actions or boots > 1:
+            qmp = Qmp(qmp_socket, deadline, machine) if qmp_socket else None
             follower = SerialFollower(serial_log)
             while True:
                 running = machine.poll() is None
                 for line in follower.lines(final=not running):
                     if echo and line.strip():
                         print(line, flush=True)
-                    if qmp is not None and shot is None and screen_when in line:
+                    if screen_when and shot is None and screen_when in line:
                         qmp.execute("screendump", filename=str(screen_path), format="png")
                         shot = screen_path
+                        if second_shot:
+                            time.sleep(SPINNER_GAP)
+                            qmp.execute("screendump", filename=str(second_path(screen_path)), format="png")
+                    for action in [action for action in pending if action[0] in line]:
+                        pending.remove(action)
+                        do_action(action[1], qmp, disk)
+                    starts += line.startswith("platform: started")
+                if starts > boots:
+                    trouble.append(f"boots: the machine started more than {boots} times; stopped")
+                    machine.kill()
+                    break
                 if not running or time.monotonic() > deadline:
                     break
-                time.sleep(0.1)
+                time.sleep(0.05)
             if qmp is not None:
                 qmp.close()
     except (OSError, ConnectionError, RuntimeError, ValueError) as error:
         trouble.append(f"screen: QMP: {error}")
     finally:
         returncode = machine.wait(max(1.0, deadline - time.monotonic()))
+    trouble += [f"action {action[1]!r} not done: {action[0]!r} never came" for action in pending]
     log = clean_log(serial_log.read_bytes()) if serial_log.exists() else ""
     return returncode, log, shot, trouble
+
+
+def do_action(action, qmp, served):
+    """One of Scenario.actions on the running machine."""
+    if action[0] == "link-off":
+        qmp.execute("set_link", name=NET_ID, up=False)
+    elif action[0] == "truncate":
+        os.truncate(Path(served) / action[1], action[2])
+    else:
+        raise ValueError(f"unknown action {action!r}")
 
 
 def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_DIR):
@@ -876,7 +1187,9 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     limit = timeout or scenario.timeout
     screen = scenario.screen
     returncode, log, shot, trouble = boot(
-        disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None
+        disk, workdir, limit, screen.when if screen else None, workdir / "screen.png" if screen else None,
+        network=scenario.network, actions=scenario.actions,
+        second_shot=bool(screen and screen.spinner == "turning"), boots=scenario.boots,
     )
     (workdir / "serial.txt").write_text(log)
     outcome = decode_exit(returncode, read_exit_codes())
@@ -889,9 +1202,18 @@ def run_scenario(scenario, efi_dir, loader=None, timeout=None, guest_dir=GUEST_D
     problems += check_console_modes(log, scenario.console_modes)
     if scenario.kernel is not None:
         problems += check_kernel(log, scenario.kernel, guest_dir)
+    if scenario.capture:
+        problems += check_capture(log, workdir / "net.pcap")
+    if scenario.boots > 1:
+        problems += [t for t in trouble if t.startswith("boots:")] + check_boots(log, scenario.boots)
+        trouble = [t for t in trouble if not t.startswith("boots:")]
+    problems += trouble
+    problems += check_resume_reads(log, scenario.reads)
+    if scenario.resume is not None:
+        problems += check_key_trace(log)
     if screen is not None:
         picture, stray = check_screenshot(shot, screen)
-        problems += trouble + picture
+        problems += picture + check_spinner([shot, shot and second_path(shot)], screen)
         if screen.alone:
             problems += stray
         else:
@@ -981,20 +1303,28 @@ DEMO = Scenario(
     cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}")),
 )
 DEMO_SCREEN_EXPECT = ScreenExpect(when="kernel: result", picture="logo")
+# The network's demo: the same kernel, with its driver package, served over
+# TFTP to a machine without a disk.
+NET_DEMO = NetScenario("demo-net", config={"options": "guest.hold=4"}, files=net_kernel_files(), timeout=150.0)
+NET_DEMO_SCREEN = REPO / "out" / "demo-net-screen.png"
 
 
-def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
+def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0, network=False):
     """Boots the reference kernel, prints the serial log as it comes, takes
     a screenshot once the kernel has reported (while it holds the machine)
-    and lets the kernel power off. True when the kernel passed and the
-    screenshot was taken."""
+    and lets the kernel power off. With `network`, the machine has no disk
+    and boots over QEMU's TFTP from a directory of the same files. True when
+    the kernel passed and the screenshot was taken."""
     workdir = Path(tempfile.mkdtemp(prefix="nimb-qemu-demo-"))
-    disk, cache_name = prepare(DEMO, efi_dir, workdir, loader, guest_dir=guest_dir)
-    DEMO_SCREEN.parent.mkdir(parents=True, exist_ok=True)
-    if DEMO_SCREEN.exists():
-        DEMO_SCREEN.unlink()
+    scenario, screen = (NET_DEMO, NET_DEMO_SCREEN) if network else (DEMO, DEMO_SCREEN)
+    disk, cache_name = prepare(scenario, efi_dir, workdir, loader, guest_dir=guest_dir)
+    if network:
+        print(f"demo: serving {disk} over TFTP")
+    screen.parent.mkdir(parents=True, exist_ok=True)
+    if screen.exists():
+        screen.unlink()
     returncode, log, shot, trouble = boot(
-        disk, workdir, timeout, DEMO_SCREEN_EXPECT.when, DEMO_SCREEN.resolve(), echo=True
+        disk, workdir, timeout, DEMO_SCREEN_EXPECT.when, screen.resolve(), echo=True, network=network
     )
     outcome = decode_exit(returncode, read_exit_codes())
     kernel = parse_kernel_report(log)
@@ -1007,7 +1337,9 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
         for check in kernel.failed_checks():
             print(f"demo:   check {check.name} FAIL {check.detail}")
     looked = f"Looking for kernel cache file '{cache_name}'" in log
-    if kernel.drivers_from == "cache" and looked:
+    if network:
+        print(f"demo: booted over the network, drivers from {kernel.drivers_from}")
+    elif kernel.drivers_from == "cache" and looked:
         print(f"demo: booted from the kernel cache {cache_name}, made by kcache, with "
               f"{len(kernel.drivers)} drivers prelinked: {', '.join(d[0] for d in kernel.drivers)}")
     else:
@@ -1018,8 +1350,9 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
     if shot is None:
         print(f"demo: no screenshot; files kept in {workdir}")
         return False
-    DOCS_SCREEN.parent.mkdir(parents=True, exist_ok=True)
-    shutil.copyfile(shot, DOCS_SCREEN)
+    if not network:
+        DOCS_SCREEN.parent.mkdir(parents=True, exist_ok=True)
+        shutil.copyfile(shot, DOCS_SCREEN)
     picture, stray = check_screenshot(shot, DEMO_SCREEN_EXPECT)
     if picture:
         print("demo: the screen is not the logo centred on grey:")
@@ -1029,8 +1362,8 @@ def demo(efi_dir, loader=None, guest_dir=GUEST_DIR, timeout=120.0):
         print("demo: " + ("and " if not picture else "") + "more than the logo is on the screen:")
     for problem in picture + stray:
         print(f"demo:   {problem}")
-    print(f"demo: screenshot in {DEMO_SCREEN} (and {DOCS_SCREEN})")
-    ok = outcome.name == "KernelPass" and kernel.drivers_from == "cache"
+    print(f"demo: screenshot in {screen}" + ("" if network else f" (and {DOCS_SCREEN})"))
+    ok = outcome.name == "KernelPass" and (network or kernel.drivers_from == "cache")
     if ok:
         shutil.rmtree(workdir, ignore_errors=True)
     else:
@@ -1053,6 +1386,7 @@ def main(argv=None):
     parser.add_argument("--show-log", action="store_true", help="print the serial log of passing runs too")
     parser.add_argument("--list", action="store_true", help="print the scenarios' names")
     parser.add_argument("--demo", action="store_true", help="boot the reference kernel and take a screenshot")
+    parser.add_argument("--net", action="store_true", help="with --demo: boot it over the network")
     args = parser.parse_args(argv)
     for number in (signal.SIGTERM, signal.SIGINT, signal.SIGHUP):
         signal.signal(number, Machine.kill_all)
@@ -1062,7 +1396,7 @@ def main(argv=None):
         print("\n".join(SCENARIOS))
         return 0
     if args.demo:
-        return 0 if demo(args.efi_dir, args.loader, args.guest_dir) else 1
+        return 0 if demo(args.efi_dir, args.loader, args.guest_dir, network=args.net) else 1
     names = args.scenario or list(SCENARIOS)
     unknown = [name for name in names if name not in SCENARIOS]
     if unknown:

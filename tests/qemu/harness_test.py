@@ -16,6 +16,7 @@ from scenarios import (
     AtLeast,
     DriverExpect,
     KernelExpect,
+    ResumeReads,
     Scenario,
     ScreenExpect,
     quoted,
@@ -354,6 +355,45 @@ class KernelReport(unittest.TestCase):
                 self.assertEqual(len(problems), len(wanted), problems)
                 for problem, part in zip(problems, wanted):
                     self.assertIn(part, problem)
+
+
+class Resume(unittest.TestCase):
+    def test_reads_rows(self):
+        header = "platform: read offset=0x10000 size=0x200 to=0x1de86d18 status=0x0\n"
+        inside = "platform: read offset=0x10200 size=0xfe00 to=0x5000200 status=0x0\n"
+        beyond = "platform: read offset=0x20000 size=0x100000 to=0x5010000 status=0x0\n"
+        unaligned = "platform: read offset=0x10200 size=0x100 to=0x5000300 status=0x0\n"
+        rows = [
+            (header, ResumeReads(), []),
+            (header + inside, ResumeReads(), ["1 reads after the header"]),
+            (header + inside, ResumeReads(after_header=None), []),
+            (header + inside + beyond, ResumeReads(after_header=None), ["leave the first stage"]),
+            (header + unaligned, ResumeReads(after_header=None), ["no page + 512"]),
+            (inside, ResumeReads(), ["not the 512-byte header"]),
+            ("", None, []),
+        ]
+        for log, expect, wanted in rows:
+            problems = harness.check_resume_reads(log, expect)
+            self.assertEqual(len(problems), len(wanted), (log, problems))
+            for problem, words in zip(problems, wanted):
+                self.assertIn(words, problem)
+
+    def test_key_trace_rows(self):
+        firmware = "platform: key copy at 0x1eb20072 type 6\n"
+        trace = 'kernel: resume trace kind=key address=0x{} where="{}"\n'
+        rows = [
+            (firmware + trace.format("1eb20072", "elsewhere"), 0),
+            (firmware + trace.format("431072", "runtime area"), 0),
+            (firmware + trace.format("1e000000", "runtime region copied to the area"), 0),
+            (firmware + trace.format("1fe9fb00", "elsewhere"), 1),
+            (trace.format("1eb20072", "elsewhere"), 1),
+        ]
+        for log, count in rows:
+            self.assertEqual(len(harness.check_key_trace(log)), count, log)
+
+    def test_boots(self):
+        self.assertEqual(harness.check_boots("platform: started\nplatform: started\n", 2), [])
+        self.assertEqual(len(harness.check_boots("platform: started\n", 2)), 1)
 
 
 class SerialFollower(unittest.TestCase):

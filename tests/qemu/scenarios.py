@@ -3,7 +3,9 @@ what the run must print and end with. harness.py runs them; CMakeLists.txt
 registers one ctest test per name."""
 
 import dataclasses
+import functools
 import re
+import struct
 import sys
 from pathlib import Path
 
@@ -26,6 +28,8 @@ BOOT_PLIST = "Library/Preferences/SystemConfiguration/com.quill.Boot.plist"
 # root volume's UUID as the loader should find it. Its first three fields
 # read differently in either byte order.
 PARTITION_GUID = mkdisk.DEFAULT_PARTITION_GUID
+# The raw partition that holds a resume image, behind the system partition.
+RESUME_PARTITION_GUID = "6A1E1F10-2B3C-4D5E-8F90-A1B2C3D4E5F6"
 
 # What a boot of the reference kernel prints, in this order.
 LOADING_KERNEL = "Loading 'nimb_kernel'..."
@@ -52,6 +56,8 @@ class GuestFile:
     the volume in place of content."""
 
     name: str
+    # Zero bytes behind the file up to this size (0: none).
+    pad_to: int = 0
 
 
 def quoted(value):
@@ -107,7 +113,8 @@ class KernelExpect:
     # Node path -> {property: value as printed}; an empty dict only asks
     # for the node. text() and ucs2() print values as the kernel does.
     tree: dict = dataclasses.field(default_factory=dict)
-    # Range of /chosen/memory-map -> its length, or None for any.
+    # Range of /chosen/memory-map (its name, or a compiled pattern that one
+    # name must match) -> its length, or None for any.
     ranges: dict = dataclasses.field(default_factory=dict)
     # Where the drivers came from: "loader" (staged or a package), "cache"
     # (prelinked in a kernel cache) or "none"; None: not checked.
@@ -143,11 +150,52 @@ class ScreenExpect:
     # False: whatever else is on the screen is printed, but doesn't fail the
     # scenario.
     alone: bool = True
+    # The spinner below the logo: "turning" (a frame of it in this shot and
+    # another frame in a second shot a moment later), "gone" (its square is
+    # background) or None (not looked at).
+    spinner: str | None = None
 
 
 def kernel_file(name="nimb_kernel"):
     """The volume's files for a boot of the reference kernel."""
     return {"nimb_kernel": GuestFile(name)}
+
+
+def test_picture(width, height):
+    """A binary PPM picture: colour bands, a gradient and a dark box in the
+    middle, so that the blurred grey has edges to show."""
+    rows = []
+    for y in range(height):
+        blocks = ((x * 255 // width, y * 255 // height, 255 - x * 255 // width) for x in range(0, width, 8))
+        row = b"".join(bytes(block) * 8 for block in blocks)[: 3 * width]
+        if height // 3 <= y < 2 * height // 3:
+            box = width // 4
+            row = row[: 3 * box] + bytes((20, 30, 40)) * (width - 2 * box) + row[3 * (width - box) :]
+        rows.append(row)
+    return f"P6\n{width} {height}\n255\n".encode() + b"".join(rows)
+
+
+@dataclasses.dataclass(frozen=True)
+class ResumeImage:
+    """A resume image on a raw partition, written by tools/mkresume with the
+    restart probe of tests/guest/ as its restart code; the NVRAM settings
+    that ask for it go into platform.cfg (a scenario's own keys win)."""
+
+    # mkresume's options beyond the partition's.
+    args: tuple = ()
+    # A function that gives the preview picture as PPM bytes, or None.
+    preview: object = None
+    partition_bytes: int = 8 << 20
+
+
+@dataclasses.dataclass(frozen=True)
+class ResumeReads:
+    """The loader's DiskIO reads before a reset, as the platform logs them:
+    the header first, then at most `after_header` reads (None: any), each
+    inside the `first_stage` bytes behind a page-aligned header."""
+
+    after_header: int | None = 0
+    first_stage: int = 1 << 20
 
 
 # --- the extensions directory ------------------------------------------------------------
@@ -286,6 +334,26 @@ class Scenario:
     # A screenshot and what it must show.
     screen: ScreenExpect | None = None
     timeout: float = 90.0
+    # A network boot: no disk; the files (platform.cfg, the loader
+    # nimbboot.efi and the others, by their paths on the server) are served
+    # over QEMU's TFTP, and the firmware's PXE starts the platform layer as
+    # the boot file. Needs a build of the platform with the network.
+    network: bool = False
+    # What the harness does to the running machine when a line of the serial
+    # log holds a text: (text, action) pairs, each done once. Actions:
+    # ("link-off",) takes the NIC's link down; ("truncate", path, size) cuts a
+    # served file.
+    actions: tuple = ()
+    # Check the kernel's network identity and DHCP answer against the
+    # packets captured on the wire.
+    capture: bool = False
+    # A resume image on a second partition, and the NVRAM settings for it.
+    resume: ResumeImage | None = None
+    # The starts of the machine on one variable store: above 1, a reset
+    # starts it again, and the run must end in exactly this many.
+    boots: int = 1
+    # The loader's reads up to a reset.
+    reads: ResumeReads | None = None
 
 
 _TABLE = [
@@ -501,6 +569,268 @@ _TABLE = [
         screen=ScreenExpect(when="platform: memory", picture="failure"),
     ),
 ]
+
+# --- network boots ----------------------------------------------------------------------
+
+# The loader's defaults on a network boot: the kernel next to the loader and
+# its package behind it.
+NET_KERNEL = "nimb.tarnix"
+NET_PACKAGE = "nimb.tarnix.drvpk"
+
+
+# A driver package: the loader copies it as it stands (it isn't fat).
+NET_PACKAGE_BYTES = bytes(i * 13 % 251 for i in range(20000))
+
+
+def net_kernel_files(name="nimb_kernel", pad_to=0, package=True):
+    """The served kernel under its default name, with its package."""
+    files = {NET_KERNEL: GuestFile(name, pad_to)}
+    if package:
+        files[NET_PACKAGE] = NET_PACKAGE_BYTES
+    return files
+
+
+# The package's range in /chosen/memory-map, named by its address.
+PACKAGE_RANGE = re.compile(r"DriversPackage-[0-9a-f]+")
+
+
+# A kernel file as large as a real one, which takes a while to come.
+BIG_KERNEL = 16 << 20
+
+# The NIC's MAC address: not QEMU's default, so that a MAC that reaches the
+# kernel came from the NIC.
+NET_MAC = "52:54:00:a7:3c:e1"
+
+
+def net_file_path(name):
+    """A device path over the network device, as NVRAM holds the kernel's
+    path: PciRoot(0)/Pci(2,0)/MAC(NET_MAC,1)/File(name)/End, in bytes."""
+    mac = bytes.fromhex(NET_MAC.replace(":", "")).ljust(32, b"\0")
+    text = (name + "\0").encode("utf-16-le")
+    return b"".join((
+        bytes([2, 1, 12, 0]) + struct.pack("<II", 0x0A0341D0, 0),
+        bytes([1, 1, 6, 0, 0, 2]),
+        bytes([3, 11, 37, 0]) + mac + bytes([1]),
+        bytes([4, 4]) + struct.pack("<H", 4 + len(text)) + text,
+        bytes([0x7F, 0xFF, 4, 0]),
+    ))
+
+
+# A network boot: nothing but the served files (no extensions directory).
+NetScenario = functools.partial(Scenario, network=True, extensions=None, timeout=150.0)
+
+_TABLE += [
+    # The firmware's PXE starts the platform, which serves the loader's files
+    # from the same TFTP server: the reference kernel boots with the network's
+    # identity and the server's real answers in its tree.
+    NetScenario(
+        "net_kernel",
+        config={"options": "foo=1 guest.hold=1"},
+        files=net_kernel_files(),
+        expect=(
+            "platform: net boot: station",
+            "platform: net read of nimbboot.efi",
+            f"platform: net read of {NET_PACKAGE} into",
+            KERNEL_START,
+        ),
+        exit="KernelPass",
+        kernel=KernelExpect(
+            bootargs={"commandLine": "foo=1 guest.hold=1"},
+            tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
+            ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
+        ),
+        capture=True,
+        # The spinner is wiped before the hand-off: the logo stands alone.
+        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
+    ),
+    # The spinner turns below the logo while a large kernel comes over the
+    # network.
+    NetScenario(
+        "net_spinner",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        expect=(f"platform: net read of {NET_KERNEL} into {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
+        exit="KernelPass",
+        screen=ScreenExpect(when=f"net read of {NET_KERNEL} into", picture="logo", alone=False, spinner="turning"),
+        timeout=200.0,
+    ),
+    # efi-boot-file-data names another kernel on the server, and the
+    # configuration file comes from the server too.
+    NetScenario(
+        "net_other_kernel",
+        config={"nvram-hex.efi-boot-file-data": net_file_path("kernels\\other_kernel").hex()},
+        files={
+            "kernels/other_kernel": GuestFile("nimb_kernel.fat-le"),
+            "kernels/other_kernel.drvpk": NET_PACKAGE_BYTES,
+            "com.quill.Boot.plist": plist({"Kernel Flags": "from_server=1"}),
+        },
+        expect=(
+            "platform: net read of com.quill.Boot.plist into",
+            "platform: net read of kernels/other_kernel into",
+            KERNEL_START,
+        ),
+        forbid=(f"of {NET_KERNEL}",),
+        exit="KernelPass",
+        kernel=KernelExpect(bootargs={"commandLine": "from_server=1"}),
+    ),
+    # A network boot has no driver bundles to fall back on: without its
+    # package the boot ends.
+    NetScenario(
+        "net_no_package",
+        files=net_kernel_files(package=False),
+        expect=(f"platform: net size of {NET_PACKAGE}: EFI_NOT_FOUND", "Error loading drivers",
+                "platform: loader returned"),
+    ),
+    # Bad input on the wire ends the boot with a clear message, never a hang:
+    # the kernel cut short on the server while it comes, ...
+    NetScenario(
+        "net_size_mismatch",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        actions=((f"net read of {NET_KERNEL} into", ("truncate", NET_KERNEL, 1 << 20)),),
+        expect=(f"net read of {NET_KERNEL} into", "Network file size mismatch", "platform: loader returned"),
+        timeout=200.0,
+    ),
+    # ... a server that stops answering in the middle of the kernel (the
+    # firmware's TFTP gives up), ...
+    NetScenario(
+        "net_server_gone",
+        files=net_kernel_files(pad_to=BIG_KERNEL),
+        actions=((f"net read of {NET_KERNEL} into", ("link-off",)),),
+        expect=(f"net read of {NET_KERNEL} into", f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
+        timeout=300.0,
+    ),
+    # ... and a kernel whose name no TFTP request can carry.
+    NetScenario(
+        "net_long_name",
+        config={"nvram-hex.efi-boot-file-data": net_file_path("k" * 500).hex()},
+        expect=("platform: net request of a path of no TFTP name: EFI_INVALID_PARAMETER",
+                f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
+    ),
+]
+
+# --- hibernation resume -----------------------------------------------------------------
+
+RESUME_OFFSET = 0x10000  # mkresume's default header offset
+RESET = "platform: reset type 0 status 0x0"
+
+
+def boot_image_bytes(offset_text):
+    """The size of boot-image: hard-drive node, file-path node, end node."""
+    return 42 + 4 + 2 * (len(offset_text) + 1) + 4
+
+
+def nvram_at_start(signature, image, key):
+    """The platform's line of the resume variables at a start."""
+    return f"platform: nvram at start: boot-signature={signature} boot-image={image} boot-image-key={key}"
+
+
+def resumed(name, args, preview=None, screen=None, timeout=150.0):
+    """The image restarts: the probe's checks all pass, and the machine never
+    resets."""
+    return Scenario(
+        name,
+        resume=ResumeImage(args=args, preview=preview),
+        expect=("platform: boot 1", "platform: starting", KERNEL_START, "kernel: result pass"),
+        forbid=(RESET, "platform: boot 2", "platform: loader returned"),
+        exit="KernelPass",
+        kernel=KernelExpect(),
+        screen=screen,
+        timeout=timeout,
+    )
+
+
+def reset_then_boot(name, args, after, reads=ResumeReads(), config=None):
+    """The loader resets the machine without a restart; the second start,
+    on the same variable store, finds NVRAM as `after` says and boots the
+    reference kernel."""
+    return Scenario(
+        name,
+        config=config or {},
+        resume=ResumeImage(args=args),
+        files=kernel_file(),
+        boots=2,
+        expect=("platform: boot 1", "platform: starting", RESET, "platform: boot 2", after, LOADING_KERNEL,
+                KERNEL_START),
+        forbid=("platform: loader returned",),
+        exit="KernelPass",
+        kernel=KernelExpect(),
+        reads=reads,
+        timeout=180.0,
+    )
+
+
+ACCEPTED_THEN_RESET = nvram_at_start("absent", boot_image_bytes(f"{RESUME_OFFSET:x}"), "absent")
+STAGE = 1 << 20
+
+_TABLE += [
+    # Each key size; the bar stops where the first stage ends in a larger
+    # image; the offset text with and without 0x.
+    resumed("resume_aes128", ("--key-bytes", "16", "--image-bytes", "3M", "--hex-prefix")),
+    resumed("resume_aes192", ("--key-bytes", "24", "--image-bytes", "2M", "--seed", "2")),
+    # With the preview: the screenshot shows it blurred in grey under the bar.
+    resumed(
+        "resume_aes256_preview",
+        ("--key-bytes", "32", "--image-bytes", "8M", "--first-stage", "6M", "--seed", "3"),
+        preview=lambda: test_picture(1280, 800),
+        screen=ScreenExpect(when="kernel: resume header=", picture=None, background=None, alone=False),
+    ),
+    # A preview of another size: the logo under the bar.
+    resumed(
+        "resume_preview_wrong_size",
+        ("--key-bytes", "32", "--first-stage", "2M", "--seed", "4"),
+        preview=lambda: test_picture(640, 480),
+        screen=ScreenExpect(when="kernel: resume header=", picture="logo", alone=False),
+    ),
+    # Nothing encrypted and no key at all.
+    resumed("resume_plain", ("--image-bytes", "4M", "--seed", "5")),
+    # Refused images: a reset, and a normal boot on the next start.
+    reset_then_boot("resume_bad_magic", ("--key-bytes", "16", "--set", "magic=0x73696D66"), ACCEPTED_THEN_RESET),
+    reset_then_boot(
+        "resume_wrong_machine", ("--key-bytes", "16", "--machine-signature", "0x5A5A"), ACCEPTED_THEN_RESET
+    ),
+    reset_then_boot(
+        "resume_no_boot_image",
+        ("--key-bytes", "16", "--no-boot-image"),
+        nvram_at_start("absent", "absent", "16"),
+        reads=None,
+    ),
+    # Headers that break a limit: nothing is read behind the header.
+    reset_then_boot("resume_limit_first_stage", ("--set", "firstStageBytes=256"), ACCEPTED_THEN_RESET),
+    reset_then_boot(
+        "resume_limit_preview_stage", ("--set", "previewBytes=0x200000"), ACCEPTED_THEN_RESET
+    ),
+    reset_then_boot("resume_limit_image_bytes", ("--set", "imageBytes=0x80000"), ACCEPTED_THEN_RESET),
+    reset_then_boot(
+        "resume_limit_encrypted_end",
+        ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE}"),
+        ACCEPTED_THEN_RESET,
+    ),
+    reset_then_boot(
+        "resume_limit_encrypted_step",
+        ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE - 0x1008}"),
+        ACCEPTED_THEN_RESET,
+    ),
+    reset_then_boot(
+        "resume_limit_first_extent", ("--set-extent", f"0:{RESUME_OFFSET:#x}:256"), ACCEPTED_THEN_RESET
+    ),
+    # The list holds fewer extents than the first stage needs: reads may
+    # begin, but none leaves the first stage.
+    reset_then_boot(
+        "resume_limit_extent_list",
+        ("--extent-bytes-field", "32"),
+        ACCEPTED_THEN_RESET,
+        reads=ResumeReads(after_header=None, first_stage=STAGE),
+    ),
+    reset_then_boot(
+        "resume_limit_no_key", ("--key-bytes", "16", "--no-key-variable"), ACCEPTED_THEN_RESET
+    ),
+    reset_then_boot(
+        "resume_limit_key_length",
+        ("--key-bytes", "16",),
+        ACCEPTED_THEN_RESET,
+        config={"nvram-hex.boot-image-key": "00112233445566778899aabbccddeeff0011223344"},
+    ),
+]
+
 
 # Kernel caches and drivers. Times are UTC; the platform serves them to the
 # loader exactly, nanoseconds included.

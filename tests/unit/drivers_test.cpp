@@ -118,7 +118,10 @@ class DriversTest : public nimbtest::VolumeTest {
 };
 
 TEST_F(DriversTest, ThePackageDecisionRowByRow) {
-  const Bytes package = nimbtest::Pattern(0x1800, 3);
+  // A fat package places its x86 slice alone.
+  const Bytes slice = nimbtest::Pattern(0x1234, 3);
+  const Bytes package = nimbtest::Fat(true, {{18, 0x1000, 0x10}, {7, 0x2000, uint32_t(slice.size())}},
+                                      {{0x1000, Bytes(0x10, 1)}, {0x2000, slice}});
   const Bytes fallback = nimbtest::Pattern(0x900, 4);
   // A fat package whose slice runs past its end: the read comes short.
   const Bytes cutShort = nimbtest::Fat(false, {{7, 0x1000, 0x2000}}, {{0x1000, nimbtest::Pattern(0x800)}});
@@ -244,7 +247,7 @@ TEST_F(DriversTest, ThePackageDecisionRowByRow) {
       continue;
     }
     EXPECT_EQ(status, EFI_SUCCESS);
-    const Bytes &placed = row.outcome == kFallback ? fallback : s.package;
+    const Bytes &placed = row.outcome == kFallback ? fallback : slice;
     // The failed try keeps its pages; the second stacks above them.
     const uint64_t address = row.outcome == kFallback ? kRegionTop + 0x2000 : kRegionTop;
     const std::vector<Range> expected = {
@@ -253,18 +256,6 @@ TEST_F(DriversTest, ThePackageDecisionRowByRow) {
     EXPECT_EQ(Memory(address, placed.size()), placed);
     EXPECT_EQ(nimb::gKernelRegionTop, address + ((placed.size() + 0xFFF) & ~0xFFFull));
   }
-}
-
-TEST_F(DriversTest, AFatPackagePlacesItsSliceOnly) {
-  const Bytes slice = nimbtest::Pattern(0x1234, 9);
-  Put("nimb_kernel", "k");
-  Put(kPackage, nimbtest::Fat(true, {{18, 0x1000, 0x10}, {7, 0x2000, uint32_t(slice.size())}},
-                              {{0x1000, Bytes(0x10, 1)}, {0x2000, slice}}));
-  nimb::gCustomDriverPackage = 1;
-  ASSERT_EQ(nimb::LoadDrivers(nullptr, root_), EFI_SUCCESS);
-  EXPECT_EQ(Ranges(), (std::vector<Range>{{"DriversPackage-400000", kRegionTop, uint32_t(slice.size())}}));
-  EXPECT_EQ(Memory(kRegionTop, slice.size()), slice);
-  EXPECT_EQ(nimb::gKernelRegionTop, kRegionTop + 0x2000);
 }
 
 TEST_F(DriversTest, OverLoadFileOnlyThePackageCounts) {
@@ -377,6 +368,48 @@ TEST_F(DriversTest, BundlesAreFoundKeptAndStaged) {
   }
   EXPECT_EQ(nimbtest::GetLe32(Memory(ranges[3].address + 8, 4), 0), ranges[3].address + 1017);
   EXPECT_EQ(nimb::gKernelRegionTop, address);
+}
+
+TEST_F(DriversTest, FirmwareFailuresOfABundleAndTheirMessages) {
+  // One flat bundle with code; the firmware's calls in order: Read 1-3 the
+  // directory's ".", ".." and "A.drvb", GetInfo 1 and Read 4 the list,
+  // Read 5 the directory's end, GetInfo 2 the code's size, Read 6 its fat
+  // test, GetInfo 3 its size again, Read 7 the code.
+  Put(std::string(kExtensions) + "/A.drvb/Info.plist",
+      BundleList("<string>Root</string>", "<key>VzBundleExecutable</key><string>a</string>"));
+  Put(std::string(kExtensions) + "/A.drvb/a", nimbtest::Pattern(100));
+  struct Row {
+    const char *service;
+    unsigned nth;
+    EFI_STATUS status;
+    std::string said;  // behind "Loading drivers...\n"
+    bool staged;
+    uint64_t top;
+  };
+  const Row rows[] = {
+      {"Read", 3, EFI_DEVICE_ERROR, "", false, kRegionTop},
+      {"GetInfo", 1, EFI_SUCCESS, "Couldn't get file info.\r\nError getting file size\r\n", false,
+       kRegionTop},
+      {"Read", 4, EFI_SUCCESS, "Read error 0x7\r\nError reading file A.drvb\r\n", false, kRegionTop},
+      {"GetInfo", 2, EFI_SUCCESS, "Couldn't get file info.\r\n", false, kRegionTop},
+      // The pages stay taken, and the kernel is not told of them.
+      {"Read", 7, EFI_SUCCESS,
+       "Read error 0x7\r\nError reading driver 'System\\Library\\Extensions\\A.drvb\\'\r\n", false,
+       kRegionTop + 0x1000},
+      {nullptr, 0, EFI_SUCCESS, "", true, kRegionTop + 0x1000},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(std::string(row.service ? row.service : "none") + " " + std::to_string(row.nth));
+    Fresh();
+    if (row.service != nullptr)
+      fw.FailCall(row.service, row.nth, EFI_DEVICE_ERROR);
+    const size_t mark = fw.ConOutText().size();
+    EXPECT_EQ(nimb::LoadDrivers(nullptr, root_), row.status);
+    EXPECT_EQ(Said(mark), NoDots("Loading drivers...\r\n" + row.said));
+    EXPECT_EQ(Ranges().size(), row.staged ? 1u : 0u);
+    EXPECT_EQ(nimb::gKernelRegionTop, row.top);
+    EXPECT_EQ(fw.OpenFiles(), 1u);
+  }
 }
 
 TEST_F(DriversTest, TheWalkBringsInTheLibrariesOfSelectedRecords) {

@@ -57,6 +57,9 @@ TEST_F(KernelRegionTest, AllocationsAtTheTopRoundToPagesAndRaiseIt) {
        "Error allocating 0x2 pages at 0x200000 alloc type 2\r\n"},
       {"taken", 0x400000, 0x3000, nullptr, 0x402000, 0, 0x3000, 0x400000,
        "Error allocating 0x3 pages at 0x400000 alloc type 2\r\n"},
+      // Pages counted without overflow, and refused.
+      {"a size of 2^64 - 1", 0x200000, ~0ull, nullptr, 0, 0, ~0ull, 0x200000,
+       "Error allocating 0x0 pages at 0x200000 alloc type 2\r\n"},
   };
   for (const Row &row : rows) {
     const size_t printed = fw.ConOutText().size();

@@ -6,9 +6,8 @@
 #include <functional>
 #include <vector>
 
-#include "loader_fixture.h"
 #include "resume/discovery.h"
-#include "resume_image.h"
+#include "resume_scene.h"
 
 namespace {
 
@@ -16,38 +15,15 @@ using namespace nimb;
 using nimbtest::HibernatedMachine;
 using nimbtest::ResumeImageSpec;
 
-// A firmware of its own for one case, with the loader's tables on it.
-struct Scene {
-  hostfw::Firmware fw;
-  HibernatedMachine machine;
-  nimbtest::ResumeImage image;
-  Scene() {
-    nimbtest::ResetLoaderState();
-    gST = fw.SystemTable();
-    gBS = fw.BootServices();
-    gRT = fw.RuntimeServices();
-    gImageHandle = fw.ImageHandle();
-  }
-  ~Scene() {
-    TrackedFreeAll();
-    nimbtest::ResetLoaderState();
-  }
-  void Install(const ResumeImageSpec &spec, const std::vector<uint8_t> &key = {}) {
-    image = nimbtest::BuildResumeImage(spec);
-    machine.Install(fw, image, key);
-  }
+// A scene that runs the discovery alone.
+struct Scene : nimbtest::ResumeScene {
   // The header's offset as text; on the whole disk with `disk` set.
   std::u16string Offset(const char *prefix, bool disk = false) {
     uint64_t offset = image.extents[0].start + (disk ? HibernatedMachine::kPartitionStart * 512 : 0);
-    std::string text = prefix + ToHex(offset);
-    return std::u16string(text.begin(), text.end());
-  }
-  static std::string ToHex(uint64_t value) {
     char hex[32];
-    std::snprintf(hex, sizeof(hex), "%llx", static_cast<unsigned long long>(value));
-    return hex;
+    std::snprintf(hex, sizeof(hex), "%s%llx", prefix, static_cast<unsigned long long>(offset));
+    return std::u16string(hex, hex + std::strlen(hex));
   }
-  bool Has(const CHAR16 *name) { return fw.FindVariable(name, gNimbVendorVariableGuid) != nullptr; }
   // Runs the discovery as TryResume does; false when no request was seen.
   bool Discover(ResumeState *state) {
     bool accepted = false;
@@ -236,7 +212,7 @@ TEST(ResumeDiscoveryTest, PartitionSearch) {
   for (const Case &c : cases) {
     SCOPED_TRACE(c.name);
     Scene scene;
-    scene.Install({});
+    scene.Install(ResumeImageSpec{});
     // boot-image names `wanted` and the header's place on the whole disk.
     std::vector<uint8_t> path;
     {

@@ -124,6 +124,20 @@ inline std::vector<uint8_t> ResumeImageVariable(const EFI_DEVICE_PATH_PROTOCOL *
   return path;
 }
 
+// Reference sum: Adler-32 of each page by itself, the sums added.
+inline UINT32 PageSums(const std::vector<uint8_t> &bytes) {
+  UINT32 total = 0;
+  for (size_t page = 0; page < bytes.size() / 4096; page++) {
+    UINT32 a = 1, b = 0;
+    for (size_t i = 0; i < 4096; i++) {
+      a = (a + bytes[page * 4096 + i]) % 65521;
+      b = (b + a) % 65521;
+    }
+    total += b << 16 | a;
+  }
+  return total;
+}
+
 constexpr UINT32 kResumeVariableAttributes =
     EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
 

@@ -22,6 +22,7 @@ import argparse
 import datetime
 import os
 import re
+import shutil
 import struct
 import subprocess
 import sys
@@ -140,12 +141,21 @@ def run_tool(*args):
         raise DiskError(f"{args[0]} failed: {detail}") from error
 
 
+def raw_partition_lba(disk_bytes=DISK_BYTES):
+    """Where a raw second partition begins: 1 MiB before `disk_bytes`, the
+    system partition ending in front of it."""
+    return disk_bytes // SECTOR - FIRST_SECTOR
+
+
 def build_disk(image, volume, platform, loader, config=None, disk_bytes=DISK_BYTES,
-               partition_guid=DEFAULT_PARTITION_GUID, times=True):
+               partition_guid=DEFAULT_PARTITION_GUID, times=True, raw=None, raw_guid=None):
     """Writes the disk image `image` from the directory `volume`, with the
     platform layer and the loader (host paths; a loader of None leaves it
     out), `config` as platform.cfg (text; None: the volume's own, or none)
-    and, with `times`, the table of exact times. Raises DiskError."""
+    and, with `times`, the table of exact times. With `raw` (the path of a
+    partition image), a second partition of the GUID `raw_guid` holds its
+    bytes at raw_partition_lba(), and the disk grows by its size. Raises
+    DiskError."""
     image, volume = Path(image).resolve(), Path(volume).resolve()
     if not volume.is_dir():
         raise DiskError(f"{volume} is not a directory")
@@ -165,13 +175,24 @@ def build_disk(image, volume, platform, loader, config=None, disk_bytes=DISK_BYT
     if clashes:
         raise DiskError(f"the volume has its own {', '.join(clashes)}: mkdisk puts them there")
 
+    raw_bytes = (Path(raw).stat().st_size + SECTOR - 1) // SECTOR * SECTOR if raw else 0
     with open(image, "wb") as disk:
-        disk.truncate(disk_bytes)
+        disk.truncate(disk_bytes + raw_bytes)
     # A fresh image has nothing to zap, and each of sgdisk's steps costs a
     # second of waiting for the kernel to reread the table.
-    run_tool("sgdisk", "-o", "-n", f"1:{FIRST_SECTOR}:0", "-t", "1:EF00", "-u", f"1:{partition_guid}", str(image))
+    layout, size = ["-n", f"1:{FIRST_SECTOR}:0"], []
+    if raw:
+        start = raw_partition_lba(disk_bytes)
+        layout = ["-n", f"1:{FIRST_SECTOR}:{start - 1}", "-n", f"2:{start}:{start + raw_bytes // SECTOR - 1}",
+                  "-u", f"2:{raw_guid}"]  # fmt: skip
+        size = ["-T", str(start - FIRST_SECTOR)]
+    run_tool("sgdisk", "-o", *layout, "-t", "1:EF00", "-u", f"1:{partition_guid}", str(image))
     target = f"{image}@@{PARTITION_OFFSET}"
-    run_tool("mformat", "-i", target, "-F", "-v", "ESP", "::")
+    run_tool("mformat", "-i", target, *size, "-F", "-v", "ESP", "::")
+    if raw:
+        with open(image, "r+b") as disk, open(raw, "rb") as source:
+            disk.seek(raw_partition_lba(disk_bytes) * SECTOR)
+            shutil.copyfileobj(source, disk)
 
     entries = [(path.relative_to(volume).as_posix(), path) for path in walk(volume)]
     directories = {path for path, source in entries if source.is_dir()}

@@ -1,0 +1,96 @@
+#!/usr/bin/env python3
+"""resume-vs-read: the loader's resume of a 64 MiB encrypted first stage
+against the firmware's own DiskIO read of the same extents, in one QEMU run.
+
+The disk holds a resume image written by tools/mkresume (AES-256, the
+restart probe of tests/guest/ as its restart code, no preview). Before it
+starts the loader, the platform layer reads the image's extents through the
+firmware's DiskIO and prints the time in TSC ticks; it then prints the TSC
+just before StartImage, and the probe prints the TSC at its entry. The
+loader's time is from StartImage to the probe's entry: the discovery, the
+read, the decryption, ExitBootServices, the runtime map and the copy of the
+restart code. QEMU runs with -cpu max (TCG), whose processor model has the
+AES instructions. The TSC follows virtual time under TCG: only the ratio of
+the two times in one run means anything.
+
+    bench/resume_vs_read.py [--efi-dir build/efi] [--guest-dir build/tests/guest]
+
+Prints `figure resume-vs-read: loader ... vs DiskIO read ... = R.RRx`, R
+being the loader's time over the read's (the goal is at most 1.5x), and
+exits 1 when the run gave no figure.
+"""
+
+import argparse
+import re
+import shutil
+import sys
+import tempfile
+from pathlib import Path
+
+REPO = Path(__file__).resolve().parents[1]
+sys.path.insert(0, str(REPO / "tests" / "qemu"))
+import harness  # noqa: E402
+from scenarios import ResumeImage, Scenario  # noqa: E402
+
+FIRST_STAGE = 64 << 20
+TIMED_READ = re.compile(r"platform: timed read (\d+) bytes, (\d+) extents, (\d+) ticks \((\w+)\)")
+# The platform's moment before StartImage and the probe's at its entry.
+LOADER_START = re.compile(r"platform: tsc start-image=0x([0-9a-f]+)")
+PROBE_ENTRY = re.compile(r"kernel: tsc entry=0x([0-9a-f]+)")
+
+BENCH = Scenario(
+    "resume_vs_read",
+    resume=ResumeImage(
+        args=("--key-bytes", "32", "--first-stage", str(FIRST_STAGE), "--extent-bytes", "1M",
+              "--header-offset", "0x100000", "--area-start", "0x200000", "--timed-read"),  # fmt: skip
+        partition_bytes=FIRST_STAGE + (8 << 20),
+    ),
+    timeout=1200.0,
+)
+
+
+def measure(efi_dir, guest_dir, keep):
+    workdir = Path(tempfile.mkdtemp(prefix="nimb-bench-resume-"))
+    disk, _ = harness.prepare(BENCH, efi_dir, workdir, guest_dir=guest_dir)
+    returncode, log, _, _ = harness.boot(disk, workdir, BENCH.timeout, extra=("-cpu", "max"))
+    (workdir / "serial.txt").write_text(log)
+    read, start, entry = TIMED_READ.search(log), LOADER_START.findall(log), PROBE_ENTRY.findall(log)
+    report = harness.parse_kernel_report(log)
+    problems = []
+    if read is None or read.group(4) != "EFI_SUCCESS" or int(read.group(1)) != FIRST_STAGE:
+        problems.append("no timed read of the whole first stage by the platform")
+    if not start or not entry:
+        problems.append("no TSC at StartImage or at the probe's entry")
+    if report.result is None or not report.result[0]:
+        failed = ", ".join(check.name for check in report.failed_checks())
+        problems.append(f"the restart probe did not pass ({failed or 'no result'})")
+    if problems:
+        print(f"resume-vs-read: {'; '.join(problems)} (exit status {returncode}); files in {workdir}")
+        return None
+    if not keep:
+        shutil.rmtree(workdir, ignore_errors=True)
+    return int(start[-1], 16), int(entry[-1], 16), int(read.group(3)), int(read.group(2))
+
+
+def main(argv=None):
+    parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
+    parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"))
+    parser.add_argument("--guest-dir", default=str(REPO / "build" / "tests" / "guest"))
+    parser.add_argument("--keep", action="store_true", help="keep the run's files")
+    args = parser.parse_args(argv)
+    measured = measure(args.efi_dir, args.guest_dir, args.keep)
+    if measured is None:
+        return 1
+    start, entry, read_ticks, extents = measured
+    loader_ticks = entry - start
+    mib = FIRST_STAGE / (1 << 20)
+    print(f"resume-vs-read: {extents} extents; loader {loader_ticks} ticks, DiskIO read {read_ticks} ticks")
+    print(
+        f"figure resume-vs-read: loader {mib:.0f} MiB in {loader_ticks / 1e6:.1f} Mticks vs DiskIO read "
+        f"{mib:.0f} MiB in {read_ticks / 1e6:.1f} Mticks = {loader_ticks / read_ticks:.2f}x"
+    )
+    return 0
+
+
+if __name__ == "__main__":
+    sys.exit(main())
