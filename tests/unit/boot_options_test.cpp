@@ -282,11 +282,18 @@ TEST_F(BootOptionsTest, TheConfigurationFileByName) {
   }
 }
 
+// The name holds 1023 characters and its NUL: "/" and 1016 more with
+// ".plist" fit exactly, one more does not.
 TEST_F(BootOptionsTest, AConfigValueTooLongForItsBufferReadsNoFile) {
-  std::u16string options = u"config=" + std::u16string(1100, u'a');
-  ASSERT_EQ(Process(options), EFI_SUCCESS);
-  EXPECT_EQ(gConfigDict, nullptr);
-  EXPECT_TRUE(fw.OpenedNames().empty());
+  for (size_t n : {1016u, 1017u, 1100u}) {
+    nimbtest::ResetLoaderState();
+    Attach();
+    nimb::gLoadedImage = fw.LoadedImage();
+    const size_t opened = fw.OpenedNames().size();
+    ASSERT_EQ(Process(u"config=/" + std::u16string(n, u'a')), EFI_SUCCESS) << n;
+    EXPECT_EQ(gConfigDict, nullptr) << n;
+    EXPECT_EQ(fw.OpenedNames().size(), opened + (n == 1016 ? 1 : 0)) << n;
+  }
 }
 
 TEST_F(BootOptionsTest, KernelAndDriverPackageNames) {

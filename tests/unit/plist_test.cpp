@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <deque>
 #include <functional>
@@ -298,6 +299,19 @@ TEST_F(PlistTest, ManySymbolsAreFoundAndReleased) {
   for (size_t i = 0; i < texts.size(); i++)
     ASSERT_EQ(nimb::PlistInternSymbol(texts[i].c_str()), first[i]) << texts[i];
   EXPECT_EQ(Symbols().size(), 5000u);
+  // The index grew with them and spreads them: short chains, whatever the
+  // names have in common.
+  const nimb::PlistSymbolIndex &index = nimb::gPlistSymbolIndex;
+  ASSERT_NE(index.buckets, nullptr);
+  EXPECT_GE(2 * (index.mask + 1), 5000u);
+  size_t longest = 0;
+  for (UINT64 b = 0; b <= index.mask; b++) {
+    size_t length = 0;
+    for (const PlistSymbol *s = index.buckets[b]; s != nullptr; s = s->chain)
+      length++;
+    longest = std::max(longest, length);
+  }
+  EXPECT_LE(longest, 12u);
   for (int round = 0; round < 2; round++) {
     for (size_t i = round; i < texts.size(); i += 2) {
       PlistTag *holder = nimb::PlistNewTag();

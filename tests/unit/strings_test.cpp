@@ -130,6 +130,12 @@ TEST(StringsTest, MemoryAndCopyRoutines) {
   char text[9] = "abcdefgh";
   nimb::bcopy(text, text + 2, 6);
   EXPECT_STREQ(text, "abababab");
+  // memmove is right for overlap either way.
+  char up[9] = "abcdefgh", down[9] = "abcdefgh";
+  EXPECT_EQ(nimb::memmove(up + 2, up, 6), up + 2);
+  nimb::memmove(down, down + 2, 6);
+  EXPECT_STREQ(up, "ababcdef");
+  EXPECT_STREQ(down, "cdefghgh");
 
   // strncpy never pads.
   struct Row {
