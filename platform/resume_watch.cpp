@@ -30,9 +30,11 @@ constexpr UINT32 kMaxLoggedReads = 48;
 struct WatchedDisk {
   EFI_DISK_IO_PROTOCOL *interface;
   ReadDiskFunction original;
+  UINT32 partition;  // 0 for a whole disk
 };
 
 struct LoggedRead {
+  UINT32 partition;
   UINT64 offset;
   UINT64 size;
   UINT64 destination;
@@ -50,9 +52,11 @@ ResetSystemFunction gOriginalReset;
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
                                   VOID *Buffer) {
   ReadDiskFunction original = nullptr;
+  UINT32 partition = 0;
   for (UINT32 i = 0; i < gDiskCount; i++) {
     if (gDisks[i].interface == This) {
       original = gDisks[i].original;
+      partition = gDisks[i].partition;
     }
   }
   if (original == nullptr) {
@@ -66,7 +70,7 @@ EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UI
     return status;
   }
   if (gReadCount < kMaxLoggedReads) {
-    gReads[gReadCount] = {Offset, BufferSize, reinterpret_cast<UINT64>(Buffer), status};
+    gReads[gReadCount] = {partition, Offset, BufferSize, reinterpret_cast<UINT64>(Buffer), status};
   }
   gReadCount++;
   gReadBytes += BufferSize;
@@ -78,8 +82,9 @@ VOID EFIAPI WatchedResetSystem(EFI_RESET_TYPE ResetType, EFI_STATUS ResetStatus,
                                const VOID *ResetData) {
   SerialPrintf("\nplatform: reset type %u status 0x%x\n", static_cast<UINT64>(ResetType), ResetStatus);
   for (UINT64 i = 0; i < gReadCount && i < kMaxLoggedReads; i++) {
-    SerialPrintf("platform: read offset=0x%x size=0x%x to=0x%x status=0x%x\n", gReads[i].offset,
-                 gReads[i].size, gReads[i].destination, gReads[i].status);
+    SerialPrintf("platform: read partition=%u offset=0x%x size=0x%x to=0x%x status=0x%x\n",
+                 static_cast<UINT64>(gReads[i].partition), gReads[i].offset, gReads[i].size,
+                 gReads[i].destination, gReads[i].status);
   }
   SerialPrintf("platform: reads %u, bytes 0x%x\n", gReadCount, gReadBytes);
   gOriginalReset(ResetType, ResetStatus, DataSize, ResetData);
@@ -161,7 +166,7 @@ void WatchDiskAndReset() {
         continue;
       }
       EFI_DISK_IO_PROTOCOL *disk = static_cast<EFI_DISK_IO_PROTOCOL *>(interface);
-      gDisks[gDiskCount++] = {disk, disk->ReadDisk};
+      gDisks[gDiskCount++] = {disk, disk->ReadDisk, PartitionNumberOf(handles[i])};
       disk->ReadDisk = WatchedReadDisk;
     }
     gBS->FreePool(handles);

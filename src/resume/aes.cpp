@@ -287,22 +287,27 @@ void ExpandKey(const UINT8 *key, UINT32 keyWords, UINT32 rounds, AesDecryptConte
 
 }  // namespace
 
-void AesExpandDecryptKey(const UINT8 *key, INT32 keyLength, AesDecryptContext *context) {
+UINT32 AesRoundsForKeyLength(INT32 keyLength) {
   switch (keyLength) {
     case 16:
     case 128:
-      ExpandKey(key, 4, 10, context);
-      break;
+      return 10;
     case 24:
     case 192:
-      ExpandKey(key, 6, 12, context);
-      break;
+      return 12;
     case 32:
     case 256:
-      ExpandKey(key, 8, 14, context);
-      break;
+      return 14;
     default:
-      break;
+      return 0;
+  }
+}
+
+void AesExpandDecryptKey(const UINT8 *key, INT32 keyLength, AesDecryptContext *context) {
+  // 4 key words for 10 rounds, 6 for 12, 8 for 14.
+  const UINT32 rounds = AesRoundsForKeyLength(keyLength);
+  if (rounds != 0) {
+    ExpandKey(key, rounds - 6, rounds, context);
   }
 }
 

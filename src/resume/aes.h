@@ -22,6 +22,10 @@ struct AesDecryptContext {
 };
 static_assert(sizeof(AesDecryptContext) == 244, "60 schedule words and the round count");
 
+// The number of rounds for a key of `keyLength` bytes (16, 24, 32) or bits
+// (128, 192, 256); 0 for any other length, which selects no schedule.
+UINT32 AesRoundsForKeyLength(INT32 keyLength);
+
 // `keyLength` in bytes (16, 24, 32) or bits (128, 192, 256); any other value
 // leaves `context` untouched. Reads only the bytes of the key size.
 void AesExpandDecryptKey(const UINT8 *key, INT32 keyLength, AesDecryptContext *context);

@@ -114,12 +114,18 @@ bool ReadFirstStage(ResumeState *state) {
   return true;
 }
 
+// An encrypted image needs a key whose length selects a schedule.
+bool KeySelectsSchedule(const ResumeState *state) {
+  return state->key != nullptr && state->keyLength <= 0x7FFFFFFF &&
+         AesRoundsForKeyLength(static_cast<INT32>(state->keyLength)) != 0;
+}
+
 // Decrypts the first stage from `encryptedOffset` on, in place, and keeps
 // its last ciphertext block in `lastBlock`. False when the key is missing or
 // its length selects no schedule. The schedule is wiped before the return.
 __attribute__((noinline)) bool DecryptInPlace(ResumeState *state, UINT8 *lastBlock) {
   const ResumePlan &plan = state->plan;
-  if (state->key == nullptr || state->keyLength > 0x7FFFFFFF) {
+  if (!KeySelectsSchedule(state)) {
     return false;
   }
   AesDecryptContext context;
@@ -188,7 +194,11 @@ BOOLEAN ResumeReadImage(ResumeState *state) {
   state->header->chainBlockDelta = plan.headerOffset - kResumeChainBlockOffset;
   state->header->memoryMapDelta = plan.headerOffset - kResumeMemoryMapOffset;
 
-  // After a failed read the key is wiped by the reset's way out.
+  // A key that cannot decrypt is known before anything is read. After a
+  // failed read the key is wiped by the reset's way out.
+  if (plan.encryptedOffset != 0 && !KeySelectsSchedule(state)) {
+    return FALSE;
+  }
   return ReadFirstStage(state) && DecryptFirstStage(state);
 }
 

@@ -1023,7 +1023,7 @@ def make_resume(resume, workdir, guest_dir, disk_bytes):
     partition, settings = workdir / "resume.img", workdir / "resume.cfg"
     command = [
         sys.executable, str(RESUME_TOOL), "--restart", str(probe), "--partition", str(partition),
-        "--partition-bytes", str(resume.partition_bytes), "--partition-number", "2",
+        "--partition-bytes", str(resume.partition_bytes), "--partition-number", str(RESUME_PARTITION),
         "--partition-guid", RESUME_PARTITION_GUID, "--partition-start-lba", str(mkdisk.raw_partition_lba(disk_bytes)),
         "--partition-lbas", str(resume.partition_bytes // 512), "--nvram-out", str(settings),
         *resume.args,
@@ -1060,12 +1060,16 @@ def check_boots(log, wanted):
     return [] if starts == wanted else [f"the machine started {starts} times, wanted {wanted}"]
 
 
-READ_LINE = re.compile(r"platform: read offset=0x([0-9a-f]+) size=0x([0-9a-f]+) to=0x([0-9a-f]+)")
+RESUME_PARTITION = 2  # where make_resume puts the image
+READ_LINE = re.compile(
+    rf"platform: read partition={RESUME_PARTITION} offset=0x([0-9a-f]+) size=0x([0-9a-f]+) to=0x([0-9a-f]+)"
+)
 
 
 def check_resume_reads(log, expect):
     """Problems with the loader's DiskIO reads that the platform logged at
-    the reset, against `expect` (ResumeReads): the header read first, then
+    the reset on the image's partition (the boot volume's file system reads
+    through its own), against `expect` (ResumeReads): the header read first, then
     at most `after_header` reads, each inside the first stage behind a
     page-aligned header."""
     if expect is None:

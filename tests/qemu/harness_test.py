@@ -387,12 +387,14 @@ class DiskTool(unittest.TestCase):
 
 class Resume(unittest.TestCase):
     def test_reads_rows(self):
-        header = "platform: read offset=0x10000 size=0x200 to=0x1de86d18 status=0x0\n"
-        inside = "platform: read offset=0x10200 size=0xfe00 to=0x5000200 status=0x0\n"
-        beyond = "platform: read offset=0x20000 size=0x100000 to=0x5010000 status=0x0\n"
-        unaligned = "platform: read offset=0x10200 size=0x100 to=0x5000300 status=0x0\n"
+        header = "platform: read partition=2 offset=0x10000 size=0x200 to=0x1de86d18 status=0x0\n"
+        inside = "platform: read partition=2 offset=0x10200 size=0xfe00 to=0x5000200 status=0x0\n"
+        beyond = "platform: read partition=2 offset=0x20000 size=0x100000 to=0x5010000 status=0x0\n"
+        unaligned = "platform: read partition=2 offset=0x10200 size=0x100 to=0x5000300 status=0x0\n"
+        volume = "platform: read partition=1 offset=0x108400 size=0x10000 to=0x1de12418 status=0x0\n"
         rows = [
             (header, ResumeReads(), []),
+            (volume + header, ResumeReads(), []),
             (header + inside, ResumeReads(), ["1 reads after the header"]),
             (header + inside, ResumeReads(after_header=None), []),
             (header + inside + beyond, ResumeReads(after_header=None), ["leave the first stage"]),

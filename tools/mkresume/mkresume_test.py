@@ -105,6 +105,18 @@ class MkresumeTest(unittest.TestCase):
         self.assertNotIn("nvram-hex.boot-image-key", settings)
 
     @unittest.skipUnless(os.environ.get("MKRESUME_CHECK"), "MKRESUME_CHECK names no mkresume_check")
+    def test_the_loader_restarts_each_key_size(self):
+        # Through the loader's own TryResume: the gate is entered at the
+        # restart code with the header, and the first stage is the plain one.
+        for args in ((), ("--key-bytes", "16"), ("--key-bytes", "24"), ("--key-bytes", "32", "--extent-bytes", "4K")):
+            with self.subTest(args):
+                self.run_tool("--first-stage", "96K", *args)
+                result = subprocess.run([os.environ["MKRESUME_CHECK"], str(self.dir / "part.img"),
+                                         str(self.dir / "nvram.cfg"), str(self.dir / "plain.bin")],
+                                        capture_output=True, text=True)  # fmt: skip
+                self.assertEqual(result.returncode, 0, result.stdout + result.stderr)
+
+    @unittest.skipUnless(os.environ.get("MKRESUME_CHECK"), "MKRESUME_CHECK names no mkresume_check")
     def test_the_loader_refuses_a_bad_magic_after_taking_the_key(self):
         self.run_tool("--key-bytes", "16", "--set", "magic=0x73696D66")
         result = subprocess.run([os.environ["MKRESUME_CHECK"], str(self.dir / "part.img"),
