@@ -29,7 +29,7 @@ constexpr char kExtensions[] = "System/Library/Extensions";
 constexpr int64_t kTime = 1199145599;  // 2007-12-31 23:59:59
 // Calls swept per service (and allocations per boot) at most; the first and
 // the last are always among them.
-constexpr unsigned kSamples = 24;
+constexpr unsigned kSamples = 12;
 
 // One run's firmware and what it boots from.
 struct Scene {
