@@ -468,6 +468,10 @@ void Firmware::FailPoolAllocationOfSize(UINTN size, unsigned nth, EFI_STATUS sta
   s_->faults.push_back(fault);
 }
 
+const std::map<std::string, unsigned> &Firmware::CallCounts() const {
+  return s_->callCounts;
+}
+
 unsigned Firmware::CallCount(const std::string &name) const {
   auto it = s_->callCounts.find(name);
   return it == s_->callCounts.end() ? 0 : it->second;

@@ -364,6 +364,8 @@ class Firmware {
   void FailPoolAllocationOfSize(UINTN size, unsigned nth = 1, EFI_STATUS status = EFI_OUT_OF_RESOURCES);
   // How often a service was called since the firmware was made.
   unsigned CallCount(const std::string &name) const;
+  // Every service called so far, by name, with its count.
+  const std::map<std::string, unsigned> &CallCounts() const;
 
  private:
   struct State;

@@ -21,10 +21,17 @@ void *AllocatePool(UINTN size) {
 // so that a block carries no tag of its own. The last record of a block
 // stands for the block on gMemoryTagBlocks; the others go on the free list in
 // ascending order, so that the highest is handed out first.
-static MemoryTag *TakeMemoryTag() {
+// The memory that is to be tagged goes back to the firmware before the Fatal
+// that a missing block of tags calls for, as nothing would free it later.
+static MemoryTag *TakeMemoryTag(void *pool, EFI_PHYSICAL_ADDRESS pages, UINTN pageCount) {
   if (gFreeMemoryTags == nullptr) {
     MemoryTag *block = static_cast<MemoryTag *>(AllocatePool(kMemoryTagBlockSize));
     if (block == nullptr) {
+      if (pool != nullptr) {
+        gBS->FreePool(pool);
+      } else {
+        gBS->FreePages(pages, pageCount);
+      }
       Fatal("Can't allocate memory tag");
     }
     MemoryTag *blockRecord = &block[kMemoryTagsPerBlock - 1];
@@ -45,7 +52,7 @@ static MemoryTag *TakeMemoryTag() {
 }
 
 MemoryTag *TrackPool(void *address) {
-  MemoryTag *tag = TakeMemoryTag();
+  MemoryTag *tag = TakeMemoryTag(address, 0, 0);
   tag->poolAddress = address;
   tag->pageCount = 0;
   tag->pageAddress = 0;
@@ -68,7 +75,7 @@ EFI_STATUS TrackedAllocatePages(EFI_ALLOCATE_TYPE type, EFI_MEMORY_TYPE memoryTy
   if (EFI_ERROR(status)) {
     return status;
   }
-  MemoryTag *tag = TakeMemoryTag();
+  MemoryTag *tag = TakeMemoryTag(nullptr, *address, pages);
   tag->poolAddress = nullptr;
   tag->pageCount = pages;
   tag->pageAddress = *address;

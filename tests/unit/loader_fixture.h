@@ -60,6 +60,7 @@ inline void ResetLoaderState() {
   nimb::gCustomDriverPackage = 0;
   nimb::gPlistFreeTags = nullptr;
   nimb::gPlistSymbols = nullptr;
+  nimb::gPlistSymbolIndex = {};
   nimb::gDeviceTreeRoot = nullptr;
   nimb::gDeviceTreeNodeCount = 0;
   nimb::gDeviceTreePropertyCount = 0;
