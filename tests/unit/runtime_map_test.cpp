@@ -124,6 +124,12 @@ class Scene {
 
 class RuntimeMapTest : public nimbtest::LoaderTest {};
 
+TEST(LShiftU64Test, ShiftsUpTo63BitsAndGivesZeroBeyond) {
+  EXPECT_EQ(nimb::LShiftU64(3, 12), 0x3000u);
+  EXPECT_EQ(nimb::LShiftU64(1, 63), 0x8000000000000000ull);
+  EXPECT_EQ(nimb::LShiftU64(1, 64), 0u);
+}
+
 TEST_F(RuntimeMapTest, AddressesCopiesAndTheRewrittenMapInBothModes) {
   struct Row {
     const char *what;
