@@ -9,9 +9,9 @@
 #include <vector>
 
 struct Figure {
-  std::string name;     // as the issues name it, e.g. "lzss-vs-inflate"
-  std::string loader;   // the full name of the loader's benchmark
-  std::string peer;     // the full name of the peer's benchmark
+  std::string name;    // as the issues name it, e.g. "lzss-vs-inflate"
+  std::string loader;  // the full name of the loader's benchmark
+  std::string peer;    // the full name of the peer's benchmark
 };
 
 // Registers a figure; call it from a BenchSuite's body.

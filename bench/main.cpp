@@ -5,11 +5,11 @@
 #include <openssl/evp.h>
 #include <zlib.h>
 
+#include <algorithm>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <map>
-#include <algorithm>
 #include <string>
 #include <vector>
 
@@ -151,7 +151,6 @@ void Register(const char *routine, const Contender<Function> (&contenders)[N], B
     }
   }
 }
-
 
 // --- the summary figures ----------------------------------------------------------------
 
