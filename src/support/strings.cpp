@@ -9,6 +9,8 @@ namespace {
 
 // Word reads over buffers of any declared type.
 typedef UINT64 __attribute__((may_alias)) AliasedUint64;
+// The same at any address: x86 reads and writes words unaligned.
+typedef UINT64 __attribute__((may_alias, aligned(1))) UnalignedUint64;
 typedef UINT32 __attribute__((may_alias)) AliasedUint32;
 
 // Characters compared as the signed bytes they are on this platform.
@@ -30,7 +32,16 @@ void *memset(void *destination, int value, UINTN count) {
 void *memcpy(void *destination, const void *source, UINTN count) {
   UINT8 *d = static_cast<UINT8 *>(destination);
   const UINT8 *s = static_cast<const UINT8 *>(source);
-  for (UINTN i = 0; i < count; i++) {
+  UINTN i = 0;
+  // Eight bytes a step wherever that gives the bytes of the upward byte loop:
+  // when the destination lies below the source, or 8 bytes or more above it,
+  // no word read takes in a byte that the same step writes.
+  if (reinterpret_cast<UINTN>(d) - reinterpret_cast<UINTN>(s) >= 8) {
+    for (; count - i >= 8; i += 8) {
+      *reinterpret_cast<UnalignedUint64 *>(d + i) = *reinterpret_cast<const UnalignedUint64 *>(s + i);
+    }
+  }
+  for (; i < count; i++) {
     d[i] = s[i];
   }
   return destination;

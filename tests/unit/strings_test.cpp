@@ -130,6 +130,19 @@ TEST(StringsTest, MemoryAndCopyRoutines) {
   char text[9] = "abcdefgh";
   nimb::bcopy(text, text + 2, 6);
   EXPECT_STREQ(text, "abababab");
+  // The copy gives the bytes of the upward byte loop for every overlap.
+  for (int distance = -10; distance <= 10; distance++) {
+    for (UINTN count = 0; count <= 40; count++) {
+      UINT8 mine[64], theirs[64];
+      for (int i = 0; i < 64; i++)
+        mine[i] = theirs[i] = static_cast<UINT8>(i * 7 + 1);
+      UINT8 *from = theirs + 12;
+      for (UINTN i = 0; i < count; i++)
+        from[distance + static_cast<int>(i)] = from[i];
+      nimb::memcpy(mine + 12 + distance, mine + 12, count);
+      ASSERT_EQ(0, std::memcmp(mine, theirs, sizeof mine)) << "distance " << distance << " count " << count;
+    }
+  }
   // memmove is right for overlap either way.
   char up[9] = "abcdefgh", down[9] = "abcdefgh";
   EXPECT_EQ(nimb::memmove(up + 2, up, 6), up + 2);
