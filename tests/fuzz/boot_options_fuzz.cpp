@@ -23,6 +23,7 @@
 #include "fuzz_firmware.h"
 #include "hostfw/network.h"
 #include "memory/tracking.h"
+#include "tests/unit/loader_state.h"
 
 namespace {
 
@@ -69,26 +70,13 @@ void SetVariable(hostfw::Firmware &fw, const char16_t *name, bool present, const
     fw.PutVariable(name, gNimbVendorVariableGuid, 7, std::vector<uint8_t>(value.begin(), value.end()));
 }
 
-void ResetConfiguration() {
-  nimb::gBootFlags = 0;
-  nimb::gBootOptions = nullptr;
-  nimb::gConfigDict = nullptr;
-  nimb::gKernelName = nullptr;
-  nimb::gKernelDevicePath = nullptr;
-  nimb::gDriverPackageName = nullptr;
-  nimb::gDriverPackagePath = nullptr;
-  nimb::gCustomDriverPackage = 0;
-  nimb::gPlistFreeTags = nullptr;
-  nimb::gPlistSymbols = nullptr;
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   Machine &m = TheMachine();
   hostfw::Firmware &fw = m.fw;
   nimbfuzz::AttachLoader(fw);
-  ResetConfiguration();
+  nimbtest::ResetConfigurationState();
 
   FuzzedDataProvider input(data, size);
   const uint8_t flags = input.ConsumeIntegral<uint8_t>();

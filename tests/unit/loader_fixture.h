@@ -16,6 +16,7 @@
 #include "devicetree/platform.h"
 #include "hostfw/hostfw.h"
 #include "load/bundles.h"
+#include "loader_state.h"
 #include "memory/kernel_region.h"
 #include "memory/tracking.h"
 #include "screen/bootscreen.h"
@@ -50,17 +51,7 @@ inline void ResetLoaderState() {
   nimb::gMemoryTags = nullptr;
   nimb::gFreeMemoryTags = nullptr;
   nimb::gMemoryTagBlocks = nullptr;
-  nimb::gBootFlags = 0;
-  nimb::gBootOptions = nullptr;
-  nimb::gConfigDict = nullptr;
-  nimb::gKernelName = nullptr;
-  nimb::gKernelDevicePath = nullptr;
-  nimb::gDriverPackageName = nullptr;
-  nimb::gDriverPackagePath = nullptr;
-  nimb::gCustomDriverPackage = 0;
-  nimb::gPlistFreeTags = nullptr;
-  nimb::gPlistSymbols = nullptr;
-  nimb::gPlistSymbolIndex = {};
+  ResetConfigurationState();
   nimb::gDeviceTreeRoot = nullptr;
   nimb::gDeviceTreeNodeCount = 0;
   nimb::gDeviceTreePropertyCount = 0;
