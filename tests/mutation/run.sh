@@ -1,11 +1,12 @@
 #!/usr/bin/env bash
-# Plants each fault of mutations.txt in turn, builds the unit tests, runs them
+# Plants each fault of the lists (tests/mutation/*.txt) in turn, builds the unit tests, runs them
 # and says whether they caught it; the file is put back after each.
 #
 #   tests/mutation/run.sh [-b BUILD_DIR] [NAME...]
 #
 # BUILD_DIR is a configured host build (default: build). NAME picks
-# mutations by name; none means all. Per mutation: "caught" (a test failed),
+# mutations by name, or a whole list by its file's name (config, load, ...);
+# none means all. Per mutation: "caught" (a test failed),
 # "MISSED" (all passed), "no build" (the fault does not compile: fix the
 # list). The exit status is 1 when any was missed.
 set -euo pipefail
@@ -20,7 +21,6 @@ while getopts "b:" option; do
 done
 shift $((OPTIND - 1))
 
-list=tests/mutation/mutations.txt
 saved=$(mktemp -d)
 current=""
 restore() {
@@ -46,7 +46,8 @@ PY
 
 caught=0 missed=0 broken=0 total=0
 missedNames=()
-while IFS= read -r line; do
+while IFS=: read -r path line; do
+  group=$(basename "$path" .txt)
   case "$line" in '#'* | '') continue ;; esac
   name=${line%% ||| *}
   rest=${line#* ||| }
@@ -54,7 +55,7 @@ while IFS= read -r line; do
   rest=${rest#* ||| }
   text=${rest%% ||| *}
   replacement=${rest#* ||| }
-  if [ $# -gt 0 ] && ! printf '%s\n' "$@" | grep -qx -- "$name"; then
+  if [ $# -gt 0 ] && ! printf '%s\n' "$@" | grep -qx -- "$name" && ! printf '%s\n' "$@" | grep -qx -- "$group"; then
     continue
   fi
   total=$((total + 1))
@@ -79,7 +80,7 @@ while IFS= read -r line; do
   fi
   restore
   printf '%-28s %s\n' "$name" "$result"
-done <"$list"
+done < <(grep -H '' tests/mutation/*.txt)
 
 # The build left as the sources are.
 nice cmake --build "$build" --target unit_tests >/dev/null 2>&1 || true
