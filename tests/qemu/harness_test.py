@@ -112,29 +112,15 @@ kernel: hold 4 s
 
 class KernelReport(unittest.TestCase):
     def test_parse(self):
+        # What the check rows below don't show on their own: escapes undone,
+        # numbers read, every line of a known kind.
         report = harness.parse_kernel_report(KERNEL_LOG)
-        self.assertEqual(report.starts, 1)
-        self.assertEqual([(c.name, c.ok) for c in report.checks],
-                         [("entry-eax-ebx", True), ("bootargs-address", True), ("tree-walk", True)])  # fmt: skip
         self.assertEqual(report.bootargs["commandLine"], 'foo=1 q="a b" \\ \x01')
         self.assertEqual(report.bootargs["runtimePageCount"], 0x788)
-        self.assertEqual(
-            report.tree,
-            {
-                "/": {"name": '"/"', "compatible": '"ACPI"'},
-                "/chosen": {"name": '"chosen"', "boot-uuid": text("0FAB1E5D-3C2B-4A19-8E7F-60C5D4B3A291"),
-                            "boot-file": text("nimb_kernel")},
-                "/chosen/memory-map": {"name": '"memory-map"',
-                                       "BootCLUT": "<00 b0 10 00 00 03 00 00> (address 0x10b000, length 0x300)"},
-                "/efi": {"name": '"efi"', "firmware-abi": text("EFI64")},
-                "/efi/platform": {"name": '"platform"', "Model": ucs2("QEMU1,1")},
-            },
-        )  # fmt: skip
-        self.assertEqual(report.ranges, {"BootCLUT": (0x10B000, 0x300)})
-        self.assertEqual(report.result, (True, 3, 0))
+        self.assertEqual(report.tree["/chosen/memory-map"]["BootCLUT"],
+                         "<00 b0 10 00 00 03 00 00> (address 0x10b000, length 0x300)")  # fmt: skip
         self.assertEqual(report.drivers, [("com.x.A", "loader", 6, 3, 0x24D0127), ("com.x.B", "loader", 1, 0, 1)])
-        self.assertEqual((report.package, report.drivers_from), ((3, 0x24D0127), "loader"))
-        self.assertEqual(report.unknown, [])
+        self.assertEqual((report.package, report.drivers_from, report.unknown), ((3, 0x24D0127), "loader", []))
 
     def test_check_rows(self):
         good = KernelExpect(
