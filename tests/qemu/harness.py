@@ -17,6 +17,7 @@ the kernel's report and, when the scenario asks, screenshots.
 """
 
 import argparse
+import collections
 import dataclasses
 import os
 import re
@@ -185,11 +186,7 @@ ROOT_UUID_MESSAGE = re.compile(r"root device uuid is '(.*)'")
 UNCHECKED_KINDS = ("entry", "memmap", "efi", "hold", "resume")
 
 
-@dataclasses.dataclass(frozen=True)
-class KernelCheck:
-    name: str
-    ok: bool
-    detail: str
+KernelCheck = collections.namedtuple("KernelCheck", "name ok detail")
 
 
 @dataclasses.dataclass
@@ -808,14 +805,7 @@ def check_resume_reads(log, expect):
 # --- runs -----------------------------------------------------------------------------
 
 
-@dataclasses.dataclass
-class Result:
-    passed: bool
-    seconds: float
-    outcome: Outcome
-    problems: list
-    log: str
-    workdir: Path
+Result = collections.namedtuple("Result", "passed seconds outcome problems log workdir")
 
 
 def watch(scenario, workdir, served, png=False):

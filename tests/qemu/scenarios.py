@@ -41,9 +41,9 @@ ACPI_20_TABLE = "/efi/configuration-table/8868E871-E4F1-11D3-BC22-0080C73C8881"
 ACPI_10_TABLE = "/efi/configuration-table/EB9D2D30-2D88-11D3-9A16-0090273FC14D"
 
 
-def plist(entries):
-    """A configuration property list of string values."""
-    body = "".join(f"\t<key>{key}</key>\n\t<string>{value}</string>\n" for key, value in entries.items())
+def plist(entries, body=""):
+    """A property list of string values (`entries`), then `body` as it stands."""
+    body = "".join(f"\t<key>{key}</key>\n\t<string>{value}</string>\n" for key, value in entries.items()) + body
     return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
 
 
@@ -205,17 +205,15 @@ EXTENSIONS_DIR = "System/Library/Extensions"
 def driver_plist(identifier, required=None, executable=None, libraries=()):
     """A driver bundle's Info.plist: its identifier, and the keys that the
     loader reads when given (`required` a string, or another tag's text)."""
-    lines = [f"\t<key>VzBundleIdentifier</key>\n\t<string>{identifier}</string>\n"]
-    if executable is not None:
-        lines.append(f"\t<key>VzBundleExecutable</key>\n\t<string>{executable}</string>\n")
+    keys = {"VzBundleIdentifier": identifier, **({"VzBundleExecutable": executable} if executable is not None else {})}
+    body = ""
     if required is not None:
         tag = required if required.startswith("<") else f"<string>{required}</string>"
-        lines.append(f"\t<key>VzBundleRequired</key>\n\t{tag}\n")
+        body += f"\t<key>VzBundleRequired</key>\n\t{tag}\n"
     if libraries:
         entries = "".join(f"\t\t<key>{name}</key>\n\t\t<string>1.0</string>\n" for name in libraries)
-        lines.append(f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n")
-    body = "".join(lines)
-    return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
+        body += f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n"
+    return plist(keys, body)
 
 
 def driver_code(seed, length):
@@ -366,6 +364,22 @@ HUGE_DRIVER = {
     f"{EXTENSIONS_DIR}/Huge.drvb/Huge": struct.pack(">7I", 0xCAFEBABE, 1, 7, 3, 28, 0xF0000000, 12),
 }
 
+def low_kernel(room):
+    """A kernel object of one page of code whose end leaves `room` pages
+    below the legacy video hole at 640 KiB, which is never memory: what the
+    loader places behind the kernel runs into it. The boot record takes a
+    page, the colour table one, the failure picture five, the device tree
+    one, then come the memory map and the runtime area."""
+    address = 0xA0000 - (room + 1) * 0x1000
+
+    def command(kind, length, words):
+        return (struct.pack("<II", kind, length) + struct.pack(f"<{len(words)}I", *words)).ljust(length, b"\0")
+
+    entry = [0] * 10 + [address] + [0] * 5  # the thread's registers, the instruction pointer eleventh
+    body = command(1, 56, [0, 0, 0, 0, address, 0x1000, 0x1000, 16, 7, 7]) + command(5, 80, [1, 16, *entry])
+    return (struct.pack("<7I", 0xFEEDFACE, 7, 3, 2, 2, len(body), 0) + body).ljust(0x1000, b"\0") + bytes(16)
+
+
 _TABLE = [
     # The loader's fatal messages that the firmware reaches with a shaped
     # volume or configuration, each with all memory given back.
@@ -376,6 +390,16 @@ _TABLE = [
           extensions=None),
     fatal("driver_too_large", "Loading drivers...", "Could not allocate driver module memory", files=kernel_file(),
           extensions=HUGE_DRIVER),
+    # A kernel placed so low that what comes behind it finds no memory.
+    *(fatal(name, message, files={"nimb_kernel": low_kernel(room)}, extensions=None, directories=(EXTENSIONS_DIR,))
+      for name, room, message in [
+          ("no_room_boot_record", 0, "Couldn't allocate bootArgs"),
+          ("no_room_colour_table", 1, "Could not allocate CLUT"),
+          ("no_room_failure_picture", 2, "Could not allocate Pict-FailedBoot"),
+          ("no_room_device_tree", 7, "Couldn't allocate device tree"),
+          ("no_room_memory_map", 8, "Couldn't allocate memory map"),
+          ("no_room_runtime_area", 127, "Runtime services area not free"),
+      ]),
     # The firmware's own console, without the console control that the
     # platform otherwise adds.
     fatal("console_missing", "Can not initialize console", config={"console": "none"},
