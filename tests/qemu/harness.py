@@ -775,8 +775,9 @@ def check_key_trace(log):
     copy "elsewhere" that the platform did not find before the loader
     started, the loader left behind."""
     firmware = {int(address, 16) for address, _ in KEY_COPY.findall(log)}
-    return [f"key: the key's bytes at {address} are no copy of the firmware's"
-            for address, where in KEY_TRACE.findall(log) if where == "elsewhere" and int(address, 16) not in firmware]  # fmt: skip
+    found = KEY_TRACE.findall(log)
+    return [f"key: the key's bytes at {address} are no copy of the firmware's" for address, where in found
+            if where == "elsewhere" and int(address, 16) not in firmware]  # fmt: skip
 
 
 def check_resume_reads(log, expect):

@@ -414,7 +414,8 @@ _TABLE = [
           config={"console": "text", "options": "  Kernel=nimb_test -v"}, forbid=(KERNEL_ERROR,)),
     # Shift held alone: safe mode, which reads no NVRAM (the kernel that
     # boot-args names would win over the configuration file's).
-    fatal("safe_mode_keys", "Using Safe Mode", "Error loading kernel 'mach_test'", before=("platform: nvram boot-args set",),
+    fatal("safe_mode_keys", "Using Safe Mode", "Error loading kernel 'mach_test'",
+          before=("platform: nvram boot-args set",),
           config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"},
           files={BOOT_PLIST: plist({"Kernel": "mach_test"})}, forbid=("nvram_kernel", KERNEL_ERROR)),
     # GUI-V held: a verbose boot switches a graphics console to text before
@@ -536,8 +537,9 @@ _TABLE = [
 ]
 # The kernel as fat files, either byte order, under the default name.
 _TABLE += [
-    Scenario(f"kernel_fat_{order}", files=kernel_file(f"nimb_kernel.fat-{order}"), expect=(LOADING_KERNEL, KERNEL_START),
-             exit="KernelPass", kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}))
+    Scenario(f"kernel_fat_{order}", files=kernel_file(f"nimb_kernel.fat-{order}"),
+             expect=(LOADING_KERNEL, KERNEL_START), exit="KernelPass",
+             kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}))
     for order in ("be", "le")
 ]  # fmt: skip
 
@@ -785,7 +787,8 @@ _TABLE += [
     # A package that the configuration names is used whatever its time, and
     # a valid cache is then not looked at.
     drivers("package_named", PACKAGE_SLICE_ONLY, ("Loading Custom\\drivers.pk...", KERNEL_START),
-            {**kernel_file(), "Custom/drivers.pk": PACKAGE_FILE, BOOT_PLIST: plist({"Drvpk Cache": "Custom/drivers.pk"})},
+            {**kernel_file(), "Custom/drivers.pk": PACKAGE_FILE,
+             BOOT_PLIST: plist({"Drvpk Cache": "Custom/drivers.pk"})},
             times={**EXTENSIONS_TIME, "Custom/drivers.pk": "2001-01-01 00:00:00.000000000"},
             cache=CACHE_NOT_LOOKED_FOR, forbid=("Looking for kernel cache file",)),
     # Safe mode: neither the valid cache nor the valid package; the bundles,
