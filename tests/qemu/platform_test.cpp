@@ -1,6 +1,8 @@
 // Host tests of the platform layer's logic: its configuration file, text
-// conversion, exit codes, memory count, console modes, key protocols, Data
-// Hub and the size handshake of its answering protocols.
+// conversion, exit codes, memory count, console modes and Data Hub. The
+// protocols that only pass the configuration on (held keys, device
+// properties, network boot answers) are checked end to end by the QEMU
+// scenarios, whose kernel reports what it got.
 #include <gtest/gtest.h>
 
 #include <cstring>
@@ -11,10 +13,8 @@
 #include "../../platform/config.h"
 #include "../../platform/console_control.h"
 #include "../../platform/data_hub.h"
-#include "../../platform/device_properties.h"
 #include "../../platform/exitcodes.h"
 #include "../../platform/format.h"
-#include "../../platform/key_state.h"
 #include "../../platform/memory.h"
 
 namespace nimb::platform {
@@ -405,53 +405,6 @@ TEST(PlatformConsole, SwitchesModesOnTheRealConsole) {
   }
 }
 
-// --- key protocols ------------------------------------------------------------------------
-
-TEST(PlatformKeys, ReportsHeldKeysWithinTheCallersRoom) {
-  struct Row {
-    const char *name;
-    const char *keys;  // the configuration's value
-    UINTN room;        // the count passed in
-    bool noArray;
-    EFI_STATUS status;
-    UINT16 modifiers;
-    UINTN count;  // the count passed out
-    std::vector<UINT16> written;
-  };
-  const std::vector<Row> rows = {
-      {"nothing held", "", 32, false, EFI_SUCCESS, 0, 0, {}},
-      {"gui and v", "gui+v", 32, false, EFI_SUCCESS, 0x08, 1, {0x7019}},
-      {"exactly enough room", "gui+v+s", 2, false, EFI_SUCCESS, 0x08, 2, {0x7019, 0x7016}},
-      {"one short", "gui+v+s", 1, false, EFI_BUFFER_TOO_SMALL, 0x08, 2, {}},
-      {"no room, asking for the count", "rshift+a", 0, true, EFI_BUFFER_TOO_SMALL, 0x20, 1, {}},
-      {"no room and nothing held", "ctrl", 0, true, EFI_SUCCESS, 0x01, 0, {}},
-      {"room but no array", "a", 4, true, EFI_INVALID_PARAMETER, 0, 4, {}},
-  };
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.name);
-    const Parsed parsed(std::string("keys=") + row.keys);
-    PlatformKeyState state;
-    KeyStateInit(&state, parsed.config.keys);
-    std::vector<UINT16> keys(row.room + 1, 0xEEEE);
-    UINT16 modifiers = 0xEEEE;
-    UINTN count = row.room;
-    EXPECT_EQ(
-        state.protocol.ReadKeyState(&state.protocol, &modifiers, &count, row.noArray ? nullptr : keys.data()),
-        row.status);
-    if (row.status != EFI_INVALID_PARAMETER) {
-      EXPECT_EQ(modifiers, row.modifiers);
-    }
-    EXPECT_EQ(count, row.count);
-    std::vector<UINT16> expected = row.written;
-    expected.resize(row.room + 1, 0xEEEE);
-    EXPECT_EQ(keys, expected) << "wrote where it should not";
-    UINT16 ignored = 0;
-    EXPECT_EQ(state.protocol.ReadKeyState(&state.protocol, nullptr, &count, nullptr), EFI_INVALID_PARAMETER);
-    EXPECT_EQ(state.protocol.ReadKeyState(&state.protocol, &ignored, nullptr, nullptr),
-              EFI_INVALID_PARAMETER);
-  }
-}
-
 // --- Data Hub -------------------------------------------------------------------------------
 
 // A hub built from configuration text, in 8-byte aligned storage.
@@ -525,60 +478,6 @@ TEST(PlatformDataHub, HoldsTheConfiguredRecordsThenOneOfItsOwn) {
   DataHubInit(&empty, nullptr, 0);
   count = 0;
   EXPECT_EQ(empty.protocol.GetNextDataRecord(&empty.protocol, &count, nullptr, &record), EFI_NOT_FOUND);
-}
-
-// --- the answering protocols' size handshake ----------------------------------------------
-
-TEST(PlatformAnswers, SizeHandshake) {
-  struct Row {
-    const char *name;
-    int given;  // bytes of the answer; -1: absent
-    UINT32 room;
-    bool buffer;
-    EFI_STATUS status;
-    UINT32 size;  // passed out
-    bool copied;  // the answer stands at the buffer's start
-  };
-  const std::vector<Row> rows = {
-      {"asking the size", 300, 0, false, EFI_BUFFER_TOO_SMALL, 300, false},
-      {"one byte short", 300, 299, true, EFI_BUFFER_TOO_SMALL, 300, false},
-      {"exactly the size", 300, 300, true, EFI_SUCCESS, 300, true},
-      {"more room than needed gives the size", 300, 4096, true, EFI_SUCCESS, 300, true},
-      {"empty answer, size asked", 0, 0, false, EFI_SUCCESS, 0, false},
-      {"empty answer into a buffer", 0, 16, true, EFI_SUCCESS, 0, false},
-      {"room without a buffer", 300, 300, false, EFI_INVALID_PARAMETER, 300, false},
-      {"absent answer, size untouched", -1, 0, false, EFI_NOT_FOUND, 0, false},
-      {"absent answer with a buffer", -1, 64, true, EFI_NOT_FOUND, 64, false},
-  };
-  // Through the device properties protocol; the network boot protocol's
-  // answers share the handshake (and both reach the kernel's tree end to end).
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.name);
-    std::string blob;
-    for (int i = 0; i < row.given; i++) {
-      blob.push_back(static_cast<char>(i * 7 + 1));
-    }
-    const Parsed parsed("device-properties-hex=" +
-                        Hex(reinterpret_cast<const UINT8 *>(blob.data()), blob.size()));
-    ConfigBytes answer = parsed.config.deviceProperties;
-    if (row.given < 0) {
-      answer = {};
-    }
-    PlatformDeviceProperties properties;
-    DevicePropertiesInit(&properties, answer);
-    std::vector<UINT8> buffer(row.room + 1, 0xEE);
-    UINT32 size = row.room;
-    EXPECT_EQ(
-        properties.protocol.GetProperties(&properties.protocol, row.buffer ? buffer.data() : nullptr, &size),
-        row.status);
-    EXPECT_EQ(size, row.size);
-    const size_t copied = row.copied ? blob.size() : 0;
-    EXPECT_EQ(std::string(buffer.begin(), buffer.begin() + static_cast<long>(copied)),
-              blob.substr(0, copied));
-    EXPECT_EQ(std::vector<UINT8>(buffer.begin() + static_cast<long>(copied), buffer.end()),
-              std::vector<UINT8>(buffer.size() - copied, 0xEE))
-        << "wrote where it should not";
-  }
 }
 
 }  // namespace
