@@ -252,8 +252,11 @@ TEST_F(KcacheBootTest, TheLoaderTakesWhatTheWriterWrote) {
     const char *name;
     bool fatKernel, compressed, matchFields, drivers;
   } rows[] = {
-      {"compressed", false, true, true, false},      {"no fields to compare", false, true, false, false},
-      {"uncompressed", false, false, true, false},   {"fat kernel", true, true, true, false},
+      {"compressed", false, true, true, false},
+      {"no fields to compare", false, true, false, false},
+      {"uncompressed", false, false, true, false},
+      {"fat kernel", true, true, true, false},
+      {"uncompressed fat kernel", true, false, true, false},
       {"prelinked drivers", true, true, true, true},
   };
   for (const auto &row : rows) {
