@@ -334,7 +334,7 @@ TEST_F(ResumePreviewTest, BrokenOrMismatchedPicturesDrawNothing) {
       {"a row offset past the end", HandMade({{4, 44}}), 3, 2, 4, 0},
       {"a row offset far out", HandMade({{3, 0xFFFFFFF0}}), 3, 2, 4, 0},
       {"a row that ends early", HandMade(), 3, 2, 4, 1},
-      {"no room for the row table", HandMade(), 3, 2, 4, 24},
+      {"no room for the row table", HandMade({{3, 0}}), 3, 2, 4, 28},
       {"no header", HandMade(), 3, 2, 4, 33},
   };
   for (const Row &row : rows) {

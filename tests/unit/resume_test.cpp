@@ -375,7 +375,7 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
        [](auto &s) {
          s.extentLengths = {0x100, 0x800, 0};
        },
-       same},
+       [](ResumeImage &image) { image.extents[1].start = image.extents[0].start + 0x100; }},
       {"extents short of the first stage", [](auto &) {},
        [](ResumeImage &image) { image.extents[2].length -= 16; }},
       {"an entry not read yet",
@@ -383,7 +383,8 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
          s.extentLengths = {512, 8, 0};
        },
        same},
-      {"an extent list of no entry", [](auto &) {}, header([](auto &h) { h.extentBytes = 8; })},
+      {"an extent list of no entry", [](auto &s) { s.extentLengths = {0x6000}; },
+       header([](auto &h) { h.extentBytes = 8; })},
   };
   for (const Case &c : cases) {
     SCOPED_TRACE(c.name);
