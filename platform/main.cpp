@@ -348,6 +348,8 @@ const char *ModeName(EFI_CONSOLE_CONTROL_SCREEN_MODE mode) {
       return "text";
     case EfiConsoleControlScreenGraphics:
       return "graphics";
+    case kConsoleNone:
+      return "none";
     default:
       return nullptr;
   }
@@ -424,12 +426,15 @@ void InstallAnswerProtocols(const PlatformConfig &config) {
 // The protocols of the machines that the loader was made for, which the
 // firmware lacks.
 void InstallProtocols(const PlatformConfig &config) {
-  EFI_STATUS status = ConsoleControlInstall(&gConsole, config.consoleMode);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
+  EFI_STATUS status = EFI_SUCCESS;
+  if (config.consoleMode != kConsoleNone) {
+    status = ConsoleControlInstall(&gConsole, config.consoleMode);
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
+    }
+    gConsole.onSetMode = ReportSetMode;
+    gConsole.hiddenText = config.timeText ? TimedWriteText : SerialWriteText;
   }
-  gConsole.onSetMode = ReportSetMode;
-  gConsole.hiddenText = config.timeText ? TimedWriteText : SerialWriteText;
   // Drawing for the loader's boot screen; a firmware without graphics output
   // boots without pictures.
   status = InstallGraphicsProtocols(gST);

@@ -123,6 +123,7 @@ TEST(PlatformNetLoadFile, AnswersAsALoadFile) {
       {"no name", u"\\", 0, EFI_SUCCESS, EFI_INVALID_PARAMETER, 0, 0},
   };
   for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
     FakePxe pxe;
     pxe.Add("nimb.tarnix", kernel, kernel.size());
     pxe.Add("short", std::string(3000, 's'), 5000);
@@ -136,14 +137,14 @@ TEST(PlatformNetLoadFile, AnswersAsALoadFile) {
     UINTN size = row.room;
     const EFI_STATUS status = loader.protocol.LoadFile(&loader.protocol, AsPath(path), FALSE, &size,
                                                        row.room == 0 ? nullptr : buffer.data());
-    EXPECT_EQ(status, row.status) << row.name;
-    EXPECT_EQ(size, row.size) << row.name;
-    EXPECT_EQ(pxe.requests.size(), row.requests) << row.name;
+    EXPECT_EQ(status, row.status);
+    EXPECT_EQ(size, row.size);
+    EXPECT_EQ(pxe.requests.size(), row.requests);
     if (status == EFI_SUCCESS && row.room != 0 && row.file == u"nimb.tarnix") {
-      EXPECT_EQ(std::string(buffer.data(), size), kernel) << row.name;
+      EXPECT_EQ(std::string(buffer.data(), size), kernel);
     }
     for (const std::string &request : pxe.requests) {
-      EXPECT_NE(request.find(" " + std::to_string(kTftpBlockSize)), std::string::npos) << row.name;
+      EXPECT_NE(request.find(" " + std::to_string(kTftpBlockSize)), std::string::npos);
     }
   }
 }
