@@ -10,7 +10,9 @@ import sys
 from pathlib import Path
 
 sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkdisk"))
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "qemuboot"))
 import mkdisk  # noqa: E402
+from qemuboot import NET_MAC  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -337,9 +339,9 @@ class Scenario:
     # ("link-off",) takes the NIC's link down; ("truncate", path, size) cuts a
     # served file.
     actions: tuple = ()
-    # Check the kernel's network identity and DHCP answer against the
-    # packets captured on the wire.
-    capture: bool = False
+    # Check the kernel's network identity: the NIC's MAC and the DHCP
+    # answer that the firmware kept.
+    net_identity: bool = False
     # A resume image on a second partition, and the NVRAM settings for it.
     resume: ResumeImage | None = None
     # The starts of the machine on one variable store: above 1, a reset
@@ -565,9 +567,6 @@ def net_kernel_files(name="nimb_kernel", pad_to=0, package=True):
 PACKAGE_RANGE = re.compile(r"DriversPackage-[0-9a-f]+")
 # A kernel file as large as a real one, which takes a while to come.
 BIG_KERNEL = 16 << 20
-# The NIC's MAC address: not QEMU's default, so that a MAC that reaches the
-# kernel came from the NIC.
-NET_MAC = "52:54:00:a7:3c:e1"
 
 
 def net_file_path(name):
@@ -608,7 +607,7 @@ _TABLE += [
             tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
             ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
         ),
-        capture=True,
+        net_identity=True,
         # The spinner is wiped before the hand-off: the logo stands alone.
         screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
     ),
