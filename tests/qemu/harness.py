@@ -73,13 +73,10 @@ REPORT_CONSOLE_MODE = re.compile(r"platform: console mode (\S+)")
 # --- exit codes -----------------------------------------------------------------------
 
 
-@dataclasses.dataclass(frozen=True)
-class Outcome:
-    """What a run's exit status says."""
-
-    name: str  # the name of the code in its header, or a word of the harness's own
-    status: str | None = None  # the loader's status, when the loader came back
-    memory: str | None = None  # "same" or "changed", when the loader came back
+# What a run's exit status says: the name of the code in its header (or a
+# word of the harness's own) and, when the loader came back, its status and
+# whether the free memory is the "same" or "changed".
+Outcome = collections.namedtuple("Outcome", "name status memory", defaults=(None, None))
 
 
 STATUS_OF_PREFIX = {"Aborted": "EFI_ABORTED", "Success": "EFI_SUCCESS", "Other": "other"}
@@ -301,11 +298,7 @@ def matches(wanted, value):
 
 
 def describe(wanted):
-    if isinstance(wanted, re.Pattern):
-        return f"/{wanted.pattern}/"
-    if callable(wanted):
-        return str(wanted)
-    return repr(wanted)
+    return f"/{wanted.pattern}/" if isinstance(wanted, re.Pattern) else repr(wanted)
 
 
 def check_drivers(report, expect, guest_dir=GUEST_DIR):
@@ -716,10 +709,9 @@ def check_key_trace(log):
 
 
 def check_resume_reads(log, expect):
-    """Problems with the loader's DiskIO reads that the platform logged at
-    the reset on the image's partition, against `expect` (ResumeReads): the
-    header read first, then at most `after_header` reads, each inside the
-    first stage behind a page-aligned header."""
+    """Problems with the loader's reads of the image's partition before the
+    reset against `expect` (ResumeReads): the header first, then at most
+    `after_header` reads inside the first stage behind a page-aligned header."""
     if expect is None:
         return []
     reads = [tuple(int(v, 16) for v in m) for m in READ_LINE.findall(log)]
@@ -745,9 +737,8 @@ Result = collections.namedtuple("Result", "passed seconds outcome problems log w
 
 
 def watch(scenario, workdir, served, png=False):
-    """What a scenario's boot does as serial lines come (qemuboot's
-    on_line): its screenshots (with `png`, also one as screen.png), its
-    actions (Scenario.actions) and its count of starts. Returns it, the
+    """qemuboot's on_line for a scenario: its screenshots (with `png`, one as
+    screen.png too), its actions and its count of starts. Returns it, the
     shots taken, a list of troubles and the actions not done."""
     shots, trouble, pending, starts = [], [], list(scenario.actions), [0]
 

@@ -95,7 +95,7 @@ class AtLeast:
     def __call__(self, value):
         return isinstance(value, int) and value >= self.minimum
 
-    def __str__(self):
+    def __repr__(self):
         return f">= {self.minimum}"
 
 
@@ -270,11 +270,9 @@ PACKAGE_SLICE = GuestFile("nimb_kernel")
 
 @dataclasses.dataclass(frozen=True)
 class KernelCache:
-    """A kernel cache that the harness has kcache write on the volume, after
-    the files and their times, for the machine it boots. kcache gives it the
-    time one second after the newer of the kernel and the extensions
-    directory; `shift` seconds are added to that. Arguments of `args` that
-    start with "volume:" are paths on the volume."""
+    """A kernel cache that kcache writes on the volume for the harness's
+    machine, timed one second after the newer of the kernel and the
+    extensions, plus `shift` seconds. "volume:" arguments are volume paths."""
 
     args: tuple = ()
     kernel: str = "nimb_kernel"
@@ -353,9 +351,8 @@ class Scenario:
 
 def fatal(name, *messages, before=(), make=Scenario, **knobs):
     """A boot that the loader gives up: the platform's lines `before`, then
-    `messages` in order on the serial log, then the loader back with
-    EFI_ABORTED and the firmware's free memory as it was before the start
-    (the Scenario's defaults)."""
+    `messages`, then the loader back with EFI_ABORTED and the firmware's free
+    memory as it was before the start (the Scenario's defaults)."""
     return make(name, expect=(*before, "platform: starting", *messages, "platform: loader returned"), **knobs)
 
 
@@ -367,11 +364,10 @@ HUGE_DRIVER = {
 }
 
 def low_kernel(room):
-    """A kernel object of one page of code whose end leaves `room` pages
-    below the legacy video hole at 640 KiB, which is never memory: what the
-    loader places behind the kernel runs into it. The boot record takes a
-    page, the colour table one, the failure picture five, the device tree
-    one, then come the memory map and the runtime area."""
+    """A kernel object of one page of code that leaves `room` pages below
+    the legacy video hole at 640 KiB, never memory: the boot record (a page),
+    colour table (one), failure picture (five), device tree (one), memory map
+    and runtime area that follow it run into the hole in turn."""
     address = 0xA0000 - (room + 1) * 0x1000
 
     def command(kind, length, words):
