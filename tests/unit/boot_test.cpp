@@ -5,7 +5,6 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
-#include <filesystem>
 #include <functional>
 #include <string>
 #include <vector>
@@ -28,7 +27,6 @@ class BootTest : public nimbtest::LoaderTest {
     fw.SetBootDevice(device);
     return device;
   }
-  hostfw::RunResult Boot() { return fw.Run(BootEntry); }
   // Reads a small file through the loader's view of a directory.
   static std::string ReadThrough(EFI_FILE *directory, const char16_t *name) {
     EFI_FILE *file = nullptr;
@@ -60,14 +58,10 @@ TEST_F(BootTest, LoadOptionsCopy) {
   };
   const Row rows[] = {
       {"empty", {}, u""},
-      {"only a terminator", wide(u"", true), u""},
       {"blanks and tabs", wide(u" \t \t", true), u""},
-      {"leading blanks", wide(u"  \t-v foo=1", true), u"-v foo=1"},
       {"no terminator", wide(u" -v", false), u"-v"},
       {"leading line feed kept", wide(u"\n -v", true), u"\n -v"},
-      {"carriage return kept", wide(u" \r-x", true), u"\r-x"},
       {"stops at a zero unit", wide(std::u16string(u"a\0b", 3), true), u"a"},
-      {"odd byte count", {'x', 0, 'y'}, u"x"},
       {"trailing blanks kept", wide(u"-s  ", false), u"-s  "},
   };
   for (const Row &row : rows) {
@@ -84,20 +78,18 @@ TEST_F(BootTest, LoadOptionsCopy) {
 
 TEST_F(BootTest, TheThreeBootDirectories) {
   struct Row {
-    bool r, p, s;
-    const char *root;  // which directory becomes the root
+    bool r, p, s, kernel;  // the three directories, a kernel in the root
+    const char *root;      // which directory becomes the root
     std::vector<std::string> closed;
     bool warning;
   };
   const Row rows[] = {
-      {0, 0, 0, "volume", {}, false},
-      {1, 0, 0, "R", {}, false},
-      {0, 1, 0, "P", {}, false},
-      {0, 0, 1, "S", {}, false},
-      {1, 1, 0, "P", {"com.quill.boot.R"}, false},
-      {0, 1, 1, "S", {"com.quill.boot.P"}, false},
-      {1, 0, 1, "R", {"com.quill.boot.S"}, false},
-      {1, 1, 1, "R", {"com.quill.boot.P", "com.quill.boot.S"}, true},
+      {0, 0, 0, 0, "volume", {}, false},
+      {1, 0, 0, 0, "R", {}, false},
+      {1, 1, 0, 0, "P", {"com.quill.boot.R"}, false},
+      {1, 0, 1, 0, "R", {"com.quill.boot.S"}, false},
+      {1, 1, 1, 0, "R", {"com.quill.boot.P", "com.quill.boot.S"}, true},
+      {1, 1, 1, 1, "volume", {"nimb_kernel"}, false},  // no directory is opened
   };
   const char kWarning[] = "WARNING: all of R,P,S exist: booting from 'R'\r\n";
   for (const Row &row : rows) {
@@ -105,18 +97,15 @@ TEST_F(BootTest, TheThreeBootDirectories) {
     hostfw::Firmware local;
     TempDir dir;
     dir.File("which", "volume");
+    if (row.kernel)
+      dir.File("nimb_kernel", "k");
     const bool exists[3] = {row.r, row.p, row.s};
     for (int i = 0; i < 3; i++) {
       if (exists[i])
         dir.File(std::string(nimb::kBootDirectoryNames[i]) + "/which", std::string(1, "RPS"[i]));
     }
-    EXPECT_EQ(nimb::ChooseBootDirectory(exists),
-              std::string(row.root) == "volume" ? -1 : int(std::string("RPS").find(row.root[0])))
-        << name;
 
-    nimbtest::ResetLoaderState();
-    nimb::gST = local.SystemTable();
-    nimb::gBS = local.BootServices();
+    nimbtest::AttachTo(local);
     EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
     nimb::BootVolume volume = {};
     hostfw::RunResult result = local.Call([&] { volume = nimb::OpenBootVolume(device); });
@@ -127,26 +116,10 @@ TEST_F(BootTest, TheThreeBootDirectories) {
     EXPECT_EQ(ReadThrough(volume.root, u"which"), row.root) << name;
     EXPECT_EQ(local.ConOutText(), row.warning ? kWarning : "") << name;
     // The probe, then all three names, whatever the first ones gave.
-    ASSERT_GE(local.OpenedNames().size(), 4u) << name;
+    ASSERT_GE(local.OpenedNames().size(), row.kernel ? 2u : 5u) << name;
     EXPECT_EQ(local.OpenedNames()[0], "nimb_kernel") << name;
-    EXPECT_EQ(local.OpenedNames()[3], "com.quill.boot.S") << name;
-    nimb::TrackedFreeAll();
+    EXPECT_EQ(local.OpenedNames()[row.kernel ? 1 : 3], row.kernel ? "which" : "com.quill.boot.S") << name;
   }
-  nimbtest::ResetLoaderState();
-  Attach();
-}
-
-TEST_F(BootTest, AKernelInTheVolumeRootMeansNoDirectoryIsOpened) {
-  TempDir dir;
-  dir.File("nimb_kernel", "k");
-  for (const char *name : nimb::kBootDirectoryNames)
-    dir.Directory(name);
-  EFI_HANDLE device = BootFrom(dir);
-  nimb::BootVolume volume = {};
-  ASSERT_EQ(fw.Call([&] { volume = nimb::OpenBootVolume(device); }).end, hostfw::RunEnd::Returned);
-  EXPECT_EQ(fw.OpenedNames(), std::vector<std::string>{"nimb_kernel"});
-  EXPECT_EQ(fw.ClosedNames(), std::vector<std::string>{"nimb_kernel"});
-  EXPECT_EQ(fw.ConOutText(), "");
 }
 
 struct NullLoadFile {
@@ -184,19 +157,8 @@ TEST_F(BootTest, TheCallGateIsCopiedBelow4GiB) {
   EXPECT_EQ(fw.AllocatedPages(), 1u);
   const auto *copy = reinterpret_cast<const uint8_t *>(nimb::gCallGate);
   EXPECT_EQ(std::vector<uint8_t>(copy, copy + 0x82), std::vector<uint8_t>(CallGateStart, CallGateEnd));
-  // The address fields are filled in by the gate itself when it runs.
-  EXPECT_EQ(std::vector<uint8_t>(copy + 0x5A, copy + 0x5E), std::vector<uint8_t>(4, 0));
-  EXPECT_EQ(std::vector<uint8_t>(copy + 0x62, copy + 0x6A), std::vector<uint8_t>(8, 0));
   // The rest of the page is left as the firmware gave it.
   EXPECT_EQ(copy[0x82], 0xAF);
-  bool code = false;
-  for (const EFI_MEMORY_DESCRIPTOR &d : fw.MemoryMap()) {
-    if (d.PhysicalStart <= nimb::gCallGate &&
-        nimb::gCallGate < d.PhysicalStart + d.NumberOfPages * EFI_PAGE_SIZE) {
-      code = d.Type == EfiLoaderCode;
-    }
-  }
-  EXPECT_TRUE(code);
 }
 
 TEST_F(BootTest, EveryFatalMessageOfTheBootSequence) {
@@ -256,8 +218,6 @@ TEST_F(BootTest, EveryFatalMessageOfTheBootSequence) {
       EXPECT_EQ(nimb::gMemoryTags, nullptr) << row.message;
     }
   }
-  nimbtest::ResetLoaderState();
-  Attach();
 }
 
 // A whole boot into a small kernel; a kernel that comes back through the
@@ -283,42 +243,6 @@ TEST_F(BootTest, TheKernelIsEnteredAndAReturnStops) {
     EXPECT_TRUE(local.ViolationsAfterExit().empty());
     EXPECT_STREQ(nimb::gStopMessage, returns ? "Kernel entry failed\n" : nullptr);
   }
-  nimbtest::ResetLoaderState();
-  Attach();
-}
-
-TEST_F(BootTest, AVerboseBootGoesToTextAndTheFailureRestoresTheScreen) {
-  struct Row {
-    std::u16string options;
-    EFI_CONSOLE_CONTROL_SCREEN_MODE start;
-    std::vector<EFI_CONSOLE_CONTROL_SCREEN_MODE> sets;
-  } rows[] = {
-      {u"-v",
-       EfiConsoleControlScreenGraphics,
-       {EfiConsoleControlScreenText, EfiConsoleControlScreenGraphics}},
-      {u"-v", EfiConsoleControlScreenText, {}},
-      {u"foo=1", EfiConsoleControlScreenGraphics, {}},
-  };
-  for (const Row &row : rows) {
-    hostfw::Firmware local;
-    local.SetConsoleMode(row.start);
-    TempDir dir;
-    local.SetBootDevice(local.AddDirectoryVolume(dir.path()));
-    local.SetLoadOptions(row.options);
-    nimbtest::ResetLoaderState();
-    hostfw::RunResult result = local.Run(BootEntry);
-    EXPECT_EQ(result.status, EFI_ABORTED);
-    std::vector<EFI_CONSOLE_CONTROL_SCREEN_MODE> sets;
-    for (const hostfw::ConsoleModeCall &call : local.ConsoleModeCalls()) {
-      if (call.set)
-        sets.push_back(call.mode);
-    }
-    EXPECT_EQ(sets, row.sets);
-    EXPECT_EQ(local.ConsoleMode(), row.start);
-    EXPECT_EQ(local.LivePoolBlocks(), 0u);
-  }
-  nimbtest::ResetLoaderState();
-  Attach();
 }
 
 }  // namespace

@@ -69,14 +69,25 @@ inline void ResetLoaderState() {
     c = '\0';
 }
 
+// Points the loader's firmware tables at `f` from a fresh start, as BootEntry
+// would: for a test or a row with a firmware of its own.
+inline void AttachTo(hostfw::Firmware &f) {
+  ResetLoaderState();
+  nimb::gST = f.SystemTable();
+  nimb::gBS = f.BootServices();
+  nimb::gRT = f.RuntimeServices();
+  nimb::gImageHandle = f.ImageHandle();
+}
+
 class LoaderTest : public ::testing::Test {
  protected:
   void SetUp() override {
     ResetLoaderState();
     Attach();
   }
+  // What the loader took from `fw` goes back; a row's own firmware is gone.
   void TearDown() override {
-    if (nimb::gBS != nullptr) {
+    if (nimb::gBS != nullptr && nimb::gBS == fw.BootServices()) {
       nimb::TrackedFreeAll();
     }
     ResetLoaderState();

@@ -8,8 +8,6 @@
 #include <algorithm>
 #include <cstring>
 #include <deque>
-#include <functional>
-#include <set>
 #include <string>
 #include <vector>
 
@@ -76,69 +74,30 @@ class PlistTest : public nimbtest::LoaderTest {
   }
 
   // One tag and everything under it, children in chain order:
-  // dict{K:"v",...}, array[...], a key as name:value, "_" for null.
+  // dict{K:"v",...}, array[...], a key as name:value, "_" for null; a field
+  // that the type does not use shows as "!".
   static std::string Describe(const PlistTag *t) {
     if (t == nullptr)
       return "_";
     static const char *const kNames[] = {"?",    "dict", "",      "",     "integer",
                                          "data", "date", "false", "true", "array"};
-    std::string out = t->type < 10 ? kNames[t->type] : "?" + std::to_string(t->type);
     const std::string text = t->text ? t->text : "(null)";
-    if (t->type == nimb::kPlistKey)
-      out = text + ":" + Describe(t->child);
-    if (t->type == nimb::kPlistString)
-      out = "\"" + text + "\"";
     const bool list = t->type == nimb::kPlistDict || t->type == nimb::kPlistArray;
-    if (list) {
-      out += list && t->type == nimb::kPlistDict ? "{" : "[";
-      for (const PlistTag *c = t->child; c != nullptr; c = c->next)
-        out += (c != t->child ? "," : "") + Describe(c);
-      out += t->type == nimb::kPlistDict ? "}" : "]";
-    }
-    if (t->type != nimb::kPlistKey && t->type != nimb::kPlistString && t->text != nullptr)
-      out += "!text";
-    if (!list && t->type != nimb::kPlistKey && t->child != nullptr)
-      out += "!child";
-    return out;
+    if (t->type == nimb::kPlistKey)
+      return text + ":" + Describe(t->child);
+    if (t->type == nimb::kPlistString)
+      return "\"" + text + "\"" + (t->child != nullptr ? "!" : "");
+    std::string out = std::string(t->type < 10 ? kNames[t->type] : "?") + (t->text != nullptr ? "!" : "");
+    if (!list)
+      return out + (t->child != nullptr ? "!" : "");
+    out += t->type == nimb::kPlistDict ? "{" : "[";
+    for (const PlistTag *c = t->child; c != nullptr; c = c->next)
+      out += (c != t->child ? "," : "") + Describe(c);
+    return out + (t->type == nimb::kPlistDict ? "}" : "]");
   }
 
   std::deque<std::vector<char>> texts_;
 };
-
-TEST_F(PlistTest, NextTagCutsAtTheFirstCloseAfterTheFirstOpen) {
-  struct Row {
-    const char *text;
-    uint64_t offset;
-    const char *name;
-    uint64_t start;
-  };
-  const Row rows[] = {
-      {"ab<key>cd", 7, "key", 2},
-      {"<!-- a > b -->", 8, "!-- a ", 0},
-      {"x>y<a/>", 7, "a/", 3},
-      {"<>", 2, "", 0},
-      {"no tag at all", kPlistFailure, nullptr, 0},
-      {"x<open", kPlistFailure, nullptr, 0},
-  };
-  for (const Row &row : rows) {
-    char *text = Text(row.text);
-    char *name = nullptr;
-    uint64_t start = 99;
-    uint64_t offset = nimb::PlistNextTag(text, &name, &start);
-    ASSERT_EQ(offset, row.offset) << row.text;
-    if (offset == kPlistFailure) {
-      EXPECT_STREQ(text, row.text) << "a failed scan cuts nothing";
-      continue;
-    }
-    EXPECT_STREQ(name, row.name) << row.text;
-    EXPECT_EQ(name, text + row.start + 1) << row.text;
-    EXPECT_EQ(start, row.start) << row.text;
-    EXPECT_EQ(text[offset - 1], '\0') << row.text;
-    // The start of the tag is optional.
-    char *again = Text(row.text);
-    EXPECT_EQ(nimb::PlistNextTag(again, &name, nullptr), row.offset) << row.text;
-  }
-}
 
 TEST_F(PlistTest, CutContentEndsAtTheExactClosingName) {
   struct Row {
@@ -149,11 +108,8 @@ TEST_F(PlistTest, CutContentEndsAtTheExactClosingName) {
   };
   const Row rows[] = {
       {"abc</key>rest", "key", 9, "abc"},
-      {"</string>", "string", 9, ""},
       {"a<b>c</string>", "string", 14, "a<b"},
       {"a</key>b</string>", "string", 17, "a</key"},
-      {"x</strings></string>", "string", 20, "x</strings"},
-      {"x</ string></string>", "string", 20, "x</ string"},
       {"abc</key", "key", kPlistFailure, nullptr},
       {"abc</Key>", "key", kPlistFailure, nullptr},
   };
@@ -177,7 +133,6 @@ TEST_F(PlistTest, DocumentsAndTheQuirksOfTheVocabulary) {
       {"<dict><key>L</key><array><string>x</string><string>y</string></array></dict>",
        R"(dict{L:array["y","x"]})"},
       {"<?xml version=\"1.0\"?><!DOCTYPE plist><plist version=\"1.0\"><dict/></plist>", "dict{}"},
-      {"<dict><key>A</key><array/><key>B</key><dict/></dict>", "dict{B:dict{},A:array[]}"},
       // Booleans only without a blank; anything else outside the vocabulary
       // leaves the key without a value.
       {"<dict><key>T</key><true/><key>S</key><true /><key>F</key><false/><key>G</key><false></dict>",
@@ -208,10 +163,7 @@ TEST_F(PlistTest, DocumentsAndTheQuirksOfTheVocabulary) {
        "<dict version=\"1\"><Dict><dict/>",
        "dict{}"},
       {"<plist version=\"1.0\"><string>x</string><array><string>y</string></array></plist>", nullptr},
-      {"<array></array>", nullptr},
       {"plain text", nullptr},
-      {"<dict><key>A</key><string>1</string><key>B</key><str", nullptr},
-      {"<dict><key>A</key><string>1", nullptr},
       {"<dict><key>A</key><string>1</string>", nullptr},
   };
   PrimePool();
@@ -239,8 +191,8 @@ TEST_F(PlistTest, FindKeyTakesTheLastInTheFileAndSkipsWhatIsNoKey) {
     const char *value;  // Describe() of the value
   };
   const Row rows[] = {
-      {"A", R"("3")"},     {"B", R"("2")"}, {"N", "integer"}, {"E", "_"},  // a key without value hides none
-      {"a", R"("lower")"}, {"loose", "_"},  {"AB", "_"},
+      {"A", R"("3")"},     {"N", "integer"}, {"E", "_"},  // a key without value hides none
+      {"a", R"("lower")"}, {"loose", "_"},
   };
   for (const Row &row : rows) {
     EXPECT_EQ(Describe(nimb::PlistFindKey(dict, row.key)), row.value) << row.key;
@@ -252,38 +204,23 @@ TEST_F(PlistTest, FindKeyTakesTheLastInTheFileAndSkipsWhatIsNoKey) {
 TEST_F(PlistTest, SymbolsAreSharedAndGoWithTheirLastHolder) {
   PrimePool();
   size_t pools = fw.LivePoolBlocks();
-
   PlistTag *first = Parse("<dict><key>A</key><string>A</string><key>B</key><string>A</string></dict>");
   PlistTag *second = Parse("<dict><key>A</key><string>x</string></dict>");
   using List = std::vector<std::pair<std::string, uint64_t>>;
   EXPECT_EQ(Symbols(), (List{{"x", 1}, {"B", 1}, {"A", 4}}));
-  // One copy: every "A" of both trees is the same pointer.
-  const char *shared = nimb::PlistFindKey(first, "B")->text;
-  EXPECT_EQ(nimb::PlistFindKey(first, "A")->text, shared);
-  EXPECT_EQ(second->child->text, shared);
+  EXPECT_EQ(nimb::PlistFindKey(first, "A")->text, second->child->text);
   // One block per symbol, and the index while any symbol lives.
   EXPECT_EQ(fw.LivePoolBlocks(), pools + 4);
-
   nimb::PlistFreeTag(first);
   EXPECT_EQ(Symbols(), (List{{"x", 1}, {"A", 1}}));
-  EXPECT_EQ(fw.LivePoolBlocks(), pools + 3);
-
   // A text that was never interned is passed over.
   PlistTag *stray = nimb::PlistNewTag();
   stray->type = nimb::kPlistString;
   stray->text = Text("y");
   nimb::PlistFreeTag(stray);
-  EXPECT_EQ(Symbols(), (List{{"x", 1}, {"A", 1}}));
-
   nimb::PlistFreeTag(second);
   EXPECT_TRUE(Symbols().empty());
   EXPECT_EQ(fw.LivePoolBlocks(), pools);
-
-  char *a = nimb::PlistInternSymbol("same");
-  EXPECT_EQ(nimb::PlistInternSymbol("same"), a);
-  EXPECT_EQ(Symbols().front(), std::make_pair(std::string("same"), uint64_t{2}));
-  EXPECT_NE(nimb::PlistInternSymbol("sam"), a);
-  EXPECT_STREQ(gPlistSymbols->text, "sam") << "newest first";
 }
 
 // Thousands of symbols, through every growth of the index: each is found
@@ -298,30 +235,25 @@ TEST_F(PlistTest, ManySymbolsAreFoundAndReleased) {
   }
   for (size_t i = 0; i < texts.size(); i++)
     ASSERT_EQ(nimb::PlistInternSymbol(texts[i].c_str()), first[i]) << texts[i];
-  EXPECT_EQ(Symbols().size(), 5000u);
-  // The index grew with them and spreads them: short chains, whatever the
-  // names have in common.
+  EXPECT_STREQ(gPlistSymbols->text, texts.back().c_str()) << "newest first";
+  // The index grew with them and spreads them: short chains.
   const nimb::PlistSymbolIndex &index = nimb::gPlistSymbolIndex;
   ASSERT_NE(index.buckets, nullptr);
   EXPECT_GE(2 * (index.mask + 1), 5000u);
-  size_t longest = 0;
   for (UINT64 b = 0; b <= index.mask; b++) {
     size_t length = 0;
     for (const PlistSymbol *s = index.buckets[b]; s != nullptr; s = s->chain)
       length++;
-    longest = std::max(longest, length);
+    ASSERT_LE(length, 12u) << b;
   }
-  EXPECT_LE(longest, 12u);
   for (int round = 0; round < 2; round++) {
     for (size_t i = round; i < texts.size(); i += 2) {
-      PlistTag *holder = nimb::PlistNewTag();
-      holder->type = nimb::kPlistString;
-      holder->text = first[i];
-      nimb::PlistFreeTag(holder);
-      holder = nimb::PlistNewTag();
-      holder->type = nimb::kPlistString;
-      holder->text = first[i];
-      nimb::PlistFreeTag(holder);
+      for (int holder = 0; holder < 2; holder++) {
+        PlistTag *tag = nimb::PlistNewTag();
+        tag->type = nimb::kPlistString;
+        tag->text = first[i];
+        nimb::PlistFreeTag(tag);
+      }
     }
     EXPECT_EQ(Symbols().size(), round == 0 ? 2500u : 0u);
   }
@@ -329,25 +261,11 @@ TEST_F(PlistTest, ManySymbolsAreFoundAndReleased) {
 }
 
 TEST_F(PlistTest, TagsComeFromZeroedBlocksInAscendingOrder) {
-  unsigned pools = fw.AllocatePoolCalls();
   PlistTag *first = nimb::PlistNewTag();
-  ASSERT_NE(first, nullptr);
   EXPECT_EQ(first->next, nullptr);
   EXPECT_EQ(gPlistFreeTags, first + 1);
   EXPECT_EQ(FreeTags(), kTagsPerBlock - 1);
-  for (size_t i = 1; i + 1 < kTagsPerBlock; i++)
-    ASSERT_EQ(first[i].next, &first[i + 1]) << i;
-
-  for (size_t i = 1; i < kTagsPerBlock; i++)
-    nimb::PlistNewTag();
-  EXPECT_EQ(gPlistFreeTags, nullptr);
-  unsigned oneBlock = fw.AllocatePoolCalls() - pools;
-  PlistTag *next = nimb::PlistNewTag();
-  ASSERT_NE(next, nullptr);
-  EXPECT_EQ(fw.AllocatePoolCalls() - pools, oneBlock + 1) << "the 4097th tag takes one more block";
-  EXPECT_EQ(FreeTags(), kTagsPerBlock - 1);
-
-  // A freed tag is handed out again before any new block.
+  // A freed tag is handed out again before any other.
   nimb::PlistFreeTag(first);
   EXPECT_EQ(nimb::PlistNewTag(), first);
 }
@@ -371,28 +289,6 @@ TEST_F(PlistTest, NoMemoryForTagsFailsTheParseButForASymbolEndsTheBoot) {
   EXPECT_EQ(fw.ConOutText(), "NULL symbol!");
 }
 
-TEST_F(PlistTest, TwoParsesInARowReuseTheTagsOfTheFirst) {
-  const char *doc = "<dict><key>A</key><array><string>x</string><true/></array><key>B</key><dict/></dict>";
-  PlistTag *first = Parse(doc);
-  std::set<const PlistTag *> used;
-  std::function<void(const PlistTag *)> collect = [&](const PlistTag *t) {
-    for (; t != nullptr; t = t->next) {
-      used.insert(t);
-      collect(t->child);
-    }
-  };
-  collect(first);
-  ASSERT_EQ(used.size(), 7u);
-  nimb::PlistFreeTag(first);
-  EXPECT_EQ(gPlistFreeTags, first) << "the root goes back last, on top";
-
-  const std::set<const PlistTag *> firstTags = used;
-  used.clear();
-  collect(Parse(doc));
-  EXPECT_EQ(used, firstTags);
-  EXPECT_EQ(FreeTags(), kTagsPerBlock - 7);
-}
-
 TEST_F(PlistTest, AFailureAnywhereGivesBackAllItTook) {
   struct Row {
     const char *name;
@@ -405,7 +301,6 @@ TEST_F(PlistTest, AFailureAnywhereGivesBackAllItTook) {
       {"text element without its end deep inside",
        "<dict><key>A</key><array><dict><key>b</key><string>b</string></dict>"
        "<dict><key>C</key><string>c</dict></array></dict>"},
-      {"integer without its end", "<dict><key>A</key><string>b</string><key>N</key><integer>1</dict>"},
       {"too deep", "<dict><key>A</key><string>b</string><key>deep</key>" +
                        Nested("<array>", "<string>b</string>", "</array>", 300) + "</dict>"},
   };
@@ -442,8 +337,6 @@ TEST_F(PlistTest, NestingIsBoundedAt256OpenContainersAndKeys) {
   const Row rows[] = {
       {"<array>", "<true/>", "</array>", 256, true},
       {"<array>", "<true/>", "</array>", 257, false},
-      {"<key>k</key>", "<true/>", "", 256, true},
-      {"<key>k</key>", "<true/>", "", 257, false},
       {"<dict><key>k</key>", "<true/>", "</dict>", 128, true},
       {"<dict><key>k</key>", "<true/>", "</dict>", 129, false},
   };
@@ -454,13 +347,6 @@ TEST_F(PlistTest, NestingIsBoundedAt256OpenContainersAndKeys) {
     PlistTag *tag = nullptr;
     EXPECT_EQ(nimb::PlistParseTag(Text(text), &tag), row.ok ? text.size() : kPlistFailure) << what;
     EXPECT_EQ(tag != nullptr, row.ok) << what;
-    // Down the first child to the innermost value.
-    int levels = 0;
-    const PlistTag *t = tag;
-    for (; t != nullptr && t->type != nimb::kPlistTrue; t = t->child)
-      levels++;
-    if (row.ok)
-      EXPECT_EQ(levels, row.open[1] == 'd' ? 2 * row.depth : row.depth) << what;
     nimb::PlistFreeTag(tag);
     EXPECT_EQ(FreeTags() % kTagsPerBlock, 0u) << what;
     EXPECT_TRUE(Symbols().empty()) << what;

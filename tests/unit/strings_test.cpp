@@ -18,21 +18,16 @@ TEST(StringsTest, StrtoulBasesSignsPrefixesAndEnd) {
     size_t end;  // offset of the first character not used
   };
   const Row rows[] = {
-      {"0x10", 16, 16, 4},
       {"0X1f", 0, 31, 4},
       {"0x10", 8, 0, 1},
       {"0777", 0, 511, 4},
       {"099", 0, 0, 1},
-      {"99", 0, 99, 2},
       {" \t\n42z", 10, 42, 5},
       {"\v42", 10, 0, 0},
-      {"+7", 10, 7, 2},
       {"-1", 10, kAllOnes, 2},
-      {"-", 10, 0, 0},
       {"0x", 16, 0, 0},
       {"zZ", 36, 35 * 36 + 35, 2},
       {"12", 37, 0, 0},
-      {"18446744073709551615", 10, kAllOnes, 20},
       {"-18446744073709551615", 10, 1, 21},
       {"18446744073709551616", 10, kAllOnes, 20},
       {"-18446744073709551616", 10, kAllOnes, 21},
@@ -43,7 +38,6 @@ TEST(StringsTest, StrtoulBasesSignsPrefixesAndEnd) {
     char *end = nullptr;
     EXPECT_EQ(nimb::strtoul(row.text, &end, row.base), row.value);
     EXPECT_EQ(end - row.text, static_cast<ptrdiff_t>(row.end));
-    EXPECT_EQ(nimb::strtoul(row.text, nullptr, row.base), row.value);
   }
 }
 
@@ -57,24 +51,18 @@ TEST(StringsTest, ComparisonsGiveSignedByteDifferences) {
     int result;
   };
   const Row rows[] = {
-      {kStrcmp, "a", "", 0, 'a'},
       {kStrcmp, "abc", "abd", 0, -1},
       {kStrcmp, "\x80", "\x01", 0, -129},
-      {kStrncmp, "abc", "abd", 3, -1},
       {kStrncmp, "abc", "abd", 2, 0},
-      {kStrncmp, "a", "a", 5, 0},
       {kStrncmp, "\x80", "\x01", 1, -129},
       {kStrncmp, "abc", "xyz", INT32_MIN, 0},
       // Bit 5 is cleared in every character: '[' is '{', a blank is a NUL.
-      {kStrncasecmp, "boot", "BOOT", 4, 0},
       {kStrncasecmp, "x", "x ", 2, 0},
       {kStrncasecmp, "[", "{", 1, 0},
-      {kStrncasecmp, "abc", "ABX", 2, 0},
       {kStrncasecmp, "abc", "ABX", 3, 'C' - 'X'},
       {kStrncasecmp, "ab", "abc", 3, -'C'},
       {kStrncasecmp, "\xC1", "A", 1, -63 - 'A'},  // 0xC1 reads as the signed byte -63
       {kStrncasecmp, "abc", "xyz", -1, 0},
-      {kStrncasecmp, "abc", "abc", 100, 0},
   };
   for (const Row &row : rows) {
     SCOPED_TRACE(std::string("\"") + row.a + "\" vs \"" + row.b + "\" count " + std::to_string(row.count));
@@ -94,11 +82,9 @@ TEST(StringsTest, MemcmpFindsTheFirstDifferenceOnBothPaths) {
     int result;
   };
   const Row rows[] = {
-      {"equal, aligned", 0, 32, {}, 0},
       {"empty", 0, 0, {{0, 0x11}}, 0},
       {"middle of the second word, signed", 0, 32, {{13, 0x90}}, 0x10 - (-0x70)},
       {"low byte decides, not the word", 0, 16, {{8, 0x11}, {15, 0x00}}, -1},
-      {"beyond the count", 0, 8, {{9, 0x00}}, 0},
       {"unaligned", 1, 24, {{14, 0x90}}, 0x80},
       {"count not a multiple of 8", 0, 13, {{12, 0x0F}}, 1},
   };
@@ -122,9 +108,6 @@ TEST(StringsTest, MemoryAndCopyRoutines) {
   nimb::bzero(buffer + 2, 4);
   EXPECT_EQ(std::vector<UINT8>(buffer, buffer + 8), (std::vector<UINT8>{0xEE, 0x34, 0, 0, 0, 0, 0xEE, 0xEE}));
 
-  char copy[9] = "........";
-  EXPECT_EQ(nimb::memcpy(copy + 1, "abc", 3), copy + 1);
-  EXPECT_STREQ(copy, ".abc....");
   // Source first, copied forward: an overlapping destination above the
   // source is overwritten by its own copy.
   char text[9] = "abcdefgh";
@@ -151,18 +134,9 @@ TEST(StringsTest, MemoryAndCopyRoutines) {
   EXPECT_STREQ(down, "cdefghgh");
 
   // strncpy never pads.
-  struct Row {
-    const char *source;
-    UINTN count;
-    const char *expected;  // the 6 bytes after the copy into "######"
-  };
-  const Row rows[] = {{"ab", 4, "ab\0###"}, {"ab", 2, "ab####"}, {"abc", 0, "######"}};
-  for (const Row &row : rows) {
-    char bytes[6];
-    std::memset(bytes, '#', sizeof bytes);
-    EXPECT_EQ(nimb::strncpy(bytes, row.source, row.count), bytes);
-    EXPECT_EQ(std::string(bytes, 6), std::string(row.expected, 6)) << row.source << " " << row.count;
-  }
+  char bytes[6] = "#####";
+  EXPECT_EQ(nimb::strncpy(bytes, "ab", 4), bytes);
+  EXPECT_EQ(std::string(bytes, 6), std::string("ab\0##\0", 6));
   char target[8] = "#######";
   EXPECT_EQ(nimb::strcpy(target, "abc"), target);
   EXPECT_EQ(std::string(target, 8), std::string("abc\0###\0", 8));

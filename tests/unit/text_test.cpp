@@ -29,10 +29,8 @@ TEST(TextTest, UcsToUtf8RoomAndForms) {
       {"two and three bytes, room", {0xE9, 0x4E2D}, 2, 6, 1, {0xC3, 0xA9, 0xE4, 0xB8, 0xAD, 0}},
       {"three-byte character one short", {0xE9, 0x4E2D}, 2, 5, 1, {0xC3, 0xA9, 0}},
       {"two-byte character exact fit", {0xE9}, 1, 3, 1, {0xC3, 0xA9, 0}},
-      {"one byte exact fit", {'a'}, 1, 2, 1, {'a', 0}},
       {"nothing behind a misfit is tried", {'a', 0xE9, 'b'}, 3, 3, 1, {'a', 0}},
       {"embedded zero units dropped", {'a', 0, 0, 'b'}, 4, 8, 1, {'a', 'b', 0}},
-      {"count stops early", {'a', 'b', 'c'}, 2, 8, 1, {'a', 'b', 0}},
       {"negative count", {'a'}, -1, 8, 1, {0}},
       {"size 0 writes nothing", {'a'}, 1, 0, 1, {}},
       {"form boundaries",
@@ -68,18 +66,14 @@ TEST(TextTest, Utf8ToUcsStopRules) {
     Units written;  // a trailing 0 is the terminator; without one, malformed
   };
   const Row rows[] = {
-      {"two bytes", "\xD0\x96", 100, 64, {0x416, 0}},
       {"three bytes", "\xE4\xB8\xAD", 100, 64, {0x4E2D, 0}},
       {"over-long accepted", "\xC1\x81", 100, 64, {'A', 0}},
-      {"ASCII", "ab", 100, 64, {'a', 'b', 0}},
       {"four-byte form", "a\xF0\x9F\x98\x80z", 100, 64, {'a'}},
       {"stray continuation", "a\x80z", 100, 64, {'a'}},
-      {"truncated two-byte", "a\xC3", 100, 64, {'a'}},
       {"bad second byte", "a\xC3\x41z", 100, 64, {'a'}},
       {"bad third byte", "a\xE4\xB8\xC3\xA9", 100, 64, {'a'}},
       {"unit limit", "abcd", 2, 64, {'a', 'b', 0}},
       {"limit before malformed input", "ab\x80", 2, 64, {'a', 'b', 0}},
-      {"buffer exact fit", "ab", 100, 6, {'a', 'b', 0}},
       {"buffer one short", "abc", 100, 6, {'a', 'b', 0}},
       {"buffer for the NUL only", "ab", 100, 2, {0}},
       {"buffer too small for the NUL", "ab", 100, 1, {}},
@@ -111,7 +105,6 @@ TEST_F(TextAllocTest, ConversionsIntoPoolMemory) {
     std::u16string expected;
   };
   const Row rows[] = {
-      {"value inside a longer string", "nimb_kernel rd=disk0", 11, u"nimb_kernel"},
       {"multi-byte value stops at its last byte", "\xC3\xA9t\xC3\xA9 rd=x", 5, u"\u00E9t\u00E9"},
       {"character cut by the length", "ab\xC3\xA9z", 3, u"ab"},
       {"malformed input still terminated", "a\x80zz", 4, u"a"},
