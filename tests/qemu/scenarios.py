@@ -10,7 +10,9 @@ import sys
 from pathlib import Path
 
 sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkdisk"))
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "qemuboot"))
 import mkdisk  # noqa: E402
+from qemuboot import NET_MAC  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -93,7 +95,7 @@ class AtLeast:
     def __call__(self, value):
         return isinstance(value, int) and value >= self.minimum
 
-    def __str__(self):
+    def __repr__(self):
         return f">= {self.minimum}"
 
 
@@ -268,11 +270,9 @@ PACKAGE_SLICE = GuestFile("nimb_kernel")
 
 @dataclasses.dataclass(frozen=True)
 class KernelCache:
-    """A kernel cache that the harness has kcache write on the volume, after
-    the files and their times, for the machine it boots. kcache gives it the
-    time one second after the newer of the kernel and the extensions
-    directory; `shift` seconds are added to that. Arguments of `args` that
-    start with "volume:" are paths on the volume."""
+    """A kernel cache that kcache writes on the volume for the harness's
+    machine, timed one second after the newer of the kernel and the
+    extensions, plus `shift` seconds. "volume:" arguments are volume paths."""
 
     args: tuple = ()
     kernel: str = "nimb_kernel"
@@ -337,9 +337,9 @@ class Scenario:
     # ("link-off",) takes the NIC's link down; ("truncate", path, size) cuts a
     # served file.
     actions: tuple = ()
-    # Check the kernel's network identity and DHCP answer against the
-    # packets captured on the wire.
-    capture: bool = False
+    # Check the kernel's network identity: the NIC's MAC and the DHCP
+    # answer that the firmware kept.
+    net_identity: bool = False
     # A resume image on a second partition, and the NVRAM settings for it.
     resume: ResumeImage | None = None
     # The starts of the machine on one variable store: above 1, a reset
@@ -351,9 +351,8 @@ class Scenario:
 
 def fatal(name, *messages, before=(), make=Scenario, **knobs):
     """A boot that the loader gives up: the platform's lines `before`, then
-    `messages` in order on the serial log, then the loader back with
-    EFI_ABORTED and the firmware's free memory as it was before the start
-    (the Scenario's defaults)."""
+    `messages`, then the loader back with EFI_ABORTED and the firmware's free
+    memory as it was before the start (the Scenario's defaults)."""
     return make(name, expect=(*before, "platform: starting", *messages, "platform: loader returned"), **knobs)
 
 
@@ -365,11 +364,10 @@ HUGE_DRIVER = {
 }
 
 def low_kernel(room):
-    """A kernel object of one page of code whose end leaves `room` pages
-    below the legacy video hole at 640 KiB, which is never memory: what the
-    loader places behind the kernel runs into it. The boot record takes a
-    page, the colour table one, the failure picture five, the device tree
-    one, then come the memory map and the runtime area."""
+    """A kernel object of one page of code that leaves `room` pages below
+    the legacy video hole at 640 KiB, never memory: the boot record (a page),
+    colour table (one), failure picture (five), device tree (one), memory map
+    and runtime area that follow it run into the hole in turn."""
     address = 0xA0000 - (room + 1) * 0x1000
 
     def command(kind, length, words):
@@ -565,9 +563,6 @@ def net_kernel_files(name="nimb_kernel", pad_to=0, package=True):
 PACKAGE_RANGE = re.compile(r"DriversPackage-[0-9a-f]+")
 # A kernel file as large as a real one, which takes a while to come.
 BIG_KERNEL = 16 << 20
-# The NIC's MAC address: not QEMU's default, so that a MAC that reaches the
-# kernel came from the NIC.
-NET_MAC = "52:54:00:a7:3c:e1"
 
 
 def net_file_path(name):
@@ -608,7 +603,7 @@ _TABLE += [
             tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
             ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
         ),
-        capture=True,
+        net_identity=True,
         # The spinner is wiped before the hand-off: the logo stands alone.
         screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
     ),
