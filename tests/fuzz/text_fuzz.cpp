@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "boot/boot.h"
+#include "fuzz_firmware.h"
 #include "hostfw/hostfw.h"
 #include "memory/tracking.h"
 #include "support/sprint.h"
@@ -19,6 +20,8 @@
 #include "support/text.h"
 
 namespace {
+
+using nimbfuzz::Check;
 
 // Exactly `size` bytes on the heap, however many that is.
 struct ExactBuffer {
@@ -47,8 +50,7 @@ std::vector<UINT16> Decode(const uint8_t *text, UINT64 maxUnits) {
   std::vector<UINT16> units(strlen(reinterpret_cast<const char *>(text)) + 1);
   UINT64 count = 0;
   nimb::Utf8ToUcs(text, maxUnits, units.data(), &count, 2 * units.size());
-  if (count > units.size())
-    abort();
+  Check(count <= units.size());
   units.resize(count);
   return units;
 }
@@ -58,12 +60,9 @@ void CheckUtf8ToUcs(const uint8_t *data, size_t size, UINT64 maxUnits, size_t ou
   ExactBuffer out(outBytes);
   UINT64 count = ~0ULL;
   nimb::Utf8ToUcs(text.bytes.get(), maxUnits, out.As<UINT16>(), &count, outBytes);
-  if (2 * count > outBytes)
-    abort();
-  if (count > 0 && count - 1 > maxUnits)
-    abort();
-  if (outBytes >= 2 && maxUnits == 0 && count != 1)
-    abort();
+  Check(2 * count <= outBytes);
+  Check(count == 0 || count - 1 <= maxUnits);
+  Check(outBytes < 2 || maxUnits != 0 || count == 1);
 
   // A prefix of what a buffer large enough gives, and at most a terminator
   // behind it.
@@ -71,8 +70,7 @@ void CheckUtf8ToUcs(const uint8_t *data, size_t size, UINT64 maxUnits, size_t ou
   const UINT16 *units = out.As<UINT16>();
   for (UINT64 i = 0; i < count; i++) {
     const bool terminator = i == count - 1 && units[i] == 0;
-    if (!terminator && (i >= full.size() || units[i] != full[i]))
-      abort();
+    Check(terminator || (i < full.size() && units[i] == full[i]));
   }
 }
 
@@ -91,8 +89,7 @@ void CheckUcsToUtf8(const uint8_t *data, size_t size, bool swapped, size_t outBy
     return;
 
   const size_t length = strnlen(reinterpret_cast<const char *>(out.bytes.get()), outBytes);
-  if (length >= outBytes)
-    abort();  // no terminator
+  Check(length < outBytes);  // a terminator
 
   // The output decodes back to the non-zero units, in order, up to the
   // first one that did not fit.
@@ -105,16 +102,12 @@ void CheckUcsToUtf8(const uint8_t *data, size_t size, bool swapped, size_t outBy
       expected.push_back(unit);
   }
   std::vector<UINT16> decoded = Decode(out.bytes.get(), ~0ULL);
-  if (decoded.empty() || decoded.back() != 0)
-    abort();
+  Check(!decoded.empty() && decoded.back() == 0);
   decoded.pop_back();
-  if (decoded.size() > expected.size())
-    abort();
-  if (!std::equal(decoded.begin(), decoded.end(), expected.begin()))
-    abort();
+  Check(decoded.size() <= expected.size());
+  Check(std::equal(decoded.begin(), decoded.end(), expected.begin()));
   // The next character would have fitted, terminator included.
-  if (decoded.size() < expected.size() && length + EncodedLength(expected[decoded.size()]) < outBytes)
-    abort();
+  Check(decoded.size() >= expected.size() || length + EncodedLength(expected[decoded.size()]) >= outBytes);
 }
 
 void CheckSPrint(const uint8_t *data, size_t size, size_t outBytes) {
@@ -124,16 +117,13 @@ void CheckSPrint(const uint8_t *data, size_t size, size_t outBytes) {
   CHAR16 *buffer = out.As<CHAR16>();
   const UINTN written = nimb::SPrint(buffer, outBytes, u"%a", text.bytes.get());
   if (outBytes < 2) {
-    if (written != 0)
-      abort();
+    Check(written == 0);
     return;
   }
   const size_t kept = std::min(length, outBytes / 2 - 1);
-  if (written != kept + 1 || buffer[kept] != 0)
-    abort();
+  Check(written == kept + 1 && buffer[kept] == 0);
   for (size_t i = 0; i < kept; i++) {
-    if (buffer[i] != text.bytes[i])
-      abort();
+    Check(buffer[i] == text.bytes[i]);
   }
 }
 
@@ -142,12 +132,9 @@ void CheckStrtoul(const uint8_t *data, size_t size, INT32 base) {
   const char *start = text.As<char>();
   char *end = nullptr;
   const UINT64 value = nimb::strtoul(start, &end, base);
-  if (end < start || end > start + (text.size - 1))
-    abort();
-  if (end == start && value != 0)
-    abort();
-  if (nimb::strtoul(start, nullptr, base) != value)
-    abort();
+  Check(end >= start && end <= start + (text.size - 1));
+  Check(end != start || value == 0);
+  Check(nimb::strtoul(start, nullptr, base) == value);
 }
 
 // The value is the first `maxUnits` bytes of a longer text: converting it in
@@ -156,14 +143,12 @@ void CheckStrtoul(const uint8_t *data, size_t size, INT32 base) {
 void CheckUtf8ToUcsAlloc(const uint8_t *data, size_t size, UINT64 maxUnits) {
   ExactBuffer text = Terminated(data, size);
   const CHAR16 *converted = nimb::Utf8ToUcsAlloc(text.As<char>(), maxUnits);
-  if (converted == nullptr)
-    abort();
+  Check(converted != nullptr);
   const size_t bufferUnits = (4 * (text.size - 1) + 2) / 2;
   size_t length = 0;
   while (length < bufferUnits && converted[length] != 0)
     length++;
-  if (length == bufferUnits)
-    abort();
+  Check(length < bufferUnits);
 
   const size_t valueBytes = std::min<size_t>(maxUnits, text.size - 1);
   ExactBuffer value(valueBytes + 1);
@@ -172,24 +157,11 @@ void CheckUtf8ToUcsAlloc(const uint8_t *data, size_t size, UINT64 maxUnits) {
   std::vector<UINT16> expected = Decode(value.bytes.get(), maxUnits);
   // The terminator, or an over-long form of NUL, ends the text as a string.
   expected.erase(std::find(expected.begin(), expected.end(), 0), expected.end());
-  if (length != expected.size())
-    abort();
+  Check(length == expected.size());
   for (size_t i = 0; i < length; i++) {
-    if (converted[i] != expected[i])
-      abort();
+    Check(converted[i] == expected[i]);
   }
   nimb::TrackedFreeAll();
-}
-
-hostfw::Firmware *Firmware() {
-  static hostfw::Firmware *firmware = [] {
-    auto *fw = new hostfw::Firmware;
-    nimb::gST = fw->SystemTable();
-    nimb::gBS = fw->BootServices();
-    nimb::gRT = fw->RuntimeServices();
-    return fw;
-  }();
-  return firmware;
 }
 
 }  // namespace
@@ -197,7 +169,8 @@ hostfw::Firmware *Firmware() {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (size < 4)
     return 0;
-  Firmware();
+  static hostfw::Firmware &fw = *new hostfw::Firmware;
+  nimbfuzz::AttachLoader(fw);
   const size_t outBytes = (data[0] | data[1] << 8) % 600;
   const UINT64 maxUnits = data[2] == 0xFF ? ~0ULL : data[2];
   const INT32 base = data[3] % 40;

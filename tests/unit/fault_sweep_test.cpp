@@ -19,7 +19,7 @@
 #include "kernel_images.h"
 #include "loader_fixture.h"
 #include "resume/resume.h"
-#include "resume_image.h"
+#include "resume_scene.h"
 #include "support/devicepath.h"
 
 namespace {
@@ -32,10 +32,8 @@ constexpr int64_t kTime = 1199145599;  // 2007-12-31 23:59:59
 // the last are always among them.
 constexpr unsigned kSamples = 12;
 
-// One run's firmware and what it boots from.
-struct Scene {
-  hostfw::Firmware fw;
-  nimbtest::HibernatedMachine machine;
+// One run's firmware, the loader's tables on it, and what it boots from.
+struct Scene : nimbtest::ResumeScene {
   std::unique_ptr<hostfw::NetworkDevice> net;
 };
 
@@ -65,15 +63,7 @@ class FaultSweep : public ::testing::Test {
   void TearDown() override { nimbtest::ResetLoaderState(); }
 
   static hostfw::RunResult Run(Scene &scene, const Kind &kind) {
-    nimbtest::ResetLoaderState();
-    if (!kind.resume)
-      return scene.fw.Run(BootEntry);
-    nimb::gST = scene.fw.SystemTable();
-    nimb::gBS = scene.fw.BootServices();
-    nimb::gRT = scene.fw.RuntimeServices();
-    nimb::gImageHandle = scene.fw.ImageHandle();
-    nimb::gCallGate = 0x7000;
-    return scene.fw.Call([] { nimb::TryResume(); });
+    return kind.resume ? scene.fw.Call([] { nimb::TryResume(); }) : scene.fw.Run(BootEntry);
   }
 
   // Runs `kind` with `fault` injected and checks the outcome; returns how
@@ -136,9 +126,6 @@ class FaultSweep : public ::testing::Test {
       default:
         ADD_FAILURE() << "ended as " << static_cast<int>(result.end) << "\n" << text;
     }
-    if (nimb::gBS != nullptr)
-      nimb::TrackedFreeAll();
-    nimbtest::ResetLoaderState();
     return result.end;
   }
 
@@ -158,7 +145,6 @@ class FaultSweep : public ::testing::Test {
         counts[service] = count - (it == before.end() ? 0 : it->second);
       }
       allocations = counts["AllocatePool"] + counts["AllocatePages"];
-      nimbtest::ResetLoaderState();
     }
     // The run's own ends are not faults it can meet, nor can a service
     // without a status fail.
@@ -246,7 +232,7 @@ TEST_F(FaultSweep, EveryFailureOfEveryKindOfBoot) {
          spec.firstStageBytes = 0xA000;
          spec.imageBytes = 0x10000;
          spec.extentLengths = {0x1200, 0x600, 0x3000, 0x100, 0};
-         scene.machine.Install(scene.fw, nimbtest::BuildResumeImage(spec), std::vector<uint8_t>(16, 0x4B));
+         scene.Install(spec);
        }},
   };
   for (const Kind &kind : kinds)
