@@ -4,22 +4,26 @@
 # found. What a run finds new stays in build/fuzz-corpus/NAME; a crash is
 # written to build/fuzz-findings/NAME/.
 #
-#   scripts/fuzz.sh [-t SECONDS] [-j JOBS] [NAME...]
+#   scripts/fuzz.sh [-t SECONDS | -c CPU_SECONDS] [-j JOBS] [NAME...]
 #
 # NAME is a target's corpus name (tests/fuzz/NAME_fuzz.cpp); none means all.
-# -t is the (wall) time per target (default 600), -j how many run at once
-# (default 1); the table gives the CPU seconds each run had.
+# -t is the (wall) time per target (default 600); -c instead runs each target
+# until it has had that many seconds of CPU, however loaded the machine is;
+# -j how many run at once (default 1); the table gives the CPU seconds each
+# run had.
 # The runs are niced. The exit status is 1 when any target found something.
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 seconds=600
+cpu=0
 jobs=1
-while getopts "t:j:" option; do
+while getopts "t:c:j:" option; do
   case $option in
     t) seconds=$OPTARG ;;
+    c) cpu=$OPTARG seconds=$((OPTARG * 50)) ;;
     j) jobs=$OPTARG ;;
-    *) sed -n '2,12p' "$0"; exit 2 ;;
+    *) sed -n '2,14p' "$0"; exit 2 ;;
   esac
 done
 shift $((OPTIND - 1))
@@ -45,16 +49,23 @@ run() {
   mkdir -p "$work" "$findings"
   local seeds=()
   [ -d "tests/fuzz/corpus/$name" ] && seeds=("tests/fuzz/corpus/$name")
-  # The CPU seconds the run took, user and system together.
-  local TIMEFORMAT='%0U %0S'
-  { time nice "$build/fuzz_${name}_fuzz" -max_total_time="$seconds" -timeout=10 -rss_limit_mb=4096 \
+  nice "$build/fuzz_${name}_fuzz" -max_total_time="$seconds" -timeout=10 -rss_limit_mb=4096 \
     -print_final_stats=1 -artifact_prefix="$findings" "$work" "${seeds[@]}" \
-    >"$build/fuzz-logs/$name.log" 2>&1 || true; } 2>"$build/fuzz-logs/$name.time"
-  read -r user system <"$build/fuzz-logs/$name.time"
-  echo "$((user + system))" >"$build/fuzz-logs/$name.cpu"
+    >"$build/fuzz-logs/$name.log" 2>&1 &
+  local pid=$! used=0 ticks
+  ticks=$(getconf CLK_TCK)
+  # The CPU seconds the run has had, user and system together; with a CPU
+  # budget the run is interrupted (it prints its statistics) once it is spent.
+  while kill -0 "$pid" 2>/dev/null; do
+    used=$(awk -v t="$ticks" '{ print int(($14 + $15) / t) }' "/proc/$pid/stat" 2>/dev/null || echo "$used")
+    [ "$cpu" -gt 0 ] && [ "$used" -ge "$cpu" ] && kill -INT "$pid"
+    sleep 2
+  done
+  wait "$pid" || true
+  echo "$used" >"$build/fuzz-logs/$name.cpu"
 }
 export -f run
-export build seconds
+export build seconds cpu
 
 printf '%s\n' "${names[@]}" | xargs -P "$jobs" -I{} bash -c 'run {}'
 
