@@ -47,6 +47,7 @@ LoggedRead gReads[kMaxLoggedReads];
 UINT64 gReadCount;
 UINT64 gReadBytes;
 UINT32 gReadDepth;
+bool gTimeReads;
 ResetSystemFunction gOriginalReset;
 
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
@@ -64,10 +65,16 @@ EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UI
   }
   // A partition's DiskIO reads through its disk's: only the outer call is
   // the caller's.
+  const UINT64 begin = ReadTsc();
   gReadDepth++;
   const EFI_STATUS status = original(This, MediaId, Offset, BufferSize, Buffer);
   if (--gReadDepth != 0) {
     return status;
+  }
+  if (gTimeReads) {
+    const UINT64 end = ReadTsc();
+    ReportTsc("read-begin", begin);
+    ReportTsc("read-end", end);
   }
   if (gReadCount < kMaxLoggedReads) {
     gReads[gReadCount] = {partition, Offset, BufferSize, reinterpret_cast<UINT64>(Buffer), status};
@@ -156,7 +163,8 @@ void ReportResumeVariables() {
   SerialPrintf("\n");
 }
 
-void WatchDiskAndReset() {
+void WatchDiskAndReset(bool timeReads) {
+  gTimeReads = timeReads;
   UINTN count = 0;
   EFI_HANDLE *handles = nullptr;
   if (!EFI_ERROR(gBS->LocateHandleBuffer(ByProtocol, &gEfiDiskIoProtocolGuid, nullptr, &count, &handles))) {

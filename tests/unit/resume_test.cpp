@@ -331,6 +331,7 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
     std::function<void(ResumeImageSpec &)> spec;
     std::function<void(ResumeImage &)> image;  // after the build
     std::vector<uint8_t> key = std::vector<uint8_t>(16, 0x4B);
+    std::function<void(hostfw::Firmware &)> fault;  // a Fatal before the key is taken
   };
   auto same = [](ResumeImage &) {};
   auto header = [](std::function<void(ResumeHeader &)> change) {
@@ -384,6 +385,8 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
        },
        same},
       {"an extent list of no entry", [](auto &) {}, header([](auto &h) { h.extentBytes = 8; })},
+      {"no pool for memory tags", [](auto &) {}, same, std::vector<uint8_t>(16, 0x4B),
+       [](hostfw::Firmware &f) { f.FailPoolAllocationOfSize(kMemoryTagBlockSize); }},
   };
   for (const Case &c : cases) {
     SCOPED_TRACE(c.name);
@@ -399,12 +402,14 @@ TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
       std::memcpy(broken.bytes.data() + 0x1E0 + 16 * i, &broken.extents[i], 16);
     scene.Install(broken, c.key);
     local.GuardFreeMemory();
+    if (c.fault)
+      c.fault(local);
     hostfw::RunResult result = local.Call([] { TryResume(); });
     EXPECT_EQ(result.end, hostfw::RunEnd::Reset);
     EXPECT_EQ(result.resetType, EfiResetCold);
     EXPECT_FALSE(local.BootServicesExited());
-    EXPECT_EQ(local.FindVariable(kResumeKeyVariable, gNimbVendorVariableGuid), nullptr);
-    EXPECT_EQ(local.ConOutText(), "");
+    EXPECT_EQ(local.FindVariable(kResumeKeyVariable, gNimbVendorVariableGuid) == nullptr, !c.fault);
+    EXPECT_EQ(local.ConOutText(), c.fault ? "Can't allocate memory tag" : "");
     TrackedFreeAll();
     EXPECT_EQ(local.AllocatedPages(), 0u);
   }
