@@ -16,9 +16,9 @@ the two times in one run means anything.
 The platform also prints the counter around each of the loader's DiskIO
 reads, which splits the loader's time: up to its first read of the image
 (discovery, the memory plan, the first drawing), the reads themselves, the
-time between reads (the bar, the loop), and from the last read to the
-probe (the decryption, ExitBootServices, the runtime map, the copy of the
-restart code).
+time between reads (the bar, the loop), from the last read to the
+restart's GetMemoryMap (the decryption), and from there to the probe
+(ExitBootServices, the runtime map, the copy of the restart code).
 
     bench/resume_vs_read.py [--efi-dir build/efi] [--guest-dir build/tests/guest]
 
@@ -46,6 +46,7 @@ LOADER_START = re.compile(r"platform: tsc start-image=0x([0-9a-f]+)")
 PROBE_ENTRY = re.compile(r"kernel: tsc entry=0x([0-9a-f]+)")
 # The platform's moments around each of the loader's DiskIO reads.
 READ_MOMENT = re.compile(r"platform: tsc read-(begin|end)=0x([0-9a-f]+)")
+MEMORY_MAP = re.compile(r"platform: tsc memory-map=0x([0-9a-f]+)")
 
 BENCH = Scenario(
     "resume_vs_read",
@@ -81,10 +82,11 @@ def measure(efi_dir, guest_dir, keep):
     moments = [(kind, int(value, 16)) for kind, value in READ_MOMENT.findall(log)]
     reads = [(moments[i][1], moments[i + 1][1]) for i in range(0, len(moments) - 1, 2)
              if moments[i][0] == "begin" and moments[i + 1][0] == "end"]
-    return int(start[-1], 16), int(entry[-1], 16), int(read.group(3)), int(read.group(2)), reads
+    maps = [int(value, 16) for value in MEMORY_MAP.findall(log)]
+    return int(start[-1], 16), int(entry[-1], 16), int(read.group(3)), int(read.group(2)), reads, maps
 
 
-def breakdown(start, entry, reads):
+def breakdown(start, entry, reads, maps):
     """The loader's time in four parts, from its DiskIO reads' moments."""
     if not reads:
         return None
@@ -92,11 +94,14 @@ def breakdown(start, entry, reads):
     first = image[0][0] if image else header[1]
     last = image[-1][1] if image else header[1]
     reading = sum(end - begin for begin, end in image)
+    # The restart's GetMemoryMap comes right after the decryption.
+    restart = maps[-1] if maps and last <= maps[-1] <= entry else entry
     return [
         ("start to the first read of the image (discovery, plan, first drawing)", first - start),
         (f"the image's reads ({len(image)} DiskIO calls)", reading),
         ("between the reads (bar, loop)", last - first - reading),
-        ("last read to the probe (decryption, exit, runtime map, restart code)", entry - last),
+        ("last read to the restart's GetMemoryMap (decryption, key wiped)", restart - last),
+        ("GetMemoryMap to the probe (ExitBootServices, runtime map, restart code)", entry - restart),
     ]
 
 
@@ -109,9 +114,9 @@ def main(argv=None):
     measured = measure(args.efi_dir, args.guest_dir, args.keep)
     if measured is None:
         return 1
-    start, entry, read_ticks, extents, reads = measured
+    start, entry, read_ticks, extents, reads, maps = measured
     loader_ticks = entry - start
-    parts = breakdown(start, entry, reads)
+    parts = breakdown(start, entry, reads, maps)
     for name, ticks in parts or []:
         print(f"resume-vs-read: {name}: {ticks / 1e6:.1f} Mticks ({100 * ticks / loader_ticks:.0f}%)")
     mib = FIRST_STAGE / (1 << 20)

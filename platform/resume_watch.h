@@ -29,7 +29,8 @@ void ReportKeyCopies(const ConfigEntryList &variables);
 // goes to the firmware ("platform: reset cold", "platform: read ...",
 // "platform: reads N, bytes B"). With `timeReads`, each read also prints the
 // counter at its start and end ("platform: tsc read-begin=",
-// "platform: tsc read-end=") as it returns.
+// "platform: tsc read-end=") as it returns, and each GetMemoryMap call
+// the counter as it starts ("platform: tsc memory-map=").
 void WatchDiskAndReset(bool timeReads);
 
 // Reads the extents of `request` (u32 partition number, then u64 start and
