@@ -143,7 +143,7 @@ def main(argv=None):
     disk = workdir / "disk.img"
     mkdisk.build_disk(disk, volume, Path(args.efi_dir) / "BOOTX64.efi", Path(args.efi_dir) / "nimbboot.efi",
                       disk_bytes=scenario.disk_mib << 20)
-    returncode, log, _, _ = harness.boot(disk, workdir, 600)
+    returncode, log, _ = harness.boot(disk, workdir, 600)
     (workdir / "serial.txt").write_text(log)
 
     report = harness.parse_kernel_report(log)
@@ -166,7 +166,7 @@ def main(argv=None):
         (volume / mkdisk.BOOT_DIR / mkdisk.CONFIG_NAME).write_text(harness.render_config(config))
         mkdisk.build_disk(disk, volume, Path(args.efi_dir) / "BOOTX64.efi", Path(args.efi_dir) / "nimbboot.efi",
                           disk_bytes=scenario.disk_mib << 20)
-        _, log, _, _ = harness.boot(disk, workdir, 600)
+        _, log, _ = harness.boot(disk, workdir, 600)
         (workdir / "serial-texts.txt").write_text(log)
         moments = tsc_moments(log)
         parts = breakdown(log, moments.get("kernel-entry", 0)) if "start-image" in moments else None

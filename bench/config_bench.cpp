@@ -1,8 +1,8 @@
 // The boot options step on configuration files of growing size (read,
 // parsed, merged), and the property lists of growing numbers of driver
 // bundles parsed into one shared symbol list (the parse timed, the freeing
-// not): the time per byte stays the same from the smallest to the largest,
-// so that no configuration makes the boot slow.
+// not), and tracked pool blocks taken and given back: the time per byte stays the same from the smallest to
+// the largest, so that no configuration makes the boot slow.
 //
 // Figures: the rate (bytes per second) at the largest size against the rate
 // at the smallest; 1.00x is linear growth, and a cost that grew with the
@@ -31,6 +31,10 @@ namespace {
 constexpr size_t kConfigSizes[] = {256 << 10, 1 << 20, 4 << 20, 8 << 20};
 // Driver bundles, each with an Info.plist of its own.
 constexpr size_t kBundleCounts[] = {25, 100, 400};
+// Tracked pool blocks, all taken and then given back oldest first (the
+// farthest from the newest end of the tag list).
+constexpr size_t kTrackedBlockCounts[] = {1000, 16000};
+constexpr size_t kTrackedBlockSize = 64;
 
 std::string ConfigText(size_t size) {
   std::string flags;
@@ -176,6 +180,26 @@ void RegisterBundles() {
   }
 }
 
+void RegisterTracking() {
+  for (size_t count : kTrackedBlockCounts) {
+    benchmark::RegisterBenchmark(("Tracking/free/" + std::to_string(count)).c_str(), [count](benchmark::State
+                                                                                                 &state) {
+      TheMachine();
+      std::vector<void *> blocks(count);
+      for (auto _ : state) {
+        for (void *&block : blocks)
+          block = nimb::TrackedAllocatePool(kTrackedBlockSize);
+        for (void *block : blocks)
+          nimb::TrackedFree(block);
+        state.PauseTiming();
+        nimb::TrackedFreeAll();
+        state.ResumeTiming();
+      }
+      state.SetBytesProcessed(static_cast<int64_t>(state.iterations() * count * kTrackedBlockSize));
+    })->Unit(benchmark::kMillisecond);
+  }
+}
+
 // Before anything is timed: the largest file gives the whole option string
 // (every flag word once), and every bundle parses.
 bool CheckConfig() {
@@ -210,6 +234,7 @@ BenchSuite config("config", [] {
     return false;
   RegisterConfig();
   RegisterBundles();
+  RegisterTracking();
   const std::string smallConfig = std::to_string(kConfigSizes[0]);
   const std::string largeConfig = std::to_string(kConfigSizes[std::size(kConfigSizes) - 1]);
   AddFigure("config-largest-vs-smallest", "BootOptions/config/" + largeConfig,
@@ -217,6 +242,9 @@ BenchSuite config("config", [] {
   AddFigure("bundles-most-vs-fewest",
             "Plist/bundles/" + std::to_string(kBundleCounts[std::size(kBundleCounts) - 1]),
             "Plist/bundles/" + std::to_string(kBundleCounts[0]));
+  AddFigure("tracked-frees-most-vs-fewest",
+            "Tracking/free/" + std::to_string(kTrackedBlockCounts[std::size(kTrackedBlockCounts) - 1]),
+            "Tracking/free/" + std::to_string(kTrackedBlockCounts[0]));
   return true;
 });
 

@@ -102,7 +102,7 @@ def main():
         workdir = Path(tempfile.mkdtemp(prefix="nimb-bench-net-"))
         served = workdir / "tftp"
         serve(served, args.efi_dir, args.guest_dir)
-        returncode, log, _, _ = harness.boot(served, workdir, args.timeout, network=True, qemu_args=ICOUNT)
+        returncode, log, _ = harness.boot(served, workdir, args.timeout, network=True, extra=ICOUNT)
         try:
             times = measure(log)
         except RuntimeError as error:

@@ -62,7 +62,7 @@ BENCH = Scenario(
 def measure(efi_dir, guest_dir, keep):
     workdir = Path(tempfile.mkdtemp(prefix="nimb-bench-resume-"))
     disk, _ = harness.prepare(BENCH, efi_dir, workdir, guest_dir=guest_dir)
-    returncode, log, _, _ = harness.boot(disk, workdir, BENCH.timeout, extra=("-cpu", "max"))
+    returncode, log, _ = harness.boot(disk, workdir, BENCH.timeout, extra=("-cpu", "max"))
     (workdir / "serial.txt").write_text(log)
     read, start, entry = TIMED_READ.search(log), LOADER_START.findall(log), PROBE_ENTRY.findall(log)
     report = harness.parse_kernel_report(log)

@@ -192,10 +192,15 @@ void Misuse(const char *format, ...) {
   std::abort();
 }
 
-bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *protocol, const UINTN *size) {
+bool CalledAfterExit(State &s, const char *name) {
   s.callCounts[name]++;
-  if (s.exited) {
+  if (s.exited)
     s.violations.push_back(name);
+  return s.exited;
+}
+
+bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *protocol, const UINTN *size) {
+  if (CalledAfterExit(s, name)) {
     *failure = EFI_UNSUPPORTED;
     return true;
   }

@@ -358,6 +358,7 @@ class Firmware {
   // prefix: "TextReset", "TextSetMode", "BlockReset"). With
   // `protocol` set, only HandleProtocol/LocateProtocol calls for that GUID
   // are counted (and those of the other services that take a protocol GUID).
+  // CopyMem and SetMem have no status: they never fail.
   void FailCall(const std::string &name, unsigned nth = 1, EFI_STATUS status = EFI_DEVICE_ERROR,
                 const EFI_GUID *protocol = nullptr);
   // The n-th pool allocation from now of exactly `size` bytes fails.

@@ -234,6 +234,11 @@ using State = Services::State;
 // fail at once, with `*failure` as its status and no other effect.
 bool Refused(State &s, const char *name, EFI_STATUS *failure, const EFI_GUID *protocol = nullptr,
              const UINTN *size = nullptr);
+// For CopyMem and SetMem, which have no status to fail with: counted, and
+// refused (as a violation) only after ExitBootServices; a fault asked for
+// them is never due. Skipping the copy would leave the caller's buffer as
+// the allocator left it, which no firmware does.
+bool CalledAfterExit(State &s, const char *name);
 // The same for the runtime services, which stay callable after ExitBootServices.
 bool RefusedAtRuntime(State &s, const char *name, EFI_STATUS *failure);
 // A boot service slot the host firmware does not implement: the call is

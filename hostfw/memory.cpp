@@ -285,18 +285,14 @@ EFI_STATUS EFIAPI FreePool(VOID *Buffer) {
 }
 
 VOID EFIAPI CopyMem(VOID *Destination, const VOID *Source, UINTN Length) {
-  State &s = Services::Active();
-  EFI_STATUS failure;
-  if (Refused(s, "CopyMem", &failure))
+  if (CalledAfterExit(Services::Active(), "CopyMem"))
     return;
   if (Length != 0)
     std::memmove(Destination, Source, Length);
 }
 
 VOID EFIAPI SetMem(VOID *Buffer, UINTN Size, UINT8 Value) {
-  State &s = Services::Active();
-  EFI_STATUS failure;
-  if (Refused(s, "SetMem", &failure))
+  if (CalledAfterExit(Services::Active(), "SetMem"))
     return;
   if (Size != 0)
     std::memset(Buffer, Value, Size);

@@ -50,6 +50,8 @@ bool ApplyConsole(PlatformConfig *config, const char *, char *value) {
     config->consoleMode = EfiConsoleControlScreenText;
   } else if (strcmp(value, "graphics") == 0) {
     config->consoleMode = EfiConsoleControlScreenGraphics;
+  } else if (strcmp(value, "none") == 0) {
+    config->consoleMode = kConsoleNone;
   } else {
     return false;
   }

@@ -113,13 +113,16 @@ struct ConfigBytes {
   UINT32 size;
 };
 
+constexpr EFI_CONSOLE_CONTROL_SCREEN_MODE kConsoleNone = EfiConsoleControlScreenMaxValue;
+
 struct PlatformConfig {
   // The loader's path on the platform's own volume.
   const char *loaderPath;
   // The loader's load options; null when the file gives none, in which case
   // the loader gets none at all (not an empty text).
   const char *options;
-  // The console mode that the loader finds when it starts.
+  // The console mode that the loader finds when it starts; kConsoleNone:
+  // no console control at all, as the firmware has none of its own.
   EFI_CONSOLE_CONTROL_SCREEN_MODE consoleMode;
   // Seconds to wait between the report and the power-off.
   UINT32 holdSeconds;

@@ -281,10 +281,16 @@ void TimedWriteText(const CHAR16 *text) {
   SerialWriteText(text);
 }
 
+void SerialHex(const UINT8 *bytes, UINTN size) {
+  static const char kHexDigits[] = "0123456789abcdef";
+  for (UINTN i = 0; i < size; i++) {
+    SerialPrintf("%c%c", kHexDigits[bytes[i] >> 4], kHexDigits[bytes[i] & 15]);
+  }
+}
+
 // The device path of the loader's device, end node included, in hex: the
 // loader finds its kernel cache by a checksum over these bytes.
 void ReportBootDevicePath(EFI_HANDLE device) {
-  static const char kHexDigits[] = "0123456789abcdef";
   void *interface = nullptr;
   if (EFI_ERROR(gBS->HandleProtocol(device, &gEfiDevicePathProtocolGuid, &interface)) ||
       interface == nullptr) {
@@ -296,9 +302,7 @@ void ReportBootDevicePath(EFI_HANDLE device) {
   for (UINTN at = 0;;) {
     const EFI_DEVICE_PATH_PROTOCOL *node = reinterpret_cast<const EFI_DEVICE_PATH_PROTOCOL *>(bytes + at);
     const UINTN length = DevicePathNodeLength(node);
-    for (UINTN i = 0; i < length; i++) {
-      SerialPrintf("%c%c", kHexDigits[bytes[at + i] >> 4], kHexDigits[bytes[at + i] & 15]);
-    }
+    SerialHex(bytes + at, length);
     at += length;
     if (node->Type == END_DEVICE_PATH_TYPE || length < sizeof(EFI_DEVICE_PATH_PROTOCOL)) {
       break;
@@ -348,6 +352,8 @@ const char *ModeName(EFI_CONSOLE_CONTROL_SCREEN_MODE mode) {
       return "text";
     case EfiConsoleControlScreenGraphics:
       return "graphics";
+    case kConsoleNone:
+      return "none";
     default:
       return nullptr;
   }
@@ -424,12 +430,15 @@ void InstallAnswerProtocols(const PlatformConfig &config) {
 // The protocols of the machines that the loader was made for, which the
 // firmware lacks.
 void InstallProtocols(const PlatformConfig &config) {
-  EFI_STATUS status = ConsoleControlInstall(&gConsole, config.consoleMode);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
+  EFI_STATUS status = EFI_SUCCESS;
+  if (config.consoleMode != kConsoleNone) {
+    status = ConsoleControlInstall(&gConsole, config.consoleMode);
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
+    }
+    gConsole.onSetMode = ReportSetMode;
+    gConsole.hiddenText = config.timeText ? TimedWriteText : SerialWriteText;
   }
-  gConsole.onSetMode = ReportSetMode;
-  gConsole.hiddenText = config.timeText ? TimedWriteText : SerialWriteText;
   // Drawing for the loader's boot screen; a firmware without graphics output
   // boots without pictures.
   status = InstallGraphicsProtocols(gST);
@@ -641,6 +650,9 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
   }
   ReportBytes("platform: net boot answers: dhcp", dhcp);
   ReportBytes(", bsdp", discovery);
+  // The answer's bytes, which the kernel is to find as they are.
+  SerialPrintf("\nplatform: net boot dhcp answer ");
+  SerialHex(dhcp.bytes, dhcp.size);
   SerialPrintf("\n");
   status = NetBootInfoInstall(&gNetBootInfo, dhcp, discovery);
   if (EFI_ERROR(status)) {

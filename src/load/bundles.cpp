@@ -252,6 +252,10 @@ static void StageDriver(EFI_FILE *root, const DriverRecord *record, CHAR16 *path
   UINT64 address = gKernelRegionTop;
   UINT64 rounded = total;
   if (codeSize >= kBlockLimit || total >= kBlockLimit || AllocateKernelPages(&address, &rounded) == 0) {
+    // The code file's handle goes back with everything else the boot took.
+    if (open) {
+      BootFileClose(&file);
+    }
     Fatal("Could not allocate driver module memory");
   }
   gKernelRegionTop += rounded;

@@ -2,6 +2,7 @@
 
 #include "boot/boot.h"
 #include "screen/console.h"
+#include "support/strings.h"
 
 namespace nimb {
 
@@ -51,13 +52,117 @@ static MemoryTag *TakeMemoryTag(void *pool, EFI_PHYSICAL_ADDRESS pages, UINTN pa
   return tag;
 }
 
+// The index of the live pool tags, so that TrackedFree finds a tag (and the
+// tag before it in gMemoryTags) without walking the list. It is made when a
+// free had to walk far, and then kept in step: open addressing over a power
+// of two of slots from the untracked pool, at most half of them used. The
+// slot of a pool tag holds the tag behind it on gMemoryTags (null for the
+// head), which is what unlinking needs. Without memory for it, the list is
+// walked as before.
+struct MemoryTagSlot {
+  MemoryTag *tag;
+  MemoryTag *previous;
+};
+struct MemoryTagIndex {
+  MemoryTagSlot *slots;
+  UINT64 mask;      // slot count - 1
+  UINT64 count;     // pool tags held
+  MemoryTag *list;  // gMemoryTags when the index was last kept in step
+};
+static MemoryTagIndex gMemoryTagIndex;
+
+// A free that walks further than this makes the index.
+constexpr UINT64 kMemoryTagWalkLimit = 1024;
+constexpr UINT64 kMemoryTagFirstSlots = 256;
+
+static UINT64 SlotOf(const void *address, UINT64 mask) {
+  UINT64 hash = (reinterpret_cast<UINTN>(address) >> 3) * 0x9E3779B97F4A7C15ULL;
+  return (hash ^ (hash >> 29)) & mask;
+}
+
+// The index, or null when there is none. An index whose list was set aside
+// from outside (the lists emptied without TrackedFreeAll) went with it.
+static MemoryTagIndex *TagIndex() {
+  if (gMemoryTagIndex.slots != nullptr && gMemoryTagIndex.list != gMemoryTags) {
+    gMemoryTagIndex = {};
+  }
+  return gMemoryTagIndex.slots != nullptr ? &gMemoryTagIndex : nullptr;
+}
+
+static void DropTagIndex() {
+  if (TagIndex() != nullptr) {
+    gBS->FreePool(gMemoryTagIndex.slots);
+  }
+  gMemoryTagIndex = {};
+}
+
+// The slot of a pool tag of `address`: of `tag` itself when it is given, else
+// of the first found; an empty slot when there is none.
+static MemoryTagSlot *FindSlot(const MemoryTagIndex *index, const void *address, const MemoryTag *tag) {
+  for (UINT64 i = SlotOf(address, index->mask);; i = (i + 1) & index->mask) {
+    MemoryTagSlot *slot = &index->slots[i];
+    if (slot->tag == nullptr || slot->tag == tag || (tag == nullptr && slot->tag->poolAddress == address)) {
+      return slot;
+    }
+  }
+}
+
+// Makes the index anew over every pool tag, with four slots for each;
+// without memory for it there is none.
+static void RebuildTagIndex() {
+  UINT64 count = 0;
+  for (const MemoryTag *tag = gMemoryTags; tag != nullptr; tag = tag->next) {
+    count += tag->poolAddress != nullptr;
+  }
+  UINT64 slots = kMemoryTagFirstSlots;
+  while (slots < 4 * count) {
+    slots *= 2;
+  }
+  DropTagIndex();
+  MemoryTagIndex index = {static_cast<MemoryTagSlot *>(AllocatePool(slots * sizeof(MemoryTagSlot))),
+                          slots - 1, count, gMemoryTags};
+  if (index.slots == nullptr) {
+    return;
+  }
+  bzero(index.slots, slots * sizeof(MemoryTagSlot));
+  MemoryTag *previous = nullptr;
+  for (MemoryTag *tag = gMemoryTags; tag != nullptr; previous = tag, tag = tag->next) {
+    if (tag->poolAddress != nullptr) {
+      *FindSlot(&index, tag->poolAddress, tag) = {tag, previous};
+    }
+  }
+  gMemoryTagIndex = index;
+}
+
+// Pushes a tag on gMemoryTags, and into the index when there is one.
+static void PushMemoryTag(MemoryTag *tag) {
+  MemoryTagIndex *index = TagIndex();
+  MemoryTag *head = gMemoryTags;
+  tag->next = head;
+  gMemoryTags = tag;
+  if (index == nullptr) {
+    return;
+  }
+  index->list = tag;
+  if (head != nullptr && head->poolAddress != nullptr) {
+    FindSlot(index, head->poolAddress, head)->previous = tag;
+  }
+  if (tag->poolAddress != nullptr) {
+    if (2 * (index->count + 1) > index->mask + 1) {
+      RebuildTagIndex();
+    } else {
+      *FindSlot(index, tag->poolAddress, tag) = {tag, nullptr};
+      index->count++;
+    }
+  }
+}
+
 MemoryTag *TrackPool(void *address) {
   MemoryTag *tag = TakeMemoryTag(address, 0, 0);
   tag->poolAddress = address;
   tag->pageCount = 0;
   tag->pageAddress = 0;
-  tag->next = gMemoryTags;
-  gMemoryTags = tag;
+  PushMemoryTag(tag);
   return tag;
 }
 
@@ -79,9 +184,24 @@ EFI_STATUS TrackedAllocatePages(EFI_ALLOCATE_TYPE type, EFI_MEMORY_TYPE memoryTy
   tag->poolAddress = nullptr;
   tag->pageCount = pages;
   tag->pageAddress = *address;
-  tag->next = gMemoryTags;
-  gMemoryTags = tag;
+  PushMemoryTag(tag);
   return status;
+}
+
+// Takes the slot out of the index; the slots behind it that belong nearer
+// their home move up, so that no search stops short.
+static void RemoveSlot(MemoryTagIndex *index, MemoryTagSlot *slot) {
+  UINT64 hole = static_cast<UINT64>(slot - index->slots);
+  for (UINT64 i = (hole + 1) & index->mask; index->slots[i].tag != nullptr; i = (i + 1) & index->mask) {
+    const UINT64 home = SlotOf(index->slots[i].tag->poolAddress, index->mask);
+    // The entry may move when its home is not cyclically in (hole, i].
+    if (((i - home) & index->mask) >= ((i - hole) & index->mask)) {
+      index->slots[hole] = index->slots[i];
+      hole = i;
+    }
+  }
+  index->slots[hole].tag = nullptr;
+  index->count--;
 }
 
 // The firmware is asked first: the memory goes back whether or not a tag is
@@ -91,19 +211,51 @@ EFI_STATUS TrackedFree(void *address) {
   if (EFI_ERROR(status)) {
     return status;
   }
-  for (MemoryTag **link = &gMemoryTags; *link != nullptr; link = &(*link)->next) {
-    MemoryTag *tag = *link;
-    if (tag->poolAddress == address) {
-      *link = tag->next;
-      tag->next = gFreeMemoryTags;
-      gFreeMemoryTags = tag;
-      break;
+  MemoryTagIndex *index = TagIndex();
+  MemoryTag *tag = nullptr;
+  MemoryTag **link = &gMemoryTags;
+  if (index != nullptr) {
+    MemoryTagSlot *slot = FindSlot(index, address, nullptr);
+    tag = slot->tag;
+    if (tag == nullptr) {
+      return status;
+    }
+    MemoryTag *previous = slot->previous;
+    link = previous != nullptr ? &previous->next : &gMemoryTags;
+    MemoryTag *next = tag->next;
+    if (next != nullptr && next->poolAddress != nullptr) {
+      FindSlot(index, next->poolAddress, next)->previous = previous;
+    }
+    RemoveSlot(index, slot);
+  } else {
+    UINT64 steps = 0;
+    for (; *link != nullptr && (*link)->poolAddress != address; link = &(*link)->next) {
+      steps++;
+    }
+    tag = *link;
+    if (tag == nullptr) {
+      return status;
+    }
+    if (steps > kMemoryTagWalkLimit) {
+      index = &gMemoryTagIndex;
+    }
+  }
+  *link = tag->next;
+  tag->next = gFreeMemoryTags;
+  gFreeMemoryTags = tag;
+  if (index != nullptr) {
+    gMemoryTagIndex.list = gMemoryTags;
+    if (gMemoryTags == nullptr) {
+      DropTagIndex();
+    } else if (gMemoryTagIndex.slots == nullptr) {
+      RebuildTagIndex();
     }
   }
   return status;
 }
 
 void TrackedFreeAll() {
+  DropTagIndex();
   for (MemoryTag *tag = gMemoryTags; tag != nullptr; tag = tag->next) {
     if (tag->poolAddress != nullptr) {
       gBS->FreePool(tag->poolAddress);

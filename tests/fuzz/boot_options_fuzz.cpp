@@ -14,6 +14,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <string>
 
 #include "boot/volume.h"
@@ -27,42 +28,17 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
-struct Machine {
-  hostfw::Firmware fw;
+struct Machine : nimbfuzz::VolumeMachine {
   hostfw::NetworkDevice net{fw};
-  std::string configPath;
-  EFI_HANDLE volume = nullptr;
-  EFI_FILE *root = nullptr;
+  std::string configPath = directory + "/Library/Preferences/SystemConfiguration";
 
   Machine() {
-    fw.SetConOutPresent(false);
-    fw.SetStdErrPresent(false);
-    char pattern[] = "/tmp/nimb-fuzz-XXXXXX";
-    Check(mkdtemp(pattern) != nullptr);
-    const std::string dir = pattern;
-    std::string path = dir;
-    for (const char *part : {"/Library", "/Preferences", "/SystemConfiguration"}) {
-      path += part;
-      std::system(("mkdir -p '" + path + "'").c_str());
-    }
-    configPath = path + "/com.quill.Boot.plist";
-    volume = fw.AddDirectoryVolume(dir);
-    EFI_SIMPLE_FILE_SYSTEM_PROTOCOL *fileSystem = nullptr;
-    fw.BootServices()->HandleProtocol(volume, &gEfiSimpleFileSystemProtocolGuid,
-                                      reinterpret_cast<void **>(&fileSystem));
-    Check(fileSystem != nullptr && fileSystem->OpenVolume(fileSystem, &root) == EFI_SUCCESS);
+    std::filesystem::create_directories(configPath);
+    configPath += "/com.quill.Boot.plist";
   }
 };
-
-Machine &TheMachine() {
-  static Machine *machine = new Machine;
-  return *machine;
-}
 
 void SetVariable(hostfw::Firmware &fw, const char16_t *name, bool present, const std::string &value) {
   fw.RuntimeServices()->SetVariable(const_cast<CHAR16 *>(name), &gNimbVendorVariableGuid, 7, 0, nullptr);
@@ -73,7 +49,7 @@ void SetVariable(hostfw::Firmware &fw, const char16_t *name, bool present, const
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
-  Machine &m = TheMachine();
+  static Machine &m = *new Machine;
   hostfw::Firmware &fw = m.fw;
   nimbfuzz::AttachLoader(fw);
   nimbtest::ResetConfigurationState();
@@ -99,11 +75,11 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     Check(file != nullptr);
     std::fwrite(config.data(), 1, config.size(), file);
     std::fclose(file);
-    fw.SetBootDevice(m.volume);
+    fw.SetBootDevice(m.device);
     root = m.root;
   }
   nimb::gLoadedImage = fw.LoadedImage();
-  nimb::gBootDevicePath = fw.DevicePathOf(network ? m.net.Handle() : m.volume);
+  nimb::gBootDevicePath = fw.DevicePathOf(network ? m.net.Handle() : m.device);
 
   EFI_STATUS status = EFI_ABORTED;
   const hostfw::RunResult run = fw.Call([&] {
@@ -117,10 +93,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   }
   Check(network == ((nimb::gBootFlags & nimb::kBootNetwork) != 0));
 
-  nimb::TrackedFreeAll();
-  Check(fw.LivePoolBlocks() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
+  nimbfuzz::FinishInput(fw, false);
   return 0;
 }

@@ -21,10 +21,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 uint32_t GetLe32(const uint8_t *at) {
   return uint32_t(at[0]) | uint32_t(at[1]) << 8 | uint32_t(at[2]) << 16 | uint32_t(at[3]) << 24;
@@ -107,13 +104,8 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   Check(nimb::gKernelRegionTop == expected);
   Check(m.fw.OpenFiles() == 1);
 
-  nimb::TrackedFreeAll();
-  Check(m.fw.LivePoolBlocks() == 0 && m.fw.AllocatedPages() == 0);
   nimb::gPlistFreeTags = nullptr;
   nimb::gPlistSymbols = nullptr;
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
-  nimb::gImageHandle = nullptr;
+  nimbfuzz::FinishInput(m.fw);
   return 0;
 }

@@ -15,6 +15,11 @@
 
 namespace nimbfuzz {
 
+inline void Check(bool condition) {
+  if (!condition)
+    abort();
+}
+
 inline void AttachLoader(hostfw::Firmware &fw) {
   nimb::gST = fw.SystemTable();
   nimb::gBS = fw.BootServices();
@@ -33,6 +38,14 @@ inline void DetachLoader() {
   nimb::gImageHandle = nullptr;
 }
 
+// The end of an input: all the loader took given back (the pages too, with
+// `pages`), and its tables cleared.
+inline void FinishInput(hostfw::Firmware &fw, bool pages = true) {
+  nimb::TrackedFreeAll();
+  Check(fw.LivePoolBlocks() == 0 && (!pages || fw.AllocatedPages() == 0));
+  DetachLoader();
+}
+
 // Declares all of the arena above its first `usable` bytes reserved, so that
 // a segment or block of a gigabyte is refused at once instead of being
 // filled byte by byte on every run.
@@ -49,6 +62,16 @@ inline void LimitUsableMemory(hostfw::Firmware &fw, UINT64 usable) {
   }
 }
 
+// A firmware for the whole run, quiet (messages would pile up in its records
+// over millions of runs), with its usable memory limited when `usable` is set.
+inline hostfw::Firmware &Quiet(hostfw::Firmware &fw, UINT64 usable = 0) {
+  fw.SetConOutPresent(false);
+  fw.SetStdErrPresent(false);
+  if (usable != 0)
+    LimitUsableMemory(fw, usable);
+  return fw;
+}
+
 // A firmware for targets that read files: quiet (messages would pile up in
 // its records over millions of runs), with the usable memory limited, and
 // a directory volume over a fresh host directory whose root stays open.
@@ -59,9 +82,7 @@ struct VolumeMachine {
   EFI_FILE *root = nullptr;
 
   VolumeMachine() {
-    fw.SetConOutPresent(false);
-    fw.SetStdErrPresent(false);
-    LimitUsableMemory(fw, 32ull << 20);
+    Quiet(fw, 32ull << 20);
     char pattern[] = "/tmp/nimb-fuzz-XXXXXX";
     directory = mkdtemp(pattern);
     device = fw.AddDirectoryVolume(directory);

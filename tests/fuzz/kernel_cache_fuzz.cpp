@@ -28,10 +28,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 // Sizes in the header are kept below this, so that no input has the pool
 // asked for a gigabyte.
@@ -134,11 +131,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
     Check(tag->poolAddress == nullptr);
   Check(m.fw.OpenFiles() == 1);
-  nimb::TrackedFreeAll();
-  Check(m.fw.LivePoolBlocks() == 0 && m.fw.AllocatedPages() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
-  nimb::gImageHandle = nullptr;
+  nimbfuzz::FinishInput(m.fw);
   return 0;
 }

@@ -15,30 +15,15 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 // The memory a kernel may take per input.
 constexpr UINT64 kUsableMemory = 32ull << 20;
 
-hostfw::Firmware &TheFirmware() {
-  static hostfw::Firmware *fw = [] {
-    auto *made = new hostfw::Firmware;
-    // Messages would pile up in the firmware's records over millions of runs.
-    made->SetConOutPresent(false);
-    made->SetStdErrPresent(false);
-    nimbfuzz::LimitUsableMemory(*made, kUsableMemory);
-    return made;
-  }();
-  return *fw;
-}
-
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
-  hostfw::Firmware &fw = TheFirmware();
+  static hostfw::Firmware &fw = nimbfuzz::Quiet(*new hostfw::Firmware, kUsableMemory);
   nimbfuzz::AttachLoader(fw);
   nimb::gKernelRegionBase = 0xFFFFFFFF;
   nimb::gKernelRegionTop = 0;
@@ -77,11 +62,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   // Only the pages of segments are kept; the commands buffer went back.
   for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
     Check(tag->poolAddress == nullptr);
-  nimb::TrackedFreeAll();
-  Check(fw.LivePoolBlocks() == 0 && fw.AllocatedPages() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
-  nimb::gImageHandle = nullptr;
+  nimbfuzz::FinishInput(fw);
   return 0;
 }

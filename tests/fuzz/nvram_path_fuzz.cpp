@@ -16,27 +16,14 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
-
-hostfw::Firmware &TheFirmware() {
-  static hostfw::Firmware *fw = [] {
-    auto *made = new hostfw::Firmware;
-    made->SetConOutPresent(false);
-    made->SetStdErrPresent(false);
-    return made;
-  }();
-  return *fw;
-}
+using nimbfuzz::Check;
 
 }  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (size == 0)
     return 0;
-  hostfw::Firmware &fw = TheFirmware();
+  static hostfw::Firmware &fw = nimbfuzz::Quiet(*new hostfw::Firmware);
   nimbfuzz::AttachLoader(fw);
   const bool wantMac = (data[0] & 1) != 0;
   const bool replace = (data[0] & 2) != 0;
@@ -60,10 +47,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
       }
     }
   }
-  nimb::TrackedFreeAll();
-  Check(fw.LivePoolBlocks() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
+  nimbfuzz::FinishInput(fw, false);
   return 0;
 }

@@ -21,10 +21,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    abort();
-}
+using nimbfuzz::Check;
 
 struct Word {
   const char *word;

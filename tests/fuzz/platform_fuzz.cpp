@@ -21,10 +21,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 void Put32(std::vector<uint8_t> &table, size_t at, uint64_t value) {
   for (size_t i = 0; i < 4 && at + i < table.size(); i++)
@@ -70,8 +67,7 @@ uint64_t Place(hostfw::Firmware &fw, const std::vector<uint8_t> &bytes) {
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   FuzzedDataProvider input(data, size);
   hostfw::Firmware fw;
-  fw.SetConOutPresent(false);
-  fw.SetStdErrPresent(false);
+  nimbfuzz::Quiet(fw);
   nimbfuzz::AttachLoader(fw);
   std::memset(nimb::gModelName, 0, sizeof(nimb::gModelName));
 
@@ -119,10 +115,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   });
   Check(run.end == hostfw::RunEnd::Returned);
   nimb::DeviceTreeFree();
-  nimb::TrackedFreeAll();
-  Check(fw.LivePoolBlocks() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
+  nimbfuzz::FinishInput(fw, false);
   return 0;
 }

@@ -13,10 +13,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 // Walks the whole tree, checking what each type may hold.
 void Walk(const nimb::PlistTag *tag, int depth) {
@@ -84,12 +81,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   }
   Check(Length(nimb::gPlistFreeTags) == blocks * 4096);
 
-  nimb::TrackedFreeAll();
-  Check(fw.LivePoolBlocks() == 0);
   nimb::gPlistFreeTags = nullptr;
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
-  nimb::gImageHandle = nullptr;
+  nimbfuzz::FinishInput(fw, false);
   return 0;
 }

@@ -14,10 +14,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 uint32_t Word(const std::vector<uint8_t> &bytes, size_t at) {
   uint32_t value = 0;
@@ -57,11 +54,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   for (size_t i = static_cast<size_t>(rowBytes) * height; i < frame.size(); i++)
     Check(frame[i] == 0xA5);
 
-  nimb::TrackedFreeAll();
-  Check(fw.LivePoolBlocks() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
-  nimb::gImageHandle = nullptr;
+  nimbfuzz::FinishInput(fw, false);
   return 0;
 }

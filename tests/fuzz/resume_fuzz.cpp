@@ -17,10 +17,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 // The memory the resume may take: the rest of the arena is reserved, so
 // that a header asking for a gigabyte is refused at once.
@@ -35,9 +32,7 @@ struct Machine {
       std::make_shared<std::vector<uint8_t>>((kPartitionStart + kPartitionBlocks) * 512);
 
   Machine() {
-    fw.SetConOutPresent(false);
-    fw.SetStdErrPresent(false);
-    nimbfuzz::LimitUsableMemory(fw, kUsableMemory);
+    nimbfuzz::Quiet(fw, kUsableMemory);
     fw.InstallAcpi({});
     EFI_HANDLE partition = fw.AddBlockDevice(disk, 512, kPartitionStart, kPartitionBlocks);
     fw.PutVariable(nimb::kResumeImageVariable, gNimbVendorVariableGuid, nimbtest::kResumeVariableAttributes,

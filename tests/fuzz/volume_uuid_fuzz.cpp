@@ -16,10 +16,7 @@
 
 namespace {
 
-void Check(bool condition) {
-  if (!condition)
-    std::abort();
-}
+using nimbfuzz::Check;
 
 constexpr size_t kVolumeBytes = 64 * 1024;
 
@@ -45,10 +42,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (status == EFI_SUCCESS) {
     Check(textSize >= nimb::kUuidTextSize && std::strlen(text.get()) == nimb::kUuidTextSize - 1);
   }
-  nimb::TrackedFreeAll();
-  Check(m->fw.LivePoolBlocks() == 0);
-  nimb::gST = nullptr;
-  nimb::gBS = nullptr;
-  nimb::gRT = nullptr;
+  nimbfuzz::FinishInput(m->fw, false);
   return 0;
 }

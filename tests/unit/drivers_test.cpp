@@ -127,83 +127,36 @@ TEST_F(DriversTest, ThePackageDecisionRowByRow) {
   const Bytes cutShort = nimbtest::Fat(false, {{7, 0x1000, 0x2000}}, {{0x1000, nimbtest::Pattern(0x800)}});
   const Bytes otherSlice = nimbtest::Fat(false, {{18, 0x1000, 0x100}}, {{0x1000, nimbtest::Pattern(0x100)}});
   enum Outcome { kPackage_, kFallback, kBundles };
-  struct Setup {
-    Bytes package;
-    int64_t packageTime;
-    bool packageDirectory = false, noExtensions = false, extensionsFile = false, noKernel = false;
-    bool withFallback = false, devicePath = false;
-    UINT8 custom = 0;
-    UINT64 flags = 0;
-  };
+  constexpr int kLater = 1, kEarlier = 2, kOld = 4, kNoExtensions = 8, kExtensionsFile = 16, kSafe = 32,
+                kCustom = 64, kMissing = 128, kWithFallback = 256, kDirectory = 512, kNoKernel = 1024,
+                kCutShort = 2048, kOtherSlice = 4096, kDevicePath = 8192;
   struct Row {
     const char *name;
-    std::function<void(Setup &)> change;
+    int setup;
     Outcome outcome;
     std::string said;  // behind "Loading drivers...\n"
   };
   const std::string loadPackage = "Loading System\\Library\\Extensions.drvpk...\r\n";
   const std::string loadFallback = "Loading nimb_kernel.drvpk...\r\n";
   const Row rows[] = {
-      {"one second after the extensions", [](Setup &) {}, kPackage_, loadPackage},
-      {"two seconds after", [](Setup &s) { s.packageTime++; }, kBundles, ""},
-      {"as old as the extensions", [](Setup &s) { s.packageTime--; }, kBundles, ""},
-      {"no extensions directory, whatever its time",
-       [](Setup &s) {
-         s.noExtensions = true;
-         s.packageTime = 0;
-       },
-       kPackage_, loadPackage},
-      {"extensions is a file", [](Setup &s) { s.extensionsFile = true; }, kPackage_, loadPackage},
-      {"safe mode", [](Setup &s) { s.flags = nimb::kBootSafeMode; }, kBundles, ""},
-      {"safe mode without extensions",
-       [](Setup &s) {
-         s.flags = nimb::kBootSafeMode;
-         s.noExtensions = true;
-       },
-       kPackage_, loadPackage},
-      {"named by the user, older, in safe mode",
-       [](Setup &s) {
-         s.custom = 1;
-         s.packageTime = 0;
-         s.flags = nimb::kBootSafeMode;
-       },
-       kPackage_, loadPackage},
-      {"named by the user and missing: no second name",
-       [](Setup &s) {
-         s.custom = 1;
-         s.package.clear();
-         s.withFallback = true;
-       },
-       kBundles, ""},
-      {"missing: no second name",
-       [](Setup &s) {
-         s.package.clear();
-         s.withFallback = true;
-       },
-       kBundles, ""},
-      {"a directory", [](Setup &s) { s.packageDirectory = true; }, kBundles, ""},
-      {"no kernel", [](Setup &s) { s.noKernel = true; }, kBundles, ""},
-      {"cut short: the second name",
-       [&](Setup &s) {
-         s.package = cutShort;
-         s.withFallback = true;
-       },
-       kFallback, loadPackage + loadFallback},
-      {"cut short, no second name", [&](Setup &s) { s.package = cutShort; }, kBundles,
+      {"one second after the extensions", 0, kPackage_, loadPackage},
+      {"two seconds after", kLater, kBundles, ""},
+      {"as old as the extensions", kEarlier, kBundles, ""},
+      {"no extensions directory, whatever its time", kNoExtensions | kOld, kPackage_, loadPackage},
+      {"extensions is a file", kExtensionsFile, kPackage_, loadPackage},
+      {"safe mode", kSafe, kBundles, ""},
+      {"safe mode without extensions", kSafe | kNoExtensions, kPackage_, loadPackage},
+      {"named by the user, older, in safe mode", kCustom | kOld | kSafe, kPackage_, loadPackage},
+      {"named by the user and missing: no second name", kCustom | kMissing | kWithFallback, kBundles, ""},
+      {"missing: no second name", kMissing | kWithFallback, kBundles, ""},
+      {"a directory", kDirectory, kBundles, ""},
+      {"no kernel", kNoKernel, kBundles, ""},
+      {"cut short: the second name", kCutShort | kWithFallback, kFallback, loadPackage + loadFallback},
+      {"cut short, no second name", kCutShort, kBundles,
        loadPackage + loadFallback + "Could not open file 'nimb_kernel.drvpk'\r\n"},
-      {"no x86 slice: no second name",
-       [&](Setup &s) {
-         s.package = otherSlice;
-         s.withFallback = true;
-       },
-       kBundles, loadPackage},
+      {"no x86 slice: no second name", kOtherSlice | kWithFallback, kBundles, loadPackage},
       // A device path without LoadFile has no source.
-      {"a device path on a disk boot",
-       [](Setup &s) {
-         s.devicePath = true;
-         s.withFallback = true;
-       },
-       kBundles, loadPackage},
+      {"a device path on a disk boot", kDevicePath | kWithFallback, kBundles, loadPackage},
   };
   const std::string bundleList = BundleList("<string>Root</string>");
   Bytes path = hostfw::FilePathNode(u"x");
@@ -213,26 +166,25 @@ TEST_F(DriversTest, ThePackageDecisionRowByRow) {
     SCOPED_TRACE(row.name);
     Clear();
     Fresh();
-    Setup s{package, kExtensionsTime + 1};
-    row.change(s);
-    if (!s.noKernel)
+    const int on = row.setup;
+    if (!(on & kNoKernel))
       Put("nimb_kernel", "k");
-    if (s.extensionsFile) {
+    if (on & kExtensionsFile) {
       Put(kExtensions, "a file");
-    } else if (!s.noExtensions) {
+    } else if (!(on & kNoExtensions)) {
       Put(std::string(kExtensions) + "/A.drvb/Info.plist", bundleList);
       SetTime(kExtensions, kExtensionsTime);
     }
-    if (s.packageDirectory)
+    if (on & kDirectory)
       dir_->Directory(std::string(kPackage) + "/x");
-    else if (!s.package.empty())
-      Put(kPackage, s.package);
-    SetTime(kPackage, s.packageTime);
-    if (s.withFallback)
+    else if (!(on & kMissing))
+      Put(kPackage, on & kCutShort ? cutShort : on & kOtherSlice ? otherSlice : package);
+    SetTime(kPackage, on & kOld ? 0 : kExtensionsTime + 1 + (on & kLater ? 1 : 0) - (on & kEarlier ? 1 : 0));
+    if (on & kWithFallback)
       Put("nimb_kernel.drvpk", fallback);
-    nimb::gCustomDriverPackage = s.custom;
-    nimb::gBootFlags = s.flags;
-    if (s.devicePath)
+    nimb::gCustomDriverPackage = (on & kCustom) != 0;
+    nimb::gBootFlags = on & kSafe ? nimb::kBootSafeMode : 0;
+    if (on & kDevicePath)
       nimb::gDriverPackagePath =
           reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(const_cast<uint8_t *>(path.data()));
 

@@ -88,25 +88,6 @@ TEST_F(KernelRegionTest, AllocationsAtTheTopRoundToPagesAndRaiseIt) {
   }
 }
 
-TEST_F(KernelRegionTest, KernelPagesAtTheirOwnAddressLeaveTheTopAlone) {
-  UINT64 address = 0x500000;
-  UINT64 size = 0x1800;
-  nimb::gKernelRegionTop = 0x200000;
-  EXPECT_EQ(nimb::AllocateKernelPages(&address, &size), 0x500000u);
-  EXPECT_EQ(address, 0x500000u);
-  EXPECT_EQ(size, 0x2000u);
-  EXPECT_EQ(nimb::gKernelRegionTop, 0x200000u);
-  EXPECT_EQ(fw.AllocatedPages(), 2u);
-
-  // The same pages again are refused; the arguments stay as they were.
-  address = 0x501000;
-  size = 0x10;
-  EXPECT_EQ(nimb::AllocateKernelPages(&address, &size), 0u);
-  EXPECT_EQ(address, 0x501000u);
-  EXPECT_EQ(size, 0x10u);
-  EXPECT_EQ(fw.ConOutText(), "Error allocating 0x1 pages at 0x501000 alloc type 2\r\n");
-}
-
 TEST_F(KernelRegionTest, RangesEnterTheLow32BitsOfAddressAndLength) {
   ASSERT_NE(nimb::DeviceTreeInit(), nullptr);
   nimb::gMemoryMapNode = nimb::DeviceTreeFindNode("/chosen/memory-map", 1);
@@ -143,32 +124,6 @@ TEST_F(KernelRegionTest, RangesEnterTheLow32BitsOfAddressAndLength) {
   ASSERT_NE(field, flat.end());
   EXPECT_EQ(field[31], 0);
   EXPECT_EQ(nimb::gDeviceTreePropertyCount, 3u + 3u);
-}
-
-TEST_F(KernelRegionTest, RefusedMemoryLeavesTheMapAsItWas) {
-  ASSERT_NE(nimb::DeviceTreeInit(), nullptr);
-  nimb::gMemoryMapNode = nimb::DeviceTreeFindNode("/chosen/memory-map", 1);
-  struct Row {
-    const char *what;
-    unsigned failAt;  // AllocatePool call refused
-    EFI_STATUS status;
-  };
-  const Row rows[] = {
-      {"copy of the name", 1, EFI_OUT_OF_RESOURCES},
-      // The property's value cannot be copied: not passed on.
-      {"copy of the value", 2, EFI_SUCCESS},
-  };
-  for (const Row &row : rows) {
-    UINT32 properties = nimb::gDeviceTreePropertyCount;
-    Bytes before = Flatten();
-    fw.FailCall("AllocatePool", row.failAt);
-    EXPECT_EQ(nimb::AddMemoryRange("Driver-1000", 0x1000, 0x10, 1), row.status) << row.what;
-    EXPECT_EQ(nimb::gDeviceTreePropertyCount, properties) << row.what;
-    EXPECT_EQ(Flatten(), before) << row.what;
-  }
-  // Without the node nothing is entered, and nothing breaks.
-  nimb::gMemoryMapNode = nullptr;
-  EXPECT_EQ(nimb::AddMemoryRange("Driver-2000", 0x2000, 0x10, 1), EFI_SUCCESS);
 }
 
 }  // namespace

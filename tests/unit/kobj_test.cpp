@@ -96,51 +96,6 @@ TEST(KobjElfTest, TakesLoadableSegmentsAtTheirPhysicalAddresses) {
             std::make_tuple(0x300000, 0x2000, Bytes()));
 }
 
-TEST(KobjWriterTest, ObjectRecords) {
-  kobj::Kernel kernel;
-  kernel.entry = 0xC0100010;
-  kernel.segments = {{0xC0100000, 0x30, Pattern(0x30)}, {0x00300000, 0x2000, {}}};
-  Bytes out = kobj::WriteObject(kernel);
-  struct Field {
-    const char *name;
-    size_t at;
-    uint32_t value;
-  };
-  const size_t thread = 28 + 2 * 40;
-  const Field fields[] = {
-      {"magic", 0, 0xFEEDFACE},
-      {"cpu type", 4, 7},
-      {"file type", 12, 2},
-      {"command count", 16, 3},
-      {"commands size", 20, 2 * 40 + 80},
-      {"flags", 24, 0},
-      {"first command", 28, 1},
-      {"first length", 32, 40},
-      {"first address", 28 + 24, 0xC0100000},
-      {"first memory size", 28 + 28, 0x30},
-      {"first file size", 28 + 36, 0x30},
-      {"second address", 68 + 24, 0x00300000},
-      {"second memory size", 68 + 28, 0x2000},
-      // A segment of zeroes alone carries one byte, so that the loader takes
-      // and clears its pages.
-      {"second file size", 68 + 36, 1},
-      {"thread command", thread, 5},
-      {"thread length", thread + 4, 80},
-      {"thread flavor", thread + 8, 1},
-      {"register words", thread + 12, 16},
-  };
-  for (const Field &field : fields)
-    EXPECT_EQ(GetLe32(out, field.at), field.value) << field.name;
-  for (size_t at = thread + 16; at < thread + 80; at += 4)
-    EXPECT_EQ(GetLe32(out, at), at == thread + 56 ? 0xC0100010 : 0u) << "register word at " << at;
-  size_t first = GetLe32(out, 28 + 32);
-  size_t second = GetLe32(out, 68 + 32);
-  EXPECT_GE(first, 28u + 160u);
-  EXPECT_EQ(Bytes(out.begin() + first, out.begin() + first + 0x30), Pattern(0x30));
-  ASSERT_EQ(second + 1, out.size());
-  EXPECT_EQ(out[second], 0);
-}
-
 TEST(KobjWriterTest, FatRecordsInBothOrders) {
   const std::vector<kobj::FatEntry> slices = {{18, 0, Pattern(0x1001)}, {7, 3, Pattern(0x20, 2)}};
   struct Row {

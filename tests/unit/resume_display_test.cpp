@@ -18,17 +18,14 @@ namespace {
 constexpr UINT32 kWidth = 640, kHeight = 480;
 constexpr UINT32 kBarLeft = (kWidth - 190) / 2, kBarTop = kHeight - 97;
 
-// The cell mask as the bar is specified.
-constexpr UINT8 kMask[16][7] = {
-    {0, 99, 216, 240, 216, 99, 0},       {81, 255, 255, 255, 255, 255, 81},
-    {174, 255, 255, 255, 255, 255, 174}, {195, 255, 255, 255, 255, 255, 195},
-    {195, 255, 255, 255, 255, 255, 195}, {195, 255, 255, 255, 255, 255, 195},
-    {195, 255, 255, 255, 255, 255, 195}, {195, 255, 255, 255, 255, 255, 195},
-    {195, 255, 255, 255, 255, 255, 195}, {195, 255, 255, 255, 255, 255, 195},
-    {195, 255, 255, 255, 255, 255, 195}, {195, 255, 255, 255, 255, 255, 195},
-    {195, 255, 255, 255, 255, 255, 195}, {174, 255, 255, 255, 255, 255, 174},
-    {84, 255, 255, 255, 255, 255, 84},   {0, 102, 219, 243, 219, 102, 0},
-};
+// The cell mask as the bar is specified: rows 0 and 15 and the outer columns
+// blend, the rest is opaque.
+UINT32 Mask(UINT32 i) {
+  static const UINT8 top[7] = {0, 99, 216, 240, 216, 99, 0}, bottom[7] = {0, 102, 219, 243, 219, 102, 0};
+  static const UINT8 side[16] = {0, 81, 174, 195, 195, 195, 195, 195, 195, 195, 195, 195, 195, 174, 84, 0};
+  const UINT32 y = i / 7, x = i % 7;
+  return y == 0 ? top[x] : y == 15 ? bottom[x] : x == 0 || x == 6 ? side[y] : 255;
+}
 
 UINT32 Grey(UINT32 level, UINT32 depth) {
   const UINT32 w = level >> 3;
@@ -80,7 +77,7 @@ class ResumeBarTest : public nimbtest::LoaderTest, public ::testing::WithParamIn
                                std::vector<UINT8> *samples = nullptr) {
     std::vector<UINT32> out = under;
     for (UINT32 i = 0; i < out.size(); i++) {
-      const UINT32 a = kMask[i / 7][i % 7];
+      const UINT32 a = Mask(i);
       if (a == 255) {
         out[i] = Grey(level, depth_);
       } else if (a != 0) {
@@ -334,7 +331,7 @@ TEST_F(ResumePreviewTest, BrokenOrMismatchedPicturesDrawNothing) {
       {"a row offset past the end", HandMade({{4, 44}}), 3, 2, 4, 0},
       {"a row offset far out", HandMade({{3, 0xFFFFFFF0}}), 3, 2, 4, 0},
       {"a row that ends early", HandMade(), 3, 2, 4, 1},
-      {"no room for the row table", HandMade(), 3, 2, 4, 24},
+      {"no room for the row table", HandMade({{3, 0}}), 3, 2, 4, 28},
       {"no header", HandMade(), 3, 2, 4, 33},
   };
   for (const Row &row : rows) {

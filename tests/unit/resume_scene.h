@@ -24,11 +24,12 @@ struct ResumeScene {
       nimb::TrackedFreeAll();
     ResetLoaderState();
   }
-  void Install(const ResumeImage &built, const std::vector<uint8_t> &key = {}) {
+  void Install(const ResumeImage &built, const std::vector<uint8_t> &key = std::vector<uint8_t>(16, 0x4B)) {
     image = built;
     machine.Install(fw, image, key);
   }
-  void Install(const ResumeImageSpec &spec, const std::vector<uint8_t> &key = {}) {
+  void Install(const ResumeImageSpec &spec,
+               const std::vector<uint8_t> &key = std::vector<uint8_t>(16, 0x4B)) {
     Install(BuildResumeImage(spec), key);
   }
   bool Has(const CHAR16 *name) { return fw.FindVariable(name, gNimbVendorVariableGuid) != nullptr; }

@@ -1,19 +1,14 @@
 // The resume from an accepted header to the restart code, over the host
-// firmware: the memory plan, the walk over the extents, every limit of the
-// header, and the restart with its record for the restart code.
+// firmware: the walk over the extents, every limit of the header, the
+// decryption, and the restart with its record for the restart code.
 #include <gtest/gtest.h>
 #include <openssl/evp.h>
 
 #include <functional>
 #include <vector>
 
-#include "loader_fixture.h"
-#include "resume/image_read.h"
-#include "resume/plan.h"
 #include "resume/preview_encoder.h"
-#include "resume/restart.h"
 #include "resume_scene.h"
-#include "screen/console.h"
 #include "screen/resume_display.h"
 
 namespace {
@@ -23,77 +18,63 @@ using nimbtest::HibernatedMachine;
 using nimbtest::ResumeImage;
 using nimbtest::ResumeImageSpec;
 
-constexpr UINT64 kGate = 0x7000;
-
-// DiskIO of the partition with every read recorded.
+// DiskIO of the partition with the size of every read recorded.
 struct ReadRecorder {
   EFI_DISK_IO_PROTOCOL protocol;
   EFI_DISK_IO_PROTOCOL *inner;
-  std::vector<std::pair<UINT64, UINTN>> reads;
+  std::vector<UINTN> reads;
 };
 ReadRecorder *gRecorder;
 
 EFI_STATUS EFIAPI RecordedRead(EFI_DISK_IO_PROTOCOL *, UINT32 mediaId, UINT64 offset, UINTN size,
                                VOID *buffer) {
-  gRecorder->reads.push_back({offset, size});
+  gRecorder->reads.push_back(size);
   return gRecorder->inner->ReadDisk(gRecorder->inner, mediaId, offset, size, buffer);
 }
 
-class ResumeRunTest : public nimbtest::LoaderTest {
- protected:
-  void SetUp() override {
-    LoaderTest::SetUp();
-    gCallGate = kGate;
-    fw.InstallAcpi({});
-  }
-  void TearDown() override {
-    gRecorder = nullptr;
-    LoaderTest::TearDown();
-  }
-  void Install(const ResumeImageSpec &spec,
-               const std::vector<uint8_t> &key = std::vector<uint8_t>(16, 0x4B)) {
-    image = nimbtest::BuildResumeImage(spec);
-    machine.Install(fw, image, key);
-  }
-  void RecordReads() {
-    void *inner = nullptr;
-    fw.BootServices()->HandleProtocol(machine.partition, &gEfiDiskIoProtocolGuid, &inner);
-    recorder.inner = static_cast<EFI_DISK_IO_PROTOCOL *>(inner);
-    recorder.protocol = *recorder.inner;
-    recorder.protocol.ReadDisk = RecordedRead;
-    gRecorder = &recorder;
-    fw.UninstallProtocol(machine.partition, gEfiDiskIoProtocolGuid);
-    fw.InstallProtocol(machine.partition, gEfiDiskIoProtocolGuid, &recorder.protocol);
-  }
-  hostfw::RunResult Run() {
-    return fw.Call([] { TryResume(); });
-  }
-  bool Has(const CHAR16 *name) { return fw.FindVariable(name, gNimbVendorVariableGuid) != nullptr; }
+void RecordReads(nimbtest::ResumeScene &scene, ReadRecorder *recorder) {
+  void *inner = nullptr;
+  scene.fw.BootServices()->HandleProtocol(scene.machine.partition, &gEfiDiskIoProtocolGuid, &inner);
+  recorder->inner = static_cast<EFI_DISK_IO_PROTOCOL *>(inner);
+  recorder->protocol = *recorder->inner;
+  recorder->protocol.ReadDisk = RecordedRead;
+  gRecorder = recorder;
+  scene.fw.UninstallProtocol(scene.machine.partition, gEfiDiskIoProtocolGuid);
+  scene.fw.InstallProtocol(scene.machine.partition, gEfiDiskIoProtocolGuid, &recorder->protocol);
+}
 
-  HibernatedMachine machine;
-  ResumeImage image;
-  ReadRecorder recorder = {};
-};
+hostfw::RunResult Resume(nimbtest::ResumeScene &scene, bool console = false) {
+  return scene.fw.Call([console] {
+    if (console)
+      ASSERT_EQ(InitConsole(), EFI_SUCCESS);
+    TryResume();
+  });
+}
 
-TEST_F(ResumeRunTest, RestartsTheImage) {
+constexpr UINT32 kWidth = 320, kHeight = 200;
+
+TEST(ResumeRunTest, RestartsTheImage) {
+  nimbtest::ResumeScene scene;
+  scene.fw.InstallAcpi({});
   ResumeImageSpec spec;
   spec.restorePageCount = 3;
   spec.firstStageBytes = 0xA000;
   spec.imageBytes = 0x10000;
   spec.extentLengths = {0x1200, 0x600, 0x3000, 0x100, 0};
-  Install(spec);
+  scene.Install(spec);
+  const ResumeImage &image = scene.image;
   // Flash behind the runtime regions, as firmware maps it for its variables:
   // it takes address space past the runtime area, but nothing is copied.
-  fw.AddMemoryRegion(EfiMemoryMappedIO, 0xFFC00000, 0x400, EFI_MEMORY_RUNTIME | EFI_MEMORY_UC);
-  fw.GuardFreeMemory();
-  hostfw::RunResult result = Run();
+  scene.fw.AddMemoryRegion(EfiMemoryMappedIO, 0xFFC00000, 0x400, EFI_MEMORY_RUNTIME | EFI_MEMORY_UC);
+  scene.fw.GuardFreeMemory();
+  hostfw::RunResult result = Resume(scene);
 
   ASSERT_EQ(result.end, hostfw::RunEnd::KernelEntered);
   EXPECT_TRUE(result.interruptsDisabled);
-  EXPECT_EQ(result.gateAddress, kGate);
+  EXPECT_EQ(result.gateAddress, 0x7000u);
   EXPECT_EQ(result.gateTarget, spec.restorePage * 4096ull + spec.restoreEntryOffset);
-  EXPECT_TRUE(fw.ViolationsAfterExit().empty());
-  EXPECT_TRUE(fw.VirtualMapSet());
+  EXPECT_TRUE(scene.fw.ViolationsAfterExit().empty());
+  EXPECT_TRUE(scene.fw.VirtualMapSet());
 
   // The header and the first stage, read through the extents in list order.
   const UINT8 *header = reinterpret_cast<const UINT8 *>(result.gateArgument);
@@ -101,12 +82,11 @@ TEST_F(ResumeRunTest, RestartsTheImage) {
   ASSERT_LT(result.gateArgument, 1ull << 32);
   const ResumeHeader &h = *reinterpret_cast<const ResumeHeader *>(header);
   EXPECT_EQ(std::memcmp(header + 512, image.bytes.data() + 512, image.bytes.size() - 512), 0);
-  EXPECT_EQ(std::memcmp(h.reservedA8, image.Header().reservedA8, sizeof(h.reservedA8)), 0);
-  EXPECT_EQ(h.magic, kResumeMagic);
+  EXPECT_EQ(std::memcmp(h.reservedA8, scene.image.Header().reservedA8, sizeof(h.reservedA8)), 0);
 
   // The restart code at its home, summed.
-  const size_t code = image.RestartCodeOffset();
-  std::vector<uint8_t> restartCode(image.bytes.begin() + code, image.bytes.begin() + code + 3 * 4096);
+  const size_t code = scene.image.RestartCodeOffset();
+  const std::vector<uint8_t> restartCode(image.bytes.begin() + code, image.bytes.begin() + code + 3 * 4096);
   EXPECT_EQ(std::memcmp(reinterpret_cast<const void *>(uintptr_t(spec.restorePage) * 4096),
                         restartCode.data(), restartCode.size()),
             0);
@@ -119,8 +99,8 @@ TEST_F(ResumeRunTest, RestartsTheImage) {
   const ResumeVideoRecord &video = *reinterpret_cast<const ResumeVideoRecord *>(scratch);
   EXPECT_EQ(video.displayMode, 1u);
   EXPECT_EQ(video.baseAddress, 0u);
-  const UINT8 *zeros = scratch + kResumeChainBlockOffset;
-  EXPECT_TRUE(std::all_of(zeros, zeros + 16, [](UINT8 b) { return b == 0; }));
+  EXPECT_EQ(std::vector<UINT8>(scratch + kResumeChainBlockOffset, scratch + kResumeChainBlockOffset + 16),
+            std::vector<UINT8>(16, 0));
 
   // The runtime map: only runtime descriptors, the copied ones inside the
   // image's area, and the system table found there by its offset.
@@ -138,101 +118,90 @@ TEST_F(ResumeRunTest, RestartsTheImage) {
   }
   EXPECT_EQ(reinterpret_cast<UINT64>(gST), area + h.systemTableOffset);
   EXPECT_EQ(gST->Hdr.Signature, EFI_SYSTEM_TABLE_SIGNATURE);
-
-  EXPECT_FALSE(Has(kResumeSignatureVariable));
-  EXPECT_TRUE(Has(kResumeImageVariable));
-  EXPECT_FALSE(Has(kResumeKeyVariable));
+  EXPECT_FALSE(scene.Has(kResumeSignatureVariable));
+  EXPECT_TRUE(scene.Has(kResumeImageVariable));
+  EXPECT_FALSE(scene.Has(kResumeKeyVariable));
 }
 
-// The header alone, without restart code: nothing is read behind it, nothing
-// copied, and the gate is entered all the same.
-TEST_F(ResumeRunTest, AFirstStageOfTheHeaderAloneEntersTheGate) {
-  ResumeImageSpec spec;
-  spec.firstStageBytes = 512;
-  spec.restorePageCount = 0;
-  spec.extentLengths = {512};
-  Install(spec);
-  RecordReads();
-  hostfw::RunResult result = Run();
-  ASSERT_EQ(result.end, hostfw::RunEnd::KernelEntered);
-  EXPECT_EQ(result.gateTarget, spec.restorePage * 4096ull + spec.restoreEntryOffset);
-  EXPECT_EQ(reinterpret_cast<const ResumeHeader *>(result.gateArgument)->restoreSum, 0u);
-  EXPECT_EQ(recorder.reads.size(), 1u);  // the header
-}
-
-TEST_F(ResumeRunTest, MainStageReadsAreOneStepOfTheBarAtMost) {
-  ResumeImageSpec spec;
-  spec.imageBytes = 1900000;
-  spec.firstStageBytes = 0x60000;
-  spec.extentLengths = {0x30000, 0};
-  Install(spec);
-  RecordReads();
-  ASSERT_EQ(Run().end, hostfw::RunEnd::KernelEntered);
-  UINT64 total = 0;
-  ASSERT_FALSE(recorder.reads.empty());
-  EXPECT_EQ(recorder.reads[0].second, 512u);  // the header
-  for (size_t i = 1; i < recorder.reads.size(); i++) {
-    EXPECT_LE(recorder.reads[i].second, 100000u);
-    total += recorder.reads[i].second;
+// The reads behind the header: without a preview one step of the bar at most
+// and none across an extent's end; with one, the preview stage in one read
+// first. The header alone reads nothing behind it and enters all the same.
+TEST(ResumeRunTest, ReadsBehindTheHeader) {
+  const UINTN previewStage = 0x1E0 + 32 + 2 * 4096 + 0x28000 - 512;
+  const struct {
+    uint64_t firstStage;
+    uint32_t pages, preview;
+    std::vector<uint64_t> extents;
+    std::vector<UINTN> first;  // the first reads behind the header
+    UINTN step;                // no later read larger
+  } rows[] = {
+      {512, 0, 0, {512}, {}, 0},
+      {0x60000, 2, 0, {0x30000, 0}, {100000, 0x30000 - 512 - 100000}, 100000},
+      {0x60000, 2, 0x28000, {0x30000, 0}, {previewStage}, (1900000 - previewStage) / 19},
+  };
+  for (const auto &row : rows) {
+    SCOPED_TRACE(row.preview);
+    nimbtest::ResumeScene scene;
+    scene.fw.InstallAcpi({});
+    ResumeImageSpec spec;
+    spec.imageBytes = 1900000;
+    spec.firstStageBytes = row.firstStage;
+    spec.restorePageCount = row.pages;
+    spec.previewBytes = row.preview;
+    spec.extentLengths = row.extents;
+    scene.Install(spec);
+    ReadRecorder recorder = {};
+    RecordReads(scene, &recorder);
+    const hostfw::RunResult result = Resume(scene);
+    ASSERT_EQ(result.end, hostfw::RunEnd::KernelEntered);
+    if (row.pages == 0)
+      EXPECT_EQ(reinterpret_cast<const ResumeHeader *>(result.gateArgument)->restoreSum, 0u);
+    ASSERT_GE(recorder.reads.size(), 1 + row.first.size());
+    EXPECT_EQ(recorder.reads[0], 512u);
+    EXPECT_EQ(std::vector<UINTN>(recorder.reads.begin() + 1, recorder.reads.begin() + 1 + row.first.size()),
+              row.first);
+    UINT64 total = 0;
+    for (size_t i = 1; i < recorder.reads.size(); i++) {
+      EXPECT_LE(recorder.reads[i], i <= row.first.size() ? row.first[i - 1] : row.step);
+      total += recorder.reads[i];
+    }
+    EXPECT_EQ(total, row.firstStage - 512);
   }
-  EXPECT_EQ(total, spec.firstStageBytes - 512);
-  // The first extent ends in the middle of a step: the read stops there.
-  EXPECT_EQ(recorder.reads[2].second, 0x30000u - 512 - 100000);
 }
 
 // Without a preview and with an image of 1900000 bytes, 250000 bytes read
 // behind the header leave the bar at step 2: cells 0 and 1 finished, cell 2
 // being worked on, the rest not reached.
-TEST_F(ResumeRunTest, TheBarStandsAtTheStepOfTheBytesRead) {
-  constexpr UINT32 kWidth = 320, kHeight = 200;
-  fw.AddScreen({kWidth, kHeight, 32});
+TEST(ResumeRunTest, TheBarStandsAtTheStepOfTheBytesRead) {
+  nimbtest::ResumeScene scene;
+  scene.fw.InstallAcpi({});
+  scene.fw.AddScreen({kWidth, kHeight, 32});
   ResumeImageSpec spec;
   spec.imageBytes = 1900000;
   spec.firstStageBytes = 512 + 250000;
   spec.extentLengths = {0x10000, 0};
-  Install(spec);
-  ASSERT_EQ(fw.Call([] {
-                ASSERT_EQ(InitConsole(), EFI_SUCCESS);
-                TryResume();
-              }).end,
-            hostfw::RunEnd::KernelEntered);
+  scene.Install(spec);
+  ASSERT_EQ(Resume(scene, true).end, hostfw::RunEnd::KernelEntered);
   const UINT32 left = (kWidth - 190) / 2, top = kHeight - 97;
   const UINT32 levels[] = {230, 230, 174, 92, 92};
   for (UINT32 cell = 0; cell < 5; cell++)  // a pixel of full alpha in each cell
-    EXPECT_EQ(fw.ScreenPixel(left + 10 * cell + 3, top + 5) & 0xFF, levels[cell]) << "cell " << cell;
+    EXPECT_EQ(scene.fw.ScreenPixel(left + 10 * cell + 3, top + 5) & 0xFF, levels[cell]) << "cell " << cell;
 }
 
-TEST_F(ResumeRunTest, PreviewStageReadsWholeExtentsAndEndsAtTheSection) {
-  ResumeImageSpec spec;
-  spec.imageBytes = 1900000;
-  spec.firstStageBytes = 0x60000;
-  spec.previewBytes = 0x28000;
-  spec.extentLengths = {0x30000, 0};
-  Install(spec);
-  RecordReads();
-  ASSERT_EQ(Run().end, hostfw::RunEnd::KernelEntered);
-  const UINT64 previewStage = image.RestartCodeOffset() + 2 * 4096 + spec.previewBytes - 512;
-  ASSERT_GE(recorder.reads.size(), 3u);
-  EXPECT_EQ(recorder.reads[1].second, previewStage);  // one read, beyond a step of the bar
-  UINT64 total = 0;
-  for (size_t i = 2; i < recorder.reads.size(); i++) {
-    EXPECT_LE(recorder.reads[i].second, (1900000 - previewStage) / 19);
-    total += recorder.reads[i].second;
-  }
-  EXPECT_EQ(total, spec.firstStageBytes - 512 - previewStage);
-}
-
-TEST_F(ResumeRunTest, AFailedReadIsReportedAndResets) {
+TEST(ResumeRunTest, AFailedReadIsReportedAndResets) {
+  nimbtest::ResumeScene scene;
+  scene.fw.InstallAcpi({});
   ResumeImageSpec spec;
   spec.imageBytes = 0x100000;  // reads of a whole extent
-  Install(spec);
+  ResumeImage image = nimbtest::BuildResumeImage(spec);
+  scene.Install(image);
   // The second extent lies beyond the partition.
   image.extents[1].start = HibernatedMachine::kPartitionBlocks * 512;
-  std::vector<uint8_t> &disk = *machine.disk;
-  std::memcpy(disk.data() + HibernatedMachine::kPartitionStart * 512 + image.extents[0].start + 0x1F0,
-              &image.extents[1], 16);
-  EXPECT_EQ(Run().end, hostfw::RunEnd::Reset);
-  EXPECT_EQ(fw.ConOutText(), "!Read 800\r\n");
+  std::memcpy(
+      scene.machine.disk->data() + HibernatedMachine::kPartitionStart * 512 + image.extents[0].start + 0x1F0,
+      &image.extents[1], 16);
+  EXPECT_EQ(Resume(scene).end, hostfw::RunEnd::Reset);
+  EXPECT_EQ(scene.fw.ConOutText(), "!Read 800\r\n");
 }
 
 // OpenSSL's AES-CBC encryption without padding, with the image's IV.
@@ -256,15 +225,12 @@ std::vector<uint8_t> Encrypt(const std::vector<uint8_t> &key, const uint8_t *pla
 // it; with the others no preview and all but the header encrypted, so that
 // the restart code is copied as decrypted.
 TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
-  constexpr UINT32 kWidth = 320, kHeight = 200;
   for (size_t keySize : {16u, 24u, 32u}) {
     SCOPED_TRACE(keySize);
     const bool preview = keySize == 16;
     nimbtest::ResumeScene scene;
-    hostfw::Firmware &local = scene.fw;
-    local.InstallAcpi({});
-    local.AddScreen({kWidth, kHeight, 32});
-
+    scene.fw.InstallAcpi({});
+    scene.fw.AddScreen({kWidth, kHeight, 32});
     std::string error;
     const std::vector<uint8_t> picture = previewenc::EncodePreview(
         std::vector<uint32_t>(kWidth * kHeight, 0x00336699), kWidth, kHeight, 4, &error);
@@ -276,11 +242,10 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
       spec.previewPictureOffset = 8;
     }
     ResumeImage image = nimbtest::BuildResumeImage(spec);
-    const size_t section = image.RestartCodeOffset() + 2 * 4096;
+    const size_t code = image.RestartCodeOffset(), section = code + 2 * 4096;
     if (preview)
       std::copy(picture.begin(), picture.end(), image.bytes.begin() + section + 8);
-    const size_t encrypted =
-        (preview ? section + spec.previewBytes : image.RestartCodeOffset()) + 15 & ~size_t(15);
+    const size_t encrypted = (preview ? section + spec.previewBytes : code) + 15 & ~size_t(15);
     image.Header().encryptedOffset = encrypted;
     const std::vector<uint8_t> plain = image.bytes;
     std::vector<uint8_t> key(keySize);
@@ -290,128 +255,104 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
     std::copy(cipher.begin(), cipher.end(), image.bytes.begin() + encrypted);
 
     scene.Install(image, key);
-    local.GuardFreeMemory();
-    hostfw::RunResult result = local.Call([] {
-      ASSERT_EQ(InitConsole(), EFI_SUCCESS);
-      TryResume();
-    });
+    scene.fw.GuardFreeMemory();
+    const hostfw::RunResult result = Resume(scene, true);
     ASSERT_EQ(result.end, hostfw::RunEnd::KernelEntered);
     const UINT8 *header = reinterpret_cast<const UINT8 *>(result.gateArgument);
     const ResumeHeader &h = *reinterpret_cast<const ResumeHeader *>(header);
     EXPECT_EQ(std::memcmp(header + 512, plain.data() + 512, plain.size() - 512), 0) << "decrypted in place";
     const UINT8 *scratch = header - h.videoDelta;
     EXPECT_EQ(std::memcmp(scratch + kResumeChainBlockOffset, cipher.data() + cipher.size() - 16, 16), 0);
-    const size_t code = image.RestartCodeOffset();
     EXPECT_EQ(h.restoreSum, nimbtest::PageSums(
                                 std::vector<uint8_t>(plain.begin() + code, plain.begin() + code + 2 * 4096)));
     const ResumeVideoRecord &video = *reinterpret_cast<const ResumeVideoRecord *>(scratch);
-    EXPECT_EQ(video.width, kWidth);
-    EXPECT_EQ(video.height, kHeight);
-    EXPECT_EQ(video.depth, 32u);
+    EXPECT_EQ(std::vector<UINT64>({video.width, video.height, video.depth}),
+              std::vector<UINT64>({kWidth, kHeight, 32}));
     EXPECT_NE(video.baseAddress, 0u);
     // The preview, or the logo, and the bar's samples saved.
-    EXPECT_EQ(local.CallCount("UgaBlt") == 0, preview);
+    EXPECT_EQ(scene.fw.CallCount("UgaBlt") == 0, preview);
     const UINT8 *table = scratch + kResumeSaveTableOffset;
     EXPECT_TRUE(std::any_of(table, table + kProgressSaveTableBytes, [](UINT8 b) { return b != 0; }));
-    EXPECT_EQ(local.FindVariable(kResumeKeyVariable, gNimbVendorVariableGuid), nullptr);
+    EXPECT_FALSE(scene.Has(kResumeKeyVariable));
     // The key's bytes stand nowhere in the loader's pool any more.
-    for (const MemoryTag *tag = gMemoryTags; tag != nullptr; tag = tag->next) {
-      if (tag->poolAddress != nullptr && std::memcmp(tag->poolAddress, key.data(), 8) == 0)
-        ADD_FAILURE() << "key bytes left in pool";
-    }
+    for (const MemoryTag *tag = gMemoryTags; tag != nullptr; tag = tag->next)
+      EXPECT_FALSE(tag->poolAddress != nullptr && std::memcmp(tag->poolAddress, key.data(), 8) == 0);
   }
 }
 
 // Every limit the header must keep: broken, the machine resets before it
 // leaves boot services, and nothing outside what the loader holds is
 // touched (the free memory is guarded).
-TEST_F(ResumeRunTest, AHeaderBreakingALimitResets) {
-  struct Case {
+TEST(ResumeRunTest, AHeaderBreakingALimitResets) {
+  using Spec = std::function<void(ResumeImageSpec &)>;
+  using Change = std::function<void(ResumeImage &)>;
+  const struct Case {
     const char *name;
-    std::function<void(ResumeImageSpec &)> spec;
-    std::function<void(ResumeImage &)> image;  // after the build
+    Spec spec;
+    Change image = [](ResumeImage &) {};  // after the build; the list goes back into the bytes
     std::vector<uint8_t> key = std::vector<uint8_t>(16, 0x4B);
     std::function<void(hostfw::Firmware &)> fault;  // a Fatal before the key is taken
-  };
-  auto same = [](ResumeImage &) {};
-  auto header = [](std::function<void(ResumeHeader &)> change) {
-    return [change](ResumeImage &image) { change(image.Header()); };
-  };
-  const Case cases[] = {
-      {"first stage below 512", [](auto &) {}, header([](auto &h) { h.firstStageBytes = 511; })},
-      {"first stage of 4 GiB", [](auto &) {}, header([](auto &h) { h.firstStageBytes = 1ull << 32; })},
-      {"image smaller than its first stage", [](auto &) {}, header([](auto &h) { h.imageBytes = 0x5FFF; })},
-      {"restart code past the first stage", [](auto &s) { s.restorePageCount = 6; }, same},
-      {"preview past the first stage", [](auto &s) { s.previewBytes = 0x5000; }, same},
+  } cases[] = {
+      {"first stage below 512", [](auto &) {}, [](auto &i) { i.Header().firstStageBytes = 511; }},
+      {"first stage of 4 GiB", [](auto &) {}, [](auto &i) { i.Header().firstStageBytes = 1ull << 32; }},
+      {"image smaller than its first stage", [](auto &) {}, [](auto &i) { i.Header().imageBytes = 0x5FFF; }},
+      {"restart code past the first stage", [](auto &s) { s.restorePageCount = 6; }},
+      {"preview past the first stage", [](auto &s) { s.previewBytes = 0x5000; }},
       {"preview inside the header",
        [](auto &s) {
          s.restorePageCount = 0;
          s.previewBytes = 1;
          s.extentLengths = {0x6000};
-       },
-       same},
-      {"restart code's home across 4 GiB", [](auto &s) { s.restorePage = 0xFFFFF; }, same},
-      {"runtime area across 4 GiB",
-       [](auto &s) {
-         s.runtimePage = 0xFFFF0;
-         s.runtimePageCount = 0x20;
-       },
-       same},
-      {"restart code's home in use",
-       [](auto &s) {
-         s.restorePage = 0x3FFFF;
-         s.restorePageCount = 1;
-       },
-       same},
-      {"runtime area too small", [](auto &s) { s.runtimePageCount = 5; }, same},
-      {"no runtime area", [](auto &s) { s.runtimePageCount = 0; }, same},
-      {"encrypted from past the first stage", [](auto &s) { s.encryptedOffset = 0x6000; }, same},
-      {"encrypted part not whole blocks", [](auto &s) { s.encryptedOffset = 0x1008; }, same},
-      {"encrypted header", [](auto &s) { s.encryptedOffset = 0x100; }, same},
-      {"encrypted extent list", [](auto &s) { s.encryptedOffset = 0x200; }, same},
-      {"encrypted without a key", [](auto &s) { s.encryptedOffset = 0x1000; }, same, {}},
-      {"encrypted with a key of 20 bytes", [](auto &s) { s.encryptedOffset = 0x1000; }, same,
+       }},
+      {"restart code's home across 4 GiB", [](auto &s) { s.restorePage = 0xFFFFF; }},
+      {"runtime area across 4 GiB", [](auto &s) { s.runtimePage = 0xFFFF0, s.runtimePageCount = 0x20; }},
+      {"restart code's home in use", [](auto &s) { s.restorePage = 0x3FFFF, s.restorePageCount = 1; }},
+      {"runtime area too small", [](auto &s) { s.runtimePageCount = 5; }},
+      {"no runtime area", [](auto &s) { s.runtimePageCount = 0; }},
+      {"encrypted from past the first stage", [](auto &s) { s.encryptedOffset = 0x6000; }},
+      {"encrypted part not whole blocks", [](auto &s) { s.encryptedOffset = 0x1008; }},
+      {"encrypted header", [](auto &s) { s.encryptedOffset = 0x100; }},
+      {"encrypted extent list", [](auto &s) { s.encryptedOffset = 0x200; }},
+      {"encrypted without a key", [](auto &s) { s.encryptedOffset = 0x1000; }, [](auto &) {}, {}},
+      {"encrypted with a key of 20 bytes", [](auto &s) { s.encryptedOffset = 0x1000; }, [](auto &) {},
        std::vector<uint8_t>(20, 0x4B)},
       {"first extent below 512",
        [](auto &s) {
          s.extentLengths = {0x100, 0x800, 0};
        },
-       same},
-      {"extents short of the first stage", [](auto &) {},
-       [](ResumeImage &image) { image.extents[2].length -= 16; }},
+       [](auto &i) { i.extents[1].start = i.extents[0].start + 0x100; }},
+      {"extents short of the first stage", [](auto &) {}, [](auto &i) { i.extents[2].length -= 16; }},
       {"an entry not read yet",
        [](auto &s) {
          s.extentLengths = {512, 8, 0};
-       },
-       same},
-      {"an extent list of no entry", [](auto &) {}, header([](auto &h) { h.extentBytes = 8; })},
-      {"no pool for memory tags", [](auto &) {}, same, std::vector<uint8_t>(16, 0x4B),
+       }},
+      {"an extent list of no entry", [](auto &s) { s.extentLengths = {0x6000}; },
+       [](auto &i) { i.Header().extentBytes = 8; }},
+      {"no pool for memory tags", [](auto &) {}, [](auto &) {}, std::vector<uint8_t>(16, 0x4B),
        [](hostfw::Firmware &f) { f.FailPoolAllocationOfSize(kMemoryTagBlockSize); }},
   };
   for (const Case &c : cases) {
     SCOPED_TRACE(c.name);
     nimbtest::ResumeScene scene;
-    hostfw::Firmware &local = scene.fw;
-    local.InstallAcpi({});
+    scene.fw.InstallAcpi({});
     ResumeImageSpec spec;
     c.spec(spec);
     ResumeImage broken = nimbtest::BuildResumeImage(spec);
     c.image(broken);
-    // The list as changed goes back into the image's bytes.
     for (size_t i = 0; i < broken.extents.size() && 0x1E0 + 16 * i + 16 <= broken.bytes.size(); i++)
       std::memcpy(broken.bytes.data() + 0x1E0 + 16 * i, &broken.extents[i], 16);
     scene.Install(broken, c.key);
-    local.GuardFreeMemory();
+    scene.fw.GuardFreeMemory();
     if (c.fault)
-      c.fault(local);
-    hostfw::RunResult result = local.Call([] { TryResume(); });
+      c.fault(scene.fw);
+    const hostfw::RunResult result = Resume(scene);
     EXPECT_EQ(result.end, hostfw::RunEnd::Reset);
     EXPECT_EQ(result.resetType, EfiResetCold);
-    EXPECT_FALSE(local.BootServicesExited());
-    EXPECT_EQ(local.FindVariable(kResumeKeyVariable, gNimbVendorVariableGuid) == nullptr, !c.fault);
-    EXPECT_EQ(local.ConOutText(), c.fault ? "Can't allocate memory tag" : "");
+    EXPECT_FALSE(scene.fw.BootServicesExited());
+    EXPECT_EQ(!scene.Has(kResumeKeyVariable), !c.fault);
+    EXPECT_EQ(scene.fw.ConOutText(), c.fault ? "Can't allocate memory tag" : "");
     TrackedFreeAll();
-    EXPECT_EQ(local.AllocatedPages(), 0u);
+    EXPECT_EQ(scene.fw.AllocatedPages(), 0u);
   }
 }
 

@@ -252,68 +252,6 @@ TEST_F(RuntimeMapTest, TableEntriesAndTheSystemTableFollowTheirRegion) {
   }
 }
 
-TEST_F(RuntimeMapTest, TheFirmwaresOwnMapEndToEnd) {
-  const UINT64 kArea = 0x1000000;
-  for (bool resume : {false, true}) {
-    SCOPED_TRACE(resume ? "resume" : "normal boot");
-    Scene scene({}, kArea);
-    scene.fw.AddMemoryRegion(EfiLoaderData, kArea, 64, 0);
-    EFI_SYSTEM_TABLE *old = scene.fw.SystemTable();
-    const void *vendor = old->FirmwareVendor;
-    scene.fw.AddConfigurationTable(gEfiAcpi20TableGuid, const_cast<void *>(vendor));
-    const EFI_SYSTEM_TABLE before = *old;
-
-    size_t announced = 0, moved = 0;
-    UINT64 pages = 0;
-    for (const EFI_MEMORY_DESCRIPTOR &d : scene.fw.MemoryMap()) {
-      Region r = {d.Type, d.PhysicalStart, d.NumberOfPages, d.Attribute, 0, 0};
-      announced += Announced(r);
-      moved += Moves(r);
-      pages += Announced(r) ? r.pages : 0;
-    }
-    ASSERT_GE(moved, 2u);
-    UINTN size = 0, key = 0, descriptorSize = 0;
-    UINT32 version = 0;
-    ASSERT_EQ(nimb::gBS->GetMemoryMap(&size, nullptr, &key, &descriptorSize, &version), EFI_BUFFER_TOO_SMALL);
-    scene.map.assign(size + moved * descriptorSize, 0);
-    ASSERT_EQ(nimb::gBS->GetMemoryMap(&size, scene.Descriptor(0), &key, &descriptorSize, &version),
-              EFI_SUCCESS);
-    ASSERT_EQ(scene.fw.BootServices()->ExitBootServices(scene.fw.ImageHandle(), key), EFI_SUCCESS);
-    nimb::gBS = nullptr;
-    EFI_MEMORY_DESCRIPTOR *start = scene.Descriptor(0);
-    EFI_MEMORY_DESCRIPTOR *end = scene.Descriptor(size / descriptorSize);
-    EFI_MEMORY_DESCRIPTOR *cursor = resume ? start : end;
-    UINT64 next = kArea;
-    hostfw::RunResult run = scene.fw.Call(
-        [&] { nimb::MapRuntimeServices(start, end, &cursor, descriptorSize, version, &next, resume); });
-
-    ASSERT_EQ(run.end, hostfw::RunEnd::Returned);
-    EXPECT_EQ(next, kArea + pages * EFI_PAGE_SIZE);
-    EXPECT_EQ(scene.fw.VirtualMap().size(), resume ? announced : size / descriptorSize);
-    EXPECT_EQ(cursor, resume ? scene.Descriptor(announced) : scene.Descriptor(size / descriptorSize + moved));
-    // The system table moved into the area, whole; the firmware converted
-    // its pointers into the same region when it was told the map.
-    UINT64 at = reinterpret_cast<UINTN>(nimb::gST);
-    EXPECT_TRUE(at >= kArea && at < next);
-    UINT64 delta = at - reinterpret_cast<UINTN>(old);
-    EXPECT_EQ(nimb::gST->NumberOfTableEntries, before.NumberOfTableEntries);
-    EXPECT_EQ(reinterpret_cast<UINTN>(nimb::gST->ConfigurationTable),
-              reinterpret_cast<UINTN>(before.ConfigurationTable) + delta);
-    EXPECT_EQ(nimb::gST->RuntimeServices->Hdr.Signature, EFI_RUNTIME_SERVICES_SIGNATURE);
-    if (resume) {
-      // The old place stays, and with it the table the entry was fixed in.
-      EXPECT_EQ(old->Hdr.Signature, EFI_SYSTEM_TABLE_SIGNATURE);
-      EXPECT_EQ(reinterpret_cast<UINTN>(old->ConfigurationTable[old->NumberOfTableEntries - 1].VendorTable),
-                reinterpret_cast<UINTN>(vendor) + delta);
-      for (size_t i = 0; i < announced; i++)
-        EXPECT_EQ(scene.Descriptor(i)->PhysicalStart, scene.Descriptor(i)->VirtualStart) << i;
-    } else {
-      EXPECT_EQ(old->Hdr.Signature, 0u);
-    }
-    EXPECT_TRUE(scene.fw.ViolationsAfterExit().empty());
-  }
-}
-
 TEST_F(RuntimeMapTest, ARefusedMapStopsWithoutBootServices) {
   struct Row {
     bool resume;
@@ -348,28 +286,20 @@ TEST_F(RuntimeMapTest, OverlappingPlacesAreCopiedInASafeOrder) {
     UINT64 next;
     bool ring;
   };
+  const UINT32 c = EfiRuntimeServicesCode, d = EfiRuntimeServicesData;
   const Row rows[] = {
-      {"down over its own old place",
-       {{EfiRuntimeServicesCode, 0x102000, 4, kRt, 0, 0x100000}},
-       0x100000,
-       false},
-      {"up over its own old place",
-       {{EfiRuntimeServicesCode, 0x100000, 4, kRt, 0, 0x102000}},
-       0x102000,
-       false},
+      {"down over its own old place", {{c, 0x102000, 4, kRt, 0, 0x100000}}, 0x100000, false},
+      {"up over its own old place", {{c, 0x100000, 4, kRt, 0, 0x102000}}, 0x102000, false},
       {"over the old place of the next region",
-       {{EfiRuntimeServicesData, 0x100000, 2, kRt, 0, 0x101000},
-        {EfiRuntimeServicesCode, 0x102000, 2, kRt, 0, 0x103000}},
+       {{d, 0x100000, 2, kRt, 0, 0x101000}, {c, 0x102000, 2, kRt, 0, 0x103000}},
        0x101000,
        false},
       {"over the old place of the region before",
-       {{EfiRuntimeServicesData, 0x104000, 1, kRt, 0, 0x101000},
-        {EfiRuntimeServicesCode, 0x100000, 2, kRt, 0, 0x102000}},
+       {{d, 0x104000, 1, kRt, 0, 0x101000}, {c, 0x100000, 2, kRt, 0, 0x102000}},
        0x101000,
        false},
       {"two regions trading places",
-       {{EfiRuntimeServicesData, 0x102000, 1, kRt, 0, 0x101000},
-        {EfiRuntimeServicesCode, 0x101000, 1, kRt, 0, 0x102000}},
+       {{d, 0x102000, 1, kRt, 0, 0x101000}, {c, 0x101000, 1, kRt, 0, 0x102000}},
        0x101000,
        true},
   };
@@ -408,45 +338,29 @@ TEST_F(RuntimeMapTest, TheRuntimeAreaMustLieInFreeMemoryBelow4GiB) {
     UINT64 spare;
     bool free;
   };
+  const UINT64 n = kFreePages, p = EFI_PAGE_SIZE;
+  const UINT32 code = EfiRuntimeServicesCode, free = EfiConventionalMemory;
   const Row rows[] = {
-      {"runtime pages and spare fit",
-       {{EfiRuntimeServicesCode, 0x300000, 4, kRt, 0, 0}},
-       kFree,
-       0x2000,
-       true},
-      {"across two free descriptors",
-       {{EfiConventionalMemory, kFree + kFreePages * EFI_PAGE_SIZE, 8, 0, 0, 0}},
-       kFree + (kFreePages - 2) * EFI_PAGE_SIZE,
-       0x4000,
-       true},
-      {"the spare is not written: it may lie in used memory",
-       {},
-       kFree + (kFreePages - 1) * EFI_PAGE_SIZE,
-       0x2000,
-       true},
-      {"the runtime pages run past it",
-       {{EfiRuntimeServicesData, 0x300000, kFreePages, kRt, 0, 0}},
-       kFree + EFI_PAGE_SIZE,
-       0,
-       false},
+      {"runtime pages and spare fit", {{code, 0x300000, 4, kRt, 0, 0}}, kFree, 0x2000, true},
+      {"across two free descriptors", {{free, kFree + n * p, 8, 0, 0, 0}}, kFree + (n - 2) * p, 0x4000, true},
+      {"the spare is not written: it may lie in used memory", {}, kFree + (n - 1) * p, 0x2000, true},
+      {"the runtime pages run past it", {{code, 0x300000, n, kRt, 0, 0}}, kFree + p, 0, false},
       {"reserved and non-runtime pages take no room",
-       {{EfiReservedMemoryType, 0x300000, kFreePages, kRt, 0, 0},
-        {EfiBootServicesData, 0x400000, kFreePages, 0, 0, 0}},
+       {{EfiReservedMemoryType, 0x300000, n, kRt, 0, 0}, {EfiBootServicesData, 0x400000, n, 0, 0, 0}},
        kFree,
-       kFreePages * EFI_PAGE_SIZE,
+       n * p,
        true},
       {"memory-mapped I/O takes addresses, not memory",
-       {{EfiRuntimeServicesCode, 0x300000, 4, kRt, 0, 0},
-        {EfiMemoryMappedIO, 0xFEC00000, 4 * kFreePages, kRt, 0, 0}},
+       {{code, 0x300000, 4, kRt, 0, 0}, {EfiMemoryMappedIO, 0xFEC00000, 4 * n, kRt, 0, 0}},
        kFree,
        0,
        true},
       {"a region's new place is in used memory",
-       {{EfiLoaderData, 0x80000, 0x80, 0, 0, 0}, {EfiRuntimeServicesCode, 0x300000, 1, kRt, 0, 0}},
+       {{EfiLoaderData, 0x80000, 0x80, 0, 0, 0}, {code, 0x300000, 1, kRt, 0, 0}},
        0x90000,
        0,
        false},
-      {"beyond 4 GiB", {{EfiConventionalMemory, 0xFFFFF000, 0x100, 0, 0, 0}}, 0xFFFFF000, 0x2000, false},
+      {"beyond 4 GiB", {{free, 0xFFFFF000, 0x100, 0, 0, 0}}, 0xFFFFF000, 0x2000, false},
   };
   for (const Row &row : rows) {
     SCOPED_TRACE(row.what);

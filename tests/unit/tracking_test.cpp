@@ -3,6 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
+#include <random>
 #include <set>
 #include <vector>
 
@@ -129,6 +131,50 @@ TEST_F(TrackingTest, PagesAreTaggedOnlyWhenTheFirmwareGivesThem) {
 
   nimb::TrackedFreeAll();
   ExpectNothingHeld();
+}
+
+// Hundreds of live tags freed in any order (past a long walk, through the
+// index): the live ones stay tagged, and all goes back.
+TEST_F(TrackingTest, ManyFreesInAnyOrder) {
+  for (bool withPages : {false, true}) {
+    std::vector<void *> buffers;
+    for (int i = 0; i < 1600; i++) {
+      buffers.push_back(nimb::TrackedAllocatePool(8));
+      EFI_PHYSICAL_ADDRESS pages = 0;
+      if (withPages && i % 400 == 200)
+        ASSERT_EQ(nimb::TrackedAllocatePages(AllocateAnyPages, EfiLoaderData, 1, &pages), EFI_SUCCESS);
+    }
+    // Oldest first, then every other from the newest, then the rest shuffled.
+    std::vector<void *> order(buffers.begin(), buffers.begin() + 300);
+    for (size_t i = buffers.size() - 1; i >= 300; i -= 2)
+      order.push_back(buffers[i]);
+    std::vector<void *> rest;
+    for (size_t i = buffers.size() - 2; i >= 300; i -= 2)
+      rest.push_back(buffers[i]);
+    std::shuffle(rest.begin(), rest.end(), std::mt19937(7));
+    order.insert(order.end(), rest.begin(), rest.end());
+    std::multiset<void *> live(buffers.begin(), buffers.end());
+    void *untracked = nimb::AllocatePool(8);
+    for (size_t n = 0; n < order.size(); n++) {
+      ASSERT_EQ(nimb::TrackedFree(order[n]), EFI_SUCCESS);
+      live.erase(order[n]);
+      if (n == 200)
+        EXPECT_EQ(nimb::TrackedFree(untracked), EFI_SUCCESS);
+      if (n % 16 != 0)
+        continue;
+      std::multiset<void *> tagged;
+      for (const MemoryTag *tag = gMemoryTags; tag != nullptr; tag = tag->next)
+        if (tag->poolAddress != nullptr)
+          tagged.insert(tag->poolAddress);
+      ASSERT_EQ(tagged, live) << withPages << " after " << n;
+    }
+    EXPECT_EQ(Length(gMemoryTags), withPages ? 4u : 0u);
+    // Nothing but the tag blocks when no tag is left.
+    if (!withPages)
+      EXPECT_EQ(fw.LivePoolBlocks(), Length(gMemoryTagBlocks));
+    nimb::TrackedFreeAll();
+    ExpectNothingHeld();
+  }
 }
 
 TEST_F(TrackingTest, ARefusedBufferLeavesNoTagAndNoBlockIsFatal) {
