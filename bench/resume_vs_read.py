@@ -13,6 +13,13 @@ restart code. QEMU runs with -cpu max (TCG), whose processor model has the
 AES instructions. The TSC follows virtual time under TCG: only the ratio of
 the two times in one run means anything.
 
+The platform also prints the counter around each of the loader's DiskIO
+reads, which splits the loader's time: up to its first read of the image
+(discovery, the memory plan, the first drawing), the reads themselves, the
+time between reads (the bar, the loop), from the last read to the
+restart's GetMemoryMap (the decryption), and from there to the probe
+(ExitBootServices, the runtime map, the copy of the restart code).
+
     bench/resume_vs_read.py [--efi-dir build/efi] [--guest-dir build/tests/guest]
 
 Prints `figure resume-vs-read: loader ... vs DiskIO read ... = R.RRx`, R
@@ -37,6 +44,9 @@ TIMED_READ = re.compile(r"platform: timed read (\d+) bytes, (\d+) extents, (\d+)
 # The platform's moment before StartImage and the probe's at its entry.
 LOADER_START = re.compile(r"platform: tsc start-image=0x([0-9a-f]+)")
 PROBE_ENTRY = re.compile(r"kernel: tsc entry=0x([0-9a-f]+)")
+# The platform's moments around each of the loader's DiskIO reads.
+READ_MOMENT = re.compile(r"platform: tsc read-(begin|end)=0x([0-9a-f]+)")
+MEMORY_MAP = re.compile(r"platform: tsc memory-map=0x([0-9a-f]+)")
 
 BENCH = Scenario(
     "resume_vs_read",
@@ -69,7 +79,30 @@ def measure(efi_dir, guest_dir, keep):
         return None
     if not keep:
         shutil.rmtree(workdir, ignore_errors=True)
-    return int(start[-1], 16), int(entry[-1], 16), int(read.group(3)), int(read.group(2))
+    moments = [(kind, int(value, 16)) for kind, value in READ_MOMENT.findall(log)]
+    reads = [(moments[i][1], moments[i + 1][1]) for i in range(0, len(moments) - 1, 2)
+             if moments[i][0] == "begin" and moments[i + 1][0] == "end"]
+    maps = [int(value, 16) for value in MEMORY_MAP.findall(log)]
+    return int(start[-1], 16), int(entry[-1], 16), int(read.group(3)), int(read.group(2)), reads, maps
+
+
+def breakdown(start, entry, reads, maps):
+    """The loader's time in four parts, from its DiskIO reads' moments."""
+    if not reads:
+        return None
+    header, image = reads[0], reads[1:]
+    first = image[0][0] if image else header[1]
+    last = image[-1][1] if image else header[1]
+    reading = sum(end - begin for begin, end in image)
+    # The restart's GetMemoryMap comes right after the decryption.
+    restart = maps[-1] if maps and last <= maps[-1] <= entry else entry
+    return [
+        ("start to the first read of the image (discovery, plan, first drawing)", first - start),
+        (f"the image's reads ({len(image)} DiskIO calls)", reading),
+        ("between the reads (bar, loop)", last - first - reading),
+        ("last read to the restart's GetMemoryMap (decryption, key wiped)", restart - last),
+        ("GetMemoryMap to the probe (ExitBootServices, runtime map, restart code)", entry - restart),
+    ]
 
 
 def main(argv=None):
@@ -81,8 +114,11 @@ def main(argv=None):
     measured = measure(args.efi_dir, args.guest_dir, args.keep)
     if measured is None:
         return 1
-    start, entry, read_ticks, extents = measured
+    start, entry, read_ticks, extents, reads, maps = measured
     loader_ticks = entry - start
+    parts = breakdown(start, entry, reads, maps)
+    for name, ticks in parts or []:
+        print(f"resume-vs-read: {name}: {ticks / 1e6:.1f} Mticks ({100 * ticks / loader_ticks:.0f}%)")
     mib = FIRST_STAGE / (1 << 20)
     print(f"resume-vs-read: {extents} extents; loader {loader_ticks} ticks, DiskIO read {read_ticks} ticks")
     print(

@@ -22,6 +22,9 @@ typedef EFI_STATUS(EFIAPI *ReadDiskFunction)(EFI_DISK_IO_PROTOCOL *This, UINT32 
                                              UINTN BufferSize, VOID *Buffer);
 typedef VOID(EFIAPI *ResetSystemFunction)(EFI_RESET_TYPE ResetType, EFI_STATUS ResetStatus, UINTN DataSize,
                                           const VOID *ResetData);
+typedef EFI_STATUS(EFIAPI *GetMemoryMapFunction)(UINTN *MemoryMapSize, EFI_MEMORY_DESCRIPTOR *MemoryMap,
+                                                 UINTN *MapKey, UINTN *DescriptorSize,
+                                                 UINT32 *DescriptorVersion);
 typedef EFI_STATUS(EFIAPI *CalculateCrc32Function)(const VOID *Data, UINTN DataSize, UINT32 *Crc32);
 
 constexpr UINT32 kMaxDiskInterfaces = 32;
@@ -47,7 +50,9 @@ LoggedRead gReads[kMaxLoggedReads];
 UINT64 gReadCount;
 UINT64 gReadBytes;
 UINT32 gReadDepth;
+bool gTimeReads;
 ResetSystemFunction gOriginalReset;
+GetMemoryMapFunction gOriginalGetMemoryMap;
 
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
                                   VOID *Buffer) {
@@ -64,10 +69,16 @@ EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UI
   }
   // A partition's DiskIO reads through its disk's: only the outer call is
   // the caller's.
+  const UINT64 begin = ReadTsc();
   gReadDepth++;
   const EFI_STATUS status = original(This, MediaId, Offset, BufferSize, Buffer);
   if (--gReadDepth != 0) {
     return status;
+  }
+  if (gTimeReads) {
+    const UINT64 end = ReadTsc();
+    ReportTsc("read-begin", begin);
+    ReportTsc("read-end", end);
   }
   if (gReadCount < kMaxLoggedReads) {
     gReads[gReadCount] = {partition, Offset, BufferSize, reinterpret_cast<UINT64>(Buffer), status};
@@ -75,6 +86,14 @@ EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UI
   gReadCount++;
   gReadBytes += BufferSize;
   return status;
+}
+
+// With the reads timed: the counter at each GetMemoryMap call, the last of
+// which, before a restart, comes right after the decryption.
+EFI_STATUS EFIAPI TimedGetMemoryMap(UINTN *MemoryMapSize, EFI_MEMORY_DESCRIPTOR *MemoryMap, UINTN *MapKey,
+                                    UINTN *DescriptorSize, UINT32 *DescriptorVersion) {
+  ReportTsc("memory-map", ReadTsc());
+  return gOriginalGetMemoryMap(MemoryMapSize, MemoryMap, MapKey, DescriptorSize, DescriptorVersion);
 }
 
 // Only port output here: the call may come after ExitBootServices.
@@ -125,6 +144,14 @@ UINT64 ReadLe(const UINT8 *bytes, UINT32 count) {
   return value;
 }
 
+// The table's checksum again, after one of its functions was replaced.
+void SealTable(EFI_TABLE_HEADER *header) {
+  header->CRC32 = 0;
+  UINT32 crc = 0;
+  reinterpret_cast<CalculateCrc32Function>(gBS->CalculateCrc32)(header, header->HeaderSize, &crc);
+  header->CRC32 = crc;
+}
+
 }  // namespace
 
 UINT32 CountBoot() {
@@ -156,7 +183,8 @@ void ReportResumeVariables() {
   SerialPrintf("\n");
 }
 
-void WatchDiskAndReset() {
+void WatchDiskAndReset(bool timeReads) {
+  gTimeReads = timeReads;
   UINTN count = 0;
   EFI_HANDLE *handles = nullptr;
   if (!EFI_ERROR(gBS->LocateHandleBuffer(ByProtocol, &gEfiDiskIoProtocolGuid, nullptr, &count, &handles))) {
@@ -171,12 +199,14 @@ void WatchDiskAndReset() {
     }
     gBS->FreePool(handles);
   }
+  if (timeReads) {
+    gOriginalGetMemoryMap = gBS->GetMemoryMap;
+    gBS->GetMemoryMap = TimedGetMemoryMap;
+    SealTable(&gBS->Hdr);
+  }
   gOriginalReset = gRT->ResetSystem;
   gRT->ResetSystem = WatchedResetSystem;
-  gRT->Hdr.CRC32 = 0;
-  UINT32 crc = 0;
-  reinterpret_cast<CalculateCrc32Function>(gBS->CalculateCrc32)(gRT, gRT->Hdr.HeaderSize, &crc);
-  gRT->Hdr.CRC32 = crc;
+  SealTable(&gRT->Hdr);
   SerialPrintf("platform: watching %u disk interfaces and the reset\n", static_cast<UINT64>(gDiskCount));
 }
 

@@ -27,8 +27,11 @@ void ReportKeyCopies(const ConfigEntryList &variables);
 // Wraps ReadDisk of every DiskIO interface and the runtime services'
 // ResetSystem: every read is logged, and a reset prints the log before it
 // goes to the firmware ("platform: reset cold", "platform: read ...",
-// "platform: reads N, bytes B").
-void WatchDiskAndReset();
+// "platform: reads N, bytes B"). With `timeReads`, each read also prints the
+// counter at its start and end ("platform: tsc read-begin=",
+// "platform: tsc read-end=") as it returns, and each GetMemoryMap call
+// the counter as it starts ("platform: tsc memory-map=").
+void WatchDiskAndReset(bool timeReads);
 
 // Reads the extents of `request` (u32 partition number, then u64 start and
 // u64 length pairs, little-endian) through the firmware's DiskIO on that

@@ -29,6 +29,8 @@ UINT64 gCallGate;
 UINT64 gKernelEntry;
 
 void ExitBoot(EFI_STATUS status) {
+  // A resume under way has no way back to the firmware: it resets.
+  ResumeResetExit();
   if (gSpinnerEvent != nullptr) {
     gBS->CloseEvent(gSpinnerEvent);
     gSpinnerEvent = nullptr;

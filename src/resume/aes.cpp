@@ -26,124 +26,215 @@ inline UINT32 ThroughTable(const UINT32 (*table)[256], UINT32 word) {
          table[3][Byte(word, 3)];
 }
 
-// A round of decryption, in assembly so that the state stays in the four
-// registers whose second byte x86 can address (movzbl %ah): five operations
-// take a word apart into its four table indexes.
+// --- the table path ---------------------------------------------------------------
 //
-// New column c is the XOR of the inverse round table's sub-table 0 at byte 0
-// of column c, sub-table 1 at byte 1 of column c + 3, sub-table 2 at byte 2
-// of column c + 2, sub-table 3 at byte 3 of column c + 1 (InvShiftRows), and
-// the round key. The code walks it the other way round: each old column
-// hands its four bytes to four new columns. Round `round`'s key lies at
-// byte 16 x round of the schedule.
+// New column c of a round is the XOR of the inverse round table's sub-table
+// 0 at byte 0 of column c, sub-table 1 at byte 1 of column c + 3, sub-table
+// 2 at byte 2 of column c + 2, sub-table 3 at byte 3 of column c + 1
+// (InvShiftRows), and the round key. The code walks it the other way round:
+// each old column hands its four bytes to four new columns.
+//
+// Two blocks run side by side (CBC decryption has no chain between blocks),
+// so that one block's work fills the other's waits for its table loads.
+// All of it is one assembly routine with every register fixed, so that no
+// state, key word or pointer of a round goes through the stack:
+//
+//   eax ebx ecx edx   the state of the round at work, whose bytes are taken
+//                     apart with the second-byte registers (movzbl %ah):
+//                     5 operations a column, the fewest x86 allows
+//   r8d-r11d          block A between its rounds
+//   r12d-r15d         block B between its rounds
+//   rsi               the table; rdi the schedule + 128, so that every
+//                     round key lies within an 8-bit displacement; ebp the
+//                     index
+//
+// A round moves a block's state into eax to edx (register moves, which the
+// processor does without an execution unit) and leaves the new state in
+// the block's own registers.
+//
+// The rounds are unrolled from round 13 down: a 128-bit key enters at
+// round 9, a 192-bit key at round 11, a 256-bit key at round 13, the entry
+// chosen once per call. Before it returns the routine clears every general
+// register it used, so that no key or state word stays behind.
+
+// What the routine takes, in one record: one pointer argument under either
+// build's calling convention.
+struct TableJob {
+  const UINT8 *input;
+  UINT8 *output;
+  const UINT8 *iv;
+  const UINT32 *schedule;
+  const UINT32 (*roundTable)[256];
+  const UINT32 (*lastRoundTable)[256];
+  UINT64 blockCount;
+  UINT64 rounds;
+};
+static_assert(__builtin_offsetof(TableJob, input) == 0 && __builtin_offsetof(TableJob, output) == 8 &&
+                  __builtin_offsetof(TableJob, iv) == 16 && __builtin_offsetof(TableJob, schedule) == 24 &&
+                  __builtin_offsetof(TableJob, roundTable) == 32 &&
+                  __builtin_offsetof(TableJob, lastRoundTable) == 40 &&
+                  __builtin_offsetof(TableJob, blockCount) == 48 &&
+                  __builtin_offsetof(TableJob, rounds) == 56,
+              "the assembly reads the record at these offsets");
+
 // clang-format off
-#define AES_FROM(s, a, b, c, d, table)               \
-  "movzbl %b[" s "], %%esi\n\t"                      \
-  "movzbl %h[" s "], %%edi\n\t"                      \
-  "xorl (%[" table "],%%rsi,4), %[" a "]\n\t"        \
-  "xorl 1024(%[" table "],%%rdi,4), %[" b "]\n\t"    \
-  "shrl $16, %[" s "]\n\t"                           \
-  "movzbl %b[" s "], %%esi\n\t"                      \
-  "movzbl %h[" s "], %%edi\n\t"                      \
-  "xorl 2048(%[" table "],%%rsi,4), %[" c "]\n\t"    \
-  "xorl 3072(%[" table "],%%rdi,4), %[" d "]\n\t"
-#define AES_ROUND(round, table)                      \
-  "movl 16*" #round "+0(%[k]), %[n0]\n\t"           \
-  "movl 16*" #round "+4(%[k]), %[n1]\n\t"           \
-  "movl 16*" #round "+8(%[k]), %[n2]\n\t"           \
-  "movl 16*" #round "+12(%[k]), %[n3]\n\t"          \
-  AES_FROM("s0", "n0", "n1", "n2", "n3", table)      \
-  AES_FROM("s1", "n1", "n2", "n3", "n0", table)      \
-  AES_FROM("s2", "n2", "n3", "n0", "n1", table)      \
-  AES_FROM("s3", "n3", "n0", "n1", "n2", table)      \
-  "movl %[n0], %[s0]\n\t"                           \
-  "movl %[n1], %[s1]\n\t"                           \
-  "movl %[n2], %[s2]\n\t"                           \
-  "movl %[n3], %[s3]\n\t"
-// One round of the state (x0, x1, x2, x3).
-#define AES_ONE_ROUND(round, table, x0, x1, x2, x3)                                       \
-  __asm__(AES_ROUND(round, table)                                                         \
-          : [s0] "+a"(x0), [s1] "+b"(x1), [s2] "+c"(x2), [s3] "+d"(x3),                   \
-            [n0] "=&r"(n0), [n1] "=&r"(n1), [n2] "=&r"(n2), [n3] "=&r"(n3)                \
-          : [k] "r"(schedule), [t] "r"(kAesInverseRoundTable), [l] "r"(kAesInverseLastRoundTable) \
-          : "rsi", "rdi", "cc", "memory")
-// clang-format on
+// The four words of round r's key into four registers.
+#define AES_KEY(r, d0, d1, d2, d3)                   \
+  "movl 16*" #r "-128(%rdi), %" d0 "\n\t"            \
+  "movl 16*" #r "-124(%rdi), %" d1 "\n\t"            \
+  "movl 16*" #r "-120(%rdi), %" d2 "\n\t"            \
+  "movl 16*" #r "-116(%rdi), %" d3 "\n\t"
+// One old column (word w, its low byte l and second byte h) to the new
+// columns d0 to d3.
+#define AES_FROM_P(w, l, h, d0, d1, d2, d3)          \
+  "movzbl %" l ", %ebp\n\t"                          \
+  "xorl (%rsi,%rbp,4), %" d0 "\n\t"                  \
+  "movzbl %" h ", %ebp\n\t"                          \
+  "xorl 1024(%rsi,%rbp,4), %" d1 "\n\t"              \
+  "shrl $16, %" w "\n\t"                             \
+  "movzbl %" l ", %ebp\n\t"                          \
+  "xorl 2048(%rsi,%rbp,4), %" d2 "\n\t"              \
+  "movzbl %" h ", %ebp\n\t"                          \
+  "xorl 3072(%rsi,%rbp,4), %" d3 "\n\t"
+// Round r of the state in eax to edx into the registers d0 to d3.
+#define AES_ROUND_P(r, d0, d1, d2, d3)               \
+  AES_KEY(r, d0 "d", d1 "d", d2 "d", d3 "d")         \
+  AES_FROM_P("eax", "al", "ah", d0 "d", d1 "d", d2 "d", d3 "d") \
+  AES_FROM_P("ebx", "bl", "bh", d1 "d", d2 "d", d3 "d", d0 "d") \
+  AES_FROM_P("ecx", "cl", "ch", d2 "d", d3 "d", d0 "d", d1 "d") \
+  AES_FROM_P("edx", "dl", "dh", d3 "d", d0 "d", d1 "d", d2 "d")
+// Round r of both blocks.
+#define AES_ROUND(r)                                 \
+  "movl %r8d, %eax\n\t" "movl %r9d, %ebx\n\t" "movl %r10d, %ecx\n\t" "movl %r11d, %edx\n\t" \
+  AES_ROUND_P(r, "r8", "r9", "r10", "r11")           \
+  "movl %r12d, %eax\n\t" "movl %r13d, %ebx\n\t" "movl %r14d, %ecx\n\t" "movl %r15d, %edx\n\t" \
+  AES_ROUND_P(r, "r12", "r13", "r14", "r15")
+// Four words at `address` XORed into a set, and the set stored at `to`.
+#define AES_XOR_WORDS(address, d0, d1, d2, d3)       \
+  "xorl 0(" address "), %" d0 "\n\t"                 \
+  "xorl 4(" address "), %" d1 "\n\t"                 \
+  "xorl 8(" address "), %" d2 "\n\t"                 \
+  "xorl 12(" address "), %" d3 "\n\t"
+#define AES_STORE_WORDS(to, d0, d1, d2, d3)          \
+  "movl %" d0 ", 0(" to ")\n\t"                      \
+  "movl %" d1 ", 4(" to ")\n\t"                      \
+  "movl %" d2 ", 8(" to ")\n\t"                      \
+  "movl %" d3 ", 12(" to ")\n\t"
+#define AES_LOAD_WORDS(from, d0, d1, d2, d3)         \
+  "movl 0(" from "), %" d0 "\n\t"                    \
+  "movl 4(" from "), %" d1 "\n\t"                    \
+  "movl 8(" from "), %" d2 "\n\t"                    \
+  "movl 12(" from "), %" d3 "\n\t"
+#define AES_BLOCK_A "r8d", "r9d", "r10d", "r11d"
+#define AES_BLOCK_B "r12d", "r13d", "r14d", "r15d"
+// A macro applied to an address and a set.
+#define AES_WORDS(macro, address, ...) macro(address, __VA_ARGS__)
 
-// Block `i` of `input` through the tables into block `i` of `output`, and
-// with `kPair` block i + 1 beside it: the two blocks' rounds alternate, so
-// that one runs while the other waits for its table loads. The four
-// registers of the round are the first block's; the compiler moves the
-// second block's state in and out around each of its rounds.
+// The whole CBC walk from the last block to the first, two blocks a pass:
+// A is block a and B block a + 1. B chains to A's ciphertext and A to block
+// a - 1's (or the IV), which both stay in place until the pass stores its
+// plaintext. With an odd count, block 0 is left for a last pass in which A
+// and B are both block 0, each chained to the IV: the two halves store the
+// same plaintext.
 //
-// The ten rounds of a 128-bit key are unrolled; a 192-bit key has two more
-// in front, a 256-bit key four.
-template <bool kPair>
-__attribute__((always_inline)) inline void DecryptBlocks(const UINT8 *input, const UINT8 *iv, UINTN i,
-                                                         UINT8 *output, const UINT32 *schedule,
-                                                         UINT32 rounds) {
-  const UINT8 *block = input + 16 * i;
-  const UINT32 *k = schedule + 4 * rounds;
-  UINT32 a0 = LoadWord(block) ^ k[0], a1 = LoadWord(block + 4) ^ k[1], a2 = LoadWord(block + 8) ^ k[2],
-         a3 = LoadWord(block + 12) ^ k[3];
-  UINT32 b0 = 0, b1 = 0, b2 = 0, b3 = 0;
-  if (kPair) {
-    b0 = LoadWord(block + 16) ^ k[0];
-    b1 = LoadWord(block + 20) ^ k[1];
-    b2 = LoadWord(block + 24) ^ k[2];
-    b3 = LoadWord(block + 28) ^ k[3];
-  }
-  UINT32 n0, n1, n2, n3;
-#define AES_STEP(round, table)                   \
-  AES_ONE_ROUND(round, table, a0, a1, a2, a3);   \
-  if (kPair) {                                   \
-    AES_ONE_ROUND(round, table, b0, b1, b2, b3); \
-  }
-  if (rounds > 10) {
-    if (rounds > 12) {
-      AES_STEP(13, "t");
-      AES_STEP(12, "t");
-    }
-    AES_STEP(11, "t");
-    AES_STEP(10, "t");
-  }
-  AES_STEP(9, "t");
-  AES_STEP(8, "t");
-  AES_STEP(7, "t");
-  AES_STEP(6, "t");
-  AES_STEP(5, "t");
-  AES_STEP(4, "t");
-  AES_STEP(3, "t");
-  AES_STEP(2, "t");
-  AES_STEP(1, "t");
-  AES_STEP(0, "l");
-#undef AES_STEP
-  // Block i + 1 chains to block i, which is stored over only after it; block
-  // i chains to block i - 1 of the input, still intact: it comes next.
-  UnalignedWord *out = reinterpret_cast<UnalignedWord *>(output + 16 * i);
-  if (kPair) {
-    out[4] = b0 ^ LoadWord(block);
-    out[5] = b1 ^ LoadWord(block + 4);
-    out[6] = b2 ^ LoadWord(block + 8);
-    out[7] = b3 ^ LoadWord(block + 12);
-  }
-  const UINT8 *chain = i != 0 ? block - 16 : iv;
-  out[0] = a0 ^ LoadWord(chain);
-  out[1] = a1 ^ LoadWord(chain + 4);
-  out[2] = a2 ^ LoadWord(chain + 8);
-  out[3] = a3 ^ LoadWord(chain + 12);
+// The frame: 0 the job, 8 the blocks still to do, 16 the entry round, 24
+// and 32 the chaining values of A and B, 40 and 48 their output blocks, 56
+// the last round's key.
+__attribute__((naked, ms_abi)) void DecryptWithTables(const TableJob *) {
+  __asm__(
+      "pushq %rbx\n\t" "pushq %rbp\n\t" "pushq %rdi\n\t" "pushq %rsi\n\t"
+      "pushq %r12\n\t" "pushq %r13\n\t" "pushq %r14\n\t" "pushq %r15\n\t"
+      "subq $64, %rsp\n\t"
+      "movq %rcx, 0(%rsp)\n\t"
+      "movq 48(%rcx), %rax\n\t"
+      "testq %rax, %rax\n\t"
+      "jz .Laes_tables_done\n\t"
+      "movq %rax, 8(%rsp)\n\t"
+      "movq 56(%rcx), %rax\n\t"
+      "movq %rax, %rdx\n\t"
+      "shlq $4, %rdx\n\t"
+      "addq 24(%rcx), %rdx\n\t"
+      "movq %rdx, 56(%rsp)\n\t"
+      "leaq .Laes_tables_from13(%rip), %rdx\n\t"
+      "leaq .Laes_tables_from11(%rip), %r8\n\t"
+      "leaq .Laes_tables_from9(%rip), %r9\n\t"
+      "cmpq $12, %rax\n\t"
+      "cmoveq %r8, %rdx\n\t"
+      "cmovbq %r9, %rdx\n\t"
+      "movq %rdx, 16(%rsp)\n"
+      ".Laes_tables_pair:\n\t"
+      "movq 0(%rsp), %rcx\n\t"
+      "movq 8(%rsp), %rax\n\t"
+      "movq 0(%rcx), %r9\n\t"
+      "movq 8(%rcx), %r10\n\t"
+      "movq 16(%rcx), %r11\n\t"
+      "cmpq $2, %rax\n\t"
+      "jae .Laes_tables_two\n\t"
+      "movq $0, 8(%rsp)\n\t"
+      "movq %r9, %r14\n\t"
+      "movq %r9, %r15\n\t"
+      "movq %r11, 24(%rsp)\n\t"
+      "movq %r11, 32(%rsp)\n\t"
+      "movq %r10, 40(%rsp)\n\t"
+      "movq %r10, 48(%rsp)\n\t"
+      "jmp .Laes_tables_load\n"
+      ".Laes_tables_two:\n\t"
+      "subq $2, %rax\n\t"
+      "movq %rax, 8(%rsp)\n\t"
+      "shlq $4, %rax\n\t"
+      "leaq (%r9,%rax), %r14\n\t"
+      "leaq 16(%r14), %r15\n\t"
+      "movq %r14, 32(%rsp)\n\t"
+      "leaq -16(%r14), %r8\n\t"
+      "testq %rax, %rax\n\t"
+      "cmoveq %r11, %r8\n\t"
+      "movq %r8, 24(%rsp)\n\t"
+      "addq %r10, %rax\n\t"
+      "movq %rax, 40(%rsp)\n\t"
+      "addq $16, %rax\n\t"
+      "movq %rax, 48(%rsp)\n"
+      ".Laes_tables_load:\n\t"
+      "movq 32(%rcx), %rsi\n\t"
+      "movq 24(%rcx), %rdi\n\t"
+      "addq $128, %rdi\n\t"
+      "movq 56(%rsp), %rbp\n\t"
+      AES_WORDS(AES_LOAD_WORDS, "%r14", AES_BLOCK_A)
+      AES_WORDS(AES_XOR_WORDS, "%rbp", AES_BLOCK_A)
+      AES_WORDS(AES_LOAD_WORDS, "%r15", AES_BLOCK_B)
+      AES_WORDS(AES_XOR_WORDS, "%rbp", AES_BLOCK_B)
+      "jmpq *16(%rsp)\n"
+      ".Laes_tables_from13:\n\t"
+      AES_ROUND(13) AES_ROUND(12)
+      ".Laes_tables_from11:\n\t"
+      AES_ROUND(11) AES_ROUND(10)
+      ".Laes_tables_from9:\n\t"
+      AES_ROUND(9) AES_ROUND(8) AES_ROUND(7) AES_ROUND(6) AES_ROUND(5)
+      AES_ROUND(4) AES_ROUND(3) AES_ROUND(2) AES_ROUND(1)
+      "movq 0(%rsp), %rsi\n\t"
+      "movq 40(%rsi), %rsi\n\t"
+      AES_ROUND(0)
+      // Both blocks chained, then stored.
+      "movq 32(%rsp), %rsi\n\t"
+      AES_WORDS(AES_XOR_WORDS, "%rsi", AES_BLOCK_B)
+      "movq 24(%rsp), %rsi\n\t"
+      AES_WORDS(AES_XOR_WORDS, "%rsi", AES_BLOCK_A)
+      "movq 48(%rsp), %rdi\n\t"
+      AES_WORDS(AES_STORE_WORDS, "%rdi", AES_BLOCK_B)
+      "movq 40(%rsp), %rdi\n\t"
+      AES_WORDS(AES_STORE_WORDS, "%rdi", AES_BLOCK_A)
+      "cmpq $0, 8(%rsp)\n\t"
+      "jne .Laes_tables_pair\n"
+      ".Laes_tables_done:\n\t"
+      "xorl %eax, %eax\n\t" "xorl %ebx, %ebx\n\t" "xorl %ecx, %ecx\n\t" "xorl %edx, %edx\n\t"
+      "xorl %esi, %esi\n\t" "xorl %edi, %edi\n\t" "xorl %ebp, %ebp\n\t"
+      "xorl %r8d, %r8d\n\t" "xorl %r9d, %r9d\n\t" "xorl %r10d, %r10d\n\t" "xorl %r11d, %r11d\n\t"
+      "xorl %r12d, %r12d\n\t" "xorl %r13d, %r13d\n\t" "xorl %r14d, %r14d\n\t" "xorl %r15d, %r15d\n\t"
+      "addq $64, %rsp\n\t"
+      "popq %r15\n\t" "popq %r14\n\t" "popq %r13\n\t" "popq %r12\n\t"
+      "popq %rsi\n\t" "popq %rdi\n\t" "popq %rbp\n\t" "popq %rbx\n\t"
+      "retq");
 }
-
-// Two blocks at a time from the end; with an odd count, block 0 alone last.
-void DecryptWithTables(const UINT8 *input, const UINT8 *iv, UINT32 blockCount, UINT8 *output,
-                       const AesDecryptContext *context) {
-  UINTN i = blockCount;
-  for (; i >= 2; i -= 2) {
-    DecryptBlocks<true>(input, iv, i - 2, output, context->schedule, context->rounds);
-  }
-  if (i == 1) {
-    DecryptBlocks<false>(input, iv, 0, output, context->schedule, context->rounds);
-  }
-}
+// clang-format on
 
 // --- the instructions path -------------------------------------------------------
 //
@@ -321,7 +412,10 @@ void AesCbcDecrypt(const UINT8 *input, const UINT8 *iv, UINT32 blockCount, UINT8
   if (AesCurrentPath() == kAesPathInstructions) {
     DecryptWithInstructions(input, iv, blockCount, output, context);
   } else {
-    DecryptWithTables(input, iv, blockCount, output, context);
+    const TableJob job = {
+        input,      output, iv, context->schedule, kAesInverseRoundTable, kAesInverseLastRoundTable,
+        blockCount, rounds};
+    DecryptWithTables(&job);
   }
 }
 

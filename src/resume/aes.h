@@ -32,9 +32,9 @@ void AesExpandDecryptKey(const UINT8 *key, INT32 keyLength, AesDecryptContext *c
 
 // CBC decryption of `blockCount` 16-byte blocks, from the last block to the
 // first, so that `input` and `output` may be the same. `iv` is not changed.
-// `context` must hold a schedule made by AesExpandDecryptKey. With the
-// instructions path, the vector registers that held round keys are cleared
-// before it returns.
+// `context` must hold a schedule made by AesExpandDecryptKey. Either path
+// clears the registers that held round keys or state before it returns: the
+// general registers (tables) or the vector registers (instructions).
 void AesCbcDecrypt(const UINT8 *input, const UINT8 *iv, UINT32 blockCount, UINT8 *output,
                    const AesDecryptContext *context);
 

@@ -1,6 +1,7 @@
 #include "resume/discovery.h"
 
 #include "boot/boot.h"
+#include "config/boot_options.h"
 #include "devicetree/platform.h"
 #include "efi/vendor.h"
 #include "memory/tracking.h"
@@ -152,6 +153,11 @@ bool SameMachine(const ResumeHeader *header) {
 }  // namespace
 
 BOOLEAN ResumeRequested() {
+  // A safe-mode boot restarts no image. Nothing has set the flags when the
+  // boot driver calls this, so the test only counts for a caller that has.
+  if ((gBootFlags & kBootSafeMode) != 0) {
+    return FALSE;
+  }
   UINTN size = 0;
   if (gRT->GetVariable(kResumeSignatureVariable, &gNimbVendorVariableGuid, nullptr, &size, nullptr) !=
       EFI_BUFFER_TOO_SMALL) {

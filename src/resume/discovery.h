@@ -7,7 +7,8 @@
 namespace nimb {
 
 // True when `boot-signature` exists; it is then deleted at once. With any
-// other answer nothing is touched.
+// other answer nothing is touched, and in safe mode (kBootSafeMode)
+// nothing is even asked.
 BOOLEAN ResumeRequested();
 
 // The rest of the discovery, up to an accepted header in `state`. False on

@@ -99,6 +99,7 @@ void ResumeRestart(ResumeState *state) {
     return;
   }
   gBS = nullptr;
+  gResumeUnderway = nullptr;
 
   // Only the runtime services are left. They move into the image's area;
   // from here on they are reached through the moved system table.

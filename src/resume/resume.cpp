@@ -14,17 +14,29 @@ void ResumeWipeKey(ResumeState *state) {
   }
 }
 
+ResumeState *gResumeUnderway;
+
+void ResumeResetExit() {
+  ResumeState *state = gResumeUnderway;
+  if (state == nullptr) {
+    return;
+  }
+  gResumeUnderway = nullptr;
+  ResumeWipeKey(state);
+  gRT->ResetSystem(EfiResetCold, EFI_SUCCESS, 0, nullptr);
+}
+
 void TryResume() {
   if (!ResumeRequested()) {
     return;
   }
   ResumeState state = {};
+  gResumeUnderway = &state;
   if (ResumeFindImage(&state) && ResumeReadImage(&state)) {
     // Comes back only when it fails before boot services end.
     ResumeRestart(&state);
   }
-  ResumeWipeKey(&state);
-  gRT->ResetSystem(EfiResetCold, EFI_SUCCESS, 0, nullptr);
+  ResumeResetExit();
 }
 
 }  // namespace nimb

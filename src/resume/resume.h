@@ -59,6 +59,17 @@ struct ResumeState {
   ResumePlan plan;
 };
 
+// The one way out of a failed resume: once `boot-signature` has been seen,
+// wipes the key and resets the machine cold. ExitBoot calls it first, so
+// that a Fatal during a resume resets too. Does nothing outside a resume,
+// and returns if the reset ever comes back.
+void ResumeResetExit();
+
+// The resume under way, from the moment `boot-signature` was seen until
+// boot services end (after which failures stop through
+// StopAfterBootServices); null outside it.
+extern ResumeState *gResumeUnderway;
+
 // Overwrites the key's buffer with zeros (when there is one).
 void ResumeWipeKey(ResumeState *state);
 

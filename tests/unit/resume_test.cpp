@@ -291,6 +291,7 @@ TEST(ResumeRunTest, AHeaderBreakingALimitResets) {
     Spec spec;
     Change image = [](ResumeImage &) {};  // after the build; the list goes back into the bytes
     std::vector<uint8_t> key = std::vector<uint8_t>(16, 0x4B);
+    std::function<void(hostfw::Firmware &)> fault;  // a Fatal before the key is taken
   } cases[] = {
       {"first stage below 512", [](auto &) {}, [](auto &i) { i.Header().firstStageBytes = 511; }},
       {"first stage of 4 GiB", [](auto &) {}, [](auto &i) { i.Header().firstStageBytes = 1ull << 32; }},
@@ -327,6 +328,8 @@ TEST(ResumeRunTest, AHeaderBreakingALimitResets) {
        }},
       {"an extent list of no entry", [](auto &s) { s.extentLengths = {0x6000}; },
        [](auto &i) { i.Header().extentBytes = 8; }},
+      {"no pool for memory tags", [](auto &) {}, [](auto &) {}, std::vector<uint8_t>(16, 0x4B),
+       [](hostfw::Firmware &f) { f.FailPoolAllocationOfSize(kMemoryTagBlockSize); }},
   };
   for (const Case &c : cases) {
     SCOPED_TRACE(c.name);
@@ -340,12 +343,14 @@ TEST(ResumeRunTest, AHeaderBreakingALimitResets) {
       std::memcpy(broken.bytes.data() + 0x1E0 + 16 * i, &broken.extents[i], 16);
     scene.Install(broken, c.key);
     scene.fw.GuardFreeMemory();
+    if (c.fault)
+      c.fault(scene.fw);
     const hostfw::RunResult result = Resume(scene);
     EXPECT_EQ(result.end, hostfw::RunEnd::Reset);
     EXPECT_EQ(result.resetType, EfiResetCold);
     EXPECT_FALSE(scene.fw.BootServicesExited());
-    EXPECT_FALSE(scene.Has(kResumeKeyVariable));
-    EXPECT_EQ(scene.fw.ConOutText(), "");
+    EXPECT_EQ(!scene.Has(kResumeKeyVariable), !c.fault);
+    EXPECT_EQ(scene.fw.ConOutText(), c.fault ? "Can't allocate memory tag" : "");
     TrackedFreeAll();
     EXPECT_EQ(scene.fw.AllocatedPages(), 0u);
   }

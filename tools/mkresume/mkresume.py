@@ -180,35 +180,24 @@ def pixel_value(rgb, bytes_per_pixel):
     return (r >> 3) << 10 | (g >> 3) << 5 | (b >> 3)
 
 
+# The preview encoder (tools/resume/preview_encoder.cpp, the one the unit
+# tests decode with the loader's own code) as a program of the host build.
+PREVIEW_ENCODE = os.environ.get("PREVIEW_ENCODE") or os.path.join(
+    os.path.dirname(os.path.abspath(__file__)), "..", "..", "build", "tools", "preview_encode")
+
+
 def encode_preview(picture, bytes_per_pixel):
-    """The preview picture in the run-length format: a header of bytes per
-    pixel, width, height and one row offset each, then each row as runs (a
-    repeat run for three or more equal pixels, else literal runs)."""
-    pack = "<I" if bytes_per_pixel == 4 else "<H"
-    header = struct.calcsize("<III") + 4 * picture.height
-    offsets, body = [], bytearray()
-    for row in picture.rows:
-        offsets.append(header + len(body))
-        values = [pixel_value(rgb, bytes_per_pixel) for rgb in row]
-        x, literal = 0, []
-        while x <= len(values):
-            run = 1
-            while x + run < len(values) and values[x + run] == values[x]:
-                run += 1
-            if x == len(values) or run >= 3:
-                if literal:
-                    body += struct.pack("<I", len(literal)) + b"".join(struct.pack(pack, v) for v in literal)
-                    literal = []
-                if x == len(values):
-                    break
-                body += struct.pack("<I", 0x01000000 | run) + struct.pack(pack, values[x])
-                x += run
-            else:
-                literal.append(values[x])
-                x += 1
-    return struct.pack("<III", bytes_per_pixel, picture.width, picture.height) + b"".join(
-        struct.pack("<I", o) for o in offsets
-    ) + bytes(body)
+    """The preview picture in the run-length format, made by the host
+    build's preview_encode (PREVIEW_ENCODE names another)."""
+    pixels = b"".join(struct.pack("<I", pixel_value(rgb, bytes_per_pixel)) for row in picture.rows for rgb in row)
+    try:
+        result = subprocess.run([PREVIEW_ENCODE, str(picture.width), str(picture.height), str(bytes_per_pixel)],
+                                input=pixels, capture_output=True, check=False)
+    except OSError as error:
+        raise UsageError(f"no preview encoder at {PREVIEW_ENCODE} ({error}): build the host tools") from error
+    if result.returncode != 0:
+        raise UsageError(result.stderr.decode(errors="replace").strip())
+    return result.stdout
 
 
 def grey_sample(value, bytes_per_pixel):
