@@ -259,10 +259,11 @@ TEST(AcpiTest, FindFacpFollowsTheRsdpRevisionAndTheEntryOrder) {
     const char *name;
     std::vector<hostfw::AcpiOptions> sets;
     std::vector<Entry> entries;
-    int expected;  // the set whose FACP is found, -1 for none
+    int expected;              // the set whose FACP is found, -1 for none
+    bool asRevision1 = false;  // the first RSDP's revision made 1, its XSDT kept
   };
   const std::vector<Row> rows = {
-      {"revision 1", {rsdp(1)}, {{v1, 0}}, -1},
+      {"revision 1 names no root", {rsdp(2)}, {{v2, 0}}, -1, true},
       {"revision 2 through the 1.0 GUID reads the XSDT", {rsdp(2, false)}, {{v1, 0}}, 0},
       {"revision 2 without XSDT", {rsdp(2, true, false)}, {{v2, 0}}, -1},
       {"revision 0 through the 2.0 GUID reads the RSDT", {rsdp(0)}, {{v2, 0}}, 0},
@@ -277,6 +278,8 @@ TEST(AcpiTest, FindFacpFollowsTheRsdpRevisionAndTheEntryOrder) {
     std::vector<hostfw::AcpiTables> sets;
     for (const hostfw::AcpiOptions &options : row.sets)
       sets.push_back(local.fw.InstallAcpi(options));
+    if (row.asRevision1)
+      reinterpret_cast<UINT8 *>(sets[0].rsdp)[15] = 1;
     for (const Entry &entry : row.entries)
       local.fw.AddConfigurationTable(
           *entry.guid, entry.set < 0 ? nullptr : reinterpret_cast<void *>(sets[size_t(entry.set)].rsdp));
