@@ -70,7 +70,7 @@ while IFS=: read -r path line; do
   if ! nice cmake --build "$build" --target unit_tests >"$saved/build.log" 2>&1; then
     result="no build"
     broken=$((broken + 1))
-  elif timeout 600 nice "$build/unit_tests" --gtest_brief=1 --gtest_fail_fast >"$saved/test.log" 2>&1; then
+  elif timeout 240 nice "$build/unit_tests" --gtest_brief=1 --gtest_fail_fast >"$saved/test.log" 2>&1; then
     result="MISSED"
     missed=$((missed + 1))
     missedNames+=("$name")
