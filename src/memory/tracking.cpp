@@ -84,22 +84,27 @@ EFI_STATUS TrackedAllocatePages(EFI_ALLOCATE_TYPE type, EFI_MEMORY_TYPE memoryTy
   return status;
 }
 
-// The firmware is asked first: the memory goes back whether or not a tag is
-// found for it.
+// The firmware is asked first: a pool block goes back whether or not a tag
+// is found for it.
 EFI_STATUS TrackedFree(void *address) {
-  EFI_STATUS status = gBS->FreePool(address);
-  if (EFI_ERROR(status)) {
-    return status;
-  }
-  for (MemoryTag **link = &gMemoryTags; *link != nullptr; link = &(*link)->next) {
-    MemoryTag *tag = *link;
-    if (tag->poolAddress == address) {
-      *link = tag->next;
-      tag->next = gFreeMemoryTags;
-      gFreeMemoryTags = tag;
+  MemoryTag **link = &gMemoryTags;
+  for (; *link != nullptr; link = &(*link)->next) {
+    const MemoryTag *tag = *link;
+    if (tag->poolAddress != nullptr ? tag->poolAddress == address
+                                    : tag->pageAddress == reinterpret_cast<UINT64>(address)) {
       break;
     }
   }
+  MemoryTag *tag = *link;
+  EFI_STATUS status = tag != nullptr && tag->poolAddress == nullptr
+                          ? gBS->FreePages(tag->pageAddress, tag->pageCount)
+                          : gBS->FreePool(address);
+  if (EFI_ERROR(status) || tag == nullptr) {
+    return status;
+  }
+  *link = tag->next;
+  tag->next = gFreeMemoryTags;
+  gFreeMemoryTags = tag;
   return status;
 }
 
