@@ -15,7 +15,9 @@ namespace nimb {
 // distance of 8 or more copies 24 bytes in three words whatever its count
 // (the bytes behind it are written again by what follows), a nearer one goes
 // byte by byte, and a run of literals moves as one word. Any other group
-// takes the careful path, item by item with every bound checked.
+// takes the careful path, item by item with every bound checked. Groups on
+// the fast path run in batches as long as the bounds hold for the worst
+// case, and a flags byte of eight literals moves its eight bytes at once.
 
 namespace {
 
@@ -27,6 +29,9 @@ constexpr UINT64 kFastGroupOutput = 7 * kLzssMaxMatch + 24;
 // Input of a group: its flags byte, eight references, and the word that a
 // run of literals reads.
 constexpr UINT64 kFastGroupInput = 1 + 8 * 2 + 8;
+// What a group takes and gives at most: eight references.
+constexpr UINT64 kMostGroupInput = 1 + 8 * 2;
+constexpr UINT64 kMostGroupOutput = 8 * kLzssMaxMatch;
 
 inline void CopyWord(UINT8 *to, const UINT8 *from) {
   *reinterpret_cast<UnalignedWord *>(to) = *reinterpret_cast<const UnalignedWord *>(from);
@@ -48,43 +53,57 @@ UINT64 DecompressLzss(UINT8 *destination, UINT64 capacity, const UINT8 *source, 
     const UINT64 written = static_cast<UINT64>(out - destination);
     if (written >= kLzssRingSize && static_cast<UINT64>(limit - out) >= kFastGroupOutput &&
         static_cast<UINT64>(end - source) >= kFastGroupInput) {
-      // Literals in a row move as one word; the bytes behind the run are
-      // written again by what follows.
-      UINT32 flags = *source++;
-      UINT32 items = 8;
-      for (;;) {
-        const UINT32 run = static_cast<UINT32>(__builtin_ctz(~flags));
-        if (run != 0) {
+      // As many groups as the bounds allow even if each took the most input
+      // and gave the most output, without looking at the bounds again.
+      UINT64 groups = static_cast<UINT64>(limit - out - kFastGroupOutput) / kMostGroupOutput;
+      const UINT64 byInput = static_cast<UINT64>(end - source - kFastGroupInput) / kMostGroupInput;
+      groups = (groups < byInput ? groups : byInput) + 1;
+      do {
+        UINT32 flags = *source++;
+        if (flags == 0xFF) {
+          // Eight literals: one word.
           CopyWord(out, source);
-          out += run;
-          source += run;
-          items -= run;
-          if (items == 0) {
+          out += 8;
+          source += 8;
+          continue;
+        }
+        // Literals in a row move as one word; the bytes behind the run are
+        // written again by what follows.
+        UINT32 items = 8;
+        for (;;) {
+          const UINT32 run = static_cast<UINT32>(__builtin_ctz(~flags));
+          if (run != 0) {
+            CopyWord(out, source);
+            out += run;
+            source += run;
+            items -= run;
+            if (items == 0) {
+              break;
+            }
+            flags >>= run;
+          }
+          const UINT32 i = source[0], j = source[1];
+          source += 2;
+          const UINT32 count = (j & 0x0F) + kLzssMinMatch;
+          const UINT32 distance = Distance(static_cast<UINT64>(out - destination), i | (j & 0xF0) << 4);
+          const UINT8 *from = out - distance;
+          if (distance >= 8) {
+            CopyWord(out, from);
+            CopyWord(out + 8, from + 8);
+            CopyWord(out + 16, from + 16);
+          } else {
+            // A short period repeats what this reference is writing.
+            for (UINT32 k = 0; k < count; k++) {
+              out[k] = from[k];
+            }
+          }
+          out += count;
+          if (--items == 0) {
             break;
           }
-          flags >>= run;
+          flags >>= 1;
         }
-        const UINT32 i = source[0], j = source[1];
-        source += 2;
-        const UINT32 count = (j & 0x0F) + kLzssMinMatch;
-        const UINT32 distance = Distance(static_cast<UINT64>(out - destination), i | (j & 0xF0) << 4);
-        const UINT8 *from = out - distance;
-        if (distance >= 8) {
-          CopyWord(out, from);
-          CopyWord(out + 8, from + 8);
-          CopyWord(out + 16, from + 16);
-        } else {
-          // A short period repeats what this reference is writing.
-          for (UINT32 k = 0; k < count; k++) {
-            out[k] = from[k];
-          }
-        }
-        out += count;
-        if (--items == 0) {
-          break;
-        }
-        flags >>= 1;
-      }
+      } while (--groups != 0);
       continue;
     }
 

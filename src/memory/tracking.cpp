@@ -204,43 +204,48 @@ static void RemoveSlot(MemoryTagIndex *index, MemoryTagSlot *slot) {
   index->count--;
 }
 
-// The firmware is asked first: the memory goes back whether or not a tag is
-// found for it.
+static bool TagHolds(const MemoryTag *tag, const void *address) {
+  return tag->poolAddress != nullptr ? tag->poolAddress == address
+                                     : tag->pageAddress == reinterpret_cast<UINT64>(address);
+}
+
+// Gives back a pool block or tracked pages by their address. A pool block
+// goes back whether or not a tag is found for it; the tag goes only when the
+// firmware took the memory back.
 EFI_STATUS TrackedFree(void *address) {
-  EFI_STATUS status = gBS->FreePool(address);
-  if (EFI_ERROR(status)) {
+  MemoryTagIndex *index = TagIndex();
+  MemoryTagSlot *slot = index != nullptr ? FindSlot(index, address, nullptr) : nullptr;
+  MemoryTag *previous = nullptr;
+  MemoryTag *tag = nullptr;
+  UINT64 steps = 0;
+  if (slot != nullptr && slot->tag != nullptr) {
+    tag = slot->tag;
+    previous = slot->previous;
+  } else {
+    // Without the index, or for pages (which it does not hold): the walk.
+    slot = nullptr;
+    for (tag = gMemoryTags; tag != nullptr && !TagHolds(tag, address); previous = tag, tag = tag->next) {
+      steps++;
+    }
+  }
+  EFI_STATUS status = tag != nullptr && tag->poolAddress == nullptr
+                          ? gBS->FreePages(tag->pageAddress, tag->pageCount)
+                          : gBS->FreePool(address);
+  if (EFI_ERROR(status) || tag == nullptr) {
     return status;
   }
-  MemoryTagIndex *index = TagIndex();
-  MemoryTag *tag = nullptr;
-  MemoryTag **link = &gMemoryTags;
   if (index != nullptr) {
-    MemoryTagSlot *slot = FindSlot(index, address, nullptr);
-    tag = slot->tag;
-    if (tag == nullptr) {
-      return status;
-    }
-    MemoryTag *previous = slot->previous;
-    link = previous != nullptr ? &previous->next : &gMemoryTags;
     MemoryTag *next = tag->next;
     if (next != nullptr && next->poolAddress != nullptr) {
       FindSlot(index, next->poolAddress, next)->previous = previous;
     }
-    RemoveSlot(index, slot);
-  } else {
-    UINT64 steps = 0;
-    for (; *link != nullptr && (*link)->poolAddress != address; link = &(*link)->next) {
-      steps++;
+    if (slot != nullptr) {
+      RemoveSlot(index, slot);
     }
-    tag = *link;
-    if (tag == nullptr) {
-      return status;
-    }
-    if (steps > kMemoryTagWalkLimit) {
-      index = &gMemoryTagIndex;
-    }
+  } else if (steps > kMemoryTagWalkLimit) {
+    index = &gMemoryTagIndex;
   }
-  *link = tag->next;
+  (previous != nullptr ? previous->next : gMemoryTags) = tag->next;
   tag->next = gFreeMemoryTags;
   gFreeMemoryTags = tag;
   if (index != nullptr) {

@@ -28,6 +28,8 @@ void *TrackedAllocatePool(UINTN size);
 MemoryTag *TrackPool(void *address);
 EFI_STATUS TrackedAllocatePages(EFI_ALLOCATE_TYPE type, EFI_MEMORY_TYPE memoryType, UINTN pages,
                                 EFI_PHYSICAL_ADDRESS *address);
+// Gives back the pool block at `address`, or the tracked pages that begin
+// there.
 EFI_STATUS TrackedFree(void *address);
 void TrackedFreeAll();
 

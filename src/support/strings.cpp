@@ -1,6 +1,7 @@
-// Byte-string, memory and UCS-2 string routines. Plain byte and unit loops:
-// none of this is on a hot path except memcmp, which compares file headers
-// a word at a time when it can.
+// Byte-string, memory and UCS-2 string routines. Plain byte and unit loops,
+// except where a routine is on a hot path: memset and memcpy go four words a
+// step (the kernel cache's segments, the hand-off's move of the runtime
+// regions), memcmp compares file headers a word at a time when it can.
 #include "support/strings.h"
 
 namespace nimb {
@@ -23,7 +24,20 @@ inline int SignedDifference(UINT8 a, UINT8 b) {
 void *memset(void *destination, int value, UINTN count) {
   UINT8 *d = static_cast<UINT8 *>(destination);
   const UINT8 byte = static_cast<UINT8>(value);
-  for (UINTN i = 0; i < count; i++) {
+  const UINT64 word = byte * 0x0101010101010101ull;
+  UINTN i = 0;
+  // Four words a step, then one, then the bytes that are left.
+  for (; count - i >= 32; i += 32) {
+    UnalignedUint64 *w = reinterpret_cast<UnalignedUint64 *>(d + i);
+    w[0] = word;
+    w[1] = word;
+    w[2] = word;
+    w[3] = word;
+  }
+  for (; count - i >= 8; i += 8) {
+    *reinterpret_cast<UnalignedUint64 *>(d + i) = word;
+  }
+  for (; i < count; i++) {
     d[i] = byte;
   }
   return destination;
@@ -36,7 +50,17 @@ void *memcpy(void *destination, const void *source, UINTN count) {
   // Eight bytes a step wherever that gives the bytes of the upward byte loop:
   // when the destination lies below the source, or 8 bytes or more above it,
   // no word read takes in a byte that the same step writes.
+  // Each word is read just before it is written, in this order, so that a
+  // step of four words gives what four steps of one would.
   if (reinterpret_cast<UINTN>(d) - reinterpret_cast<UINTN>(s) >= 8) {
+    for (; count - i >= 32; i += 32) {
+      UnalignedUint64 *to = reinterpret_cast<UnalignedUint64 *>(d + i);
+      const UnalignedUint64 *from = reinterpret_cast<const UnalignedUint64 *>(s + i);
+      to[0] = from[0];
+      to[1] = from[1];
+      to[2] = from[2];
+      to[3] = from[3];
+    }
     for (; count - i >= 8; i += 8) {
       *reinterpret_cast<UnalignedUint64 *>(d + i) = *reinterpret_cast<const UnalignedUint64 *>(s + i);
     }

@@ -10,7 +10,8 @@ namespace nimb {
 
 // Stores the low byte of `value` `count` times; returns `destination`.
 void *memset(void *destination, int value, UINTN count);
-// Byte loop upward; returns `destination`.
+// Gives what a byte loop upward gives, overlap included; returns
+// `destination`.
 void *memcpy(void *destination, const void *source, UINTN count);
 // Byte loop downward where the destination overlaps the source from above,
 // else upward: the copy is right for overlapping ranges.
