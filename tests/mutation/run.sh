@@ -44,6 +44,16 @@ open(path, "w").write(text.replace(old, new))
 PY
 }
 
+# Whether the first argument is among the others.
+picked() {
+  local wanted=$1 each
+  shift
+  for each in "$@"; do
+    [ "$each" = "$wanted" ] && return 0
+  done
+  return 1
+}
+
 caught=0 missed=0 broken=0 total=0
 missedNames=()
 while IFS=: read -r path line; do
@@ -55,7 +65,7 @@ while IFS=: read -r path line; do
   rest=${rest#* ||| }
   text=${rest%% ||| *}
   replacement=${rest#* ||| }
-  if [ $# -gt 0 ] && ! printf '%s\n' "$@" | grep -qx -- "$name" && ! printf '%s\n' "$@" | grep -qx -- "$group"; then
+  if [ $# -gt 0 ] && ! picked "$name" "$@" && ! picked "$group" "$@"; then
     continue
   fi
   total=$((total + 1))
