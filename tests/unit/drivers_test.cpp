@@ -322,48 +322,6 @@ TEST_F(DriversTest, BundlesAreFoundKeptAndStaged) {
   EXPECT_EQ(nimb::gKernelRegionTop, address);
 }
 
-TEST_F(DriversTest, FirmwareFailuresOfABundleAndTheirMessages) {
-  // One flat bundle with code; the firmware's calls in order: Read 1-3 the
-  // directory's ".", ".." and "A.drvb", GetInfo 1 and Read 4 the list,
-  // Read 5 the directory's end, GetInfo 2 the code's size, Read 6 its fat
-  // test, GetInfo 3 its size again, Read 7 the code.
-  Put(std::string(kExtensions) + "/A.drvb/Info.plist",
-      BundleList("<string>Root</string>", "<key>VzBundleExecutable</key><string>a</string>"));
-  Put(std::string(kExtensions) + "/A.drvb/a", nimbtest::Pattern(100));
-  struct Row {
-    const char *service;
-    unsigned nth;
-    EFI_STATUS status;
-    std::string said;  // behind "Loading drivers...\n"
-    bool staged;
-    uint64_t top;
-  };
-  const Row rows[] = {
-      {"Read", 3, EFI_DEVICE_ERROR, "", false, kRegionTop},
-      {"GetInfo", 1, EFI_SUCCESS, "Couldn't get file info.\r\nError getting file size\r\n", false,
-       kRegionTop},
-      {"Read", 4, EFI_SUCCESS, "Read error 0x7\r\nError reading file A.drvb\r\n", false, kRegionTop},
-      {"GetInfo", 2, EFI_SUCCESS, "Couldn't get file info.\r\n", false, kRegionTop},
-      // The pages stay taken, and the kernel is not told of them.
-      {"Read", 7, EFI_SUCCESS,
-       "Read error 0x7\r\nError reading driver 'System\\Library\\Extensions\\A.drvb\\'\r\n", false,
-       kRegionTop + 0x1000},
-      {nullptr, 0, EFI_SUCCESS, "", true, kRegionTop + 0x1000},
-  };
-  for (const Row &row : rows) {
-    SCOPED_TRACE(std::string(row.service ? row.service : "none") + " " + std::to_string(row.nth));
-    Fresh();
-    if (row.service != nullptr)
-      fw.FailCall(row.service, row.nth, EFI_DEVICE_ERROR);
-    const size_t mark = fw.ConOutText().size();
-    EXPECT_EQ(nimb::LoadDrivers(nullptr, root_), row.status);
-    EXPECT_EQ(Said(mark), NoDots("Loading drivers...\r\n" + row.said));
-    EXPECT_EQ(Ranges().size(), row.staged ? 1u : 0u);
-    EXPECT_EQ(nimb::gKernelRegionTop, row.top);
-    EXPECT_EQ(fw.OpenFiles(), 1u);
-  }
-}
-
 TEST_F(DriversTest, TheWalkBringsInTheLibrariesOfSelectedRecords) {
   // Records as a scan might leave them: only A selected; C, a library of a
   // library, stands first, so that a second pass must find it.
