@@ -210,40 +210,6 @@ TEST_F(DriversTest, ThePackageDecisionRowByRow) {
   }
 }
 
-TEST_F(DriversTest, OverLoadFileOnlyThePackageCounts) {
-  hostfw::NetworkDevice network(fw);
-  const Bytes package = nimbtest::Pattern(0x1100, 5);
-  Put(std::string(kExtensions) + "/A.drvb/Info.plist", BundleList("<string>Root</string>"));
-  Put("nimb_kernel.drvpk", package);
-  struct Row {
-    const char *name;
-    bool served;
-    EFI_STATUS status;
-  };
-  const Row rows[] = {{"served", true, EFI_SUCCESS}, {"missing: the boot ends", false, EFI_NOT_FOUND}};
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.name);
-    Fresh();
-    nimb::gDriverPackageName = u"net.drvpk";
-    if (row.served)
-      network.PutFile(u"net.drvpk", package);
-    else
-      network.RemoveFile(u"net.drvpk");
-    // With a volume at hand too, to show that nothing is looked for there.
-    EXPECT_EQ(nimb::LoadDrivers(network.Protocol(), root_), row.status);
-    // Neither the second name nor the bundles.
-    for (const hostfw::LoadFileCall &call : network.Calls())
-      EXPECT_EQ(call.name, u"net.drvpk");
-    if (row.served) {
-      EXPECT_EQ(Ranges(),
-                (std::vector<Range>{{"DriversPackage-400000", kRegionTop, uint32_t(package.size())}}));
-      EXPECT_EQ(Memory(kRegionTop, package.size()), package);
-    } else {
-      EXPECT_TRUE(Ranges().empty());
-    }
-  }
-}
-
 TEST_F(DriversTest, BundlesAreFoundKeptAndStaged) {
   const std::string dir = std::string(kExtensions) + "/";
   // The slice at 4096 of a fat code file, with another processor's behind.

@@ -27,6 +27,7 @@ using nimbtest::Object;
 using nimbtest::Pattern;
 using nimbtest::Segment;
 using nimbtest::Thread;
+using nimbtest::TrackedPoolBlocks;
 
 constexpr uint64_t kUntouchedEntry = 0x5EED;
 
@@ -47,14 +48,6 @@ Bytes WrapInFat(const Bytes &kernel, bool bigEndian) {
   uint32_t behind = (0x3000 + size + 0xFFF) & ~0xFFFu;
   return Fat(bigEndian, {{18, 0x1000, 0x800}, {7, 0x3000, size}, {12, behind, 0x100}},
              {{0x1000, Pattern(0x800, 5)}, {0x3000, kernel}, {behind, Pattern(0x100, 6)}});
-}
-
-// Pool blocks from the tracked allocator still held.
-size_t TrackedPoolBlocks() {
-  size_t count = 0;
-  for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
-    count += tag->poolAddress != nullptr;
-  return count;
 }
 
 // Memory at `address` holds `bytes`, then zeroes up to `size`.
