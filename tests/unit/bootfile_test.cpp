@@ -64,21 +64,6 @@ TEST_F(BootFileTest, VolumeReadsGoInChunksWithADotEach) {
   EXPECT_EQ(fw.OpenFiles(), 1u);  // only the root
 }
 
-TEST_F(BootFileTest, ALongNameTakesASecondInfoCall) {
-  uint64_t size = 0;
-  // A long name does not fit the first try of 208 bytes: the info comes on
-  // the second.
-  std::string longName(120, 'n');
-  Put(longName, Pattern(33));
-  BootFile other;
-  std::u16string wideName(longName.begin(), longName.end());
-  ASSERT_EQ(nimb::BootFileOpen(nullptr, root_, wideName.c_str(), &other), EFI_SUCCESS);
-  EXPECT_EQ(nimb::BootFileGetSize(&other, &size), EFI_SUCCESS);
-  EXPECT_EQ(size, 33u);
-  nimb::BootFileClose(&other);
-  EXPECT_EQ(fw.LivePoolBlocks(), 1u);  // the tag block
-}
-
 TEST_F(BootFileTest, MemoryRecords) {
   std::vector<uint8_t> bytes = Pattern(100);
   BootFile file = {};
@@ -129,24 +114,6 @@ TEST_F(BootFileTest, ALoadFileRecordFetchesOnce) {
   EXPECT_EQ(net.Calls()[1].name, u"k");
   nimb::BootFileClose(&file);
   EXPECT_EQ(fw.LivePoolBlocks(), 1u);  // path and buffer gone; the tag block stays
-}
-
-TEST_F(BootFileTest, AWholeLoadFileReadGoesStraightToTheCaller) {
-  hostfw::NetworkDevice net(fw);
-  std::vector<uint8_t> bytes = Pattern(300);
-  net.PutFile(u"k", bytes);
-  BootFile file;
-  ASSERT_EQ(nimb::BootFileOpen(net.Protocol(), nullptr, u"k", &file), EFI_SUCCESS);
-  std::vector<uint8_t> out(300);
-  uint64_t count = 300;
-  ASSERT_EQ(nimb::BootFileRead(&file, &count, out.data()), EFI_SUCCESS);
-  EXPECT_EQ(out, bytes);
-  EXPECT_EQ(file.buffer, nullptr);
-  EXPECT_EQ(file.position, 0u);
-  // The same read can be made again.
-  ASSERT_EQ(nimb::BootFileRead(&file, &count, out.data()), EFI_SUCCESS);
-  EXPECT_EQ(net.Calls().size(), 3u);  // one size query, two fetches
-  nimb::BootFileClose(&file);
 }
 
 TEST_F(BootFileTest, LoadFileFailures) {

@@ -4,9 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <cstring>
-#include <filesystem>
 #include <functional>
-#include <memory>
 #include <string>
 #include <vector>
 
@@ -14,7 +12,6 @@
 #include "loader_fixture.h"
 #include "memory/kernel_region.h"
 #include "support/devicepath.h"
-#include "temp_dir.h"
 
 namespace {
 
@@ -117,24 +114,6 @@ TEST_F(BootInfoTest, RootIdentity) {
     EXPECT_EQ(present, row.present) << row.name;
     EXPECT_EQ(printed_, row.printed) << row.name;
   }
-}
-
-TEST_F(BootInfoTest, AVolumeWithAPartitionGuidGivesItsText) {
-  // A GUID partition: type 4/1, format 2, signature type 2.
-  std::vector<uint8_t> path = {4, 1, 42, 0};
-  path.resize(42, 0);
-  path[4] = 1;  // partition number
-  const uint8_t signature[16] = {0x78, 0x56, 0x34, 0x12, 0xBC, 0x9A, 0xF0, 0xDE,
-                                 0x01, 0x23, 0x45, 0x67, 0x89, 0xAB, 0xCD, 0xEF};
-  memcpy(&path[24], signature, 16);
-  path[40] = 2;
-  path[41] = 2;
-  path.insert(path.end(), {0x7F, 0xFF, 4, 0});
-  EFI_HANDLE disk = fw.NewHandle();
-  fw.SetDevicePath(disk, path);
-  fw.LoadedImage()->DeviceHandle = disk;
-  ASSERT_EQ(Init("").end, hostfw::RunEnd::Returned);
-  EXPECT_EQ(Property("/chosen", "boot-uuid"), std::string("12345678-9ABC-DEF0-0123-456789ABCDEF", 37));
 }
 
 TEST_F(BootInfoTest, FatalConditions) {

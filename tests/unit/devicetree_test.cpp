@@ -5,7 +5,6 @@
 
 #include <algorithm>
 #include <cstring>
-#include <functional>
 #include <string>
 #include <vector>
 
@@ -63,14 +62,6 @@ Bytes NodeImage(const std::vector<Bytes> &properties, const std::vector<Bytes> &
   for (const Bytes &c : children)
     out.insert(out.end(), c.begin(), c.end());
   return out;
-}
-
-template <typename Record>
-size_t Length(const Record *list) {
-  size_t n = 0;
-  for (; list != nullptr; list = list->next)
-    n++;
-  return n;
 }
 
 class DeviceTreeTest : public nimbtest::LoaderTest {
@@ -242,96 +233,6 @@ TEST_F(DeviceTreeTest, ANameLongerThan31CharactersIsCutInsideItsField) {
   EXPECT_EQ(Flatten(), NodeImage({NameProperty("/"), Property(std::string(31, 'L'), Text("abc")),
                                   Property(exact, Text("xyz"))},
                                  {}));
-}
-
-TEST_F(DeviceTreeTest, RefusedAllocationsLeaveTheTreeAndCountersAlone) {
-  // The root, "/n" and 125 children of it: the first node block is used up.
-  auto fillNodeBlock = [&] {
-    DeviceTreeNode *n = DeviceTreeFindNode("/n", 1);
-    for (int i = 0; i < 125; i++)
-      DeviceTreeAddChild(n, "k");
-  };
-  auto fillPropertyBlock = [&] {
-    for (int i = 0; i < 100; i++)
-      DeviceTreeAddProperty(root, "p", 0, nullptr, 0);
-  };
-  struct Row {
-    const char *what;
-    std::function<void()> prepare;  // runs before the next AllocatePool is refused
-    std::function<bool()> call;     // true when the call gave a record
-    bool unnamedNode;               // the call gives a node, kept without its name
-  };
-  const Row rows[] = {
-      {"copy of a value", [] {}, [&] { return DeviceTreeAddProperty(root, "v", 4, "abc", 1) != nullptr; }},
-      {"property block", fillPropertyBlock,
-       [&] { return DeviceTreeAddProperty(root, "v", 4, "abc", 0) != nullptr; }},
-      {"node block", fillNodeBlock, [&] { return DeviceTreeAddChild(root, "c") != nullptr; }},
-      {"node made by path", fillNodeBlock, [&] { return DeviceTreeFindNode("/x", 1) != nullptr; }},
-      // The node stands, without a name: it compares as "(null)".
-      {"copy of a node's name", [] {}, [&] { return DeviceTreeFindNode("/x", 1) != nullptr; }, true},
-  };
-  for (const Row &row : rows) {
-    nimb::TrackedFreeAll();
-    root = nimb::DeviceTreeInit();
-    row.prepare();
-    const Bytes before = Flatten();
-    const UINT32 nodes = nimb::gDeviceTreeNodeCount;
-    const UINT32 properties = nimb::gDeviceTreePropertyCount;
-    const UINT32 valueBytes = nimb::gDeviceTreeValueBytes;
-    fw.FailCall("AllocatePool", 1);
-    EXPECT_EQ(row.call(), row.unnamedNode) << row.what;
-    EXPECT_EQ(nimb::gDeviceTreeNodeCount - nodes, row.unnamedNode ? 1u : 0u) << row.what;
-    EXPECT_EQ(nimb::gDeviceTreePropertyCount, properties) << row.what;
-    if (!row.unnamedNode) {
-      EXPECT_EQ(nimb::gDeviceTreeValueBytes, valueBytes) << row.what;
-      EXPECT_EQ(Flatten(), before) << row.what;
-    }
-  }
-  DeviceTreeNode *unnamed = root->children;
-  ASSERT_NE(unnamed, nullptr);
-  EXPECT_EQ(DeviceTreeFindNode("/x", 0), nullptr);
-  EXPECT_EQ(unnamed->properties, nullptr);
-  EXPECT_EQ(DeviceTreeFindNode("/(null)", 0), unnamed);
-}
-
-TEST_F(DeviceTreeTest, ARefusedImageAllocationLeavesTheBufferNull) {
-  UINT64 address = 0;
-  UINT64 size = 0;
-  fw.FailCall("AllocatePool", 1);
-  nimb::DeviceTreeFlatten(&address, &size);
-  EXPECT_EQ(address, 0u);
-  EXPECT_EQ(size, 48u);
-  // Allowed, it allocates the image itself.
-  nimb::DeviceTreeFlatten(&address, nullptr);
-  ASSERT_NE(address, 0u);
-  const uint8_t *image = reinterpret_cast<const uint8_t *>(static_cast<UINTN>(address));
-  EXPECT_EQ(Bytes(image, image + 48), NodeImage({NameProperty("/")}, {}));
-}
-
-TEST_F(DeviceTreeTest, FreeGivesBackEveryBlockAndEmptiesTheTree) {
-  DeviceTreeNode *map = DeviceTreeFindNode("/chosen/memory-map", 1);
-  for (int i = 0; i < 150; i++)
-    DeviceTreeAddProperty(map, "range", 8, "12345678", 1);
-  for (int i = 0; i < 130; i++)
-    DeviceTreeAddChild(root, "n");
-  size_t blocks = Length(nimb::gNodeBlocks) + Length(nimb::gPropertyBlocks);
-  EXPECT_EQ(blocks, 2u + 3u);
-  size_t held = fw.LivePoolBlocks();
-  nimb::DeviceTreeFree();
-  // Blocks only: the copies of names and values stay with the tracking.
-  EXPECT_EQ(held - fw.LivePoolBlocks(), blocks);
-  EXPECT_EQ(DeviceTreeFindNode("/", 0), nullptr);
-  EXPECT_EQ(DeviceTreeFindNode("/chosen", 1), nullptr);
-  EXPECT_EQ(nimb::gDeviceTreeNodeCount + nimb::gDeviceTreePropertyCount + nimb::gDeviceTreeValueBytes, 0u);
-  EXPECT_EQ(nimb::gFreeNodes, nullptr);
-  EXPECT_EQ(nimb::gFreeProperties, nullptr);
-  UINT64 address = 0x1234;
-  UINT64 size = 1;
-  nimb::DeviceTreeFlatten(&address, &size);
-  EXPECT_EQ(address, 0u);
-  EXPECT_EQ(size, 0u);
-  nimb::TrackedFreeAll();
-  ExpectNothingHeld();
 }
 
 }  // namespace

@@ -210,40 +210,6 @@ TEST_F(DriversTest, ThePackageDecisionRowByRow) {
   }
 }
 
-TEST_F(DriversTest, OverLoadFileOnlyThePackageCounts) {
-  hostfw::NetworkDevice network(fw);
-  const Bytes package = nimbtest::Pattern(0x1100, 5);
-  Put(std::string(kExtensions) + "/A.drvb/Info.plist", BundleList("<string>Root</string>"));
-  Put("nimb_kernel.drvpk", package);
-  struct Row {
-    const char *name;
-    bool served;
-    EFI_STATUS status;
-  };
-  const Row rows[] = {{"served", true, EFI_SUCCESS}, {"missing: the boot ends", false, EFI_NOT_FOUND}};
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.name);
-    Fresh();
-    nimb::gDriverPackageName = u"net.drvpk";
-    if (row.served)
-      network.PutFile(u"net.drvpk", package);
-    else
-      network.RemoveFile(u"net.drvpk");
-    // With a volume at hand too, to show that nothing is looked for there.
-    EXPECT_EQ(nimb::LoadDrivers(network.Protocol(), root_), row.status);
-    // Neither the second name nor the bundles.
-    for (const hostfw::LoadFileCall &call : network.Calls())
-      EXPECT_EQ(call.name, u"net.drvpk");
-    if (row.served) {
-      EXPECT_EQ(Ranges(),
-                (std::vector<Range>{{"DriversPackage-400000", kRegionTop, uint32_t(package.size())}}));
-      EXPECT_EQ(Memory(kRegionTop, package.size()), package);
-    } else {
-      EXPECT_TRUE(Ranges().empty());
-    }
-  }
-}
-
 TEST_F(DriversTest, BundlesAreFoundKeptAndStaged) {
   const std::string dir = std::string(kExtensions) + "/";
   // The slice at 4096 of a fat code file, with another processor's behind.
@@ -320,48 +286,6 @@ TEST_F(DriversTest, BundlesAreFoundKeptAndStaged) {
   }
   EXPECT_EQ(nimbtest::GetLe32(Memory(ranges[3].address + 8, 4), 0), ranges[3].address + 1017);
   EXPECT_EQ(nimb::gKernelRegionTop, address);
-}
-
-TEST_F(DriversTest, FirmwareFailuresOfABundleAndTheirMessages) {
-  // One flat bundle with code; the firmware's calls in order: Read 1-3 the
-  // directory's ".", ".." and "A.drvb", GetInfo 1 and Read 4 the list,
-  // Read 5 the directory's end, GetInfo 2 the code's size, Read 6 its fat
-  // test, GetInfo 3 its size again, Read 7 the code.
-  Put(std::string(kExtensions) + "/A.drvb/Info.plist",
-      BundleList("<string>Root</string>", "<key>VzBundleExecutable</key><string>a</string>"));
-  Put(std::string(kExtensions) + "/A.drvb/a", nimbtest::Pattern(100));
-  struct Row {
-    const char *service;
-    unsigned nth;
-    EFI_STATUS status;
-    std::string said;  // behind "Loading drivers...\n"
-    bool staged;
-    uint64_t top;
-  };
-  const Row rows[] = {
-      {"Read", 3, EFI_DEVICE_ERROR, "", false, kRegionTop},
-      {"GetInfo", 1, EFI_SUCCESS, "Couldn't get file info.\r\nError getting file size\r\n", false,
-       kRegionTop},
-      {"Read", 4, EFI_SUCCESS, "Read error 0x7\r\nError reading file A.drvb\r\n", false, kRegionTop},
-      {"GetInfo", 2, EFI_SUCCESS, "Couldn't get file info.\r\n", false, kRegionTop},
-      // The pages stay taken, and the kernel is not told of them.
-      {"Read", 7, EFI_SUCCESS,
-       "Read error 0x7\r\nError reading driver 'System\\Library\\Extensions\\A.drvb\\'\r\n", false,
-       kRegionTop + 0x1000},
-      {nullptr, 0, EFI_SUCCESS, "", true, kRegionTop + 0x1000},
-  };
-  for (const Row &row : rows) {
-    SCOPED_TRACE(std::string(row.service ? row.service : "none") + " " + std::to_string(row.nth));
-    Fresh();
-    if (row.service != nullptr)
-      fw.FailCall(row.service, row.nth, EFI_DEVICE_ERROR);
-    const size_t mark = fw.ConOutText().size();
-    EXPECT_EQ(nimb::LoadDrivers(nullptr, root_), row.status);
-    EXPECT_EQ(Said(mark), NoDots("Loading drivers...\r\n" + row.said));
-    EXPECT_EQ(Ranges().size(), row.staged ? 1u : 0u);
-    EXPECT_EQ(nimb::gKernelRegionTop, row.top);
-    EXPECT_EQ(fw.OpenFiles(), 1u);
-  }
 }
 
 TEST_F(DriversTest, TheWalkBringsInTheLibrariesOfSelectedRecords) {

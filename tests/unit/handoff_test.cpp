@@ -220,17 +220,6 @@ INSTANTIATE_TEST_SUITE_P(Types, NetworkIdentityTest,
                          ::testing::Values(std::make_pair(0, 12), std::make_pair(1, 12),
                                            std::make_pair(2, 64), std::make_pair(6, 64)));
 
-TEST_F(HandOffTest, ALoadFileDeviceWithoutAMacNodeIsNoNetworkIdentity) {
-  hostfw::NetworkDevice net(fw, /*macNode=*/false);
-  fw.SetBootDevice(net.Handle());
-  gBootDevicePath = fw.DevicePathOf(net.Handle());
-  Prepare();
-  ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
-  FlatTree tree = ReadTree(bootArgs);
-  EXPECT_EQ(tree.nodes["/chosen"].count("root-matching"), 0u);
-  EXPECT_EQ(tree.nodes["/"].count("net-boot"), 0u);
-}
-
 TEST_F(HandOffTest, DevicePropertiesLargerThanTheFirstBuffer) {
   FakeDeviceProperties properties = {{{}, GetDeviceProperties}, std::vector<uint8_t>(6000, 0x5C), 0};
   for (size_t i = 0; i < properties.blob.size(); i++)

@@ -18,6 +18,7 @@
 namespace {
 
 using nimbtest::Bytes;
+using nimbtest::TrackedPoolBlocks;
 
 struct Date {
   int year, month, day, hour, minute, second;
@@ -133,12 +134,6 @@ class KernelCacheTest : public nimbtest::VolumeTest {
     snprintf(digits, sizeof(digits), "%08X",
              __builtin_bswap32(StandardAdler32(nimb::gKernelCacheKey, sizeof(nimb::gKernelCacheKey))));
     return std::string("System/Library/Caches/com.quill.kernelcaches/kernelcache.") + digits;
-  }
-  size_t TrackedPoolBlocks() const {
-    size_t count = 0;
-    for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
-      count += tag->poolAddress != nullptr;
-    return count;
   }
 };
 

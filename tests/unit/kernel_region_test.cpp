@@ -1,42 +1,19 @@
-// The kernel region's allocators and the ranges announced in the device tree.
+// The kernel region's allocator (the ranges it announces are read by the drivers' and
+// boot screen's tests).
 #include "memory/kernel_region.h"
 
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <cstring>
-#include <string>
 #include <vector>
 
-#include "devicetree/devicetree.h"
 #include "loader_fixture.h"
 
 namespace {
 
 using Bytes = std::vector<uint8_t>;
 
-class KernelRegionTest : public nimbtest::LoaderTest {
- protected:
-  Bytes Flatten() {
-    UINT64 size = 0;
-    nimb::DeviceTreeFlatten(nullptr, &size);
-    Bytes area(size, 0xEE);
-    UINT64 address = reinterpret_cast<UINTN>(area.data());
-    nimb::DeviceTreeFlatten(&address, &size);
-    return area;
-  }
-
-  // The 12 bytes behind the name field of the property image named `name`
-  // (its length word and 8 value bytes), or nothing.
-  static Bytes RangeImage(const Bytes &flat, const std::string &name) {
-    Bytes field(32, 0);
-    std::memcpy(field.data(), name.data(), name.size());
-    auto at = std::search(flat.begin(), flat.end(), field.begin(), field.end());
-    if (at == flat.end() || flat.end() - at < 44)
-      return {};
-    return Bytes(at + 32, at + 44);
-  }
-};
+class KernelRegionTest : public nimbtest::LoaderTest {};
 
 TEST_F(KernelRegionTest, AllocationsAtTheTopRoundToPagesAndRaiseIt) {
   struct Row {
@@ -86,44 +63,6 @@ TEST_F(KernelRegionTest, AllocationsAtTheTopRoundToPagesAndRaiseIt) {
     nimb::TrackedFreeAll();
     EXPECT_EQ(fw.AllocatedPages(), 0u) << row.what;
   }
-}
-
-TEST_F(KernelRegionTest, RangesEnterTheLow32BitsOfAddressAndLength) {
-  ASSERT_NE(nimb::DeviceTreeInit(), nullptr);
-  nimb::gMemoryMapNode = nimb::DeviceTreeFindNode("/chosen/memory-map", 1);
-  ASSERT_NE(nimb::gMemoryMapNode, nullptr);
-  const std::string drivers = "DriversPackage-" + std::string("fedcba9876543210");
-  ASSERT_EQ(drivers.size(), 31u);
-  struct Row {
-    std::string name;
-    UINT64 address;
-    UINT64 length;
-    UINT32 type;
-    Bytes value;  // the low words of address and length
-  };
-  const Row rows[] = {
-      {"BootCLUT", 0x1234000, 0x300, 0, {0x00, 0x40, 0x23, 0x01, 0x00, 0x03, 0, 0}},
-      {"Above4G", 0x123456000ull, 0x100001000ull, 1, {0x00, 0x60, 0x45, 0x23, 0x00, 0x10, 0x00, 0x00}},
-      {drivers, 0xFFFFFFFFFFFFF000ull, 0xFFFFFFFF, 2, {0x00, 0xF0, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF}},
-  };
-  for (const Row &row : rows) {
-    // The caller's text may go once the call returns.
-    std::vector<char> name(row.name.begin(), row.name.end());
-    name.push_back('\0');
-    EXPECT_EQ(nimb::AddMemoryRange(name.data(), row.address, row.length, row.type), EFI_SUCCESS) << row.name;
-    std::fill(name.begin(), name.end(), 'X');
-  }
-  Bytes flat = Flatten();
-  for (const Row &row : rows) {
-    Bytes image = {8, 0, 0, 0};  // the length word
-    image.insert(image.end(), row.value.begin(), row.value.end());
-    EXPECT_EQ(RangeImage(flat, row.name), image) << row.name;
-  }
-  // The longest name is whole, with its NUL as the field's last byte.
-  auto field = std::search(flat.begin(), flat.end(), drivers.begin(), drivers.end());
-  ASSERT_NE(field, flat.end());
-  EXPECT_EQ(field[31], 0);
-  EXPECT_EQ(nimb::gDeviceTreePropertyCount, 3u + 3u);
 }
 
 }  // namespace

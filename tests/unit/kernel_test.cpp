@@ -27,6 +27,7 @@ using nimbtest::Object;
 using nimbtest::Pattern;
 using nimbtest::Segment;
 using nimbtest::Thread;
+using nimbtest::TrackedPoolBlocks;
 
 constexpr uint64_t kUntouchedEntry = 0x5EED;
 
@@ -47,14 +48,6 @@ Bytes WrapInFat(const Bytes &kernel, bool bigEndian) {
   uint32_t behind = (0x3000 + size + 0xFFF) & ~0xFFFu;
   return Fat(bigEndian, {{18, 0x1000, 0x800}, {7, 0x3000, size}, {12, behind, 0x100}},
              {{0x1000, Pattern(0x800, 5)}, {0x3000, kernel}, {behind, Pattern(0x100, 6)}});
-}
-
-// Pool blocks from the tracked allocator still held.
-size_t TrackedPoolBlocks() {
-  size_t count = 0;
-  for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
-    count += tag->poolAddress != nullptr;
-  return count;
 }
 
 // Memory at `address` holds `bytes`, then zeroes up to `size`.
@@ -312,58 +305,6 @@ TEST_F(KernelTest, ObjectsThatLieAreRefusedBeforeAnythingIsPlaced) {
       if (row.object.commandsSize > 0x100000)
         EXPECT_EQ(fw.AllocatePoolCalls(), poolCalls);
     }
-  }
-}
-
-TEST_F(KernelTest, FirmwareFailuresGiveTheirStatusAndMessage) {
-  const Bytes data = Pattern(0x2000, 8);
-  const uint32_t d = kObjectDataStart;
-  Object object{
-      0xFEEDFACE,
-      {Segment(0x200000, 0x1000, d, 0x1000), Segment(0x300000, 0x1000, d + 0x1000, 0x1000), Thread(0x200000)},
-      data};
-  struct Row {
-    const char *name;
-    const char *service;
-    unsigned nth;
-    EFI_STATUS status;
-    std::string message;  // what the output holds besides the dots
-    uint64_t pages;       // kept by the segments placed before the failure
-    uint64_t top;
-  };
-  const Row rows[] = {
-      {"fat header read", "Read", 1, EFI_DEVICE_ERROR, "Read error 0x", 0, 0},
-      {"rewind", "SetPosition", 1, EFI_DEVICE_ERROR, "Couldn't set position back to 0.\r\n", 0, 0},
-      {"size", "GetInfo", 1, EFI_DEVICE_ERROR, "Couldn't get file info.\r\n", 0, 0},
-      {"object header read", "Read", 2, EFI_DEVICE_ERROR, "Read error 0x", 0, 0},
-      // The firmware's status is not passed on for the commands.
-      {"commands read", "Read", 3, EFI_LOAD_ERROR, "Read error 0x", 0, 0},
-      {"seek to the second segment", "SetPosition", 3, EFI_DEVICE_ERROR, "Set offset failed\r\n", 2,
-       0x201000},
-      // A refused read leaves the count as it was asked; both numbers print
-      // as 32-bit words.
-      {"read of the second segment", "Read", 5, EFI_DEVICE_ERROR,
-       "Read error 0x7\r\nRead file failed: status 7, buffer size 0x1000\r\n", 2, 0x201000},
-      {"pages of the second segment", "AllocatePages", 2, EFI_OUT_OF_RESOURCES,
-       "Error allocating 0x1 pages at 0x300000 alloc type 2\r\n", 1, 0x201000},
-  };
-  Bytes contents = object.Build();
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.name);
-    Forget();
-    BootFile file;
-    Open(Source::kVolume, contents, &file);
-    fw.FailCall(row.service, row.nth, row.status == EFI_LOAD_ERROR ? EFI_DEVICE_ERROR : row.status);
-    size_t mark = fw.ConOutText().size();
-    EXPECT_EQ(nimb::LoadKernel(&file), row.status);
-    nimb::BootFileClose(&file);
-    std::string output = OutputSince(mark);
-    output.erase(0, output.find_first_not_of('.'));
-    EXPECT_EQ(output.substr(0, row.message.size()), row.message) << output;
-    EXPECT_EQ(nimb::gKernelEntry, kUntouchedEntry);
-    EXPECT_EQ(fw.AllocatedPages(), row.pages);
-    EXPECT_EQ(nimb::gKernelRegionTop, row.top);
-    EXPECT_EQ(TrackedPoolBlocks(), 0u);
   }
 }
 

@@ -1,6 +1,5 @@
-// The kernel object writer of the kobj tool: which ELF files it takes and
-// why it refuses the others, and the bytes of the objects and fat files it
-// writes.
+// The kobj tool's ELF reader: which ELF files it takes and why it refuses the
+// others (the objects it writes are loaded by the loader's tests).
 #include <gtest/gtest.h>
 
 #include <functional>
@@ -15,7 +14,6 @@ namespace {
 
 using nimbtest::Bytes;
 using nimbtest::ElfSegment;
-using nimbtest::GetLe32;
 using nimbtest::Pattern;
 using nimbtest::PutLe16;
 using nimbtest::PutLe32;
@@ -94,34 +92,6 @@ TEST(KobjElfTest, TakesLoadableSegmentsAtTheirPhysicalAddresses) {
             std::make_tuple(0x100000, 0x30, Pattern(0x30)));
   EXPECT_EQ(std::make_tuple(second.address, second.memorySize, second.bytes),
             std::make_tuple(0x300000, 0x2000, Bytes()));
-}
-
-TEST(KobjWriterTest, FatRecordsInBothOrders) {
-  const std::vector<kobj::FatEntry> slices = {{18, 0, Pattern(0x1001)}, {7, 3, Pattern(0x20, 2)}};
-  struct Row {
-    kobj::ByteOrder order;
-    Bytes magic;
-  };
-  const Row rows[] = {{kobj::ByteOrder::kBig, {0xCA, 0xFE, 0xBA, 0xBE}},
-                      {kobj::ByteOrder::kLittle, {0xBE, 0xBA, 0xFE, 0xCA}}};
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.magic[0]);
-    Bytes out = kobj::WriteFat(slices, row.order);
-    auto get = [&](size_t at) {
-      uint32_t value = GetLe32(out, at);
-      return row.order == kobj::ByteOrder::kBig ? __builtin_bswap32(value) : value;
-    };
-    EXPECT_EQ(Bytes(out.begin(), out.begin() + 4), row.magic);
-    EXPECT_EQ(get(4), 2u);
-    const uint32_t expected[2][5] = {{18, 0, 0x1000, 0x1001, 12}, {7, 3, 0x3000, 0x20, 12}};
-    for (size_t i = 0; i < 2; i++) {
-      for (size_t field = 0; field < 5; field++)
-        EXPECT_EQ(get(8 + 20 * i + 4 * field), expected[i][field]) << "slice " << i << " field " << field;
-      uint32_t offset = expected[i][2];
-      EXPECT_EQ(Bytes(out.begin() + offset, out.begin() + offset + expected[i][3]), slices[i].bytes);
-    }
-    EXPECT_EQ(out.size(), 0x3020u);
-  }
 }
 
 }  // namespace

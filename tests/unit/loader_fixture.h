@@ -79,6 +79,14 @@ inline void AttachTo(hostfw::Firmware &f) {
   nimb::gImageHandle = f.ImageHandle();
 }
 
+// Pool blocks from the tracked allocator still held.
+inline size_t TrackedPoolBlocks() {
+  size_t count = 0;
+  for (const nimb::MemoryTag *tag = nimb::gMemoryTags; tag != nullptr; tag = tag->next)
+    count += tag->poolAddress != nullptr;
+  return count;
+}
+
 class LoaderTest : public ::testing::Test {
  protected:
   void SetUp() override {
