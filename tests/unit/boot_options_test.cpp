@@ -136,9 +136,6 @@ TEST_F(BootOptionsTest, OptionStrings) {
     EXPECT_EQ(gBootFlags, row.flags) << name;
     EXPECT_EQ(Printed(), row.printed) << name;
   }
-  EXPECT_EQ(Wide(gKernelName), u"nimb_kernel");
-  EXPECT_EQ(Wide(gDriverPackageName), u"System\\Library\\Extensions.drvpk");
-  EXPECT_EQ(gCustomDriverPackage, 0);
 }
 
 TEST_F(BootOptionsTest, HeldKeysAndTheBootPolicy) {

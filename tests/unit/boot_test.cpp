@@ -132,15 +132,6 @@ TEST_F(BootTest, FileSystemIsPreferredToLoadFile) {
   ASSERT_EQ(fw.Call([&] { volume = nimb::OpenBootVolume(both); }).end, hostfw::RunEnd::Returned);
   EXPECT_NE(volume.root, nullptr);
   EXPECT_EQ(volume.loadFile, nullptr);
-
-  // A network device: LoadFile only, nothing probed.
-  EFI_HANDLE network = fw.NewHandle();
-  fw.InstallProtocol(network, gEfiLoadFileProtocolGuid, &loadFile);
-  size_t opens = fw.OpenedNames().size();
-  ASSERT_EQ(fw.Call([&] { volume = nimb::OpenBootVolume(network); }).end, hostfw::RunEnd::Returned);
-  EXPECT_EQ(volume.root, nullptr);
-  EXPECT_EQ(volume.loadFile, &loadFile);
-  EXPECT_EQ(fw.OpenedNames().size(), opens);
 }
 
 TEST_F(BootTest, TheCallGateIsCopiedBelow4GiB) {

@@ -273,22 +273,15 @@ const char kIdText[] = "6095E009-5132-3FC5-87C2-D5A01745283E";
 const Bytes kZeroId(8, 0);
 const char kZeroIdText[] = "A97C9EAF-E18F-3BE3-80CD-8A8C6FB6E8E7";
 
-std::string UuidOf(const Bytes &id) {
-  char text[64];
-  std::memset(text, 'z', sizeof(text));
-  EXPECT_EQ(nimb::UuidFromVolumeId(id.data(), id.size(), sizeof(text), text), EFI_SUCCESS);
-  EXPECT_EQ(text[36], '\0');
-  EXPECT_EQ(text[37], 'z') << "37 bytes written";
-  return text;
-}
-
+// 37 bytes written; a destination that cannot hold them is not written.
 TEST(VolumeUuidTest, NameBasedUuidOfAnIdentifier) {
-  EXPECT_EQ(UuidOf(kId), kIdText);
-  // A destination that cannot hold the text is not written.
-  char small[36];
-  std::memset(small, 'z', sizeof(small));
-  EXPECT_EQ(nimb::UuidFromVolumeId(kId.data(), kId.size(), sizeof(small), small), EFI_BUFFER_TOO_SMALL);
-  EXPECT_EQ(std::string(small, sizeof(small)), std::string(sizeof(small), 'z'));
+  for (UINTN size : {64, 36}) {
+    char text[64];
+    std::memset(text, 'z', sizeof(text));
+    EXPECT_EQ(nimb::UuidFromVolumeId(kId.data(), kId.size(), size, text),
+              size == 64 ? EFI_SUCCESS : EFI_BUFFER_TOO_SMALL);
+    EXPECT_EQ(std::string(text, 38), size == 64 ? kIdText + std::string("\0z", 2) : std::string(38, 'z'));
+  }
 }
 
 // The volume header, with its big-endian fields.
