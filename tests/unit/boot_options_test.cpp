@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <array>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -332,47 +333,36 @@ TEST_F(BootOptionsTest, OutOfMemoryLeavesNoOptionString) {
   }
 }
 
-constexpr size_t kNone = static_cast<size_t>(-1);
-
 TEST(OptionsTest, GetOptionValueFindsTheLastPairWithTheKey) {
-  struct Row {
-    const char *text;
-    const char *key;
-    size_t offset;  // where the value starts in `text`; kNone when not found
-    const char *value;
+  // "OFFSET:VALUE", the offset where the value starts in `text`; "none": not
+  // found, the outs untouched.
+  const std::array<const char *, 3> rows[] = {
+      {" \t\r\n", "-v", "none"},
+      {"-v", "-v", "2:"},
+      {"-vx", "-v", "none"},
+      {"-x -v", "-x", "2:"},
+      {"a=\"b c\"", "a", "3:b c"},
+      {"a=\"b c\" d=1", "d", "10:1"},
+      {"\"a b\"=c", "a b", "6:c"},
+      {"\"a\"x=1", "a", "4:"},  // the byte behind a quoted key is a separator
+      {"a=\"b", "a", "3:b"},
+      {"a=1 a=2", "a", "6:2"},
+      {"a=b=c", "a", "2:b"},
+      {"a=b=c", "", "4:c"},
+      {"configure=1", "config", "none"},
+      {"[=1", "{", "2:1"},
+      {"a=\"-v b\"", "-v", "none"},
+      {"a\tb\r\nc", "c", "6:"},
   };
-  const Row rows[] = {
-      {" \t\r\n", "-v", kNone, ""},
-      {"-v", "-v", 2, ""},
-      {"-vx", "-v", kNone, ""},
-      {"-x -v", "-x", 2, ""},
-      {"a=\"b c\"", "a", 3, "b c"},
-      {"a=\"b c\" d=1", "d", 10, "1"},
-      {"\"a b\"=c", "a b", 6, "c"},
-      {"\"a\"x=1", "a", 4, ""},  // the byte behind a quoted key is a separator
-      {"a=\"b", "a", 3, "b"},
-      {"a=1 a=2", "a", 6, "2"},
-      {"a=b=c", "a", 2, "b"},
-      {"a=b=c", "", 4, "c"},
-      {"configure=1", "config", kNone, ""},
-      {"[=1", "{", 2, "1"},
-      {"a=\"-v b\"", "-v", kNone, ""},
-      {"a\tb\r\nc", "c", 6, ""},
-  };
-  for (const Row &row : rows) {
-    SCOPED_TRACE(std::string("text \"") + row.text + "\" key \"" + row.key + "\"");
+  for (const auto &[text, key, expected] : rows) {
     const char *value = nullptr;
     UINT64 length = 12345;
-    const EFI_STATUS status = nimb::GetOptionValue(row.text, row.key, &value, &length);
-    if (row.offset == kNone) {
-      EXPECT_EQ(status, EFI_NOT_FOUND);
-      EXPECT_EQ(value, nullptr);  // outs untouched
-      EXPECT_EQ(length, 12345u);
-      continue;
-    }
-    ASSERT_EQ(status, EFI_SUCCESS);
-    EXPECT_EQ(value, row.text + row.offset);
-    EXPECT_EQ(std::string(value, length), row.value);
+    const EFI_STATUS status = nimb::GetOptionValue(text, key, &value, &length);
+    const std::string got = status == EFI_SUCCESS
+                                ? std::to_string(value - text) + ":" + std::string(value, length)
+                            : status == EFI_NOT_FOUND && value == nullptr && length == 12345 ? "none"
+                                                                                             : "?";
+    EXPECT_EQ(got, expected) << "text \"" << text << "\" key \"" << key << "\"";
   }
 }
 
@@ -453,38 +443,30 @@ TEST_F(OptionsConfigTest, TheOptionStringBeatsTheDictionaryKeyByKey) {
       "<key>Sub</key><dict><key>Kernel</key><string>nested</string></dict>"
       "</dict></plist>";
   ASSERT_EQ(nimb::PlistParseDocument(document.data(), &nimb::gConfigDict), EFI_SUCCESS);
-  struct Row {
-    const char *text;
-    const char *key;
-    const char *value;  // null when not found
-    bool fromOptions;   // the value points into `text`
+  // "options:VALUE" from the text, "config:VALUE" from the dictionary
+  // (GetConfigValue agreeing), "none" when not found.
+  const std::array<const char *, 3> rows[] = {
+      {"", "Kernel", "config:nimb_other"},
+      {"Kernel=a", "Kernel", "options:a"},
+      {"kernel=a", "Kernel", "options:a"},
+      {"Kernels=a", "Kernel", "config:nimb_other"},
+      {"", "kernel", "none"},  // the dictionary's keys match exactly
+      {nullptr, "Kernel", "config:nimb_other"},
+      {"", "Empty", "config:"},
+      {"", "Root UUID", "none"},  // not a string
+      {"rd", "rd", "options:"},
   };
-  const Row rows[] = {
-      {"", "Kernel", "nimb_other", false},
-      {"Kernel=a", "Kernel", "a", true},
-      {"kernel=a", "Kernel", "a", true},
-      {"Kernels=a", "Kernel", "nimb_other", false},
-      {"", "kernel", nullptr, false},  // the dictionary's keys match exactly
-      {nullptr, "Kernel", "nimb_other", false},
-      {"", "Empty", "", false},
-      {"", "Root UUID", nullptr, false},  // not a string
-      {"rd", "rd", "", true},
-  };
-  for (const Row &row : rows) {
-    SCOPED_TRACE(std::string("text \"") + (row.text != nullptr ? row.text : "(null)") + "\" key \"" +
-                 row.key + "\"");
-    const EFI_STATUS status = nimb::GetOptionOrConfigValue(row.text, row.key, &value, &length);
-    if (row.value == nullptr) {
-      EXPECT_EQ(status, EFI_NOT_FOUND);
-      continue;
+  for (const auto &[text, key, expected] : rows) {
+    const EFI_STATUS status = nimb::GetOptionOrConfigValue(text, key, &value, &length);
+    std::string found = status == EFI_NOT_FOUND ? "none" : "?";
+    if (status == EFI_SUCCESS) {
+      const char *config = nimb::GetConfigValue(key);
+      const std::string got(value, length);
+      const bool fromText = text != nullptr && value >= text && value <= text + strlen(text);
+      found = (fromText ? "options:" : config != nullptr && got == config ? "config:" : "?:") + got;
     }
-    ASSERT_EQ(status, EFI_SUCCESS);
-    EXPECT_EQ(std::string(value, length), row.value);
-    if (row.fromOptions) {
-      EXPECT_TRUE(value >= row.text && value <= row.text + strlen(row.text));
-    } else {
-      EXPECT_STREQ(nimb::GetConfigValue(row.key), row.value);
-    }
+    EXPECT_EQ(found, expected) << "text \"" << (text != nullptr ? text : "(null)") << "\" key \"" << key
+                               << "\"";
   }
 }
 

@@ -126,8 +126,6 @@ TEST_F(TextAllocTest, ConversionsIntoPoolMemory) {
 
 using nimb::SPrint;
 
-constexpr CHAR16 kGuard = 0xBEEF;
-
 // One SPrint call into the row's buffer.
 #define PRINT(...) [](CHAR16 *b, UINTN n) { return SPrint(b, n, __VA_ARGS__); }
 
@@ -156,13 +154,13 @@ TEST(SPrintTest, DirectivesAndCuts) {
   };
   for (const Row &row : rows) {
     SCOPED_TRACE(row.name);
-    std::vector<CHAR16> buffer(row.size / 2 + 4, kGuard);
+    std::vector<CHAR16> buffer(row.size / 2 + 4, kGuardUnit);
     const UINTN written = row.print(buffer.data(), row.size);
     std::vector<CHAR16> expected(row.expected.begin(), row.expected.end());
     if (row.size >= 2)
       expected.push_back(0);
     EXPECT_EQ(written, expected.size());
-    expected.resize(buffer.size(), kGuard);
+    expected.resize(buffer.size(), kGuardUnit);
     EXPECT_EQ(buffer, expected);
   }
 }
