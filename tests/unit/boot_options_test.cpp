@@ -6,9 +6,13 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <array>
+#include <cstring>
 #include <string>
 #include <vector>
 
+#include "config/options.h"
+#include "config/plist.h"
 #include "efi/vendor.h"
 #include "hostfw/network.h"
 #include "loader_fixture.h"
@@ -133,9 +137,6 @@ TEST_F(BootOptionsTest, OptionStrings) {
     EXPECT_EQ(gBootFlags, row.flags) << name;
     EXPECT_EQ(Printed(), row.printed) << name;
   }
-  EXPECT_EQ(Wide(gKernelName), u"nimb_kernel");
-  EXPECT_EQ(Wide(gDriverPackageName), u"System\\Library\\Extensions.drvpk");
-  EXPECT_EQ(gCustomDriverPackage, 0);
 }
 
 TEST_F(BootOptionsTest, HeldKeysAndTheBootPolicy) {
@@ -329,6 +330,143 @@ TEST_F(BootOptionsTest, OutOfMemoryLeavesNoOptionString) {
     fw.FailCall("AllocatePool", nth);
     EXPECT_EQ(Process(u"-v"), EFI_OUT_OF_RESOURCES) << nth;
     EXPECT_EQ(gBootOptions, nullptr) << nth;
+  }
+}
+
+TEST(OptionsTest, GetOptionValueFindsTheLastPairWithTheKey) {
+  // "OFFSET:VALUE", the offset where the value starts in `text`; "none": not
+  // found, the outs untouched.
+  const std::array<const char *, 3> rows[] = {
+      {" \t\r\n", "-v", "none"},
+      {"-v", "-v", "2:"},
+      {"-vx", "-v", "none"},
+      {"-x -v", "-x", "2:"},
+      {"a=\"b c\"", "a", "3:b c"},
+      {"a=\"b c\" d=1", "d", "10:1"},
+      {"\"a b\"=c", "a b", "6:c"},
+      {"\"a\"x=1", "a", "4:"},  // the byte behind a quoted key is a separator
+      {"a=\"b", "a", "3:b"},
+      {"a=1 a=2", "a", "6:2"},
+      {"a=b=c", "a", "2:b"},
+      {"a=b=c", "", "4:c"},
+      {"configure=1", "config", "none"},
+      {"[=1", "{", "2:1"},
+      {"a=\"-v b\"", "-v", "none"},
+      {"a\tb\r\nc", "c", "6:"},
+  };
+  for (const auto &[text, key, expected] : rows) {
+    const char *value = nullptr;
+    UINT64 length = 12345;
+    const EFI_STATUS status = nimb::GetOptionValue(text, key, &value, &length);
+    const std::string got = status == EFI_SUCCESS
+                                ? std::to_string(value - text) + ":" + std::string(value, length)
+                            : status == EFI_NOT_FOUND && value == nullptr && length == 12345 ? "none"
+                                                                                             : "?";
+    EXPECT_EQ(got, expected) << "text \"" << text << "\" key \"" << key << "\"";
+  }
+}
+
+// Word and key, as NextOption splits `text` up to the terminator.
+using Words = std::vector<std::pair<std::string, std::string>>;
+Words Split(const char *text) {
+  Words words;
+  while (*text != '\0') {
+    const char *word = nullptr;
+    UINT64 keyLength = 0;
+    UINT64 wordLength = 0;
+    const char *next = nimb::NextOption(text, &word, &keyLength, &wordLength);
+    EXPECT_EQ(next, word + wordLength);
+    words.push_back({std::string(word, wordLength), std::string(word, keyLength)});
+    text = next;
+  }
+  return words;
+}
+
+class OptionsAppendTest : public nimbtest::LoaderTest {};
+
+// The same rows with the plain search and with the key index.
+TEST_F(OptionsAppendTest, AppendOptionDropsWordsWhoseKeyIsInTheTextAlready) {
+  struct Row {
+    const char *base;
+    std::vector<const char *> sources;  // each split into words with NextOption
+    const char *result;
+  };
+  const Row rows[] = {
+      {"", {"a b"}, "a b"},
+      {"-v", {"-v"}, "-v"},
+      {"-v", {"-v=1"}, "-v"},
+      {"-vx", {"-v"}, "-vx -v"},
+      {"-V", {"-v"}, "-V -v"},
+      {"x\t-v\r\n", {"-v"}, "x\t-v\r\n"},
+      {"a=\"x -v y\"", {"-v"}, "a=\"x -v y\""},
+      {"", {"a=\"b c\" a=1"}, "a=\"b c\""},
+      {"=x", {"=x"}, "=x =x"},
+      {"x", {"a b "}, "x a b "},
+      {"-v foo=1", {"foo=2 bar=3 -v", "baz=4 bar=5"}, "-v foo=1 bar=3 baz=4"},
+  };
+  for (const Row &row : rows) {
+    for (bool indexed : {false, true}) {
+      SCOPED_TRACE(std::string("base \"") + row.base + "\"" + (indexed ? ", indexed" : ""));
+      std::vector<char> buffer(256, '\x55');
+      std::strcpy(buffer.data(), row.base);
+      char *end = buffer.data() + strlen(row.base);
+      nimb::OptionKeyIndex index;
+      nimb::OptionKeyIndexInit(&index, buffer.data(), buffer.size(), indexed ? 16 : 0x7FFFFFFF);
+      ASSERT_EQ(index.slots != nullptr, indexed);
+      for (const char *source : row.sources) {
+        for (const auto &[word, key] : Split(source))
+          end = nimb::AppendIndexedOption(&index, end, word.c_str(), key.size(), word.size());
+      }
+      nimb::OptionKeyIndexFree(&index);
+      EXPECT_STREQ(buffer.data(), row.result);
+      EXPECT_EQ(end, buffer.data() + strlen(row.result));
+      // Nothing is written behind the terminator.
+      EXPECT_EQ(end[1], '\x55');
+    }
+  }
+}
+
+// The configuration dictionary as second source, parsed from a document as
+// the boot options do.
+class OptionsConfigTest : public nimbtest::LoaderTest {};
+
+TEST_F(OptionsConfigTest, TheOptionStringBeatsTheDictionaryKeyByKey) {
+  const char *value = nullptr;
+  UINT64 length = 0;
+  EXPECT_EQ(nimb::GetOptionOrConfigValue("a=1", "Kernel", &value, &length), EFI_NOT_FOUND) << "no dictionary";
+  EXPECT_EQ(nimb::GetConfigValue("Kernel"), nullptr);
+  std::string document =
+      "<plist><dict>"
+      "<key>Kernel</key><string>nimb_other</string>"
+      "<key>Empty</key><string></string>"
+      "<key>Root UUID</key><integer>5</integer>"
+      "<key>Sub</key><dict><key>Kernel</key><string>nested</string></dict>"
+      "</dict></plist>";
+  ASSERT_EQ(nimb::PlistParseDocument(document.data(), &nimb::gConfigDict), EFI_SUCCESS);
+  // "options:VALUE" from the text, "config:VALUE" from the dictionary
+  // (GetConfigValue agreeing), "none" when not found.
+  const std::array<const char *, 3> rows[] = {
+      {"", "Kernel", "config:nimb_other"},
+      {"Kernel=a", "Kernel", "options:a"},
+      {"kernel=a", "Kernel", "options:a"},
+      {"Kernels=a", "Kernel", "config:nimb_other"},
+      {"", "kernel", "none"},  // the dictionary's keys match exactly
+      {nullptr, "Kernel", "config:nimb_other"},
+      {"", "Empty", "config:"},
+      {"", "Root UUID", "none"},  // not a string
+      {"rd", "rd", "options:"},
+  };
+  for (const auto &[text, key, expected] : rows) {
+    const EFI_STATUS status = nimb::GetOptionOrConfigValue(text, key, &value, &length);
+    std::string found = status == EFI_NOT_FOUND ? "none" : "?";
+    if (status == EFI_SUCCESS) {
+      const char *config = nimb::GetConfigValue(key);
+      const std::string got(value, length);
+      const bool fromText = text != nullptr && value >= text && value <= text + strlen(text);
+      found = (fromText ? "options:" : config != nullptr && got == config ? "config:" : "?:") + got;
+    }
+    EXPECT_EQ(found, expected) << "text \"" << (text != nullptr ? text : "(null)") << "\" key \"" << key
+                               << "\"";
   }
 }
 

@@ -5,6 +5,7 @@
 
 #include <cstring>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "loader_fixture.h"
@@ -111,7 +112,7 @@ TEST_F(ConsoleTest, CharactersReachTheFirmwareOneUnitAtATime) {
   EXPECT_EQ(fw.StdErrCalls().size(), 3u);
 }
 
-TEST_F(ConsoleTest, InitConsoleFailures) {
+TEST_F(ConsoleTest, InitConsoleFailuresAndModeChanges) {
   for (const char *failing : {"", "LocateProtocol", "GetMode"}) {
     hostfw::Firmware local;
     local.SetConsoleControlPresent(*failing != '\0');
@@ -121,9 +122,8 @@ TEST_F(ConsoleTest, InitConsoleFailures) {
     EXPECT_TRUE(EFI_ERROR(nimb::InitConsole())) << failing;
     EXPECT_EQ(nimb::gConsoleMode + nimb::gInitialConsoleMode, 0u) << failing;
   }
-}
-
-TEST_F(ConsoleTest, ModesChangeOnlyWhenTheyDiffer) {
+  // Modes change only when they differ.
+  nimbtest::AttachTo(fw);
   fw.SetConsoleMode(EfiConsoleControlScreenText);
   ASSERT_EQ(nimb::InitConsole(), EFI_SUCCESS);
   auto setCalls = [&] {
@@ -154,14 +154,12 @@ TEST_F(ConsoleTest, FatalPrintsRestoresTheConsoleAndGivesEverythingBack) {
       ASSERT_NE(nimb::TrackedAllocatePool(24), nullptr);
     nimb::Fatal("Bad %s at %x", "thing", 0x10u);
   });
-  EXPECT_EQ(result.end, hostfw::RunEnd::Exited);
-  EXPECT_EQ(result.status, EFI_ABORTED);
   // No newline is added to a fatal message.
-  EXPECT_EQ(fw.ConOutText(), "Bad thing at 10");
-  EXPECT_EQ(fw.ConsoleMode(), EfiConsoleControlScreenText);
-  EXPECT_EQ(nimb::gConsoleMode, 0u);
+  EXPECT_EQ(std::make_tuple(result.end, result.status, fw.ConOutText(), fw.ConsoleMode(), nimb::gConsoleMode,
+                            nimb::gMemoryTags == nullptr),
+            std::make_tuple(hostfw::RunEnd::Exited, EFI_ABORTED, std::string("Bad thing at 10"),
+                            EfiConsoleControlScreenText, UINT32{0}, true));
   ExpectNothingHeld();
-  EXPECT_EQ(nimb::gMemoryTags, nullptr);
 }
 
 }  // namespace

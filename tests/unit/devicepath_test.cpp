@@ -90,8 +90,9 @@ TEST(DevicePathTest, WalksVisitEveryNodeAndStopAtTheEndOrAtADamagedNode) {
   }
 }
 
-TEST(DevicePathTest, FirmwarePathsAreBoundedByTheLargestPathSize) {
-  // A path with nothing damaged in it but no end within the bound.
+TEST(DevicePathTest, FindNodeTakesTheFirstMatchInFrontOfTheEnd) {
+  // Firmware paths are bounded by the largest path size: nothing damaged in
+  // this one, but no end within the bound.
   Bytes bytes;
   while (bytes.size() < nimb::kMaxDevicePathSize + 8) {
     const Bytes node = Node(4, 4, 0x1000);
@@ -100,9 +101,7 @@ TEST(DevicePathTest, FirmwarePathsAreBoundedByTheLargestPathSize) {
   bytes.insert(bytes.end(), kEnd.begin(), kEnd.end());
   EXPECT_EQ(nimb::DevicePathSize(AsPath(bytes)), 0u);
   EXPECT_EQ(nimb::DevicePathSizeWithin(AsPath(bytes), bytes.size()), bytes.size());
-}
 
-TEST(DevicePathTest, FindNodeTakesTheFirstMatchInFrontOfTheEnd) {
   const Bytes path = Cat({Node(2, 1, 12), Node(0x83, 11, 10), Node(0x7F, 0x01, 4), Node(4, 1, 42),
                           Node(4, 4, 8), Node(4, 1, 42), kEnd, Node(5, 1, 4)});
   struct Row {

@@ -69,6 +69,14 @@ inline void ResetLoaderState() {
     c = '\0';
 }
 
+// `text` as little-endian UTF-16 bytes, as firmware variables and records hold it.
+inline std::vector<uint8_t> Ucs2(const std::u16string &text) {
+  std::vector<uint8_t> bytes;
+  for (char16_t unit : text)
+    bytes.insert(bytes.end(), {uint8_t(unit), uint8_t(unit >> 8)});
+  return bytes;
+}
+
 // Points the loader's firmware tables at `f` from a fresh start, as BootEntry
 // would: for a test or a row with a firmware of its own.
 inline void AttachTo(hostfw::Firmware &f) {

@@ -260,7 +260,7 @@ TEST_F(PlistTest, ManySymbolsAreFoundAndReleased) {
   EXPECT_EQ(nimb::gPlistSymbolIndex.buckets, nullptr) << "the index goes with the last symbol";
 }
 
-TEST_F(PlistTest, TagsComeFromZeroedBlocksInAscendingOrder) {
+TEST_F(PlistTest, TagsComeFromZeroedBlocksAndNoMemoryForThemFailsTheParse) {
   PlistTag *first = nimb::PlistNewTag();
   EXPECT_EQ(first->next, nullptr);
   EXPECT_EQ(gPlistFreeTags, first + 1);
@@ -268,9 +268,9 @@ TEST_F(PlistTest, TagsComeFromZeroedBlocksInAscendingOrder) {
   // A freed tag is handed out again before any other.
   nimb::PlistFreeTag(first);
   EXPECT_EQ(nimb::PlistNewTag(), first);
-}
+  nimb::TrackedFreeAll();
+  nimbtest::ResetConfigurationState();
 
-TEST_F(PlistTest, NoMemoryForTagsFailsTheParseButForASymbolEndsTheBoot) {
   // Memory tags are made once, so that the next allocation is the block.
   ASSERT_EQ(nimb::TrackedFree(nimb::TrackedAllocatePool(8)), EFI_SUCCESS);
   fw.FailCall("AllocatePool", 1, EFI_OUT_OF_RESOURCES);

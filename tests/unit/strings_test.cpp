@@ -2,9 +2,12 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <string>
 #include <vector>
+
+#include "support/checksum.h"
 
 namespace {
 
@@ -134,16 +137,14 @@ TEST(StringsTest, MemoryAndCopyRoutines) {
   EXPECT_STREQ(down, "cdefghgh");
 
   // strncpy never pads.
-  char bytes[6] = "#####";
+  char bytes[6] = "#####", target[8] = "#######";
   EXPECT_EQ(nimb::strncpy(bytes, "ab", 4), bytes);
-  EXPECT_EQ(std::string(bytes, 6), std::string("ab\0##\0", 6));
-  char target[8] = "#######";
   EXPECT_EQ(nimb::strcpy(target, "abc"), target);
-  EXPECT_EQ(std::string(target, 8), std::string("abc\0###\0", 8));
+  EXPECT_EQ(std::string(bytes, 6) + std::string(target, 8), std::string("ab\0##\0abc\0###\0", 14));
   EXPECT_EQ(nimb::strlen("abc\0def"), 3u);
 }
 
-TEST(StringsTest, WideStrings) {
+TEST(StringsTest, WideStringsAndGuids) {
   EXPECT_EQ(nimb::StrLen(u"a\u4E2Dc"), 3u);
   CHAR16 buffer[6] = {9, 9, 9, 9, 9, 9};
   nimb::StrCpy(buffer, u"ab");
@@ -152,9 +153,8 @@ TEST(StringsTest, WideStrings) {
   EXPECT_EQ(nimb::StrCmp(u"abc", u"abc"), 0);
   EXPECT_EQ(nimb::StrCmp(u"ab", u"abc"), -'c');
   EXPECT_EQ(nimb::StrCmp(u"\xFFFF", u"a"), 0xFFFF - 'a') << "units read as unsigned";
-}
 
-TEST(StringsTest, CompareGuidLooksAtAllSixteenBytes) {
+  // CompareGuid looks at all sixteen bytes.
   const EFI_GUID base = {0x12345678, 0x9ABC, 0xDEF0, {1, 2, 3, 4, 5, 6, 7, 8}};
   EFI_GUID same = base;
   EXPECT_EQ(nimb::CompareGuid(&base, &same), TRUE);
@@ -162,6 +162,84 @@ TEST(StringsTest, CompareGuidLooksAtAllSixteenBytes) {
     EFI_GUID other = base;
     reinterpret_cast<UINT8 *>(&other)[i] ^= 0x40;
     EXPECT_EQ(nimb::CompareGuid(&base, &other), FALSE) << "byte " << i;
+  }
+}
+
+// MD5 of `text` fed in pieces of `piece` bytes (0: in one call), in hex.
+std::string Md5(const std::string &text, size_t piece) {
+  nimb::Md5Context context;
+  nimb::Md5Init(&context);
+  if (piece == 0)
+    piece = text.size() + 1;
+  for (size_t at = 0; at < text.size() || at == 0; at += piece)
+    nimb::Md5Update(&context, text.data() + at, static_cast<UINT32>(std::min(piece, text.size() - at)));
+  UINT8 digest[16];
+  nimb::Md5Final(digest, &context);
+  std::string out;
+  for (UINT8 byte : digest)
+    out += {"0123456789abcdef"[byte >> 4], "0123456789abcdef"[byte & 15]};
+  // Final leaves nothing of the message behind.
+  const UINT8 *bytes = reinterpret_cast<const UINT8 *>(&context);
+  EXPECT_EQ(std::vector<UINT8>(bytes, bytes + sizeof(context)), std::vector<UINT8>(sizeof(context), 0));
+  return out;
+}
+
+// The published suite, and runs of 'a' where padding takes one block or two
+// (a million: a bit count above 2^22), whole and in pieces.
+TEST(Md5Test, PublishedSuiteAndPaddingAroundOneBlock) {
+  const std::string digits =
+      "12345678901234567890123456789012345678901234567890123456789012345678901234567890";
+  const std::pair<std::string, const char *> rows[] = {
+      {"", "d41d8cd98f00b204e9800998ecf8427e"},
+      {"abc", "900150983cd24fb0d6963f7d28e17f72"},
+      {"abcdefghijklmnopqrstuvwxyz", "c3fcd3d76192e4007dfb496cca67e13b"},
+      {digits, "57edf4a22be3c955ac49da2e2107b67a"},
+      {std::string(55, 'a'), "ef1772b6dff9a122358552954ad0df65"},
+      {std::string(56, 'a'), "3b0c8ac703f828b04c6c197006d17218"},
+      {std::string(64, 'a'), "014842d480b571495a4a0363793f7367"},
+      {std::string(119, 'a'), "8a7bd0732ed6a28ce75f6dabc90e1613"},
+      {std::string(120, 'a'), "5f61c0ccad4cac44c75ff505e1f1e537"},
+      {std::string(1000000, 'a'), "7707d6ae4e027c70eea2a935c2296f21"},
+  };
+  for (const auto &[text, digest] : rows) {
+    for (size_t piece : {0, 1, 63, 65})
+      EXPECT_EQ(Md5(text, piece), digest) << text.size() << " bytes in pieces of " << piece;
+  }
+}
+
+TEST(Md5Test, TheBitCountCarriesIntoItsHighWord) {
+  struct Row {
+    UINT32 low;  // bit count before the update
+    UINT32 length;
+    UINT32 expectedLow;
+    UINT32 expectedHigh;
+  };
+  const Row rows[] = {{0xFFFFFFF8, 1, 0, 1}, {0xFFFFFF00, 64, 0x100, 1}, {0xFFFFFE00, 63, 0xFFFFFFF8, 0}};
+  const std::string data(64, 'x');
+  for (const Row &row : rows) {
+    nimb::Md5Context context;
+    nimb::Md5Init(&context);
+    context.count[0] = row.low;
+    nimb::Md5Update(&context, data.data(), row.length);
+    EXPECT_EQ(context.count[0], row.expectedLow) << row.low;
+    EXPECT_EQ(context.count[1], row.expectedHigh) << row.low;
+  }
+}
+
+TEST(Adler32Test, ByteReversedAndReducedInTime) {
+  EXPECT_EQ(nimb::Adler32("abc", 3), 0x27014D02u);
+  EXPECT_EQ(nimb::Adler32(nullptr, 0), 0x01000000u);
+  // All 0xFF is the input that overflows first; the reference reduces after
+  // every byte.
+  for (size_t length : {5001, 100003}) {
+    const std::vector<UINT8> data(length, 0xFF);
+    UINT64 s1 = 1, s2 = 0;
+    for (UINT8 byte : data) {
+      s1 = (s1 + byte) % 65521;
+      s2 = (s2 + s1) % 65521;
+    }
+    const UINT32 sum = static_cast<UINT32>((s2 << 16) | s1);
+    EXPECT_EQ(nimb::Adler32(data.data(), data.size()), __builtin_bswap32(sum)) << length;
   }
 }
 

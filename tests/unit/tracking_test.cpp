@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <random>
 #include <set>
+#include <tuple>
 #include <vector>
 
 #include "loader_fixture.h"
@@ -31,12 +32,10 @@ TEST_F(TrackingTest, BlocksOfTagsAndTheirReuse) {
   std::vector<void *> buffers = {nimb::TrackedAllocatePool(40)};
   auto *block = static_cast<MemoryTag *>(gMemoryTagBlocks->poolAddress);
   // The block's own record is its last; the highest free tag goes first.
-  EXPECT_EQ(gMemoryTagBlocks, &block[127]);
-  EXPECT_EQ(gMemoryTagBlocks->pageCount + gMemoryTagBlocks->pageAddress, 0u);
-  EXPECT_EQ(gMemoryTags, &block[126]);
-  EXPECT_EQ(gMemoryTags->poolAddress, buffers[0]);
-  EXPECT_EQ(gFreeMemoryTags, &block[125]);
-  EXPECT_EQ(fw.LivePoolBlocks(), 2u) << "a tag block carries no tag";
+  // A tag block carries no tag.
+  EXPECT_EQ(std::make_tuple(gMemoryTagBlocks, gMemoryTagBlocks->pageCount + gMemoryTagBlocks->pageAddress,
+                            gMemoryTags, gMemoryTags->poolAddress, gFreeMemoryTags, fw.LivePoolBlocks()),
+            std::make_tuple(&block[127], UINT64{0}, &block[126], buffers[0], &block[125], size_t{2}));
   while (buffers.size() < 127)
     buffers.push_back(nimb::TrackedAllocatePool(8));
   EXPECT_EQ(gFreeMemoryTags, nullptr);
@@ -47,16 +46,13 @@ TEST_F(TrackingTest, BlocksOfTagsAndTheirReuse) {
   nimb::TrackedAllocatePool(8);
   EXPECT_EQ(Length(gMemoryTagBlocks), 1u);
   nimb::TrackedAllocatePool(8);
-  EXPECT_EQ(Length(gMemoryTagBlocks), 2u);
-  EXPECT_EQ(Length(gMemoryTags), 128u);
-  EXPECT_EQ(Length(gFreeMemoryTags), 126u);
+  EXPECT_EQ(std::make_tuple(Length(gMemoryTagBlocks), Length(gMemoryTags), Length(gFreeMemoryTags)),
+            std::make_tuple(2u, 128u, 126u));
   // One FreePool for each live buffer and each block; then a fresh block.
   unsigned frees = fw.FreePoolCalls();
   nimb::TrackedFreeAll();
   EXPECT_EQ(fw.FreePoolCalls() - frees, 128u + 2u);
-  EXPECT_EQ(gMemoryTags, nullptr);
-  EXPECT_EQ(gFreeMemoryTags, nullptr);
-  EXPECT_EQ(gMemoryTagBlocks, nullptr);
+  EXPECT_TRUE(gMemoryTags == nullptr && gFreeMemoryTags == nullptr && gMemoryTagBlocks == nullptr);
   ExpectNothingHeld();
   unsigned pools = fw.AllocatePoolCalls();
   ASSERT_NE(nimb::TrackedAllocatePool(16), nullptr);
@@ -78,9 +74,8 @@ TEST_F(TrackingTest, PagesAndForeignPoolAreTaggedOnlyWhenTheFirmwareGivesThem) {
   EFI_PHYSICAL_ADDRESS address = 0x200000;
   ASSERT_EQ(nimb::TrackedAllocatePages(AllocateAddress, EfiLoaderData, 4, &address), EFI_SUCCESS);
   ASSERT_EQ(Length(gMemoryTags), 1u);
-  EXPECT_EQ(gMemoryTags->poolAddress, nullptr);
-  EXPECT_EQ(gMemoryTags->pageCount, 4u);
-  EXPECT_EQ(gMemoryTags->pageAddress, 0x200000u);
+  EXPECT_EQ(std::make_tuple(gMemoryTags->poolAddress, gMemoryTags->pageCount, gMemoryTags->pageAddress),
+            std::make_tuple(static_cast<void *>(nullptr), UINT64{4}, UINT64{0x200000}));
   fw.FailAllocation(1);
   EFI_PHYSICAL_ADDRESS other = 0;
   EXPECT_EQ(nimb::TrackedAllocatePages(AllocateAnyPages, EfiLoaderData, 1, &other), EFI_OUT_OF_RESOURCES);
