@@ -8,20 +8,10 @@
 // hold no two words with the same key.
 //
 // The whole input is also walked as a device path bounded by its size.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <memory>
-#include <vector>
 
 #include "config/options.h"
 #include "fuzz_firmware.h"
-#include "memory/tracking.h"
 #include "support/devicepath.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 struct Word {
   const char *word;
@@ -122,8 +112,6 @@ void WalkDevicePath(const uint8_t *data, size_t size) {
     }
   }
 }
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   const size_t length = strnlen(reinterpret_cast<const char *>(data), size);

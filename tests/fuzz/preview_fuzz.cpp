@@ -2,19 +2,9 @@
 // the section (it is copied into a buffer of exactly its size, which the
 // sanitizer guards), write nothing outside the frame buffer, draw either
 // everything or nothing, and give its working memory back.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <vector>
 
 #include "fuzz_firmware.h"
-#include "hostfw/hostfw.h"
-#include "memory/tracking.h"
 #include "screen/resume_display.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 uint32_t Word(const std::vector<uint8_t> &bytes, size_t at) {
   uint32_t value = 0;
@@ -22,8 +12,6 @@ uint32_t Word(const std::vector<uint8_t> &bytes, size_t at) {
     std::memcpy(&value, &bytes[at], 4);
   return value;
 }
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   static hostfw::Firmware fw;
