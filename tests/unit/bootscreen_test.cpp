@@ -89,18 +89,6 @@ class BootScreenTest : public nimbtest::LoaderTest {
   static constexpr UINT32 kLogoX = 336, kLogoY = 236, kSpinnerX = 384, kSpinnerY = 484;
 };
 
-TEST_F(BootScreenTest, ExpandIndexedImageTakesBlueGreenRedFromTheTable) {
-  const UINT8 indexes[] = {0, 1, 255, 97, 200};
-  EFI_UGA_PIXEL *pixels = nullptr;
-  ASSERT_EQ(nimb::ExpandIndexedImage(5, 1, indexes, &pixels), EFI_SUCCESS);
-  for (size_t i = 0; i < sizeof(indexes); i++) {
-    const EFI_UGA_PIXEL p = pixels[i];
-    EXPECT_EQ(UINT32(p.Reserved) << 24 | UINT32(p.Red) << 16 | UINT32(p.Green) << 8 | p.Blue,
-              Rgb(indexes[i]));
-  }
-  nimb::TrackedFree(pixels);
-}
-
 TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
   const size_t poolBefore = fw.LivePoolBlocks();
   nimb::ShowBootScreen();
