@@ -7,15 +7,6 @@
 // "boot-args", "efi-boot-file-data", "efi-boot-drvpk-data" exist), then the
 // load options, the three variables' values, each of a length the input
 // gives, and the rest as the configuration file.
-#include <fuzzer/FuzzedDataProvider.h>
-#include <stdlib.h>
-
-#include <cstdint>
-#include <cstdio>
-#include <cstdlib>
-#include <cstring>
-#include <filesystem>
-#include <string>
 
 #include "boot/volume.h"
 #include "config/boot_options.h"
@@ -23,12 +14,7 @@
 #include "efi/vendor.h"
 #include "fuzz_firmware.h"
 #include "hostfw/network.h"
-#include "memory/tracking.h"
 #include "tests/unit/loader_state.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 struct Machine : nimbfuzz::VolumeMachine {
   hostfw::NetworkDevice net{fw};
@@ -45,8 +31,6 @@ void SetVariable(hostfw::Firmware &fw, const char16_t *name, bool present, const
   if (present)
     fw.PutVariable(name, gNimbVendorVariableGuid, 7, std::vector<uint8_t>(value.begin(), value.end()));
 }
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   static Machine &m = *new Machine;

@@ -2,26 +2,12 @@
 // it: the scan, the walk of the libraries and the staging must stay inside
 // their buffers and end; a kept bundle carries the raw text, and every
 // staged block describes itself truly.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <filesystem>
-#include <fstream>
-#include <string>
-#include <vector>
 
-#include "boot/boot.h"
 #include "config/plist.h"
 #include "devicetree/devicetree.h"
 #include "fuzz_firmware.h"
-#include "hostfw/hostfw.h"
 #include "load/bundles.h"
 #include "memory/kernel_region.h"
-#include "memory/tracking.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 uint32_t GetLe32(const uint8_t *at) {
   return uint32_t(at[0]) | uint32_t(at[1]) << 8 | uint32_t(at[2]) << 16 | uint32_t(at[3]) << 24;
@@ -52,12 +38,7 @@ Machine &TheMachine() {
   return *machine;
 }
 
-}  // namespace
-
-extern "C" int LLVMFuzzerInitialize(int *argc, char ***argv) {
-  nimbfuzz::WithoutLeakScan(argc, argv);
-  return 0;
-}
+NIMB_FUZZ_WITHOUT_LEAK_SCAN
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   Machine &m = TheMachine();

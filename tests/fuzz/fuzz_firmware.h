@@ -4,8 +4,16 @@
 // of each input.
 #pragma once
 
+#include <fuzzer/FuzzedDataProvider.h>
 #include <stdlib.h>
 
+#include <algorithm>
+#include <cstdint>
+#include <cstdio>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -94,17 +102,20 @@ struct VolumeMachine {
   }
 };
 
+}  // namespace nimbfuzz
+
 // For a target whose firmware records every file name opened: each input
 // then leaves heap behind it, and libFuzzer would scan the whole arena for
 // leaks after each. The loader's own memory is checked by the firmware's
-// counts instead. Called from LLVMFuzzerInitialize.
-inline void WithoutLeakScan(int *argc, char ***argv) {
-  static std::vector<char *> arguments(*argv, *argv + *argc);
-  static char noLeaks[] = "-detect_leaks=0";
-  arguments.push_back(noLeaks);
-  arguments.push_back(nullptr);
-  *argc += 1;
-  *argv = arguments.data();
-}
+// counts instead.
+#define NIMB_FUZZ_WITHOUT_LEAK_SCAN                              \
+  extern "C" int LLVMFuzzerInitialize(int *argc, char ***argv) { \
+    static std::vector<char *> arguments(*argv, *argv + *argc);  \
+    static char noLeaks[] = "-detect_leaks=0";                   \
+    arguments.insert(arguments.end(), {noLeaks, nullptr});       \
+    *argc += 1;                                                  \
+    *argv = arguments.data();                                    \
+    return 0;                                                    \
+  }
 
-}  // namespace nimbfuzz
+using nimbfuzz::Check;

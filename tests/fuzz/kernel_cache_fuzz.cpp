@@ -7,28 +7,14 @@
 // header to be made consistent with the file, so that the search reaches
 // the decompression (bit 0: compressedSize), the checksum (bit 1:
 // uncompressedSize) and the kernel inside (bit 2: adler32).
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <filesystem>
-#include <fstream>
-#include <string>
-#include <vector>
 
-#include "boot/boot.h"
 #include "config/boot_options.h"
 #include "devicetree/platform.h"
 #include "fuzz_firmware.h"
-#include "hostfw/hostfw.h"
 #include "load/kernel_cache.h"
 #include "load/lzss.h"
 #include "memory/kernel_region.h"
-#include "memory/tracking.h"
 #include "support/checksum.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 // Sizes in the header are kept below this, so that no input has the pool
 // asked for a gigabyte.
@@ -84,12 +70,7 @@ Machine &TheMachine() {
   return *machine;
 }
 
-}  // namespace
-
-extern "C" int LLVMFuzzerInitialize(int *argc, char ***argv) {
-  nimbfuzz::WithoutLeakScan(argc, argv);
-  return 0;
-}
+NIMB_FUZZ_WITHOUT_LEAK_SCAN
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (size == 0)

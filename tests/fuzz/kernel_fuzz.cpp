@@ -1,26 +1,14 @@
 // Any bytes as a kernel image in memory: finding the slice and loading the
 // object must stay inside the file and inside the pages the loader took,
 // and end; whatever it took must all come back.
-#include <cstdint>
-#include <cstdlib>
-#include <vector>
 
-#include "boot/boot.h"
 #include "fuzz_firmware.h"
-#include "hostfw/hostfw.h"
 #include "load/bootfile.h"
 #include "load/kernel.h"
 #include "memory/kernel_region.h"
-#include "memory/tracking.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 // The memory a kernel may take per input.
 constexpr UINT64 kUsableMemory = 32ull << 20;
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   static hostfw::Firmware &fw = nimbfuzz::Quiet(*new hostfw::Firmware, kUsableMemory);

@@ -1,11 +1,7 @@
 // Any bytes as an LZSS stream, decoded into a destination of a size that the
 // first two bytes choose: the decoder must stay inside the input and the
 // destination, and agree with the plain ring decoder byte for byte.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <vector>
-
+#include "fuzz_firmware.h"
 #include "load/lzss.h"
 #include "tests/unit/lzss_reference.h"
 

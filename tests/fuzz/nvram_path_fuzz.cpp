@@ -5,20 +5,11 @@
 //
 // Input: one byte of flags (bit 0 wantMac, bit 1 replace the last file node),
 // then the variable's bytes.
-#include <cstdint>
-#include <cstdlib>
 
 #include "config/boot_options.h"
 #include "efi/vendor.h"
 #include "fuzz_firmware.h"
-#include "memory/tracking.h"
 #include "support/devicepath.h"
-
-namespace {
-
-using nimbfuzz::Check;
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (size == 0)

@@ -8,20 +8,10 @@
 // hold no two words with the same key.
 //
 // The whole input is also walked as a device path bounded by its size.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <memory>
-#include <vector>
 
 #include "config/options.h"
 #include "fuzz_firmware.h"
-#include "memory/tracking.h"
 #include "support/devicepath.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 struct Word {
   const char *word;
@@ -68,25 +58,18 @@ void AppendWords(const std::vector<Word> &words) {
   size_t size = 64;
   for (const Word &w : words)
     size += w.wordLength + 1;
-  std::unique_ptr<char[]> buffer(new char[size]);
-  char *base = buffer.get();
-  base[0] = '\0';
-  char *end = base;
+  std::unique_ptr<char[]> buffer(new char[size]());
+  char *base = buffer.get(), *end = base;
   for (const Word &w : words) {
     end = nimb::AppendOption(base, end, w.word, w.keyLength, w.wordLength);
     Check(end >= base && end < base + size && *end == '\0');
   }
   // The indexed appends give the same string, from a first word on as the
   // merge of the boot options starts.
-  std::unique_ptr<char[]> indexedBuffer(new char[size]);
-  char *indexedBase = indexedBuffer.get();
-  indexedBase[0] = '\0';
-  char *indexedEnd = indexedBase;
-  if (!words.empty()) {
-    memcpy(indexedBase, words[0].word, words[0].wordLength);
-    indexedBase[words[0].wordLength] = '\0';
-    indexedEnd += words[0].wordLength;
-  }
+  std::unique_ptr<char[]> indexedBuffer(new char[size]());
+  char *indexedBase = indexedBuffer.get(), *indexedEnd = indexedBase;
+  if (!words.empty())
+    indexedEnd = std::copy_n(words[0].word, words[0].wordLength, indexedBase);
   nimb::OptionKeyIndex index;
   nimb::OptionKeyIndexInit(&index, indexedBase, size, words.size() + 1);
   for (size_t i = 1; i < words.size(); i++)
@@ -122,8 +105,6 @@ void WalkDevicePath(const uint8_t *data, size_t size) {
     }
   }
 }
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   const size_t length = strnlen(reinterpret_cast<const char *>(data), size);

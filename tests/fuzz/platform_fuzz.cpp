@@ -5,23 +5,11 @@
 // table's length field never claims more than the table's bytes: those are
 // the firmware's promises. The records go to /efi/platform, the model text
 // stays inside its 64 bytes, and the tree gives back all it took.
-#include <fuzzer/FuzzedDataProvider.h>
-
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <string>
-#include <vector>
 
 #include "devicetree/devicetree.h"
 #include "devicetree/platform.h"
 #include "efi/datahub.h"
 #include "fuzz_firmware.h"
-#include "memory/tracking.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 void Put32(std::vector<uint8_t> &table, size_t at, uint64_t value) {
   for (size_t i = 0; i < 4 && at + i < table.size(); i++)
@@ -61,8 +49,6 @@ uint64_t Place(hostfw::Firmware &fw, const std::vector<uint8_t> &bytes) {
   std::memcpy(reinterpret_cast<void *>(address), bytes.data(), bytes.size());
   return address;
 }
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   FuzzedDataProvider input(data, size);

@@ -1,19 +1,8 @@
 // Any bytes as a property list: the parse must stay inside the text, the tree
 // must be walkable, and freeing it must give every tag and symbol back.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <vector>
 
-#include "boot/boot.h"
 #include "config/plist.h"
 #include "fuzz_firmware.h"
-#include "hostfw/hostfw.h"
-#include "memory/tracking.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 // Walks the whole tree, checking what each type may hold.
 void Walk(const nimb::PlistTag *tag, int depth) {
@@ -40,8 +29,6 @@ size_t Length(const nimb::PlistTag *tag) {
   }
   return n;
 }
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   std::vector<char> text(data, data + size);

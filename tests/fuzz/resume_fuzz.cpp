@@ -2,22 +2,10 @@
 // a restart asked for: TryResume must end in a reset or at the gate, touch
 // no memory but what it took (the free memory is guarded and faults), and
 // before the exit from boot services give everything back to TrackedFreeAll.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <memory>
-#include <vector>
 
-#include "boot/boot.h"
 #include "fuzz_firmware.h"
-#include "hostfw/hostfw.h"
-#include "memory/tracking.h"
 #include "resume/resume.h"
 #include "tests/unit/resume_image.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 // The memory the resume may take: the rest of the arena is reserved, so
 // that a header asking for a gigabyte is refused at once.
@@ -43,8 +31,6 @@ struct Machine {
 
 // Never destroyed at exit: the host firmware's own bookkeeping may be gone by then.
 Machine *gMachine = nullptr;
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (gMachine == nullptr)

@@ -4,24 +4,11 @@
 //
 // Input: two bytes of output size, one of unit limit, one of base and byte
 // order, then the text.
-#include <algorithm>
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <memory>
-#include <vector>
 
-#include "boot/boot.h"
 #include "fuzz_firmware.h"
-#include "hostfw/hostfw.h"
-#include "memory/tracking.h"
 #include "support/sprint.h"
 #include "support/strings.h"
 #include "support/text.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 // Exactly `size` bytes on the heap, however many that is.
 struct ExactBuffer {
@@ -163,8 +150,6 @@ void CheckUtf8ToUcsAlloc(const uint8_t *data, size_t size, UINT64 maxUnits) {
   }
   nimb::TrackedFreeAll();
 }
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (size < 4)

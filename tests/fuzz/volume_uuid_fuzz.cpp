@@ -4,19 +4,9 @@
 // UUID or nothing.
 //
 // Input: one byte of text buffer size, then the volume's bytes from 1024 on.
-#include <cstdint>
-#include <cstdlib>
-#include <cstring>
-#include <memory>
-#include <vector>
 
 #include "devicetree/volume_uuid.h"
 #include "fuzz_firmware.h"
-#include "memory/tracking.h"
-
-namespace {
-
-using nimbfuzz::Check;
 
 constexpr size_t kVolumeBytes = 64 * 1024;
 
@@ -25,8 +15,6 @@ struct Machine {
   std::shared_ptr<std::vector<uint8_t>> image = std::make_shared<std::vector<uint8_t>>(kVolumeBytes);
   EFI_HANDLE device = fw.AddBlockDevice(image);
 };
-
-}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
   if (size == 0)

@@ -3,12 +3,13 @@
 #include "resume/aes.h"
 
 #include <gtest/gtest.h>
-#include <openssl/evp.h>
 
 #include <cstring>
 #include <random>
 #include <string>
 #include <vector>
+
+#include "resume_scene.h"
 
 namespace {
 
@@ -64,23 +65,6 @@ TEST_P(AesPathTest, PublishedVectorsWithLengthsInBytesAndBits) {
   }
 }
 
-// OpenSSL's AES-CBC without padding, the reference.
-Bytes Openssl(bool encrypt, const Bytes &key, const UINT8 *iv, const Bytes &data) {
-  const EVP_CIPHER *type = key.size() == 16   ? EVP_aes_128_cbc()
-                           : key.size() == 24 ? EVP_aes_192_cbc()
-                                              : EVP_aes_256_cbc();
-  EVP_CIPHER_CTX *context = EVP_CIPHER_CTX_new();
-  Bytes out(data.size() + 16);
-  int length = 0, tail = 0;
-  EVP_CipherInit_ex(context, type, nullptr, key.data(), iv, encrypt ? 1 : 0);
-  EVP_CIPHER_CTX_set_padding(context, 0);
-  EVP_CipherUpdate(context, out.data(), &length, data.data(), static_cast<int>(data.size()));
-  EVP_CipherFinal_ex(context, out.data() + length, &tail);
-  EVP_CIPHER_CTX_free(context);
-  out.resize(static_cast<size_t>(length + tail));
-  return out;
-}
-
 TEST_P(AesPathTest, RandomDataAgreesWithOpenssl) {
   std::mt19937 random(20261123);
   auto bytes = [&random](size_t n) {
@@ -94,7 +78,7 @@ TEST_P(AesPathTest, RandomDataAgreesWithOpenssl) {
   for (int round = 0; round < 33; round++) {
     const size_t keySize = 16 + 8 * (round % 3), blocks = kBlockCounts[round % std::size(kBlockCounts)];
     const Bytes key = bytes(keySize), iv = bytes(16), cipher = bytes(16 * blocks);
-    const Bytes want = Openssl(false, key, iv.data(), cipher);
+    const Bytes want = nimbtest::OpensslCbc(false, key, iv.data(), cipher);
     for (bool inPlace : {true, false})
       ASSERT_EQ(Decrypt(key, static_cast<INT32>(keySize), iv, cipher, inPlace), want)
           << keySize * 8 << "-bit key, " << blocks << " blocks" << (inPlace ? ", in place" : ", apart");

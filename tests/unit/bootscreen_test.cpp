@@ -89,18 +89,6 @@ class BootScreenTest : public nimbtest::LoaderTest {
   static constexpr UINT32 kLogoX = 336, kLogoY = 236, kSpinnerX = 384, kSpinnerY = 484;
 };
 
-TEST_F(BootScreenTest, ExpandIndexedImageTakesBlueGreenRedFromTheTable) {
-  const UINT8 indexes[] = {0, 1, 255, 97, 200};
-  EFI_UGA_PIXEL *pixels = nullptr;
-  ASSERT_EQ(nimb::ExpandIndexedImage(5, 1, indexes, &pixels), EFI_SUCCESS);
-  for (size_t i = 0; i < sizeof(indexes); i++) {
-    const EFI_UGA_PIXEL p = pixels[i];
-    EXPECT_EQ(UINT32(p.Reserved) << 24 | UINT32(p.Red) << 16 | UINT32(p.Green) << 8 | p.Blue,
-              Rgb(indexes[i]));
-  }
-  nimb::TrackedFree(pixels);
-}
-
 TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
   const size_t poolBefore = fw.LivePoolBlocks();
   nimb::ShowBootScreen();
@@ -147,20 +135,19 @@ TEST_F(BootScreenTest, PicturesStandInTheMiddleAndTheSpinner200Below) {
 }
 
 TEST_F(BootScreenTest, WithoutGraphicsNothingIsDrawn) {
-  struct Row {
+  const struct {
     const char *what;
     bool textAtStart;
     bool uga;
     const char *failCall;
     EFI_STATUS status;
     bool graphicsFlag;
-  };
-  const Row rows[] = {
+  } rows[] = {
       {"no UGA Draw", false, false, nullptr, EFI_UNSUPPORTED, false},
       {"SetMode refused", true, true, "SetMode", EFI_DEVICE_ERROR, false},
       {"GetMode refused", false, true, "UgaGetMode", EFI_DEVICE_ERROR, true},
   };
-  for (const Row &row : rows) {
+  for (const auto &row : rows) {
     nimbtest::ResetLoaderState();
     Attach();
     fw.SetUgaDrawPresent(row.uga);
@@ -206,9 +193,7 @@ TEST_F(BootScreenTest, FailureScreenOnlyInGraphicsModeWithUgaKnown) {
   }
 }
 
-class SpinnerTest : public BootScreenTest {};
-
-TEST_F(SpinnerTest, NetworkBootTurnsFrameByFrameUntilStopped) {
+TEST_F(BootScreenTest, SpinnerNetworkBootTurnsFrameByFrameUntilStopped) {
   nimb::gBootFlags = nimb::kBootNetwork;
   nimb::ShowBootScreen();
   EXPECT_TRUE(ShowsSpinner(SpinnerFrame(0)));
@@ -233,23 +218,22 @@ TEST_F(SpinnerTest, NetworkBootTurnsFrameByFrameUntilStopped) {
   EXPECT_TRUE(ShowsLogo());
 }
 
-TEST_F(SpinnerTest, WhatIsLeftWhenTheFirmwareRefuses) {
-  struct Row {
+TEST_F(BootScreenTest, SpinnerWhatIsLeftWhenTheFirmwareRefuses) {
+  const struct {
     const char *what;
     const char *failCall;     // a service refused once
     unsigned failAllocation;  // or the n-th allocation from the drawing on
     bool logo;
     bool frame0;
     size_t events;
-  };
-  const Row rows[] = {
+  } rows[] = {
       {"CreateEvent refused", "CreateEvent", 0, true, true, 0},
       {"SetTimer refused", "SetTimer", 0, true, true, 1},
       {"no pool for the logo's indexes", nullptr, 1, false, true, 1},
       {"no pool for the logo's pixels", nullptr, 2, false, true, 1},
       {"no pool for the spinner", nullptr, 3, true, false, 0},
   };
-  for (const Row &row : rows) {
+  for (const auto &row : rows) {
     fw.AddScreen({800, 600});
     nimb::gSpinnerPixels = nullptr;
     nimb::gBootFlags = nimb::kBootNetwork;
@@ -304,7 +288,7 @@ TEST_F(VideoInfoTest, FrameBufferFactsAreFetchedOnceAndCopied) {
       {"GetInfo refused", true, true, 0, true, 0, false},
   };
   const nimb::VideoInfo unset = {kUnset, kUnset, kUnset, kUnset, kUnset, kUnset};
-  for (const Row &row : rows) {
+  for (const auto &row : rows) {
     nimb::gFrameBufferBase = 0;
     nimb::gFrameBufferRowBytes = nimb::gScreenWidth = nimb::gScreenHeight = nimb::gScreenDepth = 0;
     fw.SetFrameBufferInfoPresent(row.present);

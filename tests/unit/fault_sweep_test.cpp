@@ -34,6 +34,7 @@ constexpr unsigned kSamples = 12;
 
 // One run's firmware, the loader's tables on it, and what it boots from.
 struct Scene : nimbtest::ResumeScene {
+  Scene() : ResumeScene(false) {}
   std::unique_ptr<hostfw::NetworkDevice> net;
 };
 
@@ -227,12 +228,7 @@ TEST_F(FaultSweep, EveryFailureOfEveryKindOfBoot) {
        [](Scene &scene) {
          scene.fw.AddScreen();
          scene.fw.InstallAcpi({});
-         nimbtest::ResumeImageSpec spec;
-         spec.restorePageCount = 3;
-         spec.firstStageBytes = 0xA000;
-         spec.imageBytes = 0x10000;
-         spec.extentLengths = {0x1200, 0x600, 0x3000, 0x100, 0};
-         scene.Install(spec);
+         scene.Install(nimbtest::ThreePageSpec());
        }},
   };
   for (const Kind &kind : kinds)

@@ -17,6 +17,7 @@ using nimbtest::ResumeImageSpec;
 
 // A scene that runs the discovery alone.
 struct Scene : nimbtest::ResumeScene {
+  Scene() : ResumeScene(false) {}
   // The header's offset as text; on the whole disk with `disk` set.
   std::u16string Offset(const char *prefix, bool disk = false) {
     uint64_t offset = image.extents[0].start + (disk ? HibernatedMachine::kPartitionStart * 512 : 0);

@@ -268,12 +268,11 @@ class ResumePreviewTest : public nimbtest::LoaderTest {
 };
 
 TEST_F(ResumePreviewTest, EncodedPicturesComeOutAsTheReferenceBlur) {
-  struct Row {
+  const struct {
     const char *name;
     UINT32 width, height, bytes;
     uint32_t (*pixel)(UINT32 x, UINT32 y);
-  };
-  const Row rows[] = {
+  } rows[] = {
       {"flat", 9, 7, 4, [](UINT32, UINT32) -> uint32_t { return 0xC0FFEE00; }},
       {"stripes and runs, 32-bit", 23, 11, 4,
        [](UINT32 x, UINT32 y) -> uint32_t {
@@ -284,7 +283,7 @@ TEST_F(ResumePreviewTest, EncodedPicturesComeOutAsTheReferenceBlur) {
       {"one pixel", 1, 1, 2, [](UINT32, UINT32) -> uint32_t { return 0xFFFF; }},
       {"one column, top bit set", 1, 9, 2, [](UINT32, UINT32 y) -> uint32_t { return 0x8000 | y * 1000; }},
   };
-  for (const Row &row : rows) {
+  for (const auto &row : rows) {
     std::vector<uint32_t> pixels;
     for (UINT32 y = 0; y < row.height; y++)
       for (UINT32 x = 0; x < row.width; x++)
@@ -315,13 +314,12 @@ TEST_F(ResumePreviewTest, BrokenOrMismatchedPicturesDrawNothing) {
   ASSERT_TRUE(Decode(HandMade(), 3, 2, 4, &white));
   ASSERT_TRUE(Decode(HandMade({{8, 0}, {10, 0}}), 3, 2, 4, &black));
   EXPECT_NE(white[0], black[0]) << "row 1 is read from its own offset";
-  struct Row {
+  const struct {
     const char *name;
     std::vector<UINT8> preview;
     UINT32 width, height, bytes;
     size_t cut;
-  };
-  const Row rows[] = {
+  } rows[] = {
       {"another width", HandMade(), 4, 2, 4, 0},
       {"another height", HandMade(), 3, 3, 4, 0},
       {"a 32-bit picture on a 16-bit screen", HandMade(), 3, 2, 2, 0},
@@ -334,24 +332,23 @@ TEST_F(ResumePreviewTest, BrokenOrMismatchedPicturesDrawNothing) {
       {"no room for the row table", HandMade({{3, 0}}), 3, 2, 4, 28},
       {"no header", HandMade(), 3, 2, 4, 33},
   };
-  for (const Row &row : rows) {
+  for (const auto &row : rows) {
     std::vector<UINT32> out;
     EXPECT_FALSE(Decode(row.preview, row.width, row.height, row.bytes, &out, row.cut)) << row.name;
   }
 }
 
 TEST(PreviewEncoderTest, RefusesWhatIsNoPictureAndSharesEqualRows) {
-  struct Row {
+  const struct {
     std::vector<uint32_t> pixels;
     UINT32 width, height, bytes;
     const char *error;
-  };
-  const Row rows[] = {
+  } rows[] = {
       {{1, 2}, 2, 1, 3, "bytes per pixel must be 2 or 4, not 3"},
       {{}, 0, 5, 4, "a picture needs at least one pixel"},
       {{1, 2, 3}, 2, 2, 2, "3 pixels for 2 x 2"},
   };
-  for (const Row &row : rows) {
+  for (const auto &row : rows) {
     std::string error;
     EXPECT_TRUE(previewenc::EncodePreview(row.pixels, row.width, row.height, row.bytes, &error).empty());
     EXPECT_EQ(error, row.error);

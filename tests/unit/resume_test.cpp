@@ -2,7 +2,6 @@
 // firmware: the walk over the extents, every limit of the header, the
 // decryption, and the restart with its record for the restart code.
 #include <gtest/gtest.h>
-#include <openssl/evp.h>
 
 #include <functional>
 #include <vector>
@@ -55,12 +54,7 @@ constexpr UINT32 kWidth = 320, kHeight = 200;
 
 TEST(ResumeRunTest, RestartsTheImage) {
   nimbtest::ResumeScene scene;
-  scene.fw.InstallAcpi({});
-  ResumeImageSpec spec;
-  spec.restorePageCount = 3;
-  spec.firstStageBytes = 0xA000;
-  spec.imageBytes = 0x10000;
-  spec.extentLengths = {0x1200, 0x600, 0x3000, 0x100, 0};
+  const ResumeImageSpec spec = nimbtest::ThreePageSpec();
   scene.Install(spec);
   const ResumeImage &image = scene.image;
   // Flash behind the runtime regions, as firmware maps it for its variables:
@@ -142,7 +136,6 @@ TEST(ResumeRunTest, ReadsBehindTheHeader) {
   for (const auto &row : rows) {
     SCOPED_TRACE(row.preview);
     nimbtest::ResumeScene scene;
-    scene.fw.InstallAcpi({});
     ResumeImageSpec spec;
     spec.imageBytes = 1900000;
     spec.firstStageBytes = row.firstStage;
@@ -174,7 +167,6 @@ TEST(ResumeRunTest, ReadsBehindTheHeader) {
 // being worked on, the rest not reached.
 TEST(ResumeRunTest, TheBarStandsAtTheStepOfTheBytesRead) {
   nimbtest::ResumeScene scene;
-  scene.fw.InstallAcpi({});
   scene.fw.AddScreen({kWidth, kHeight, 32});
   ResumeImageSpec spec;
   spec.imageBytes = 1900000;
@@ -190,7 +182,6 @@ TEST(ResumeRunTest, TheBarStandsAtTheStepOfTheBytesRead) {
 
 TEST(ResumeRunTest, AFailedReadIsReportedAndResets) {
   nimbtest::ResumeScene scene;
-  scene.fw.InstallAcpi({});
   ResumeImageSpec spec;
   spec.imageBytes = 0x100000;  // reads of a whole extent
   ResumeImage image = nimbtest::BuildResumeImage(spec);
@@ -204,23 +195,6 @@ TEST(ResumeRunTest, AFailedReadIsReportedAndResets) {
   EXPECT_EQ(scene.fw.ConOutText(), "!Read 800\r\n");
 }
 
-// OpenSSL's AES-CBC encryption without padding, with the image's IV.
-std::vector<uint8_t> Encrypt(const std::vector<uint8_t> &key, const uint8_t *plain, size_t size) {
-  const EVP_CIPHER *type = key.size() == 16   ? EVP_aes_128_cbc()
-                           : key.size() == 24 ? EVP_aes_192_cbc()
-                                              : EVP_aes_256_cbc();
-  EVP_CIPHER_CTX *context = EVP_CIPHER_CTX_new();
-  std::vector<uint8_t> out(size + 16);
-  int length = 0, tail = 0;
-  EVP_EncryptInit_ex(context, type, nullptr, key.data(), kResumeIv);
-  EVP_CIPHER_CTX_set_padding(context, 0);
-  EVP_EncryptUpdate(context, out.data(), &length, plain, static_cast<int>(size));
-  EVP_EncryptFinal_ex(context, out.data() + length, &tail);
-  EVP_CIPHER_CTX_free(context);
-  out.resize(size_t(length + tail));
-  return out;
-}
-
 // Each key size; with 16 bytes a preview on a screen, encrypted from behind
 // it; with the others no preview and all but the header encrypted, so that
 // the restart code is copied as decrypted.
@@ -229,7 +203,6 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
     SCOPED_TRACE(keySize);
     const bool preview = keySize == 16;
     nimbtest::ResumeScene scene;
-    scene.fw.InstallAcpi({});
     scene.fw.AddScreen({kWidth, kHeight, 32});
     std::string error;
     const std::vector<uint8_t> picture = previewenc::EncodePreview(
@@ -251,7 +224,8 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
     std::vector<uint8_t> key(keySize);
     for (size_t i = 0; i < keySize; i++)
       key[i] = uint8_t(0xA0 + i);
-    const std::vector<uint8_t> cipher = Encrypt(key, plain.data() + encrypted, plain.size() - encrypted);
+    const std::vector<uint8_t> cipher = nimbtest::OpensslCbc(
+        true, key, kResumeIv, std::vector<uint8_t>(plain.begin() + encrypted, plain.end()));
     std::copy(cipher.begin(), cipher.end(), image.bytes.begin() + encrypted);
 
     scene.Install(image, key);
@@ -334,7 +308,6 @@ TEST(ResumeRunTest, AHeaderBreakingALimitResets) {
   for (const Case &c : cases) {
     SCOPED_TRACE(c.name);
     nimbtest::ResumeScene scene;
-    scene.fw.InstallAcpi({});
     ResumeImageSpec spec;
     c.spec(spec);
     ResumeImage broken = nimbtest::BuildResumeImage(spec);
