@@ -229,10 +229,14 @@ TEST(Md5Test, TheBitCountCarriesIntoItsHighWord) {
 TEST(Adler32Test, ByteReversedAndReducedInTime) {
   EXPECT_EQ(nimb::Adler32("abc", 3), 0x27014D02u);
   EXPECT_EQ(nimb::Adler32(nullptr, 0), 0x01000000u);
-  // All 0xFF is the input that overflows first; the reference reduces after
-  // every byte.
-  for (size_t length : {5001, 100003}) {
-    const std::vector<UINT8> data(length, 0xFF);
+  // All 0xFF is the input that overflows first; bytes that differ weigh each
+  // place of a word. The reference reduces after every byte.
+  for (size_t length : {5001, 100003, (1 << 20) + 77}) {
+    std::vector<UINT8> data(length, 0xFF);
+    if (length > 100003) {
+      for (size_t i = 0; i < length; i++)
+        data[i] = static_cast<UINT8>(i * 7919 >> 3);
+    }
     UINT64 s1 = 1, s2 = 0;
     for (UINT8 byte : data) {
       s1 = (s1 + byte) % 65521;
