@@ -100,6 +100,7 @@ TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
             std::vector<UINT32>({800, 600, 32}));
   EXPECT_TRUE(ShowsLogo());
   EXPECT_NE(Color(kLogoX + 64, kLogoY + 64), kGrey) << "the mark stands in the middle";
+  EXPECT_EQ(fw.ScreenPixel(kLogoX + 64, kLogoY + 64) >> 24, 0u) << "the pixels' unused byte is zero";
   for (const auto &[x, y] : {std::pair<UINT32, UINT32>{0, 0}, {799, 599}, {400, 500}})
     EXPECT_EQ(Color(x, y), kGrey) << x << "," << y;
   EXPECT_TRUE(fw.Events().empty());
