@@ -23,6 +23,7 @@ import os
 import re
 import shutil
 import signal
+import struct
 import subprocess
 import sys
 import tempfile
@@ -33,7 +34,7 @@ from pathlib import Path
 REPO = Path(__file__).resolve().parents[2]
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 sys.path.insert(0, str(REPO / "tools" / "qemuboot"))
-from qemuboot import NET_BOOT_FILE, NET_ID, NET_MAC, Machine, boot, serve_directory  # noqa: E402,F401
+from qemuboot import NET_BOOT_FILE, NET_ID, Machine, boot, serve_directory  # noqa: E402,F401
 from scenarios import (  # noqa: E402
     BASE_CONFIG,
     KernelExpect,
@@ -384,28 +385,92 @@ def check_kernel(log, expect, guest_dir=GUEST_DIR):
     return problems
 
 
-# --- the network's identity ------------------------------------------------------------
+# --- the wire -------------------------------------------------------------------------
 
+DHCP_MAGIC = bytes([99, 130, 83, 99])
 ROOT_MATCHING = (
     "<dict><key>ZoryaProviderClass</key><string>ZoryaNetworkInterface</string><key>ZoryaParentMatch</key>"
     '<dict><key>ZoryaPropertyMatch</key><dict><key>ZoryaMACAddress</key><data format="hex">{}</data>'
     "</dict></dict></dict>"
 )
-NET_ANSWER = re.compile(r"platform: net boot dhcp answer ([0-9a-f]*)$", re.M)
 
 
-def check_net_identity(log):
-    """Problems with the kernel's network identity: "root-matching" must
-    name the NIC's MAC, "dhcp-response" be byte for byte the DHCP answer that
-    the firmware's PXE kept, as the platform printed it."""
-    report, answers = parse_kernel_report(log), NET_ANSWER.findall(log)
+def read_pcap(data):
+    """The frames of a classic pcap file (what QEMU's filter-dump writes)."""
+    magic = data[:4]
+    order = "<" if magic == b"\xd4\xc3\xb2\xa1" else ">" if magic == b"\xa1\xb2\xc3\xd4" else None
+    if order is None:
+        raise ValueError("not a pcap file")
+    frames, offset = [], 24
+    while offset + 16 <= len(data):
+        length = struct.unpack(order + "I", data[offset + 8 : offset + 12])[0]
+        frames.append(data[offset + 16 : offset + 16 + length])
+        offset += 16 + length
+    return frames
+
+
+def dhcp_messages(frames):
+    """(client MAC, server's DHCP messages) of the captured frames: the
+    Ethernet source of the client's first message and the UDP payloads
+    that left port 67, in order."""
+    client, answers = None, []
+    for frame in frames:
+        if frame[12:14] != b"\x08\x00" or len(frame) < 34 or frame[23] != 17:
+            continue
+        ip = frame[14:]
+        header = (ip[0] & 15) * 4
+        source, destination, length = struct.unpack(">HHH", ip[header : header + 6])
+        payload = ip[header + 8 : header + length]
+        if source == 68 and destination == 67 and client is None:
+            client = frame[6:12]
+        elif source == 67:
+            answers.append(payload)
+    return client, answers
+
+
+def dhcp_type(message):
+    """The DHCP message type (option 53) of a message, or None."""
+    if message[236:240] != DHCP_MAGIC:
+        return None
+    offset = 240
+    while offset + 1 < len(message) and message[offset] != 255:
+        if message[offset] == 0:
+            offset += 1
+            continue
+        if message[offset] == 53:
+            return message[offset + 2]
+        offset += 2 + message[offset + 1]
+    return None
+
+
+def check_capture(log, pcap):
+    """Problems with the kernel's network identity against the packets on
+    the wire: "dhcp-response" the server's DHCP ACK byte for byte (what
+    follows its end option may be left off if it is zeros), "root-matching"
+    the client's MAC."""
+    try:
+        client, answers = dhcp_messages(read_pcap(Path(pcap).read_bytes()))
+    except (OSError, ValueError) as error:
+        return [f"capture: {error}"]
+    acks = [message for message in answers if dhcp_type(message) == 5]
+    if client is None or not acks:
+        return ["capture: no DHCP exchange on the wire"]
+    report = parse_kernel_report(log)
     problems = []
+    wanted = quoted(ROOT_MATCHING.format(client.hex()))
     got = report.tree.get("/chosen", {}).get("root-matching")
-    if got != quoted(ROOT_MATCHING.format(NET_MAC.replace(":", ""))):
-        problems.append(f"net: root-matching {got}, wanted the NIC's MAC {NET_MAC}")
+    if got != wanted:
+        problems.append(f"capture: root-matching {got}, wanted the client's MAC {client.hex()}")
+    ack = acks[-1]
     dhcp = report.values.get(("/chosen", "dhcp-response"))
-    if len(answers) != 1 or dhcp != bytes.fromhex(answers[0]):
-        problems.append(f"net: dhcp-response {dhcp and dhcp.hex()}, wanted the firmware's answer {answers}")
+    if dhcp is None:
+        problems.append("capture: no whole dhcp-response in the kernel's report")
+    elif dhcp != ack[: len(dhcp)] or any(ack[len(dhcp) :]) or len(dhcp) > len(ack):
+        first = next((i for i, (a, b) in enumerate(zip(dhcp, ack)) if a != b), min(len(dhcp), len(ack)))
+        problems.append(
+            f"capture: dhcp-response of {len(dhcp)} bytes differs from the ACK of {len(ack)} on the wire "
+            f"at byte {first}"
+        )
     return problems
 
 
@@ -791,8 +856,8 @@ def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
         problems += check_log(log, [f"Looking for kernel cache file '{cache_name}'"])
     if scenario.kernel is not None:
         problems += check_kernel(log, scenario.kernel, guest_dir)
-    if scenario.net_identity:
-        problems += check_net_identity(log)
+    if scenario.capture:
+        problems += check_capture(log, workdir / "net.pcap")
     if scenario.boots > 1 and log.count("platform: started") != scenario.boots:
         problems.append(f"the machine started {log.count('platform: started')} times, wanted {scenario.boots}")
     problems += check_resume_reads(log, scenario.reads)

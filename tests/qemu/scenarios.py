@@ -337,9 +337,9 @@ class Scenario:
     # ("link-off",) takes the NIC's link down; ("truncate", path, size) cuts a
     # served file.
     actions: tuple = ()
-    # Check the kernel's network identity: the NIC's MAC and the DHCP
-    # answer that the firmware kept.
-    net_identity: bool = False
+    # Check the kernel's network identity and DHCP answer against the
+    # packets captured on the wire.
+    capture: bool = False
     # A resume image on a second partition, and the NVRAM settings for it.
     resume: ResumeImage | None = None
     # The starts of the machine on one variable store: above 1, a reset
@@ -603,7 +603,7 @@ _TABLE += [
             tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
             ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
         ),
-        net_identity=True,
+        capture=True,
         # The spinner is wiped before the hand-off: the logo stands alone.
         screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
     ),
