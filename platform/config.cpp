@@ -238,7 +238,8 @@ void DecodeHex(char *value) {
 
 // Stores a value under `name`, in the place of an earlier value of the name.
 // Nothing is changed, the value included, unless the whole line is good.
-bool AddEntry(ConfigEntryList *list, const char *name, char *value, bool hex, bool allowEmpty) {
+bool AddEntry(ConfigEntryList *list, const char *name, char *value, bool hex, bool allowEmpty,
+              ConfigVariableLife life = kVariableForGood) {
   if (*name == '\0' || !Utf8ToUcs2(name, nullptr, 0, nullptr)) {
     return false;
   }
@@ -262,17 +263,30 @@ bool AddEntry(ConfigEntryList *list, const char *name, char *value, bool hex, bo
   if (index == list->count) {
     list->count++;
   }
-  list->entries[index] = {name, reinterpret_cast<const UINT8 *>(value), size, !hex};
+  list->entries[index] = {name, reinterpret_cast<const UINT8 *>(value), size, !hex, life};
   return true;
 }
 
-// An NVRAM variable cannot be empty; a record's value can.
+// An NVRAM variable cannot be empty; a record's value can. A deleted
+// variable has no value.
 bool ApplyNvramText(PlatformConfig *config, const char *name, char *value) {
   return AddEntry(&config->nvram, name, value, false, false);
 }
 
 bool ApplyNvramHex(PlatformConfig *config, const char *name, char *value) {
   return AddEntry(&config->nvram, name, value, true, false);
+}
+
+bool ApplyNvramVolatileText(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->nvram, name, value, false, false, kVariableThisBoot);
+}
+
+bool ApplyNvramVolatileHex(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->nvram, name, value, true, false, kVariableThisBoot);
+}
+
+bool ApplyNvramDelete(PlatformConfig *config, const char *name, char *value) {
+  return *value == '\0' && AddEntry(&config->nvram, name, value, false, true, kVariableDeleted);
 }
 
 bool ApplyDataHubText(PlatformConfig *config, const char *name, char *value) {
@@ -327,6 +341,9 @@ constexpr ConfigKey kConfigKeys[] = {
     {"keys-ignored", ApplyKeysIgnored},
     {"nvram.", ApplyNvramText},
     {"nvram-hex.", ApplyNvramHex},
+    {"nvram-volatile.", ApplyNvramVolatileText},
+    {"nvram-volatile-hex.", ApplyNvramVolatileHex},
+    {"nvram-delete.", ApplyNvramDelete},
     {"datahub.", ApplyDataHubText},
     {"datahub-hex.", ApplyDataHubHex},
     {"device-properties-hex", ApplyDeviceProperties},
@@ -464,6 +481,12 @@ void ConfigSetDefaults(PlatformConfig *config) {
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {
+  // Editors that write a byte-order mark put it before the first key.
+  constexpr char kByteOrderMark[] = "\xEF\xBB\xBF";
+  if (size >= 3 && memcmp(text, kByteOrderMark, 3) == 0) {
+    text += 3;
+    size -= 3;
+  }
   UINT32 errors = 0;
   UINT32 line = 1;
   char *start = text;
@@ -475,6 +498,37 @@ UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport 
     }
   }
   return errors;
+}
+
+void ConfigEcho(const char *text, char *echo, UINTN capacity) {
+  static const char kDigits[] = "0123456789abcdef";
+  UINTN length = 0;
+  for (const UINT8 *p = reinterpret_cast<const UINT8 *>(text); *p != 0; p++) {
+    length += *p >= 0x20 && *p < 0x7F ? 1 : 4;
+  }
+  // Room for the mark when the whole does not fit.
+  const UINTN room = length < capacity ? capacity - 1 : capacity - 4;
+  UINTN at = 0;
+  for (const UINT8 *p = reinterpret_cast<const UINT8 *>(text); *p != 0; p++) {
+    const bool plain = *p >= 0x20 && *p < 0x7F;
+    if (at + (plain ? 1 : 4) > room) {
+      break;
+    }
+    if (plain) {
+      echo[at++] = static_cast<char>(*p);
+    } else {
+      echo[at++] = '\\';
+      echo[at++] = 'x';
+      echo[at++] = kDigits[*p >> 4];
+      echo[at++] = kDigits[*p & 15];
+    }
+  }
+  if (length >= capacity) {
+    echo[at++] = '.';
+    echo[at++] = '.';
+    echo[at++] = '.';
+  }
+  echo[at] = '\0';
 }
 
 EFI_STATUS ConfigBytesAnswer(const ConfigBytes &answer, void *buffer, UINTN *size) {

@@ -29,10 +29,17 @@
 //   keys-ignored=0|1       the boot policy's answer: 1 tells the loader not
 //                          to read the held keys; 0
 //   nvram.<name>=<text>    the NVRAM variable <name> under the loader's vendor
-//                          GUID, set to the text's UTF-8 bytes without a
-//                          terminator, non-volatile, boot and runtime access
+//                          GUID, set for good to the text's UTF-8 bytes
+//                          without a terminator: non-volatile, boot and
+//                          runtime access, on the first start of a run only
 //   nvram-hex.<name>=<hex> the same with the bytes in hexadecimal, two digits
 //                          each, blanks allowed between bytes
+//   nvram-volatile.<name>=<text>, nvram-volatile-hex.<name>=<hex>  the same
+//                          for this boot only: volatile (boot and runtime
+//                          access), set at every start, gone after a reset
+//   nvram-delete.<name>=   the variable <name> under the loader's vendor GUID
+//                          is deleted on the first start of a run (the value
+//                          stays empty); one that is not there is reported
 //   datahub.<name>=<text>  a Data Hub record of the vendor's platform producer
 //                          named <name>, whose value is the text in UCS-2 with
 //                          a NUL unit behind it
@@ -63,7 +70,9 @@
 // allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
 // text values are UTF-8 within U+FFFF. The text and hexadecimal forms of one
-// name are one variable or one record: the later line wins. Records and
+// name are one variable or one record, and the set, volatile and delete forms
+// of a name are one variable: the later line wins.
+// A UTF-8 byte-order mark at the start of the file is skipped. Records and
 // variables keep the order of their first line.
 // Without any key there is still a key state protocol (nothing held), a boot
 // policy protocol (answering 0) and a Data Hub (no vendor records), but no
@@ -90,6 +99,13 @@ struct HeldKeys {
   UINT16 keys[kMaxHeldKeys];
 };
 
+// What becomes of a configured NVRAM variable.
+enum ConfigVariableLife : UINT8 {
+  kVariableForGood,   // non-volatile; records are all of this kind
+  kVariableThisBoot,  // volatile
+  kVariableDeleted,   // no value
+};
+
 // One variable or record: the name behind the key's prefix and the value,
 // both in the file's buffer.
 struct ConfigEntry {
@@ -99,6 +115,7 @@ struct ConfigEntry {
   // The value is UTF-8 text (ending in a NUL behind `size` bytes), not bytes
   // given in hexadecimal.
   bool text;
+  ConfigVariableLife life;
 };
 
 struct ConfigEntryList {
@@ -162,6 +179,14 @@ struct ConfigIssue {
 };
 
 typedef void (*ConfigReport)(const ConfigIssue &issue, void *context);
+
+// The room for a key or value as a report echoes it, the NUL counted.
+constexpr UINT32 kConfigEchoCapacity = 64;
+
+// `text` as a report may show it on a serial line: printable ASCII as it
+// stands, every other byte as \xNN; cut with "..." at the end when it needs
+// more than `capacity` - 1 characters. `capacity` is at least 5.
+void ConfigEcho(const char *text, char *echo, UINTN capacity);
 
 void ConfigSetDefaults(PlatformConfig *config);
 

@@ -38,9 +38,14 @@ struct Parsed {
         buffer.data(), text.size(), &config,
         [](const ConfigIssue &issue, void *context) {
           static const char *const kNames[] = {"unknown", "noequals", "bad"};
+          // As the log echoes them.
+          char key[kConfigEchoCapacity];
+          char value[kConfigEchoCapacity];
+          ConfigEcho(issue.key, key, sizeof(key));
+          ConfigEcho(issue.value != nullptr ? issue.value : "", value, sizeof(value));
           *static_cast<std::string *>(context) += " "s + kNames[issue.problem] + "@" +
-                                                  std::to_string(issue.line) + ":" + issue.key +
-                                                  (issue.value != nullptr ? "="s + issue.value : "");
+                                                  std::to_string(issue.line) + ":" + key +
+                                                  (issue.value != nullptr ? "="s + value : "");
         },
         &issues);
   }
@@ -57,7 +62,8 @@ std::string Hex(const UINT8 *bytes, size_t size) {
 void AddEntries(std::ostringstream &out, const char *what, const ConfigEntryList &list) {
   for (UINT32 i = 0; i < list.count; i++) {
     const ConfigEntry &entry = list.entries[i];
-    out << what << entry.name << '=';
+    static const char *const kLives[] = {"", "/boot", "/delete"};
+    out << what << entry.name << kLives[entry.life] << '=';
     if (entry.text) {
       EXPECT_EQ(entry.bytes[entry.size], 0) << entry.name << ": text without its NUL";
       out << '"' << std::string(reinterpret_cast<const char *>(entry.bytes), entry.size) << "\" ";
@@ -112,7 +118,7 @@ std::string Summary(const std::string &text) {
 TEST(PlatformConfig, ParsesEveryKey) {
   struct Row {
     std::string text;
-    const char *summary;
+    std::string summary;
   };
   const std::vector<Row> rows = {
       // Lines, keys and values.
@@ -135,7 +141,21 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"options=\"a\"b\"\n", "errors=1 bad@1:options=\"a\"b\""},
       {"options=\"a\\\"\n", "errors=1 bad@1:options=\"a\\\""},
       {"options=\"\\q\"\n", "errors=1 bad@1:options=\"\\q\""},
-      {"options=\xF0\x9F\x98\x80\n", "errors=1 bad@1:options=\xF0\x9F\x98\x80"},
+      {"options=\xF0\x9F\x98\x80\n", "errors=1 bad@1:options=\\xf0\\x9f\\x98\\x80"},
+      // A byte-order mark is skipped at the start only; echoes are bounded
+      // and show control bytes as escapes.
+      {"\xEF\xBB\xBFhold=3\n", "hold=3 errors=0"},
+      {"\xEF\xBB\xBF", "errors=0"},
+      {"hold=1\n\xEF\xBB\xBFhold=2", "hold=1 errors=0 unknown@2:\\xef\\xbb\\xbfhold=2"},
+      {"\xEF\xBBhold=2", "errors=0 unknown@1:\\xef\\xbbhold=2"},
+      {"k\x1b[2J\x07=\x7f", "errors=0 unknown@1:k\\x1b[2J\\x07=\\x7f"},
+      {"console=" + std::string(70, 'v'), "errors=1 bad@1:console=" + std::string(60, 'v') + "..."},
+      {"console=" + std::string(63, 'v'), "errors=1 bad@1:console=" + std::string(63, 'v')},
+      {"console=" + std::string(64, 'v'), "errors=1 bad@1:console=" + std::string(60, 'v') + "..."},
+      {"console=" + std::string(14, 'v') + "\x01" + std::string(60, 'v'),
+       "errors=1 bad@1:console=" + std::string(14, 'v') + "\\x01" + std::string(42, 'v') + "..."},
+      {"console=" + std::string(59, 'v') + "\x01\x01",
+       "errors=1 bad@1:console=" + std::string(59, 'v') + "..."},
       {std::string("hold=1\0junk\nconsole=text", 24), "console=0 hold=1 errors=1 noequals@2:junk"},
       // Held keys and the boot policy.
       {"keys=gui+v+s", "modifiers=8 key=7019 key=7016 errors=0"},
@@ -158,6 +178,13 @@ TEST(PlatformConfig, ParsesEveryKey) {
       // Variables and platform records.
       {"nvram.boot-args=-v  foo=1", "nvram.boot-args=\"-v  foo=1\" errors=0"},
       {"nvram-hex.p=02 01 0C00\t7fff0400", "nvram.p=02010c007fff0400 errors=0"},
+      {"nvram-volatile.a=x\nnvram-volatile-hex.b=0a\nnvram-delete.c=",
+       "nvram.a/boot=\"x\" nvram.b/boot=0a nvram.c/delete=\"\" errors=0"},
+      {"nvram.a=1\nnvram-delete.b=\nnvram-volatile.a=2\nnvram-hex.b=03",
+       "nvram.a/boot=\"2\" nvram.b=03 errors=0"},
+      {"nvram-delete.a=1\nnvram-delete.=\nnvram-volatile.a=\nnvram-volatile-hex.a=0",
+       "errors=4 bad@1:nvram-delete.a=1 bad@2:nvram-delete.= bad@3:nvram-volatile.a= "
+       "bad@4:nvram-volatile-hex.a=0"},
       {"datahub.Model=\" Q \"\ndatahub-hex.Bus=00e1F505",
        "datahub.Model=\" Q \" datahub.Bus=00e1f505 errors=0"},
       {"datahub.A=\ndatahub-hex.B=", "datahub.A=\"\" datahub.B= errors=0"},
@@ -168,10 +195,10 @@ TEST(PlatformConfig, ParsesEveryKey) {
        "errors=3 bad@1:nvram-hex.a=abc bad@2:datahub-hex.a=0 1 bad@3:nvram-hex.a=zz"},
       {"nvram.=x\ndatahub.=y", "errors=2 bad@1:nvram.=x bad@2:datahub.=y"},
       {"nvram.a=\xF0\x9F\x98\x80\ndatahub.\xF0\x9F\x98\x80=x",
-       "errors=2 bad@1:nvram.a=\xF0\x9F\x98\x80 bad@2:datahub.\xF0\x9F\x98\x80=x"},
+       "errors=2 bad@1:nvram.a=\\xf0\\x9f\\x98\\x80 bad@2:datahub.\\xf0\\x9f\\x98\\x80=x"},
       {"nvram.a=1\nnvram-hex.a=1", "nvram.a=\"1\" errors=1 bad@2:nvram-hex.a=1"},
       {"nvram=1\ndatahub=2", "errors=0 unknown@1:nvram=1 unknown@2:datahub=2"},
-      {"datahub-hex.a=\"ab \tc\"", "errors=1 bad@1:datahub-hex.a=ab \tc"},
+      {"datahub-hex.a=\"ab \tc\"", "errors=1 bad@1:datahub-hex.a=ab \\x09c"},
       // The answers of the device properties and network boot protocols.
       {"device-properties-hex=01\nnetboot.dhcp-hex=0203\nnetboot.bsdp-hex=040506",
        "properties=01 dhcp=0203 bsdp=040506 errors=0"},
