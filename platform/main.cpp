@@ -79,19 +79,23 @@ CHAR16 *WideCopyOrFail(const char *text, const char *what, UINTN *units) {
   return wide;
 }
 
+// Keys and values are echoed bounded, control bytes and all others beyond
+// ASCII as \xNN, so that a broken file cannot flood or garble the log.
 void ReportConfigIssue(const ConfigIssue &issue, void *) {
+  char key[kConfigEchoCapacity];
+  char value[kConfigEchoCapacity];
+  ConfigEcho(issue.key, key, sizeof(key));
+  ConfigEcho(issue.value != nullptr ? issue.value : "", value, sizeof(value));
+  const UINT64 line = issue.line;
   switch (issue.problem) {
     case kConfigUnknownKey:
-      SerialPrintf("platform: %s line %u: unknown key '%s' ignored\n", kConfigName,
-                   static_cast<UINT64>(issue.line), issue.key);
+      SerialPrintf("platform: %s line %u: unknown key '%s' ignored\n", kConfigName, line, key);
       break;
     case kConfigNoEquals:
-      SerialPrintf("platform: %s line %u: no '=' in '%s'\n", kConfigName, static_cast<UINT64>(issue.line),
-                   issue.key);
+      SerialPrintf("platform: %s line %u: no '=' in '%s'\n", kConfigName, line, key);
       break;
     case kConfigBadValue:
-      SerialPrintf("platform: %s line %u: bad value '%s' for '%s'\n", kConfigName,
-                   static_cast<UINT64>(issue.line), issue.value, issue.key);
+      SerialPrintf("platform: %s line %u: bad value '%s' for '%s'\n", kConfigName, line, value, key);
       break;
   }
 }
@@ -460,25 +464,54 @@ void InstallProtocols(const PlatformConfig &config) {
   InstallAnswerProtocols(config);
 }
 
-// The loader's variables that the configuration sets; the others stay as
-// they are. The values are wiped behind them: the variable store keeps the
-// only copy (a key among them is looked for in memory after a resume).
-void SetVariables(const ConfigEntryList &variables) {
-  constexpr UINT32 kAttributes =
-      EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
+// The loader's variables that the configuration names; the others stay as
+// they are. Changes that stay (set for good, deleted) are made on the first
+// start of a run only; a variable for this boot only is set at every start,
+// as a reset has taken it. The values are wiped behind them: the variable
+// store keeps the only copy (a key among them is looked for in memory after
+// a resume).
+void SetVariables(const ConfigEntryList &variables, bool firstStart) {
+  constexpr UINT32 kThisBoot = EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
   for (UINT32 i = 0; i < variables.count; i++) {
     const ConfigEntry &variable = variables.entries[i];
     UINTN units = 0;
     CHAR16 *name = WideCopyOrFail(variable.name, "a variable's name", &units);
-    const EFI_STATUS status =
-        gRT->SetVariable(name, &gNimbVendorVariableGuid, kAttributes, variable.size, variable.bytes);
-    gBS->FreePool(name);
-    if (EFI_ERROR(status)) {
-      Fail(kExitPlatformFailed, "cannot set NVRAM variable %s (%s)", variable.name, StatusName(status));
+    UINTN found = 0;
+    if (gRT->GetVariable(name, &gNimbVendorVariableGuid, nullptr, &found, nullptr) == EFI_BUFFER_TOO_SMALL) {
+      SerialPrintf("platform: nvram %s at start: %u bytes\n", variable.name, static_cast<UINT64>(found));
+    } else {
+      SerialPrintf("platform: nvram %s at start: absent\n", variable.name);
     }
-    SerialPrintf("platform: nvram %s set, %u bytes\n", variable.name, static_cast<UINT64>(variable.size));
+    if (!firstStart && variable.life != kVariableThisBoot) {
+      SerialPrintf("platform: nvram %s left as the first start made it\n", variable.name);
+      gBS->FreePool(name);
+      continue;
+    }
+    const UINT32 attributes = variable.life == kVariableDeleted    ? 0
+                              : variable.life == kVariableThisBoot ? kThisBoot
+                                                                   : kThisBoot | EFI_VARIABLE_NON_VOLATILE;
+    const EFI_STATUS status =
+        gRT->SetVariable(name, &gNimbVendorVariableGuid, attributes, variable.size, variable.bytes);
+    gBS->FreePool(name);
+    if (variable.life == kVariableDeleted) {
+      if (EFI_ERROR(status) && status != EFI_NOT_FOUND) {
+        Fail(kExitPlatformFailed, "cannot delete NVRAM variable %s (%s)", variable.name, StatusName(status));
+      }
+      SerialPrintf("platform: nvram %s %s\n", variable.name,
+                   status == EFI_NOT_FOUND ? "not there to delete" : "deleted");
+      continue;
+    }
+    const char *life = variable.life == kVariableThisBoot ? "for this boot" : "for good";
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot set NVRAM variable %s %s (%s)", variable.name, life,
+           StatusName(status));
+    }
+    SerialPrintf("platform: nvram %s set %s, %u bytes\n", variable.name, life,
+                 static_cast<UINT64>(variable.size));
   }
-  ReportKeyCopies(variables);
+  if (firstStart) {
+    ReportKeyCopies(variables);
+  }
   for (UINT32 i = 0; i < variables.count; i++) {
     volatile UINT8 *bytes = const_cast<UINT8 *>(variables.entries[i].bytes);
     for (UINT32 j = 0; j < variables.entries[i].size; j++) {
@@ -696,13 +729,11 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
     launch = PrepareNetworkBoot(device, &config);
   }
   InstallProtocols(config);
-  // A machine that resets starts again on the same variable store: the
-  // configured variables are set on the first start only.
+  // A machine that resets starts again on the same variable store: what
+  // stays of the configured variables is done on the first start only.
   const UINT32 boot = CountBoot();
   ReportResumeVariables();
-  if (boot == 1) {
-    SetVariables(config.nvram);
-  }
+  SetVariables(config.nvram, boot == 1);
   if (config.timedExtents.bytes != nullptr) {
     TimedRead(config.timedExtents);
   }

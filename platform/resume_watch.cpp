@@ -10,7 +10,9 @@ namespace nimb::platform {
 
 namespace {
 
-// The platform's own variable: the number of starts on this store.
+// The platform's own variable: the number of starts of this run, there only
+// from a reset that went through the platform's ResetSystem to the next
+// start, which deletes it: nothing of it stays once a run has ended.
 constexpr EFI_GUID kPlatformVariableGuid = {
     0x5C1A7E02, 0x93D4, 0x4B6F, {0x8E, 0x21, 0x4A, 0x07, 0xC3, 0x9B, 0xD5, 0x60}};
 constexpr const CHAR16 *kBootCountName = u"platform-boots";
@@ -52,6 +54,7 @@ UINT64 gReadBytes;
 UINT32 gReadDepth;
 bool gTimeReads;
 ResetSystemFunction gOriginalReset;
+UINT32 gBootCount;
 GetMemoryMapFunction gOriginalGetMemoryMap;
 
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
@@ -106,6 +109,11 @@ VOID EFIAPI WatchedResetSystem(EFI_RESET_TYPE ResetType, EFI_STATUS ResetStatus,
                  gReads[i].destination, gReads[i].status);
   }
   SerialPrintf("platform: reads %u, bytes 0x%x\n", gReadCount, gReadBytes);
+  // The count of starts is kept over the reset, and only over it.
+  EFI_GUID guid = kPlatformVariableGuid;
+  gRT->SetVariable(kBootCountName, &guid,
+                   EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS,
+                   sizeof(gBootCount), &gBootCount);
   gOriginalReset(ResetType, ResetStatus, DataSize, ResetData);
 }
 
@@ -160,10 +168,10 @@ UINT32 CountBoot() {
   EFI_GUID guid = kPlatformVariableGuid;
   if (EFI_ERROR(gRT->GetVariable(kBootCountName, &guid, nullptr, &size, &count)) || size != sizeof(count)) {
     count = 0;
+  } else {
+    gRT->SetVariable(kBootCountName, &guid, 0, 0, nullptr);
   }
-  count++;
-  gRT->SetVariable(kBootCountName, &guid, EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS,
-                   sizeof(count), &count);
+  gBootCount = ++count;
   SerialPrintf("platform: boot %u\n", static_cast<UINT64>(count));
   return count;
 }

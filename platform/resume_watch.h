@@ -9,9 +9,11 @@
 
 namespace nimb::platform {
 
-// Counts this start in a variable of the platform's own and returns the
-// count, from 1; prints "platform: boot N". A store that refuses the
-// variable counts every start as the first.
+// The count of this start in the run, from 1; prints "platform: boot N". A
+// run is the starts on one variable store linked by resets that the loader
+// asked for: the count stays in a variable of the platform's own from such a
+// reset to the next start only. A store that refuses the variable counts
+// every start as the first.
 UINT32 CountBoot();
 
 // Prints "platform: nvram at start: boot-signature=absent boot-image=58

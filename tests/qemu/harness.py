@@ -722,9 +722,12 @@ def prepare(scenario, efi_dir, workdir, config_override=None, guest_dir=GUEST_DI
     if scenario.network:
         return serve_directory(volume, efi_dir / "BOOTX64.efi", loader), cache_name
     disk = workdir / "disk.img"
+    if scenario.usb:
+        disk_bytes = mkdisk.stick_bytes(volume)
     try:
         mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=disk_bytes,
-                          raw=raw, raw_guid=RESUME_PARTITION_GUID)
+                          raw=raw, raw_guid=RESUME_PARTITION_GUID,
+                          config=mkdisk.STICK_CONFIG if scenario.usb and not config else None)
     except mkdisk.DiskError as error:
         raise OSError(str(error)) from error
     return disk, cache_name
@@ -841,14 +844,24 @@ def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
         shutil.rmtree(workdir, ignore_errors=True)
         raise
     limit, screen = scenario.timeout, scenario.screen
+    earlier, error = "", None
+    if scenario.before_config is not None:
+        # The earlier power-on, from the same volume with its own platform.cfg.
+        first = dataclasses.replace(scenario, config=scenario.before_config, before_config=None)
+        (workdir / "before").mkdir()
+        first_disk, _ = prepare(first, efi_dir, workdir / "before", guest_dir=guest_dir)
+        _, earlier, error = boot(first_disk, workdir, limit, usb=scenario.usb, echo=echo)
     on_line, shots, trouble, pending = watch(scenario, workdir, disk, png=echo)
-    returncode, log, error = boot(disk, workdir, limit, on_line, network=scenario.network,
-                                  reboot=scenario.boots > 1, qmp=bool(screen or scenario.actions), echo=echo)
-    (workdir / "serial.txt").write_text(log)
+    returncode, log, later_error = boot(disk, workdir, limit, on_line, network=scenario.network,
+                                        reboot=scenario.boots > 1, qmp=bool(screen or scenario.actions), echo=echo,
+                                        usb=scenario.usb, same_store=True)
+    error = error or later_error
+    (workdir / "serial.txt").write_text(earlier + log)
     outcome = decode_exit(returncode, read_exit_codes())
     problems = ([f"timed out after {limit} s"] if returncode is None else []) + ([f"qemu: {error}"] if error else [])
     problems += check_report(log, outcome, scenario.status, scenario.memory, scenario.exit) + trouble
-    problems += check_log(log, scenario.expect, scenario.forbid) + check_console_modes(log, scenario.console_modes)
+    problems += check_log(earlier + log, scenario.expect, scenario.forbid)
+    problems += check_console_modes(log, scenario.console_modes)
     problems += [f"action {action!r} not done: {text!r} never came" for text, action in pending]
     if cache_name is not None and scenario.cache.looked_for:
         # The name that kcache gave the cache, from the boot device path the

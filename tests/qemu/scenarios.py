@@ -347,6 +347,14 @@ class Scenario:
     boots: int = 1
     # The loader's reads up to a reset.
     reads: ResumeReads | None = None
+    # platform.cfg keys (over BASE_CONFIG) of an earlier power-on of the same
+    # volume on the same variable store: its log comes in front of the
+    # scenario's own for `expect` and `forbid`; the report and exit are the
+    # scenario's run's. None: no earlier power-on.
+    before_config: dict | None = None
+    # The disk is a stick image (mkdisk --stick, its platform.cfg unless the
+    # scenario has one) on a USB controller.
+    usb: bool = False
 
 
 def fatal(name, *messages, before=(), make=Scenario, **knobs):
@@ -423,7 +431,7 @@ _TABLE = [
     # boot-args names the kernel; Shift is held, but the boot policy says
     # that held keys are not to be read: no safe mode to skip NVRAM.
     fatal("nvram_args", "Error loading kernel 'from_nvram'",
-          before=("platform: keys: modifiers 0x2, 0 keys, ignored 1", "platform: nvram boot-args set, 17 bytes"),
+          before=("platform: keys: modifiers 0x2, 0 keys, ignored 1", "platform: nvram boot-args set for good, 17 bytes"),
           config={"nvram.boot-args": "Kernel=from_nvram", "keys": "shift", "keys-ignored": "1"},
           forbid=("Using Safe Mode", KERNEL_ERROR)),
     # The platform's own way out: an unknown key is reported and ignored, and
@@ -737,6 +745,40 @@ _TABLE += [
                     reads=ResumeReads(after_header=None, first_stage=STAGE)),
     reset_then_boot("resume_limit_key_length", ("--key-bytes", "16"),
                     config={"nvram-hex.boot-image-key": "00112233445566778899aabbccddeeff0011223344"}),
+]  # fmt: skip
+
+
+# NVRAM hygiene. Each configured variable is reported as a start finds it.
+def nvram_lines(name, found, action):
+    return f"platform: nvram {name} at start: {found}", f"platform: nvram {name} {action}"
+
+
+_TABLE += [
+    # A variable for this boot only is gone on the next start of the run
+    # (the loader resets the machine on an image it refuses), and set again;
+    # one set for good is there and left alone.
+    dataclasses.replace(
+        reset_then_boot("nvram_volatile", ("--key-bytes", "16", "--set", "magic=0x73696D66"),
+                        config={"nvram-volatile.guest-volatile": "v", "nvram.guest-kept": "k"}),
+        expect=("platform: boot 1", *nvram_lines("guest-volatile", "absent", "set for this boot, 1 bytes"),
+                *nvram_lines("guest-kept", "absent", "set for good, 1 bytes"), "platform: starting", RESET,
+                "platform: boot 2", ACCEPTED_THEN_RESET, *nvram_lines("guest-volatile", "absent", "set for this boot"),
+                *nvram_lines("guest-kept", "1 bytes", "left as the first start made it"), LOADING_KERNEL,
+                KERNEL_START)),
+    # A variable that an earlier power-on set for good is deleted, and the
+    # loader no longer boots the kernel it named; one not there is no error.
+    fatal("nvram_delete", KERNEL_ERROR,
+          before=("platform: nvram boot-args set for good, 17 bytes", "Error loading kernel 'from_nvram'",
+                  "platform: loader returned", "platform: boot 1", *nvram_lines("boot-args", "17 bytes", "deleted"),
+                  *nvram_lines("guest-never", "absent", "not there to delete")),
+          before_config={"nvram.boot-args": "Kernel=from_nvram"},
+          config={"nvram-delete.boot-args": "", "nvram-delete.guest-never": ""}),
+    # The stick image, with its own platform.cfg for a real PC, boots from
+    # a USB controller (its device path: a USB node, then the partition's)
+    # to the reference kernel.
+    Scenario("usb_stick", base_config=False, files=kernel_file(), usb=True,
+             expect=("03050600000004012a00", LOADING_KERNEL, KERNEL_START),
+             exit="KernelPass", kernel=KernelExpect(), timeout=150.0),
 ]  # fmt: skip
 
 

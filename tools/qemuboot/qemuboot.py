@@ -93,8 +93,12 @@ def serve_directory(volume, platform, loader, config_name="platform.cfg"):
     return volume
 
 
-def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, reboot=False, extra=()):
-    """QEMU's command line, on a private copy of the variable store. With
+def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, reboot=False, extra=(), usb=False,
+                 same_store=False):
+    """QEMU's command line, on a private copy of the variable store in
+    `workdir` (with `same_store`, the copy that an earlier machine there left,
+    if any: the machine powers on with what it left in NVRAM). With `usb`,
+    the disk is a USB stick on an xHCI controller. With
     `tftp_dir` and no `disk`, the machine boots over a virtio NIC without
     option ROM (so that the firmware's own PXE boots) from QEMU's TFTP server
     on that directory, every packet written to workdir/net.pcap; with
@@ -102,7 +106,12 @@ def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, rebo
     instead of ending QEMU; `extra` goes behind the accelerator."""
     code, variables = find_ovmf()
     private_vars = Path(workdir) / "OVMF_VARS.fd"
-    shutil.copyfile(variables, private_vars)
+    if not (same_store and private_vars.exists()):
+        shutil.copyfile(variables, private_vars)
+    drive = ["-drive", f"format=raw,file={disk}"]
+    if usb:
+        drive = ["-drive", f"if=none,id=stick,format=raw,file={disk}", "-device", "qemu-xhci",
+                 "-device", "usb-storage,drive=stick,removable=on"]  # fmt: skip
     network = ["-nic", "none"]
     if tftp_dir is not None:
         network = [
@@ -115,7 +124,7 @@ def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, rebo
         "-display", "none", *([] if reboot else ["-no-reboot"]),
         "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={code}",
         "-drive", f"if=pflash,format=raw,unit=1,file={private_vars}",
-        *(["-drive", f"format=raw,file={disk}"] if disk is not None else []),
+        *(drive if disk is not None else []),
         "-device", "isa-debug-exit,iobase=0xf4,iosize=0x04", *network,
         "-serial", f"file:{serial_log}", "-monitor", "none",
         *(["-qmp", f"unix:{qmp_socket},server=on,wait=off"] if qmp_socket else []),
@@ -241,19 +250,21 @@ class Qmp:
         self.sock.close()
 
 
-def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=()):
+def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=(),
+         usb=False, same_store=False):
     """Runs QEMU on `disk` (with `network`: the directory served over TFTP)
     until it ends, for at most `timeout` seconds. `on_line(line, qmp)` hears
     each cleaned serial line as it comes, with a Qmp connection when `qmp` is
     set (else None), and stops the machine by returning True; with `echo`,
-    each line is printed. Returns QEMU's exit status (None: timed out or
+    each line is printed; `usb` and `same_store` as for qemu_command. Returns QEMU's exit status (None: timed out or
     stopped), the cleaned serial log and what went wrong over QMP or in
     `on_line` (its OSError, ValueError, RuntimeError), or None."""
     workdir = Path(workdir)
     serial_log = workdir / "serial.log"
+    serial_log.unlink(missing_ok=True)  # an earlier machine's, in the same workdir
     qmp_socket = workdir / "qmp.sock" if qmp else None
     command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, disk if network else None,
-                           reboot, extra)
+                           reboot, extra, usb, same_store)
     machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
     trouble, connection = None, None
@@ -286,6 +297,7 @@ def main(argv=None):
     parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
     parser.add_argument("image", help="the disk image, or with --net the directory to stage and serve")
     parser.add_argument("--net", action="store_true", help="boot over the network from the directory IMAGE")
+    parser.add_argument("--usb", action="store_true", help="attach the image as a USB stick (mkdisk --stick)")
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"), help="with --net: BOOTX64.efi, nimbboot.efi")
     parser.add_argument("--timeout", type=float, default=120.0, help="seconds before QEMU is stopped (120)")
     parser.add_argument("--screenshot", help="where the screenshot goes (.png or .ppm)")
@@ -309,7 +321,7 @@ def main(argv=None):
                 shots.append(args.screenshot)
 
         returncode, log, trouble = boot(image, workdir, args.timeout, on_line, network=args.net,
-                                        qmp=bool(args.screenshot), echo=not args.quiet)
+                                        qmp=bool(args.screenshot), echo=not args.quiet, usb=args.usb)
     if args.log:
         Path(args.log).write_text(log)
     for problem in [trouble] if trouble else []:
