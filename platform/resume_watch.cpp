@@ -55,6 +55,8 @@ UINT32 gReadDepth;
 bool gTimeReads;
 ResetSystemFunction gOriginalReset;
 UINT32 gBootCount;
+// Boot services have ended: a reset now is the kernel's, not the loader's.
+bool gBootServicesEnded;
 GetMemoryMapFunction gOriginalGetMemoryMap;
 
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
@@ -109,12 +111,18 @@ VOID EFIAPI WatchedResetSystem(EFI_RESET_TYPE ResetType, EFI_STATUS ResetStatus,
                  gReads[i].destination, gReads[i].status);
   }
   SerialPrintf("platform: reads %u, bytes 0x%x\n", gReadCount, gReadBytes);
-  // The count of starts is kept over the reset, and only over it.
-  EFI_GUID guid = kPlatformVariableGuid;
-  gRT->SetVariable(kBootCountName, &guid,
-                   EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS,
-                   sizeof(gBootCount), &gBootCount);
+  // The count of starts is kept over a reset of the loader's, and only
+  // over it.
+  if (!gBootServicesEnded) {
+    EFI_GUID guid = kPlatformVariableGuid;
+    gRT->SetVariable(kBootCountName, &guid, EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS,
+                     sizeof(gBootCount), &gBootCount);
+  }
   gOriginalReset(ResetType, ResetStatus, DataSize, ResetData);
+}
+
+VOID EFIAPI NoteBootServicesEnd(EFI_EVENT, VOID *) {
+  gBootServicesEnded = true;
 }
 
 UINTN NodeLength(const EFI_DEVICE_PATH_PROTOCOL *node) {
@@ -212,6 +220,8 @@ void WatchDiskAndReset(bool timeReads) {
     gBS->GetMemoryMap = TimedGetMemoryMap;
     SealTable(&gBS->Hdr);
   }
+  EFI_EVENT event = nullptr;
+  gBS->CreateEvent(EVT_SIGNAL_EXIT_BOOT_SERVICES, TPL_NOTIFY, NoteBootServicesEnd, nullptr, &event);
   gOriginalReset = gRT->ResetSystem;
   gRT->ResetSystem = WatchedResetSystem;
   SealTable(&gRT->Hdr);

@@ -11,8 +11,8 @@ namespace nimb::platform {
 
 // The count of this start in the run, from 1; prints "platform: boot N". A
 // run is the starts on one variable store linked by resets that the loader
-// asked for: the count stays in a variable of the platform's own from such a
-// reset to the next start only. A store that refuses the variable counts
+// asked for (before boot services end): the count stays in a variable of the
+// platform's own from such a reset to the next start only. A store that refuses the variable counts
 // every start as the first.
 UINT32 CountBoot();
 
