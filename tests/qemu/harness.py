@@ -639,7 +639,8 @@ def cell(image, x, y):
 
 def find_text(image, text):
     """Where a line of the firmware's text console reads `text`: (x, y) of
-    its first cell, or None. A line reads `text` when its cells are blank
+    its first cell (or of a window a few rows above it, where the glyphs'
+    blank tops allow), or None. A line reads `text` when its cells are blank
     exactly where `text` has blanks, and two of them are the same picture
     exactly where `text` has the same character: a pattern that no other
     text of the length, and no picture, gives by chance. The cell behind the

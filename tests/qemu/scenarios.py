@@ -17,8 +17,10 @@ from qemuboot import NET_MAC  # noqa: E402
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
 # What every scenario's platform.cfg starts with, unless the scenario says
-# otherwise: the platform records of the machine.
+# otherwise: the end through the debug-exit device and the platform records
+# of the machine.
 BASE_CONFIG = {
+    "debug-exit": "1",
     "datahub.Model": "QEMU1,1",
     "datahub-hex.BusFrequency": "00e1f50500000000",  # 100 MHz, 64 bits
 }
