@@ -63,6 +63,7 @@ Ending gEnding;
 void SetEnding(const PlatformConfig &config) {
   gEnding.debugExit = config.debugExit == kDebugExitAuto ? MachineIsQemu() : config.debugExit == kDebugExitOn;
   gEnding.waitKey = config.waitKey;
+  SerialPrintf("platform: debug-exit %s\n", gEnding.debugExit ? "in use" : "not used");
 }
 
 // The outcome goes on a text screen; the loader's own mode changes alone
@@ -154,6 +155,7 @@ void ParseConfig(char *text, UINTN size, PlatformConfig *config) {
   if (ConfigParse(text, size, config, ReportConfigIssue, nullptr) != 0) {
     Fail(kExitConfigInvalid, "%s has errors", kConfigName);
   }
+  SetEnding(*config);
 }
 
 // The whole of a file of the platform's volume, with room for a NUL behind
@@ -192,6 +194,7 @@ void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
   char *text = ReadWholeFile(root, kConfigPath, kConfigName, kExitConfigInvalid, &size);
   if (text == nullptr) {
     SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    SetEnding(*config);
     return;
   }
   ParseConfig(text, size, config);
@@ -678,6 +681,7 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
   status = NetLoadFileFetch(&gNetBoot.loadFile, kConfigName, AllocateForFetch, &bytes, &size);
   if (status == EFI_NOT_FOUND) {
     SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    SetEnding(*config);
   } else if (EFI_ERROR(status)) {
     Fail(kExitConfigInvalid, "cannot fetch %s (%s)", kConfigName, StatusName(status));
   } else {
@@ -729,6 +733,7 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   // The boot manager's watchdog would reset a slow run.
   gBS->SetWatchdogTimer(0, 0, 0, nullptr);
   SerialPrintf("\nplatform: started\n");
+  // Until a configuration says otherwise.
   gEnding.debugExit = MachineIsQemu();
 
   // Everything that allocates comes before the first measurement.
@@ -753,8 +758,6 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   } else {
     launch = PrepareNetworkBoot(device, &config);
   }
-  SetEnding(config);
-  SerialPrintf("platform: debug-exit %s\n", gEnding.debugExit ? "in use" : "not used");
   InstallProtocols(config);
   // A machine that resets starts again on the same variable store: the
   // configured variables are set on the first start only.

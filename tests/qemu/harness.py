@@ -865,7 +865,7 @@ def watch(scenario, workdir, served, png=False):
     """qemuboot's on_line for a scenario: its screenshots (with `png`, one as
     screen.png too), its actions and its count of starts. Returns it, the
     shots taken, a list of troubles and the actions not done."""
-    shots, trouble, pending, starts = [], [], list(scenario.actions), [0]
+    shots, trouble, pending, starts, stopped = [], [], list(scenario.actions), [0], []
 
     def on_line(line, qmp):
         if scenario.screen is not None and not shots and scenario.screen.when in line:
@@ -883,13 +883,16 @@ def watch(scenario, workdir, served, png=False):
                 qmp.execute("set_link", name=NET_ID, up=False)
             else:  # ("truncate", path, size)
                 os.truncate(Path(served) / action[1], action[2])
+        if scenario.stop_at and scenario.stop_at in line:
+            stopped.append(line)
+            return True
         starts[0] += line.startswith("platform: started")
         if starts[0] > scenario.boots:
             trouble.append(f"boots: the machine started more than {scenario.boots} times; stopped")
             return True
         return False
 
-    return on_line, shots, trouble, pending
+    return on_line, shots, trouble, pending, stopped
 
 
 def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
@@ -901,13 +904,14 @@ def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
         shutil.rmtree(workdir, ignore_errors=True)
         raise
     limit, screen = scenario.timeout, scenario.screen
-    on_line, shots, trouble, pending = watch(scenario, workdir, disk, png=echo)
+    on_line, shots, trouble, pending, stopped = watch(scenario, workdir, disk, png=echo)
     on_tick, seen = watch_screen(scenario, workdir) if scenario.screen_text else (None, [])
     returncode, log, error = boot(disk, workdir, limit, on_line, network=scenario.network, reboot=scenario.boots > 1,
                                   qmp=bool(screen or scenario.actions or on_tick), echo=echo, extra=scenario.qemu_args,
                                   bare=scenario.bare, on_tick=on_tick)
     (workdir / "serial.txt").write_text(log)
-    outcome = Outcome("Stopped") if on_tick and len(seen) == 2 else decode_exit(returncode, read_exit_codes())
+    done = stopped or (on_tick and len(seen) == 2)
+    outcome = Outcome("Stopped") if done else decode_exit(returncode, read_exit_codes())
     problems = ([f"timed out after {limit} s"] if returncode is None else []) + ([f"qemu: {error}"] if error else [])
     problems += check_report(log, outcome, scenario.status, scenario.memory, scenario.exit) + trouble
     problems += check_log(log, scenario.expect, scenario.forbid) + check_console_modes(log, scenario.console_modes)

@@ -359,6 +359,9 @@ class Scenario:
     # replace them. The run ends as "Stopped".
     screen_text: tuple = ()
     after_key: str = ""
+    # The harness stops the machine once a line of the serial log holds this
+    # text: the run ends as "Stopped".
+    stop_at: str = ""
 
 
 def fatal(name, *messages, before=(), make=Scenario, **knobs):
@@ -484,6 +487,17 @@ _TABLE = [
             ranges={"BootCLUT": 0x300, "Pict-FailedBoot": 0x4020},
         ),
     ),  # fmt: skip
+    # Without debug-exit the platform goes back to the firmware with an
+    # error, which the firmware's boot manager reports before its next
+    # option, with the file system as it was.
+    Scenario(
+        "platform_back_to_firmware",
+        config={"debug-exit": "0", "loader": "\\EFI\\BOOT\\missing.efi"},
+        expect=("platform: debug-exit not used", "platform: exit code 0x21",
+                "back to the firmware with EFI_LOAD_ERROR", "failed to start Boot0002", ": Load Error", "FS0:"),
+        stop_at="FS0:",
+        exit="Stopped",
+    ),
     # A firmware without graphics output: the loader finds a text console,
     # is refused the graphics it asks for and boots the kernel in text.
     Scenario(
