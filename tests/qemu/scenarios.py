@@ -519,7 +519,7 @@ _TABLE = [
         config={"wait-key": "1"},
         bare=True,
         screen_text=("The loader returned EFI_ABORTED (0x8000000000000015).", "Press a key to go on."),
-        after_key="Shell> ",
+        after_key="Shell>",
         exit="Stopped",
         timeout=150.0,
     ),
