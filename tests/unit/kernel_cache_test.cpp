@@ -6,11 +6,11 @@
 
 #include <gtest/gtest.h>
 
-#include <ctime>
 #include <functional>
 #include <string>
 #include <vector>
 
+#include "hostfw/network.h"
 #include "kernel_images.h"
 #include "load/bootfile.h"
 #include "loader_fixture.h"
@@ -38,27 +38,8 @@ EFI_FILE_INFO InfoAt(const Date &d) {
   return info;
 }
 
-// Seconds since 1970 in UTC, as SetFileTime takes them.
 int64_t Seconds(const Date &d) {
-  std::tm tm = {};
-  tm.tm_year = d.year - 1900;
-  tm.tm_mon = d.month - 1;
-  tm.tm_mday = d.day;
-  tm.tm_hour = d.hour;
-  tm.tm_min = d.minute;
-  tm.tm_sec = d.second;
-  return timegm(&tm);
-}
-
-// The standard checksum, written out here so as not to share the loader's
-// faults.
-uint32_t StandardAdler32(const uint8_t *data, size_t length) {
-  uint32_t a = 1, b = 0;
-  for (size_t i = 0; i < length; i++) {
-    a = (a + data[i]) % 65521;
-    b = (b + a) % 65521;
-  }
-  return b << 16 | a;
+  return nimbtest::UtcSeconds(d.year, d.month, d.day, d.hour, d.minute, d.second);
 }
 
 // A kernel of one page at 0x200000, entered at 0x200010.
@@ -131,21 +112,18 @@ class KernelCacheTest : public nimbtest::VolumeTest {
   static std::string CacheName() {
     nimb::MakeKernelCacheKey();
     char digits[9];
-    snprintf(digits, sizeof(digits), "%08X",
-             __builtin_bswap32(StandardAdler32(nimb::gKernelCacheKey, sizeof(nimb::gKernelCacheKey))));
+    snprintf(
+        digits, sizeof(digits), "%08X",
+        __builtin_bswap32(nimbtest::ReferenceAdler32(nimb::gKernelCacheKey, sizeof(nimb::gKernelCacheKey))));
     return std::string("System/Library/Caches/com.quill.kernelcaches/kernelcache.") + digits;
   }
 };
 
 TEST_F(KernelCacheTest, TheKeyAndTheNameItGives) {
-  // A device path of `size` bytes: one vendor node and the end node.
+  // A device path of `size` bytes: one file-path node and the end node.
   auto pathOf = [](size_t size) {
-    Bytes path(size, 0xA5);
-    path[0] = 1;
-    path[1] = 4;
-    nimbtest::PutLe16(path, 2, static_cast<uint32_t>(size - 4));
-    const uint8_t end[] = {0x7F, 0xFF, 4, 0};
-    std::copy(end, end + 4, path.end() - 4);
+    Bytes path = hostfw::FilePathNode(std::u16string((size - 10) / 2, u'p')), end = hostfw::EndNode();
+    path.insert(path.end(), end.begin(), end.end());
     return path;
   };
   struct Row {
@@ -223,8 +201,8 @@ struct CacheFile {
     Bytes out(384, 0);
     std::copy(signature.begin(), signature.end(), out.begin());
     std::copy(compressType.begin(), compressType.end(), out.begin() + 4);
-    nimbtest::PutBe32(out, 8,
-                      static_cast<uint32_t>(StandardAdler32(kernel.data(), kernel.size()) + adlerDelta));
+    nimbtest::PutBe32(
+        out, 8, static_cast<uint32_t>(nimbtest::ReferenceAdler32(kernel.data(), kernel.size()) + adlerDelta));
     nimbtest::PutBe32(out, 12, static_cast<uint32_t>(kernel.size() + uncompressedDelta));
     nimbtest::PutBe32(out, 16, static_cast<uint32_t>(stream.size()));
     std::copy(model.begin(), model.end(), out.begin() + 64);
@@ -308,12 +286,11 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
     else
       dir.File(cacheName, s.file.empty() ? s.cache.Build() : s.file);
     hostfw::Firmware local;
-    nimbtest::ResetLoaderState();
-    nimb::gST = local.SystemTable();
-    nimb::gBS = local.BootServices();
-    local.SetFileTime(dir.path() + "/nimb_kernel", Seconds(s.kernel));
-    local.SetFileTime(dir.path() + "/" + extensions, Seconds(s.extensions));
-    local.SetFileTime(dir.path() + "/" + cacheName, Seconds(s.cacheTime));
+    nimbtest::AttachTo(local);
+    for (const auto &[name, date] : {std::pair<std::string, Date>{"nimb_kernel", s.kernel},
+                                     {extensions, s.extensions},
+                                     {cacheName, s.cacheTime}})
+      local.SetFileTime(dir.path() + "/" + name, Seconds(date));
     EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
     nimb::gBootDevicePath = local.DevicePathOf(device);
     strcpy(nimb::gModelName, "TestBox1,1");
