@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "hostfw/network.h"
+#include "kcache/cache_writer.h"
 #include "kernel_images.h"
 #include "load/bootfile.h"
 #include "loader_fixture.h"
@@ -179,48 +180,17 @@ TEST_F(KernelCacheTest, TheKeyAndTheNameItGives) {
             std::string::npos);
 }
 
-// A cache of the kernel in `kernel` as the header says: "comp", "lzss", the
-// checksum, the sizes, model and path fields, then the stream (literals
-// only, each group a flags byte of 0xFF and eight bytes).
-struct CacheFile {
-  Bytes kernel;
-  std::string signature = "comp";
-  std::string compressType = "lzss";
-  int64_t adlerDelta = 0;
-  int64_t uncompressedDelta = 0;
-  size_t cutStream = 0;  // bytes taken off the end of the stream
-  Bytes model;           // the header's model field; empty: zero
-  Bytes bootPath;        // the header's boot path field; empty: zero
-
-  Bytes Build() const {
-    Bytes stream;
-    for (size_t i = 0; i < kernel.size(); i += 8) {
-      stream.push_back(0xFF);
-      stream.insert(stream.end(), kernel.begin() + i, kernel.begin() + std::min(i + 8, kernel.size()));
-    }
-    Bytes out(384, 0);
-    std::copy(signature.begin(), signature.end(), out.begin());
-    std::copy(compressType.begin(), compressType.end(), out.begin() + 4);
-    nimbtest::PutBe32(
-        out, 8, static_cast<uint32_t>(nimbtest::ReferenceAdler32(kernel.data(), kernel.size()) + adlerDelta));
-    nimbtest::PutBe32(out, 12, static_cast<uint32_t>(kernel.size() + uncompressedDelta));
-    nimbtest::PutBe32(out, 16, static_cast<uint32_t>(stream.size()));
-    std::copy(model.begin(), model.end(), out.begin() + 64);
-    std::copy(bootPath.begin(), bootPath.end(), out.begin() + 128);
-    out.insert(out.end(), stream.begin(), stream.end() - cutStream);
-    return out;
-  }
-};
-
+// Caches from the cache writer, spoilt byte by byte: "comp", "lzss", the
+// checksum, the sizes, the model and path fields at 64, then the stream.
 TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
   const Bytes kernel = OnePageKernel();
   const std::string cacheName = CacheName();
-  const Bytes key(nimb::gKernelCacheKey, nimb::gKernelCacheKey + 320);
+  kcache::CacheKey key;
+  std::copy(nimb::gKernelCacheKey, nimb::gKernelCacheKey + key.size(), key.begin());
   const Date kernelTime = {2006, 12, 31, 23, 59, 59};
 
   struct Setup {
-    CacheFile cache;
-    Bytes file;  // when not empty: the cache file's bytes as they stand
+    Bytes file;  // the cache file's bytes
     Date kernel, extensions, cacheTime;
     bool extensionsDirectory = true, noExtensions = false, cacheDirectory = false;
     UINT64 flags = 0;
@@ -228,11 +198,10 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
   };
   // Both fields as in the key, but for one byte flipped (0: none).
   auto keyFields = [&](Setup &s, size_t flip) {
-    Bytes fields = key;
-    fields[flip] ^= flip != 0;
-    s.cache.model.assign(fields.begin(), fields.begin() + 64);
-    s.cache.bootPath.assign(fields.begin() + 64, fields.end());
+    s.file = kcache::WriteCache(kernel, key, true);
+    s.file[64 + flip] ^= flip != 0;
   };
+  auto size = [&](Setup &s, int delta) { nimbtest::PutBe32(s.file, 12, uint32_t(kernel.size() + delta)); };
   struct Row {
     const char *name;
     std::function<void(Setup &)> change;
@@ -257,14 +226,14 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
       {"the cache is a directory", [](Setup &s) { s.cacheDirectory = true; }, EFI_NOT_FOUND},
       {"shorter than the header, though a plain kernel",
        [&](Setup &s) { s.file.assign(kernel.begin(), kernel.begin() + 383); }, EFI_NOT_FOUND},
-      {"another compression", [](Setup &s) { s.cache.compressType = "lzvn"; }, EFI_NOT_FOUND},
+      {"another compression", [](Setup &s) { std::copy_n("lzvn", 4, s.file.begin() + 4); }, EFI_NOT_FOUND},
       {"another model", [&](Setup &s) { keyFields(s, 63); }, EFI_NOT_FOUND},
       {"another boot path", [&](Setup &s) { keyFields(s, 319); }, EFI_NOT_FOUND},
-      {"compressed data cut short", [](Setup &s) { s.cache.cutStream = 1; }, EFI_NOT_FOUND},
-      {"a wrong checksum", [](Setup &s) { s.cache.adlerDelta = 1; }, EFI_DEVICE_ERROR},
-      {"a stream shorter than the size", [](Setup &s) { s.cache.uncompressedDelta = 1; }, EFI_DEVICE_ERROR},
+      {"compressed data cut short", [](Setup &s) { s.file.pop_back(); }, EFI_NOT_FOUND},
+      {"a wrong checksum", [](Setup &s) { s.file[11] ^= 1; }, EFI_DEVICE_ERROR},
+      {"a stream shorter than the size", [&](Setup &s) { size(s, 1); }, EFI_DEVICE_ERROR},
       // The stream stops at the size: what it gives then fails the checksum.
-      {"a stream longer than the size", [](Setup &s) { s.cache.uncompressedDelta = -1; }, EFI_DEVICE_ERROR},
+      {"a stream longer than the size", [&](Setup &s) { size(s, -1); }, EFI_DEVICE_ERROR},
       {"safe mode", [](Setup &s) { s.flags = nimb::kBootSafeMode; }, EFI_ACCESS_DENIED},
       {"network", [](Setup &s) { s.flags = nimb::kBootNetwork; }, EFI_ACCESS_DENIED},
       {"another kernel", [](Setup &s) { s.flags = nimb::kBootOtherKernel; }, EFI_ACCESS_DENIED},
@@ -273,7 +242,7 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
   for (const Row &row : rows) {
     SCOPED_TRACE(row.name);
     nimbtest::TempDir dir;
-    Setup s{CacheFile{kernel}, {}, kernelTime, {2006, 1, 1, 0, 0, 0}, {2007, 1, 1, 0, 0, 0}};
+    Setup s{kcache::WriteCache(kernel, key, false), kernelTime, {2006, 1, 1, 0, 0, 0}, {2007, 1, 1, 0, 0, 0}};
     row.change(s);
     dir.File("nimb_kernel", kernel);
     const std::string extensions = "System/Library/Extensions";
@@ -284,7 +253,7 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
     if (s.cacheDirectory)
       dir.Directory(cacheName);
     else
-      dir.File(cacheName, s.file.empty() ? s.cache.Build() : s.file);
+      dir.File(cacheName, s.file);
     hostfw::Firmware local;
     nimbtest::AttachTo(local);
     for (const auto &[name, date] : {std::pair<std::string, Date>{"nimb_kernel", s.kernel},

@@ -5,7 +5,6 @@
 
 #include <gtest/gtest.h>
 
-#include <fstream>
 #include <random>
 #include <string>
 #include <vector>
@@ -53,15 +52,6 @@ TEST(LzssTest, FixedStreams) {
   }
 }
 
-// Real x86 code: this test program's own bytes.
-Bytes OwnCode(size_t size) {
-  std::ifstream in("/proc/self/exe", std::ios::binary);
-  Bytes bytes(size);
-  in.read(reinterpret_cast<char *>(bytes.data()), static_cast<std::streamsize>(size));
-  bytes.resize(static_cast<size_t>(in.gcount()));
-  return bytes;
-}
-
 TEST(LzssTest, RoundTripsThroughTheEncoder) {
   std::mt19937 random(7);
   auto randomBytes = [&](size_t size, unsigned range) {
@@ -90,7 +80,6 @@ TEST(LzssTest, RoundTripsThroughTheEncoder) {
       {"spaces only", Bytes(5000, ' ')},
       {"zeros only", Bytes(70000, 0)},
       {"text", Bytes(text.begin(), text.end())},
-      {"x86 code", OwnCode(32768)},
   };
   for (size_t size : {1, 2, 17, 18, 19, 4077, 4078, 4079, 4095, 4096, 4097, 20000})
     rows.push_back({"random", randomBytes(size, 256)});
