@@ -45,15 +45,6 @@ class PlatformReport(unittest.TestCase):
                 problems = harness.check_report(log, outcome, status, "same", exit_name)
                 self.assertEqual(len(problems), count, problems)
 
-    def test_exit_codes(self):
-        # A hang or a crash must never decode as a loader's outcome.
-        known = {0x10: ABORTED_SAME, 0x31: harness.Outcome("KernelPass")}
-        rows = [(0x21, "AbortedSame"), (0x63, "KernelPass"), (0, "PoweredOff"), (None, "Timeout"),
-                (-9, "Signal9"), (1, "QemuExit1")]  # fmt: skip
-        for returncode, expected in rows:
-            self.assertEqual(harness.decode_exit(returncode, known).name, expected)
-        self.assertIn(ABORTED_SAME, harness.read_exit_codes().values())
-
 
 # A boot's report as the kernel prints it, cut short: the loader's last
 # messages, then the kernel's lines.

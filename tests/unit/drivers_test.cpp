@@ -21,6 +21,7 @@
 namespace {
 
 using nimbtest::Bytes;
+using nimbtest::Memory;
 
 constexpr uint64_t kRegionTop = 0x400000;
 constexpr char kExtensions[] = "System/Library/Extensions";
@@ -79,10 +80,6 @@ class DriversTest : public nimbtest::VolumeTest {
       ranges.push_back({p->name, nimbtest::GetLe32(value, 0), nimbtest::GetLe32(value, 4)});
     }
     return ranges;
-  }
-  static Bytes Memory(uint64_t address, size_t length) {
-    const auto *p = reinterpret_cast<const uint8_t *>(address);
-    return Bytes(p, p + length);
   }
   // The console's text since `mark`, without dots: those of reading come
   // one by one, and cannot be told from those of the messages.

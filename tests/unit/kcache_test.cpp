@@ -19,6 +19,7 @@
 namespace {
 
 using nimbtest::Bytes;
+using nimbtest::Memory;
 
 TEST(KcacheTest, TimeIsOneSecondAfterTheNewer) {
   const struct {
@@ -34,12 +35,6 @@ TEST(KcacheTest, TimeIsOneSecondAfterTheNewer) {
     EXPECT_EQ(std::make_pair(got.tv_sec, got.tv_nsec), std::make_pair(row.want.tv_sec, row.want.tv_nsec))
         << row.name;
   }
-}
-
-// Bytes of the host firmware's memory, at their physical address.
-Bytes Memory(uint64_t address, uint64_t size) {
-  const auto *at = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(address));
-  return Bytes(at, at + size);
 }
 
 // --- through the loader ----------------------------------------------------------------

@@ -34,6 +34,12 @@ inline uint32_t GetLe32(const Bytes &bytes, size_t at) {
   return bytes[at] | bytes[at + 1] << 8 | bytes[at + 2] << 16 | static_cast<uint32_t>(bytes[at + 3]) << 24;
 }
 
+// Bytes of the host firmware's memory, at their physical address.
+inline Bytes Memory(uint64_t address, uint64_t size) {
+  const auto *at = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(address));
+  return Bytes(at, at + size);
+}
+
 inline Bytes Pattern(size_t size, unsigned seed = 1) {
   Bytes bytes(size);
   for (size_t i = 0; i < size; i++)
