@@ -46,12 +46,6 @@ Bytes WrapInFat(const Bytes &kernel, bool bigEndian) {
              {{0x1000, Pattern(0x800, 5)}, {0x3000, kernel}, {behind, Pattern(0x100, 6)}});
 }
 
-// Memory at `address` holds `bytes`, then zeroes up to `size`.
-void ExpectPlaced(uint64_t address, Bytes bytes, uint64_t size) {
-  bytes.resize(size);
-  EXPECT_EQ(nimbtest::Memory(address, size), bytes) << std::hex << address;
-}
-
 class KernelTest : public nimbtest::VolumeTest {
  protected:
   // Opens `bytes` as a file of the given kind; the bytes must outlive it.
@@ -230,7 +224,9 @@ TEST_F(KernelTest, SegmentsArePlacedAndTheirPagesCleared) {
       nimb::BootFileClose(&file);
       uint64_t pages = 0;
       for (const Placed &p : row.placed) {
-        ExpectPlaced(p.address, Bytes(data.begin() + p.from, data.begin() + p.from + p.count), p.size);
+        Bytes placed(data.begin() + p.from, data.begin() + p.from + p.count);
+        placed.resize(p.size);  // zeroes behind the data
+        EXPECT_EQ(nimbtest::Memory(p.address, p.size), placed) << std::hex << p.address;
         pages += p.size / 4096;
       }
       EXPECT_EQ(fw.AllocatedPages(), pages);
