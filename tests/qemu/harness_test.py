@@ -54,22 +54,16 @@ kernel: start
 kernel: bootargs commandLine="foo=1 q=\\"a b\\" \\\\ \\x01"
 kernel: bootargs videoDisplayMode=1
 kernel: bootargs runtimePageCount=0x788
-kernel: tree / (3 properties, 2 children)
-kernel: tree   name = "/"
-kernel: tree   chosen/ (4 properties, 1 child)
-kernel: tree     name = "chosen"
+kernel: tree / (0 properties, 2 children)
+kernel: tree   chosen/ (2 properties, 1 child)
 kernel: tree     boot-uuid = "0FAB1E5D-3C2B-4A19-8E7F-60C5D4B3A291"
 kernel: tree     boot-file = "nimb_kernel"
-kernel: tree     memory-map/ (2 properties, 0 children)
-kernel: tree       name = "memory-map"
+kernel: tree     memory-map/ (1 property, 0 children)
 kernel: tree       BootCLUT = <00 b0 10 00 00 03 00 00> (address 0x10b000, length 0x300)
-kernel: tree   efi/ (2 properties, 1 child)
-kernel: tree     name = "efi"
-kernel: tree     firmware-abi = "EFI64"
-kernel: tree     platform/ (2 properties, 0 children)
-kernel: tree       name = "platform"
+kernel: tree   efi/ (0 properties, 1 child)
+kernel: tree     platform/ (1 property, 0 children)
 kernel: tree       Model = u"QEMU1,1"
-kernel: check tree-walk ok 5 nodes, 11 properties, 0x200 of 0x200 bytes
+kernel: check tree-walk ok 5 nodes, 5 properties, 0x200 of 0x200 bytes
 kernel: range BootCLUT address=0x10b000 length=0x300
 kernel: driver "com.x.A" from=loader address=0x120000 plist=0x6 code=0x3 sum=0x24d0127
 kernel: driver "com.x.B" from=loader address=0x121000 plist=0x1 code=0x0 sum=0x1
