@@ -201,6 +201,23 @@ bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
   return ApplyFlag(&config->keysIgnored, value);
 }
 
+bool ApplyDebugExit(PlatformConfig *config, const char *, char *value) {
+  if (strcmp(value, "auto") == 0) {
+    config->debugExit = kDebugExitAuto;
+    return true;
+  }
+  bool on = false;
+  if (!ApplyFlag(&on, value)) {
+    return false;
+  }
+  config->debugExit = on ? kDebugExitOn : kDebugExitOff;
+  return true;
+}
+
+bool ApplyWaitKey(PlatformConfig *config, const char *, char *value) {
+  return ApplyFlag(&config->waitKey, value);
+}
+
 bool ApplyTimePxe(PlatformConfig *config, const char *, char *value) {
   return ApplyFlag(&config->timePxeDownload, value);
 }
@@ -336,6 +353,8 @@ constexpr ConfigKey kConfigKeys[] = {
     {"options", ApplyOptions},
     {"console", ApplyConsole},
     {"hold", ApplyHold},
+    {"debug-exit", ApplyDebugExit},
+    {"wait-key", ApplyWaitKey},
     {"net.time-pxe", ApplyTimePxe},
     {"keys", ApplyKeys},
     {"keys-ignored", ApplyKeysIgnored},
@@ -467,6 +486,8 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->options = nullptr;
   config->consoleMode = EfiConsoleControlScreenGraphics;
   config->holdSeconds = 0;
+  config->debugExit = kDebugExitAuto;
+  config->waitKey = false;
   config->timePxeDownload = false;
   config->keys = {};
   config->keysIgnored = false;

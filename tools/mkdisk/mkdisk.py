@@ -72,8 +72,9 @@ console=graphics
 # The loader's load options, for example a kernel's name and its arguments:
 # options=Kernel=nimb_kernel -v
 
-# Seconds the outcome stays on the screen when the loader comes back.
-hold=10
+# When the loader comes back (no kernel started), its outcome is shown on the
+# screen; 1 waits for a key there before going back to the firmware.
+wait-key=1
 
 # A variable for this boot only, gone when the machine restarts:
 # nvram-volatile.boot-args=-v
