@@ -57,6 +57,7 @@ ResetSystemFunction gOriginalReset;
 UINT32 gBootCount;
 // Boot services have ended: a reset now is the kernel's, not the loader's.
 bool gBootServicesEnded;
+EFI_EVENT gBootServicesEndEvent;
 GetMemoryMapFunction gOriginalGetMemoryMap;
 
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
@@ -220,8 +221,8 @@ void WatchDiskAndReset(bool timeReads) {
     gBS->GetMemoryMap = TimedGetMemoryMap;
     SealTable(&gBS->Hdr);
   }
-  EFI_EVENT event = nullptr;
-  gBS->CreateEvent(EVT_SIGNAL_EXIT_BOOT_SERVICES, TPL_NOTIFY, NoteBootServicesEnd, nullptr, &event);
+  gBS->CreateEvent(EVT_SIGNAL_EXIT_BOOT_SERVICES, TPL_NOTIFY, NoteBootServicesEnd, nullptr,
+                   &gBootServicesEndEvent);
   gOriginalReset = gRT->ResetSystem;
   gRT->ResetSystem = WatchedResetSystem;
   SealTable(&gRT->Hdr);
@@ -240,6 +241,11 @@ void UnwatchDiskAndReset() {
   if (gOriginalReset != nullptr) {
     gRT->ResetSystem = gOriginalReset;
     SealTable(&gRT->Hdr);
+  }
+  // Its function lies in the image that the firmware frees.
+  if (gBootServicesEndEvent != nullptr) {
+    gBS->CloseEvent(gBootServicesEndEvent);
+    gBootServicesEndEvent = nullptr;
   }
 }
 
