@@ -13,6 +13,31 @@ extern EFI_HANDLE gImageHandle;
 
 // Boot services slots that efi.h types as `void *`.
 typedef EFI_STATUS(EFIAPI *EFI_IMAGE_UNLOAD)(EFI_HANDLE ImageHandle);
+typedef EFI_STATUS(EFIAPI *EFI_REINSTALL_PROTOCOL_INTERFACE)(EFI_HANDLE Handle, const EFI_GUID *Protocol,
+                                                             VOID *OldInterface, VOID *NewInterface);
+
+// Where a protocol that the platform serves goes: the handle that carries
+// the firmware's own interface (or the handle to install on; null: a new
+// one) and that interface, null when the firmware has none.
+struct ProtocolSlot {
+  EFI_HANDLE handle;
+  void *firmware;
+};
+
+// Hears of each protocol that the firmware has of its own, by name, and
+// whether the platform's replaces it; null: no one.
+extern void (*gOnFirmwareProtocol)(const char *name, bool replaced);
+
+// Looks for the firmware's own `guid` (the first handle that has it) and
+// fills in `slot`. True when the platform is to put its own there: always
+// when the firmware has none, else only with `replace`, in which case it
+// takes the firmware's place on the same handle rather than standing beside
+// it where nobody looks.
+bool ProtocolClaim(const EFI_GUID &guid, const char *name, bool replace, ProtocolSlot *slot);
+
+// Puts `ours` into the slot: in place of the firmware's interface, or on
+// `slot.handle` (a new handle when null).
+EFI_STATUS ProtocolPut(ProtocolSlot slot, const EFI_GUID &guid, void *ours);
 
 // A file path media node: the header, then the UCS-2 path with its NUL.
 struct FILEPATH_DEVICE_PATH {

@@ -832,6 +832,32 @@ def watch(scenario, workdir, served, png=False):
     return on_line, shots, trouble, pending
 
 
+def hold_keys(scenario):
+    """QEMU's extra arguments and qemuboot's on_tick for the scenario's held
+    keys, and the on_line that follows the platform's start and its reading
+    of the keyboard; all empty or None without held keys."""
+    if not scenario.held:
+        return (), None, None
+    events = [{"type": "key", "data": {"down": True, "key": {"type": "qcode", "data": key}}}
+              for key in scenario.held]  # fmt: skip
+    state = {"resumed": False, "started": False, "read": False}
+
+    def on_tick(qmp):
+        if not state["resumed"]:
+            qmp.execute("cont")  # input events are refused while the machine is paused
+            qmp.execute("input-send-event", events=events)
+            state["resumed"] = True
+        elif state["started"] and not state["read"]:
+            qmp.execute("input-send-event", events=events)
+
+    def on_line(line):
+        state["started"] |= line.startswith("platform: started")
+        state["read"] |= line.startswith("platform: keys:")
+
+    usb = ("-device", "qemu-xhci", "-device", "usb-kbd") if scenario.usb_keyboard else ()
+    return ("-S", *usb), on_tick, on_line
+
+
 def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
     start = time.monotonic()
     workdir = Path(tempfile.mkdtemp(prefix=f"nimb-qemu-{scenario.name}-"))
@@ -842,8 +868,17 @@ def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
         raise
     limit, screen = scenario.timeout, scenario.screen
     on_line, shots, trouble, pending = watch(scenario, workdir, disk, png=echo)
-    returncode, log, error = boot(disk, workdir, limit, on_line, network=scenario.network,
-                                  reboot=scenario.boots > 1, qmp=bool(screen or scenario.actions), echo=echo)
+    extra, on_tick, keys_on_line = hold_keys(scenario)
+    if keys_on_line is not None:
+        watch_line = on_line
+
+        def on_line(line, qmp):
+            keys_on_line(line)
+            return watch_line(line, qmp)
+
+    returncode, log, error = boot(disk, workdir, limit, on_line, network=scenario.network, reboot=scenario.boots > 1,
+                                  qmp=bool(screen or scenario.actions or scenario.held), echo=echo, extra=extra,
+                                  on_tick=on_tick)
     (workdir / "serial.txt").write_text(log)
     outcome = decode_exit(returncode, read_exit_codes())
     problems = ([f"timed out after {limit} s"] if returncode is None else []) + ([f"qemu: {error}"] if error else [])

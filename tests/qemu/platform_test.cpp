@@ -1,11 +1,13 @@
 // Host tests of the platform layer's logic: its configuration file, text
-// conversion, exit codes, memory count, console modes and Data Hub. The
-// protocols that only pass the configuration on (held keys, device
-// properties, network boot answers) are checked end to end by the QEMU
-// scenarios, whose kernel reports what it got.
+// conversion, exit codes, memory count, console modes, screen facts, held
+// keys from the keyboard, the firmware's own protocols and the Data Hub.
+// The protocols that only pass the configuration on (device properties,
+// network boot answers) are checked end to end by the QEMU scenarios, whose
+// kernel reports what it got.
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <iomanip>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -15,7 +17,10 @@
 #include "../../platform/data_hub.h"
 #include "../../platform/exitcodes.h"
 #include "../../platform/format.h"
+#include "../../platform/graphics.h"
+#include "../../platform/key_state.h"
 #include "../../platform/memory.h"
+#include "hostfw/hostfw.h"
 
 namespace nimb::platform {
 namespace {
@@ -97,8 +102,14 @@ std::string Summary(const std::string &text) {
   for (UINT32 i = 0; i < config.keys.count; i++) {
     out << "key=" << std::hex << config.keys.keys[i] << std::dec << ' ';
   }
+  if (config.keysGiven && config.keys.modifiers == 0 && config.keys.count == 0) {
+    out << "nothing-held ";  // the keyboard is not read
+  }
   if (config.keysIgnored) {
     out << "ignored ";
+  }
+  if (config.replaceFirmwareProtocols) {
+    out << "replace ";
   }
   AddEntries(out, "nvram.", config.nvram);
   AddEntries(out, "datahub.", config.dataHub);
@@ -144,7 +155,7 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"keys=a+z+1+9+0+0x28+0xE0", "key=7004 key=701d key=701e key=7026 key=7027 key=7028 key=70e0 errors=0"},
       {"keys=a+b+c+d+e+f+g+h",
        "key=7004 key=7005 key=7006 key=7007 key=7008 key=7009 key=700a key=700b errors=0"},
-      {"keys=gui+v\nkeys=", "errors=0"},
+      {"keys=gui+v\nkeys=", "nothing-held errors=0"},
       {"keys=shift+lshift\nkeys-ignored=1", "modifiers=2 ignored errors=0"},
       {"keys-ignored=1\nkeys-ignored=0", "errors=0"},
       {"keys=shift\nkeys=a+b+c+d+e+f+g+h+i", "modifiers=2 errors=1 bad@2:keys=a+b+c+d+e+f+g+h+i"},
@@ -153,6 +164,9 @@ TEST(PlatformConfig, ParsesEveryKey) {
        "bad@6:keys=ab bad@7:keys=leftshift"},
       {"keys=0x\nkeys=0x00\nkeys=0x100\nkeys=0x2g\nkeys=gui + v",
        "errors=5 bad@1:keys=0x bad@2:keys=0x00 bad@3:keys=0x100 bad@4:keys=0x2g bad@5:keys=gui + v"},
+      {"firmware-protocols=replace", "replace errors=0"},
+      {"firmware-protocols=replace\nfirmware-protocols=keep\nfirmware-protocols=Replace",
+       "errors=1 bad@3:firmware-protocols=Replace"},
       {"keys-ignored=2\nkeys-ignored=01\nkeys-ignored=",
        "errors=3 bad@1:keys-ignored=2 bad@2:keys-ignored=01 bad@3:keys-ignored="},
       // Variables and platform records.
@@ -478,6 +492,238 @@ TEST(PlatformDataHub, HoldsTheConfiguredRecordsThenOneOfItsOwn) {
   DataHubInit(&empty, nullptr, 0);
   count = 0;
   EXPECT_EQ(empty.protocol.GetNextDataRecord(&empty.protocol, &count, nullptr, &record), EFI_NOT_FOUND);
+}
+
+// --- screen facts ------------------------------------------------------------------------
+
+TEST(PlatformGraphics, FrameBufferOnlyForBgrxBelow4GiB) {
+  constexpr UINT64 k4G = 0x100000000ULL, kWhole = 1024 * 4 * 768;
+  struct Row {
+    const char *name;
+    EFI_GRAPHICS_PIXEL_FORMAT format;
+    EFI_PIXEL_BITMASK masks;
+    UINT64 base, size;
+    UINT32 scanLine;
+    bool told;
+    UINT32 depth;  // as UGA reports it
+  };
+  const std::vector<Row> rows = {
+      {"bgrx low", PixelBlueGreenRedReserved8BitPerColor, {}, 0x80000000, kWhole, 1024, true, 32},
+      {"bgrx up to 4 GiB", PixelBlueGreenRedReserved8BitPerColor, {}, k4G - kWhole, kWhole, 1024, true, 32},
+      {"padded rows", PixelBlueGreenRedReserved8BitPerColor, {}, 0xC0000000, 1088 * 4 * 768, 1088, true, 32},
+      {"across 4 GiB",
+       PixelBlueGreenRedReserved8BitPerColor,
+       {},
+       k4G - kWhole + 0x1000,
+       kWhole,
+       1024,
+       false,
+       32},
+      {"above 4 GiB", PixelBlueGreenRedReserved8BitPerColor, {}, 0x800000000, kWhole, 1024, false, 32},
+      {"no base", PixelBlueGreenRedReserved8BitPerColor, {}, 0, kWhole, 1024, false, 32},
+      {"rows beyond the buffer",
+       PixelBlueGreenRedReserved8BitPerColor,
+       {},
+       0x80000000,
+       kWhole - 4,
+       1024,
+       false,
+       32},
+      {"rows narrower than the screen",
+       PixelBlueGreenRedReserved8BitPerColor,
+       {},
+       0x80000000,
+       kWhole,
+       1000,
+       false,
+       32},
+      {"rgbx", PixelRedGreenBlueReserved8BitPerColor, {}, 0x80000000, kWhole, 1024, false, 32},
+      {"bit mask 5-6-5", PixelBitMask, {0xF800, 0x07E0, 0x001F, 0}, 0x80000000, kWhole, 1024, false, 16},
+      {"bit mask 8-8-8", PixelBitMask, {0xFF0000, 0xFF00, 0xFF, 0}, 0x80000000, kWhole, 1024, false, 24},
+      {"blt only", PixelBltOnly, {}, 0, 0, 1024, false, 0},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    EFI_GRAPHICS_OUTPUT_MODE_INFORMATION info = {0, 1024, 768, row.format, row.masks, row.scanLine};
+    EFI_GRAPHICS_OUTPUT_PROTOCOL_MODE mode = {1, 0, &info, sizeof(info), row.base, row.size};
+    EFI_GRAPHICS_OUTPUT_PROTOCOL graphics = {};
+    graphics.Mode = &mode;
+    PlatformUgaDraw uga;
+    PlatformFrameBufferInfo frameBuffer;
+    GraphicsInit(&uga, &frameBuffer, &graphics);
+    UINT32 facts[6] = {7, 7, 7, 7, 7, 7};  // size, row bytes, width, height, depth, refresh
+    EFI_PHYSICAL_ADDRESS base = 7;
+    const EFI_STATUS status = frameBuffer.protocol.GetInfo(&frameBuffer.protocol, &base, &facts[0], &facts[1],
+                                                           &facts[2], &facts[3], &facts[4]);
+    if (row.told) {
+      EXPECT_EQ(status, EFI_SUCCESS);
+      EXPECT_EQ(base, row.base);
+      EXPECT_EQ(std::vector<UINT32>(facts, facts + 5),
+                (std::vector<UINT32>{UINT32(row.size), row.scanLine * 4, 1024, 768, 32}));
+    } else {
+      EXPECT_EQ(status, EFI_UNSUPPORTED);
+      EXPECT_EQ(base, 7u) << "nothing written";
+      EXPECT_EQ(std::vector<UINT32>(facts, facts + 5), std::vector<UINT32>(5, 7));
+    }
+    ASSERT_EQ(uga.protocol.GetMode(&uga.protocol, &facts[2], &facts[3], &facts[4], &facts[5]), EFI_SUCCESS);
+    EXPECT_EQ(facts[4], row.depth);
+  }
+}
+
+// --- held keys from the keyboard ---------------------------------------------------------
+
+// A keyboard that gives its readings in turn (the last one over and over
+// with `endless`, else EFI_NOT_READY without a shift state) and records the
+// toggle states set.
+struct Keyboard {
+  EFI_SIMPLE_TEXT_INPUT_EX_PROTOCOL protocol = {};
+  std::vector<std::pair<EFI_STATUS, EFI_KEY_DATA>> readings;
+  bool endless = false;
+  EFI_STATUS setState = EFI_SUCCESS;
+  size_t calls = 0;
+  std::vector<int> states;
+};
+Keyboard *gKeyboard;
+
+EFI_STATUS EFIAPI FakeReadKeyStrokeEx(EFI_SIMPLE_TEXT_INPUT_EX_PROTOCOL *, EFI_KEY_DATA *data) {
+  Keyboard &k = *gKeyboard;
+  const size_t at = k.endless && k.calls >= k.readings.size() ? k.readings.size() - 1 : k.calls;
+  k.calls++;
+  *data = {};
+  if (at >= k.readings.size()) {
+    return EFI_NOT_READY;
+  }
+  *data = k.readings[at].second;
+  return k.readings[at].first;
+}
+
+EFI_STATUS EFIAPI FakeSetState(EFI_SIMPLE_TEXT_INPUT_EX_PROTOCOL *, EFI_KEY_TOGGLE_STATE *state) {
+  gKeyboard->states.push_back(*state);
+  return gKeyboard->setState;
+}
+
+TEST(PlatformKeys, HeldKeysFromTheFirmwaresKeyboard) {
+  constexpr UINT32 kValid = EFI_SHIFT_STATE_VALID;
+  auto stroke = [](UINT16 scan, CHAR16 c, UINT32 shift, UINT8 toggle = 0) {
+    return std::make_pair(EFI_SUCCESS, EFI_KEY_DATA{{scan, c}, {shift, toggle}});
+  };
+  auto now = [](UINT32 shift, UINT8 toggle = 0) {
+    return std::make_pair(EFI_NOT_READY, EFI_KEY_DATA{{0, 0}, {shift, toggle}});
+  };
+  struct Row {
+    const char *name;
+    std::vector<std::pair<EFI_STATUS, EFI_KEY_DATA>> readings;
+    std::string held;  // modifiers, then keys
+    std::vector<int> states;
+    bool endless = false;
+    EFI_STATUS setState = EFI_SUCCESS;
+  };
+  const std::vector<Row> rows = {
+      {"shift alone, a partial keystroke; Num Lock kept",
+       {now(kValid, 0x82), stroke(0, 0, kValid | EFI_LEFT_SHIFT_PRESSED)},
+       "02",
+       {0xC2, 0x82}},
+      {"shift alone, only in the state", {now(kValid | EFI_RIGHT_SHIFT_PRESSED)}, "20", {0xC0, 0x80}},
+      {"GUI-V repeated",
+       {stroke(0, 'v', kValid | EFI_LEFT_LOGO_PRESSED), stroke(0, 'v', kValid | EFI_LEFT_LOGO_PRESSED)},
+       "08 7019",
+       {0xC0, 0x80}},
+      {"released: the latest state wins",
+       {stroke(0, 0, kValid | EFI_LEFT_SHIFT_PRESSED), now(kValid)},
+       "00",
+       {0xC0, 0x80}},
+      {"no valid state changes nothing",
+       {stroke(0, 'S', EFI_LEFT_LOGO_PRESSED), stroke(0, 0x13, 0)},
+       "00 7016",
+       {0xC0, 0x80}},
+      {"all modifiers", {now(kValid | 0xFF)}, "ff", {0xC0, 0x80}},
+      {"characters, control letters, scan codes",
+       {stroke(0, '!', 0), stroke(0, '\r', 0), stroke(0, 0x16, kValid | EFI_RIGHT_CONTROL_PRESSED),
+        stroke(0, 0x7F, 0), stroke(0x17, 0, 0), stroke(0x01, 0, 0), stroke(0x16, 0, 0), stroke(0x18, 0, 0),
+        stroke(0, '/', 0)},
+       "10 701e 7028 7019 7029 7052 7045 7038",
+       {0xC0, 0x80}},
+      {"a key that never runs dry, partial keys refused",
+       {stroke(0, 'a', 0)},
+       "00 7004",
+       {0xC0},
+       true,
+       EFI_UNSUPPORTED},
+  };
+  for (const Row &row : rows) {
+    SCOPED_TRACE(row.name);
+    hostfw::Firmware firmware;
+    gST = firmware.SystemTable();
+    gBS = firmware.BootServices();
+    Keyboard keyboard;
+    gKeyboard = &keyboard;
+    keyboard.protocol.ReadKeyStrokeEx = FakeReadKeyStrokeEx;
+    keyboard.protocol.SetState = FakeSetState;
+    keyboard.readings = row.readings;
+    keyboard.endless = row.endless;
+    keyboard.setState = row.setState;
+    gST->ConsoleInHandle = firmware.NewHandle();
+    firmware.InstallProtocol(gST->ConsoleInHandle, gEfiSimpleTextInputExProtocolGuid, &keyboard.protocol);
+    HeldKeys held = {};
+    const KeySample sample = KeyStateSample(&held, 50000);
+    std::ostringstream out;
+    out << std::hex << std::setfill('0') << std::setw(2) << held.modifiers;
+    for (UINT32 i = 0; i < held.count; i++) {
+      out << ' ' << held.keys[i];
+    }
+    EXPECT_EQ(out.str(), row.held);
+    EXPECT_EQ(keyboard.states, row.states);
+    EXPECT_EQ(sample.exposeState, row.setState);
+    EXPECT_LE(keyboard.calls, 1 + 6 * 4 * kMaxHeldKeys) << "a bounded number of readings in 50 ms";
+  }
+  hostfw::Firmware none;
+  gST = none.SystemTable();
+  gBS = none.BootServices();
+  HeldKeys held = {};
+  EXPECT_EQ(KeyStateSample(&held, 50000).status, EFI_UNSUPPORTED) << "no keyboard, no wait";
+}
+
+// --- the firmware's own protocols ----------------------------------------------------------
+
+TEST(PlatformProtocols, TheFirmwaresOwnIsKeptOrReplacedInPlace) {
+  static std::string heard;
+  gOnFirmwareProtocol = [](const char *name, bool replaced) {
+    heard += std::string(name) + (replaced ? " replaced;" : " kept;");
+  };
+  for (const bool replace : {false, true}) {
+    SCOPED_TRACE(replace);
+    hostfw::Firmware firmware;
+    gST = firmware.SystemTable();
+    gBS = firmware.BootServices();
+    heard.clear();
+    // The firmware has a key state protocol of its own, no boot policy.
+    NIMB_KEY_STATE_PROTOCOL theirs = {};
+    const EFI_HANDLE handle = firmware.NewHandle();
+    firmware.InstallProtocol(handle, gNimbKeyStateProtocolGuid, &theirs);
+    PlatformConfig config;
+    ConfigSetDefaults(&config);
+    config.keysGiven = true;
+    config.replaceFirmwareProtocols = replace;
+    PlatformKeyState state = {};
+    PlatformBootPolicy policy = {};
+    KeySample sample;
+    ASSERT_EQ(KeyProtocolsInstall(&state, &policy, config, &sample), EFI_SUCCESS);
+    EXPECT_EQ(heard, replace ? "key state replaced;" : "key state kept;");
+    for (const auto &[guid, wanted] :
+         {std::make_pair(gNimbKeyStateProtocolGuid, replace ? (void *)&state.protocol : &theirs),
+          std::make_pair(gNimbBootPolicyProtocolGuid, (void *)&policy.protocol)}) {
+      UINTN count = 0;
+      EFI_HANDLE *handles = nullptr;
+      ASSERT_EQ(gBS->LocateHandleBuffer(ByProtocol, &guid, nullptr, &count, &handles), EFI_SUCCESS);
+      EXPECT_EQ(count, 1u) << "never a second one beside the firmware's";
+      void *found = nullptr;
+      EXPECT_EQ(gBS->LocateProtocol(&guid, nullptr, &found), EFI_SUCCESS);
+      EXPECT_EQ(found, wanted);
+      EXPECT_EQ(handles[0] == handle, wanted != &policy.protocol) << "the firmware's handle keeps it";
+      gBS->FreePool(handles);
+    }
+  }
+  gOnFirmwareProtocol = nullptr;
 }
 
 }  // namespace

@@ -241,12 +241,15 @@ class Qmp:
         self.sock.close()
 
 
-def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=()):
+def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=(),
+         on_tick=None):
     """Runs QEMU on `disk` (with `network`: the directory served over TFTP)
     until it ends, for at most `timeout` seconds. `on_line(line, qmp)` hears
     each cleaned serial line as it comes, with a Qmp connection when `qmp` is
     set (else None), and stops the machine by returning True; with `echo`,
-    each line is printed. Returns QEMU's exit status (None: timed out or
+    each line is printed. `on_tick(qmp)` is called once right after the QMP
+    connection is made and then every 50 ms (for a machine started paused
+    with -S in `extra`, the first call resumes it). Returns QEMU's exit status (None: timed out or
     stopped), the cleaned serial log and what went wrong over QMP or in
     `on_line` (its OSError, ValueError, RuntimeError), or None."""
     workdir = Path(workdir)
@@ -262,6 +265,8 @@ def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=
             connection = Qmp(qmp_socket, deadline, machine) if qmp else None
             follower = SerialFollower(serial_log)
             while True:
+                if on_tick is not None:
+                    on_tick(connection)
                 running = machine.poll() is None
                 for line in follower.lines(final=not running):
                     if echo and line.strip():
