@@ -39,7 +39,8 @@ void BootPolicyInit(PlatformBootPolicy *policy, bool keysIgnored);
 // Escape, Backspace, Tab, Space, the US punctuation, arrows, the editing
 // keys, F1 to F12) is added once, in the order first seen, up to
 // kMaxHeldKeys. A reading with neither key nor character (a partial
-// keystroke) adds only its shift state.
+// keystroke) adds only its shift state. A Shift that the firmware folds into
+// a character ('V' for Shift-V, no shift bit) is not guessed back.
 void HeldKeysAdd(HeldKeys *held, const EFI_KEY_DATA &reading, bool stroke);
 
 // How long the keyboard is read: long enough for a keyboard's repeat of a
