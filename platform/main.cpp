@@ -467,10 +467,12 @@ void InstallProtocols(const PlatformConfig &config) {
     SerialPrintf("platform: keyboard: %s, partial keys %s, %u keystrokes\n", StatusName(sample.status),
                  StatusName(sample.exposeState), static_cast<UINT64>(sample.strokes));
   }
-  SerialPrintf("platform: keys: modifiers 0x%x, %u keys, ignored %u, from %s\n",
-               static_cast<UINT64>(gKeyState.held.modifiers), static_cast<UINT64>(gKeyState.held.count),
-               static_cast<UINT64>(config.keysIgnored ? 1 : 0),
-               config.keysGiven ? "platform.cfg" : "keyboard");
+  if (gKeyState.protocol.ReadKeyState != nullptr) {  // not when the firmware's own is kept
+    SerialPrintf("platform: keys: modifiers 0x%x, %u keys, ignored %u, from %s\n",
+                 static_cast<UINT64>(gKeyState.held.modifiers), static_cast<UINT64>(gKeyState.held.count),
+                 static_cast<UINT64>(config.keysIgnored ? 1 : 0),
+                 config.keysGiven ? "platform.cfg" : "keyboard");
+  }
   if (ProtocolClaim(gEfiDataHubProtocolGuid, "Data Hub", config.replaceFirmwareProtocols, &slot)) {
     status = DataHubInstall(&gDataHub, config.dataHub, slot);
     if (EFI_ERROR(status)) {
