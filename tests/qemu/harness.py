@@ -851,7 +851,8 @@ def hold_keys(scenario):
             qmp.execute("input-send-event", events=events)
 
     def on_line(line):
-        state["started"] |= line.startswith("platform: started")
+        # The firmware's boot manager runs once its keyboard drivers have started.
+        state["started"] |= "BdsDxe:" in line or line.startswith("platform: started")
         state["read"] |= line.startswith("platform: keys:")
 
     usb = ("-device", "qemu-xhci", "-device", "usb-kbd") if scenario.usb_keyboard else ()

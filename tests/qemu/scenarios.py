@@ -350,7 +350,9 @@ class Scenario:
     # Keys held down on the machine's keyboard from power-on (QEMU key
     # codes: "shift", "meta_l", "v", ...), never let go: QMP sends their
     # key-down events as the machine starts, and again every 50 ms from the
-    # platform's start until it has read the keyboard, as a real keyboard
+    # firmware's boot manager on until the platform has read the keyboard
+    # (not earlier: with key events streaming in while OVMF started, its
+    # PS/2 keyboard driver saw neither of two held keys), as a real keyboard
     # repeats a held key (the firmware's keyboard driver resets the keyboard
     # and forgets what was down before). The PS/2 keyboard of the machine,
     # or with `usb_keyboard` a USB one.
