@@ -210,6 +210,23 @@ bool ApplyFirmwareProtocols(PlatformConfig *config, const char *, char *value) {
   return true;
 }
 
+bool ApplyDebugExit(PlatformConfig *config, const char *, char *value) {
+  if (strcmp(value, "auto") == 0) {
+    config->debugExit = kDebugExitAuto;
+    return true;
+  }
+  bool on = false;
+  if (!ApplyFlag(&on, value)) {
+    return false;
+  }
+  config->debugExit = on ? kDebugExitOn : kDebugExitOff;
+  return true;
+}
+
+bool ApplyWaitKey(PlatformConfig *config, const char *, char *value) {
+  return ApplyFlag(&config->waitKey, value);
+}
+
 bool ApplyTimePxe(PlatformConfig *config, const char *, char *value) {
   return ApplyFlag(&config->timePxeDownload, value);
 }
@@ -331,6 +348,8 @@ constexpr ConfigKey kConfigKeys[] = {
     {"options", ApplyOptions},
     {"console", ApplyConsole},
     {"hold", ApplyHold},
+    {"debug-exit", ApplyDebugExit},
+    {"wait-key", ApplyWaitKey},
     {"net.time-pxe", ApplyTimePxe},
     {"keys", ApplyKeys},
     {"keys-ignored", ApplyKeysIgnored},
@@ -460,6 +479,8 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->options = nullptr;
   config->consoleMode = EfiConsoleControlScreenGraphics;
   config->holdSeconds = 0;
+  config->debugExit = kDebugExitAuto;
+  config->waitKey = false;
   config->timePxeDownload = false;
   config->keys = {};
   config->keysGiven = false;

@@ -12,8 +12,15 @@
 //   loader=<path>          the loader on this volume; \EFI\BOOT\nimbboot.efi
 //   options=<text>         the loader's load options; none when absent
 //   console=text|graphics  the console mode the loader finds; graphics
-//   hold=<seconds>         wait between the report and the power-off, 0 to
-//                          3600; 0
+//   hold=<seconds>         wait between the report and the end of the run
+//                          (the screen as the loader left it), 0 to 3600; 0
+//   debug-exit=auto|0|1    1: end the run through QEMU's debug-exit device
+//                          (port 0xF4) with a code of exitcodes.h; 0: never
+//                          write the port; auto: on a machine that SMBIOS
+//                          names QEMU. Without the device the run goes on as
+//                          with 0; auto
+//   wait-key=0|1           1: after the outcome is on the screen, wait for a
+//                          key before the end; 0
 //   net.time-pxe=0|1       on a network boot, 1 times the firmware's own
 //                          download of the boot file before the loader
 //                          starts, then fetches it over the network's own
@@ -133,8 +140,12 @@ struct PlatformConfig {
   // The console mode that the loader finds when it starts; kConsoleNone:
   // no console control at all, as the firmware has none of its own.
   EFI_CONSOLE_CONTROL_SCREEN_MODE consoleMode;
-  // Seconds to wait between the report and the power-off.
+  // Seconds to wait between the report and the end of the run.
   UINT32 holdSeconds;
+  // Whether the run ends through the debug-exit device: kDebugExit...
+  UINT8 debugExit;
+  // Wait for a key once the outcome is on the screen.
+  bool waitKey;
   // On a network boot: time the firmware's own download of the boot file
   // before the loader starts (net.time-pxe=1).
   bool timePxeDownload;
@@ -160,6 +171,9 @@ constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";
 // On a network boot: the loader's name on the TFTP server.
 constexpr const char *kDefaultNetLoaderName = "nimbboot.efi";
 constexpr UINT32 kMaxHoldSeconds = 3600;
+constexpr UINT8 kDebugExitOff = 0;
+constexpr UINT8 kDebugExitOn = 1;
+constexpr UINT8 kDebugExitAuto = 2;  // when the machine is QEMU
 
 enum ConfigProblem : UINT32 {
   kConfigUnknownKey,  // reported, not an error

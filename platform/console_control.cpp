@@ -170,6 +170,11 @@ EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_P
   console->onSetMode = nullptr;
   console->hiddenText = nullptr;
   InitScreenText(console);
+  // Without graphics output the screen can only be text: the loader then
+  // finds text and boots in text.
+  if (graphics == nullptr && mode == EfiConsoleControlScreenGraphics) {
+    mode = EfiConsoleControlScreenText;
+  }
   return Enter(console, mode);
 }
 

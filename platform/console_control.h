@@ -35,8 +35,8 @@ struct PlatformConsole {
 };
 
 // Fills in the protocol over `text` and `graphics` and puts the screen into
-// `mode`, clearing it even if the mode is already the one set. No one hears
-// of SetMode yet.
+// `mode`, clearing it even if the mode is already the one set; text instead
+// of graphics when there is no graphics output. No one hears of SetMode yet.
 EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text,
                               EFI_GRAPHICS_OUTPUT_PROTOCOL *graphics, EFI_CONSOLE_CONTROL_SCREEN_MODE mode);
 

@@ -3,6 +3,7 @@
 #pragma once
 
 #include "efi/efi.h"
+#include "efi/textin.h"
 
 namespace nimb::platform {
 
@@ -38,6 +39,19 @@ bool ProtocolClaim(const EFI_GUID &guid, const char *name, bool replace, Protoco
 // Puts `ours` into the slot: in place of the firmware's interface, or on
 // `slot.handle` (a new handle when null).
 EFI_STATUS ProtocolPut(ProtocolSlot slot, const EFI_GUID &guid, void *ours);
+typedef EFI_STATUS(EFIAPI *EFI_WAIT_FOR_EVENT)(UINTN NumberOfEvents, EFI_EVENT *Event, UINTN *Index);
+typedef EFI_STATUS(EFIAPI *EFI_PROTOCOLS_PER_HANDLE)(EFI_HANDLE Handle, EFI_GUID ***ProtocolBuffer,
+                                                     UINTN *ProtocolBufferCount);
+typedef EFI_STATUS(EFIAPI *EFI_UNINSTALL_PROTOCOL_INTERFACE)(EFI_HANDLE Handle, const EFI_GUID *Protocol,
+                                                             VOID *Interface);
+
+// The firmware's keyboard, as the system table's ConIn (its keys as the
+// extended text input has them).
+struct EFI_SIMPLE_TEXT_INPUT_PROTOCOL {
+  EFI_STATUS(EFIAPI *Reset)(EFI_SIMPLE_TEXT_INPUT_PROTOCOL *This, BOOLEAN ExtendedVerification);
+  EFI_STATUS(EFIAPI *ReadKeyStroke)(EFI_SIMPLE_TEXT_INPUT_PROTOCOL *This, EFI_INPUT_KEY *Key);
+  EFI_EVENT WaitForKey;
+};
 
 // A file path media node: the header, then the UCS-2 path with its NUL.
 struct FILEPATH_DEVICE_PATH {

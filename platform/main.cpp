@@ -1,7 +1,9 @@
 // The platform layer: the program that the firmware starts from
 // \EFI\BOOT\BOOTX64.EFI. It gives the firmware what the loader expects of
 // the machines it was made for, starts the loader, reports how the loader
-// came back and powers the machine off with an exit code that tells it.
+// came back, shows the outcome on the screen and ends the run: through
+// QEMU's debug-exit device with an exit code that tells the outcome, or back
+// to the firmware with the loader's status.
 #include <stdarg.h>
 
 #include "config.h"
@@ -9,12 +11,14 @@
 #include "data_hub.h"
 #include "device_properties.h"
 #include "efi/vendor.h"
+#include "ending.h"
 #include "exitcodes.h"
 #include "file_times.h"
 #include "firmware.h"
 #include "format.h"
 #include "graphics.h"
 #include "key_state.h"
+#include "machine.h"
 #include "memory.h"
 #include "net_boot.h"
 #include "net_boot_info.h"
@@ -42,25 +46,75 @@ PlatformNetBoot gNetBoot;
 MemoryMeter gMeter;
 FileTimeTable gTimes;
 
-// The debug-exit device ends the machine with the code; without one the
-// write goes nowhere and the firmware powers off instead.
-[[noreturn]] void PowerOff(UINT8 code) {
+// How the run is to end, as far as it is known: by the machine alone until
+// the configuration is read.
+struct Ending {
+  bool debugExit;
+  bool waitKey;
+  // The device whose file system serves exact times; null: none.
+  EFI_HANDLE timedDevice;
+  // Once the loader came back, its status, which the firmware gets back
+  // whatever fails after it.
+  bool loaderReturned;
+  EFI_STATUS loaderStatus;
+};
+Ending gEnding;
+
+void SetEnding(const PlatformConfig &config) {
+  gEnding.debugExit = config.debugExit == kDebugExitAuto ? MachineIsQemu() : config.debugExit == kDebugExitOn;
+  gEnding.waitKey = config.waitKey;
+  SerialPrintf("platform: debug-exit %s\n", gEnding.debugExit ? "in use" : "not used");
+}
+
+// The outcome goes on a text screen; the loader's own mode changes alone
+// show in the log.
+void ScreenToText() {
+  if (gConsole.protocol.SetMode != nullptr && gConsole.mode != EfiConsoleControlScreenText) {
+    gConsole.onSetMode = nullptr;
+    gConsole.protocol.SetMode(&gConsole.protocol, EfiConsoleControlScreenText);
+  }
+}
+
+// Shows `outcome` on the screen, waits for a key when configured, then ends
+// QEMU through the debug-exit device with `code`, when it is in use. Without
+// one the write goes nowhere, and the platform goes back to the firmware
+// with `status`, having put back and removed all that the firmware would
+// otherwise call in the freed image.
+[[noreturn]] void End(EFI_STATUS status, UINT8 code, const char *outcome) {
+  ScreenToText();
+  ShowOnScreen(outcome);
+  if (gEnding.waitKey) {
+    ShowOnScreen("Press a key to go on.");
+    SerialPrintf("platform: waiting for a key\n");
+    SerialPrintf("platform: %s\n", WaitForKeyPress() ? "key pressed" : "no keyboard to wait for");
+  }
   SerialPrintf("platform: exit code 0x%x\n", static_cast<UINT64>(code));
-  PortWriteByte(kDebugExitPort, code);
-  gRT->ResetSystem(EfiResetShutdown, EFI_SUCCESS, 0, nullptr);
+  if (gEnding.debugExit) {
+    PortWriteByte(kDebugExitPort, code);
+  }
+  UnwatchDiskAndReset();
+  if (gEnding.timedDevice != nullptr) {
+    FileTimesUninstall(gEnding.timedDevice);
+  }
+  const UINTN removed = UninstallOwnInterfaces();
+  SerialPrintf("platform: %u interfaces removed; back to the firmware with %s\n",
+               static_cast<UINT64>(removed), StatusName(status));
+  gBS->Exit(gImageHandle, status, 0, nullptr);
   for (;;) {
     __asm__ volatile("hlt");
   }
 }
 
 [[noreturn]] void Fail(UINT8 code, const char *format, ...) {
-  SerialPrintf("platform: error: ");
+  char message[160];
   va_list arguments;
   va_start(arguments, format);
-  SerialPrintv(format, arguments);
+  FormatToBufferv(message, sizeof(message), format, arguments);
   va_end(arguments);
-  SerialPrintf("\n");
-  PowerOff(code);
+  SerialPrintf("platform: error: %s\n", message);
+  char outcome[192];
+  FormatToBuffer(outcome, sizeof(outcome), "Platform error: %s", message);
+  End(gEnding.loaderReturned ? gEnding.loaderStatus : EFI_LOAD_ERROR, code, outcome);
 }
 
 void *AllocateOrFail(UINTN size, const char *what) {
@@ -101,6 +155,7 @@ void ParseConfig(char *text, UINTN size, PlatformConfig *config) {
   if (ConfigParse(text, size, config, ReportConfigIssue, nullptr) != 0) {
     Fail(kExitConfigInvalid, "%s has errors", kConfigName);
   }
+  SetEnding(*config);
 }
 
 // The whole of a file of the platform's volume, with room for a NUL behind
@@ -139,6 +194,7 @@ void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
   char *text = ReadWholeFile(root, kConfigPath, kConfigName, kExitConfigInvalid, &size);
   if (text == nullptr) {
     SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    SetEnding(*config);
     return;
   }
   ParseConfig(text, size, config);
@@ -165,6 +221,7 @@ void ServeExactTimes(EFI_FILE_PROTOCOL *root, EFI_HANDLE device) {
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot serve exact file times (%s)", StatusName(status));
   }
+  gEnding.timedDevice = device;
   SerialPrintf("platform: exact times of %u paths\n", static_cast<UINT64>(gTimes.count));
 }
 
@@ -451,6 +508,9 @@ void InstallProtocols(const PlatformConfig &config) {
     }
     gConsole.onSetMode = ReportSetMode;
     gConsole.hiddenText = config.timeText ? TimedWriteText : SerialWriteText;
+    if (gConsole.mode != config.consoleMode) {
+      SerialPrintf("platform: no graphics output: console %s\n", ModeName(gConsole.mode));
+    }
   }
   // Drawing for the loader's boot screen; a firmware without graphics output
   // boots without pictures.
@@ -644,6 +704,7 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
   status = NetLoadFileFetch(&gNetBoot.loadFile, kConfigName, AllocateForFetch, &bytes, &size);
   if (status == EFI_NOT_FOUND) {
     SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    SetEnding(*config);
   } else if (EFI_ERROR(status)) {
     Fail(kExitConfigInvalid, "cannot fetch %s (%s)", kConfigName, StatusName(status));
   } else {
@@ -701,6 +762,8 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   gBS->SetWatchdogTimer(0, 0, 0, nullptr);
   gOnFirmwareProtocol = ReportFirmwareProtocol;
   SerialPrintf("\nplatform: started\n");
+  // Until a configuration says otherwise.
+  gEnding.debugExit = MachineIsQemu();
 
   // Everything that allocates comes before the first measurement.
   EFI_HANDLE device = nullptr;
@@ -743,16 +806,18 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
     Fail(kExitPlatformFailed, "cannot size the memory map (%s)", StatusName(status));
   }
   SerialPrintf("platform: starting %s, console %s, %u directories\n", config.loaderPath,
-               ModeName(config.consoleMode), directories);
+               ModeName(config.consoleMode == kConsoleNone ? kConsoleNone : gConsole.mode), directories);
 
   const UINT64 pagesBefore = FreePagesOrFail("before the loader");
   const EFI_STATUS loaderStatus = RunLoader(launch, config);
+  // The status first: whatever fails after it, the log has it.
+  SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));
+  gEnding.loaderReturned = true;
+  gEnding.loaderStatus = loaderStatus;
   if (root != nullptr) {
     MemoryWarmDirectoryCache(root);
   }
   const UINT64 pagesAfter = FreePagesOrFail("after the loader");
-
-  SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));
   if (gTimes.entries != nullptr) {
     SerialPrintf("platform: exact times served %u times\n", FileTimesServed());
   }
@@ -765,7 +830,10 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   for (UINT32 second = 0; second < config.holdSeconds; second++) {
     gBS->Stall(1000000);
   }
-  PowerOff(ExitCodeForOutcome(loaderStatus, changed));
+  char outcome[96];
+  FormatToBuffer(outcome, sizeof(outcome), "The loader returned %s (0x%x).", StatusName(loaderStatus),
+                 loaderStatus);
+  End(loaderStatus, ExitCodeForOutcome(loaderStatus, changed), outcome);
 }
 
 }  // namespace nimb::platform

@@ -210,6 +210,21 @@ void WatchDiskAndReset(bool timeReads) {
   SerialPrintf("platform: watching %u disk interfaces and the reset\n", static_cast<UINT64>(gDiskCount));
 }
 
+void UnwatchDiskAndReset() {
+  for (UINT32 i = 0; i < gDiskCount; i++) {
+    gDisks[i].interface->ReadDisk = gDisks[i].original;
+  }
+  gDiskCount = 0;
+  if (gOriginalGetMemoryMap != nullptr) {
+    gBS->GetMemoryMap = gOriginalGetMemoryMap;
+    SealTable(&gBS->Hdr);
+  }
+  if (gOriginalReset != nullptr) {
+    gRT->ResetSystem = gOriginalReset;
+    SealTable(&gRT->Hdr);
+  }
+}
+
 void ReportKeyCopies(const ConfigEntryList &variables) {
   const ConfigEntry *key = nullptr;
   for (UINT32 i = 0; i < variables.count; i++) {

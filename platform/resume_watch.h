@@ -32,6 +32,8 @@ void ReportKeyCopies(const ConfigEntryList &variables);
 // "platform: tsc read-end=") as it returns, and each GetMemoryMap call
 // the counter as it starts ("platform: tsc memory-map=").
 void WatchDiskAndReset(bool timeReads);
+// Puts back what WatchDiskAndReset wrapped, before the platform leaves.
+void UnwatchDiskAndReset();
 
 // Reads the extents of `request` (u32 partition number, then u64 start and
 // u64 length pairs, little-endian) through the firmware's DiskIO on that

@@ -19,6 +19,7 @@
 #include "../../platform/format.h"
 #include "../../platform/graphics.h"
 #include "../../platform/key_state.h"
+#include "../../platform/machine.h"
 #include "../../platform/memory.h"
 #include "hostfw/hostfw.h"
 
@@ -96,6 +97,12 @@ std::string Summary(const std::string &text) {
   if (config.holdSeconds != 0) {
     out << "hold=" << config.holdSeconds << ' ';
   }
+  if (config.debugExit != kDebugExitAuto) {
+    out << "debug-exit=" << int{config.debugExit} << ' ';
+  }
+  if (config.waitKey) {
+    out << "wait-key ";
+  }
   if (config.keys.modifiers != 0) {
     out << "modifiers=" << std::hex << config.keys.modifiers << std::dec << ' ';
   }
@@ -141,6 +148,12 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"console=none\n", "console=2 errors=0"},
       {"\nhold=3s\nhold=-1\nhold=3601\n", "errors=3 bad@2:hold=3s bad@3:hold=-1 bad@4:hold=3601"},
       {"hold=3600\n", "hold=3600 errors=0"},
+      // How the run ends.
+      {"debug-exit=1\nwait-key=1", "debug-exit=1 wait-key errors=0"},
+      {"debug-exit=0\ndebug-exit=auto\nwait-key=1\nwait-key=0", "errors=0"},
+      {"debug-exit=0", "debug-exit=0 errors=0"},
+      {"debug-exit=yes\ndebug-exit=Auto\nwait-key=2",
+       "errors=3 bad@1:debug-exit=yes bad@2:debug-exit=Auto bad@3:wait-key=2"},
       {"loader=\n", "errors=1 bad@1:loader="},
       {"options=\"-v\n", "errors=1 bad@1:options=\"-v"},
       {"options=\"a\"b\"\n", "errors=1 bad@1:options=\"a\"b\""},
@@ -291,6 +304,43 @@ TEST(PlatformReport, ExitCodesAndBoundedText) {
   EXPECT_STREQ(small, "memory=");
 }
 
+// An SMBIOS structure: header (type, length, handle), the formatted bytes
+// behind it, then the strings and the closing NUL.
+std::string Structure(UINT8 type, const std::string &formatted, const std::vector<std::string> &strings) {
+  std::string out = {static_cast<char>(type), static_cast<char>(4 + formatted.size()), 1, 0};
+  out += formatted;
+  for (const std::string &text : strings) {
+    out += text + '\0';
+  }
+  return out + (strings.empty() ? "\0\0"s : "\0"s);
+}
+
+TEST(PlatformMachine, FindsTheSystemManufacturer) {
+  const std::string bios = Structure(0, "\x01\x02", {"EDK II", "unknown"});
+  const std::string end = Structure(127, "", {});
+  struct Row {
+    const char *name;
+    std::string table;
+    bool qemu;
+  };
+  const std::vector<Row> rows = {
+      {"first string", bios + Structure(1, "\x01\x02", {"QEMU", "Standard PC"}) + end, true},
+      {"second string", bios + Structure(1, "\x02\x01", {"Standard PC", "QEMU"}) + end, true},
+      {"another maker", Structure(1, "\x01", {"QEMU Inc"}) + end, false},
+      {"no string number", Structure(1, "\x00", {"QEMU"}) + end, false},
+      {"a number beyond the strings", Structure(1, "\x03", {"QEMU", "x"}) + end, false},
+      {"no manufacturer field", Structure(1, "", {"QEMU"}) + end, false},
+      {"the end before it", end + Structure(1, "\x01", {"QEMU"}), false},
+      {"cut in the strings", (bios + Structure(1, "\x01", {"QEMU"})).substr(0, bios.size() + 7), false},
+      {"a header shorter than 4", "\x01\x03\x00\x00QEMU\0\0"s, false},
+  };
+  for (const Row &row : rows) {
+    EXPECT_EQ(SmbiosManufacturerIs(reinterpret_cast<const UINT8 *>(row.table.data()), row.table.size(), "QEMU"),
+              row.qemu)
+        << row.name;
+  }
+}
+
 TEST(PlatformMemory, CountsConventionalPagesByTheFirmwaresStride) {
   const std::vector<std::pair<UINT32, UINT64>> regions = {
       {EfiConventionalMemory, 100}, {EfiBootServicesData, 7},   {EfiConventionalMemory, 23},
@@ -386,6 +436,8 @@ TEST(PlatformConsole, SwitchesModesOnTheRealConsole) {
       {"beyond the modes", kText, 2, true, EFI_SUCCESS, EFI_INVALID_PARAMETER, kText, {}},
       {"far beyond", kGraphics, 0xFFFFFFFF, true, EFI_SUCCESS, EFI_INVALID_PARAMETER, kGraphics, {}},
       {"no graphics output", kText, kGraphics, false, EFI_SUCCESS, EFI_UNSUPPORTED, kText, {}},
+      // Graphics asked for at the start without graphics output: text.
+      {"no graphics output at all", kGraphics, kGraphics, false, EFI_SUCCESS, EFI_UNSUPPORTED, kText, {}},
       {"a clear that fails",
        kGraphics,
        kText,

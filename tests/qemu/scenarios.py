@@ -17,8 +17,10 @@ from qemuboot import NET_MAC  # noqa: E402
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
 # What every scenario's platform.cfg starts with, unless the scenario says
-# otherwise: the platform records of the machine.
+# otherwise: the end through the debug-exit device and the platform records
+# of the machine.
 BASE_CONFIG = {
+    "debug-exit": "1",
     "datahub.Model": "QEMU1,1",
     "datahub-hex.BusFrequency": "00e1f50500000000",  # 100 MHz, 64 bits
 }
@@ -347,6 +349,19 @@ class Scenario:
     boots: int = 1
     # The loader's reads up to a reset.
     reads: ResumeReads | None = None
+    # QEMU's arguments beyond the harness's machine (tools/qemuboot).
+    qemu_args: tuple = ()
+    # A machine without serial port and debug-exit device, as a PC: only
+    # the screen tells the outcome.
+    bare: bool = False
+    # Lines that the firmware's text console must show (found in screenshots
+    # taken twice a second); then Enter is pressed, and `after_key` must
+    # replace them. The run ends as "Stopped".
+    screen_text: tuple = ()
+    after_key: str = ""
+    # The harness stops the machine once a line of the serial log holds this
+    # text: the run ends as "Stopped".
+    stop_at: str = ""
     # Keys held down on the machine's keyboard from power-on (QEMU key
     # codes: "shift", "meta_l", "v", ...), never let go: QMP sends their
     # key-down events as the machine starts, and again every 50 ms from the
@@ -458,6 +473,8 @@ _TABLE = [
         expect=(
             "platform: platform.cfg line 1: unknown key 'colour' ignored",
             "platform: error: loader \\EFI\\BOOT\\missing.efi not found (EFI_NOT_FOUND)",
+            # The same on the firmware's console, which OVMF mirrors to the port.
+            "Platform error: loader \\EFI\\BOOT\\missing.efi not found (EFI_NOT_FOUND)",
         ),
         forbid=("platform: starting",),
         exit="LoaderMissing",
@@ -493,6 +510,42 @@ _TABLE = [
             ranges={"BootCLUT": 0x300, "Pict-FailedBoot": 0x4020},
         ),
     ),  # fmt: skip
+    # Without debug-exit the platform goes back to the firmware with an
+    # error, which the firmware's boot manager reports before its next
+    # option, with the file system as it was.
+    Scenario(
+        "platform_back_to_firmware",
+        config={"debug-exit": "0", "loader": "\\EFI\\BOOT\\missing.efi"},
+        expect=("platform: debug-exit not used", "platform: exit code 0x21",
+                "back to the firmware with EFI_LOAD_ERROR", "failed to start Boot0002", ": Load Error", "FS0:"),
+        stop_at="FS0:",
+        exit="Stopped",
+    ),
+    # A firmware without graphics output: the loader finds a text console,
+    # is refused the graphics it asks for and boots the kernel in text.
+    Scenario(
+        "kernel_no_graphics",
+        config={"console": "graphics"},
+        files=kernel_file(),
+        qemu_args=("-vga", "none"),
+        expect=("platform: no graphics output: console text", "platform: starting \\EFI\\BOOT\\nimbboot.efi, console text",
+                "platform: console mode graphics refused (EFI_UNSUPPORTED)", LOADING_KERNEL, KERNEL_START),
+        console_modes=("graphics",),
+        exit="KernelPass",
+        kernel=KernelExpect(bootargs={"videoDisplayMode": 2}),
+    ),
+    # A PC without serial port and debug-exit device: the outcome and the
+    # request for a key on the screen, then the firmware's own shell once
+    # the platform went back to it.
+    Scenario(
+        "screen_outcome_bare",
+        config={"wait-key": "1"},
+        bare=True,
+        screen_text=("The loader returned EFI_ABORTED (0x8000000000000015).", "Press a key to go on."),
+        after_key="Shell>",
+        exit="Stopped",
+        timeout=150.0,
+    ),
     # -v: the console goes to text and stays there for the kernel.
     Scenario(
         "kernel_verbose",

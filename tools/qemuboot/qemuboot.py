@@ -93,13 +93,14 @@ def serve_directory(volume, platform, loader, config_name="platform.cfg"):
     return volume
 
 
-def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, reboot=False, extra=()):
+def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, reboot=False, extra=(), bare=False):
     """QEMU's command line, on a private copy of the variable store. With
     `tftp_dir` and no `disk`, the machine boots over a virtio NIC without
     option ROM (so that the firmware's own PXE boots) from QEMU's TFTP server
     on that directory, every packet written to workdir/net.pcap; with
     `reboot`, a reset starts the machine again (on the same variable store)
-    instead of ending QEMU; `extra` goes behind the accelerator."""
+    instead of ending QEMU; `extra` goes behind the accelerator; `bare` leaves
+    out the serial port and the debug-exit device, as on a PC."""
     code, variables = find_ovmf()
     private_vars = Path(workdir) / "OVMF_VARS.fd"
     shutil.copyfile(variables, private_vars)
@@ -116,8 +117,8 @@ def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, rebo
         "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={code}",
         "-drive", f"if=pflash,format=raw,unit=1,file={private_vars}",
         *(["-drive", f"format=raw,file={disk}"] if disk is not None else []),
-        "-device", "isa-debug-exit,iobase=0xf4,iosize=0x04", *network,
-        "-serial", f"file:{serial_log}", "-monitor", "none",
+        *([] if bare else ["-device", "isa-debug-exit,iobase=0xf4,iosize=0x04"]), *network,
+        "-serial", "none" if bare else f"file:{serial_log}", "-monitor", "none",
         *(["-qmp", f"unix:{qmp_socket},server=on,wait=off"] if qmp_socket else []),
     ]  # fmt: skip
 
@@ -242,36 +243,41 @@ class Qmp:
 
 
 def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=(),
-         on_tick=None):
+         bare=False, on_tick=None, tick=0.5):
     """Runs QEMU on `disk` (with `network`: the directory served over TFTP)
     until it ends, for at most `timeout` seconds. `on_line(line, qmp)` hears
     each cleaned serial line as it comes, with a Qmp connection when `qmp` is
     set (else None), and stops the machine by returning True; with `echo`,
-    each line is printed. `on_tick(qmp)` is called once right after the QMP
-    connection is made and then every 50 ms (for a machine started paused
-    with -S in `extra`, the first call resumes it). Returns QEMU's exit status (None: timed out or
+    each line is printed. `on_tick(qmp)`, when given, is called every `tick`
+    seconds, the first time as soon as the machine runs (for a machine
+    started paused with -S in `extra`, that call resumes it), and stops the
+    machine in the same way (for a `bare` machine, which has no serial
+    port). Returns QEMU's exit status (None: timed out or
     stopped), the cleaned serial log and what went wrong over QMP or in
     `on_line` (its OSError, ValueError, RuntimeError), or None."""
     workdir = Path(workdir)
     serial_log = workdir / "serial.log"
     qmp_socket = workdir / "qmp.sock" if qmp else None
     command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, disk if network else None,
-                           reboot, extra)
+                           reboot, extra, bare)
     machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
     trouble, connection = None, None
     try:
-        if on_line is not None or echo:
+        if on_line is not None or on_tick is not None or echo:
             connection = Qmp(qmp_socket, deadline, machine) if qmp else None
-            follower = SerialFollower(serial_log)
+            follower, next_tick = SerialFollower(serial_log), 0.0
             while True:
-                if on_tick is not None:
-                    on_tick(connection)
                 running = machine.poll() is None
                 for line in follower.lines(final=not running):
                     if echo and line.strip():
                         print(line, flush=True)
                     if on_line is not None and on_line(line, connection) and running:
+                        machine.kill()
+                        running = False
+                if on_tick is not None and running and time.monotonic() >= next_tick:
+                    next_tick = time.monotonic() + tick
+                    if on_tick(connection):
                         machine.kill()
                         running = False
                 if not running or time.monotonic() > deadline:
