@@ -437,10 +437,12 @@ _TABLE = [
     fatal("text_console", "console text", "Error loading kernel 'nimb_test'",
           config={"console": "text", "options": "  Kernel=nimb_test -v"}, forbid=(KERNEL_ERROR,)),
     # Shift held alone: safe mode, which reads no NVRAM (the kernel that
-    # boot-args names would win over the configuration file's).
+    # boot-args names would win over the configuration file's). The Shift of
+    # keys= wins over GUI-V held on the keyboard.
     fatal("safe_mode_keys", "Using Safe Mode", "Error loading kernel 'mach_test'",
-          before=("platform: nvram boot-args set",),
-          config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"},
+          before=("platform: keys: modifiers 0x2, 0 keys, ignored 0, from platform.cfg",
+                  "platform: nvram boot-args set"),
+          config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"}, held=("meta_l", "v"),
           files={BOOT_PLIST: plist({"Kernel": "mach_test"})}, forbid=("nvram_kernel", KERNEL_ERROR)),
     # GUI-V held: a verbose boot switches a graphics console to text before
     # anything else, and back to graphics only on the way out.
