@@ -8,6 +8,21 @@ EFI_RUNTIME_SERVICES *gRT;
 EFI_HANDLE gImageHandle;
 void (*gOnFirmwareProtocol)(const char *name, bool replaced);
 
+namespace {
+
+// The firmware's interfaces that the platform's replaced: one for each kind
+// of protocol that it serves.
+struct Replaced {
+  EFI_HANDLE handle;
+  const EFI_GUID *guid;
+  void *firmware;
+  void *ours;
+};
+Replaced gReplaced[8];
+UINTN gReplacedCount;
+
+}  // namespace
+
 bool ProtocolClaim(const EFI_GUID &guid, const char *name, bool replace, ProtocolSlot *slot) {
   *slot = {nullptr, nullptr};
   UINTN count = 0;
@@ -32,11 +47,27 @@ bool ProtocolClaim(const EFI_GUID &guid, const char *name, bool replace, Protoco
 }
 
 EFI_STATUS ProtocolPut(ProtocolSlot slot, const EFI_GUID &guid, void *ours) {
-  if (slot.firmware != nullptr) {
-    return reinterpret_cast<EFI_REINSTALL_PROTOCOL_INTERFACE>(gBS->ReinstallProtocolInterface)(
-        slot.handle, &guid, slot.firmware, ours);
+  if (slot.firmware == nullptr) {
+    return gBS->InstallProtocolInterface(&slot.handle, &guid, EFI_NATIVE_INTERFACE, ours);
   }
-  return gBS->InstallProtocolInterface(&slot.handle, &guid, EFI_NATIVE_INTERFACE, ours);
+  const EFI_STATUS status = reinterpret_cast<EFI_REINSTALL_PROTOCOL_INTERFACE>(
+      gBS->ReinstallProtocolInterface)(slot.handle, &guid, slot.firmware, ours);
+  if (!EFI_ERROR(status) && gReplacedCount < sizeof(gReplaced) / sizeof(gReplaced[0])) {
+    gReplaced[gReplacedCount++] = {slot.handle, &guid, slot.firmware, ours};
+  }
+  return status;
+}
+
+UINTN ProtocolsGiveBack() {
+  UINTN given = 0;
+  for (; gReplacedCount > 0; gReplacedCount--) {
+    const Replaced &r = gReplaced[gReplacedCount - 1];
+    given += EFI_ERROR(reinterpret_cast<EFI_REINSTALL_PROTOCOL_INTERFACE>(gBS->ReinstallProtocolInterface)(
+                 r.handle, r.guid, r.ours, r.firmware))
+                 ? 0
+                 : 1;
+  }
+  return given;
 }
 
 }  // namespace nimb::platform

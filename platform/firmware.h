@@ -39,6 +39,11 @@ bool ProtocolClaim(const EFI_GUID &guid, const char *name, bool replace, Protoco
 // Puts `ours` into the slot: in place of the firmware's interface, or on
 // `slot.handle` (a new handle when null).
 EFI_STATUS ProtocolPut(ProtocolSlot slot, const EFI_GUID &guid, void *ours);
+
+// Puts the firmware's own interfaces back in the places where ProtocolPut
+// replaced them, before the platform goes back to the firmware. Returns how
+// many it put back.
+UINTN ProtocolsGiveBack();
 typedef EFI_STATUS(EFIAPI *EFI_WAIT_FOR_EVENT)(UINTN NumberOfEvents, EFI_EVENT *Event, UINTN *Index);
 typedef EFI_STATUS(EFIAPI *EFI_PROTOCOLS_PER_HANDLE)(EFI_HANDLE Handle, EFI_GUID ***ProtocolBuffer,
                                                      UINTN *ProtocolBufferCount);

@@ -96,6 +96,10 @@ void ScreenToText() {
   if (gEnding.timedDevice != nullptr) {
     FileTimesUninstall(gEnding.timedDevice);
   }
+  const UINTN givenBack = ProtocolsGiveBack();
+  if (givenBack != 0) {
+    SerialPrintf("platform: %u of the firmware's own protocols put back\n", static_cast<UINT64>(givenBack));
+  }
   const UINTN removed = UninstallOwnInterfaces();
   SerialPrintf("platform: %u interfaces removed; back to the firmware with %s\n",
                static_cast<UINT64>(removed), StatusName(status));

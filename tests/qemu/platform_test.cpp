@@ -714,6 +714,9 @@ TEST(PlatformProtocols, TheFirmwaresOwnIsKeptOrReplacedInPlace) {
     gBS->LocateProtocol(&gNimbBootPolicyProtocolGuid, nullptr, &found[1]);
     EXPECT_EQ(found[0], replace ? static_cast<void *>(&state.protocol) : &theirs);
     EXPECT_EQ(found[1], &policy.protocol);
+    EXPECT_EQ(ProtocolsGiveBack(), replace ? 1u : 0u) << "before going back to the firmware";
+    gBS->LocateProtocol(&gNimbKeyStateProtocolGuid, nullptr, &found[0]);
+    EXPECT_EQ(found[0], &theirs);
   }
   gOnFirmwareProtocol = nullptr;
 }
