@@ -184,6 +184,7 @@ bool ApplyKeys(PlatformConfig *config, const char *, char *value) {
     more = *p++ == '+';
   }
   config->keys = held;
+  config->keysGiven = true;
   return true;
 }
 
@@ -199,6 +200,14 @@ bool ApplyFlag(bool *flag, const char *value) {
 
 bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
   return ApplyFlag(&config->keysIgnored, value);
+}
+
+bool ApplyFirmwareProtocols(PlatformConfig *config, const char *, char *value) {
+  if (strcmp(value, "keep") != 0 && strcmp(value, "replace") != 0) {
+    return false;
+  }
+  config->replaceFirmwareProtocols = value[0] == 'r';
+  return true;
 }
 
 bool ApplyDebugExit(PlatformConfig *config, const char *, char *value) {
@@ -358,6 +367,7 @@ constexpr ConfigKey kConfigKeys[] = {
     {"net.time-pxe", ApplyTimePxe},
     {"keys", ApplyKeys},
     {"keys-ignored", ApplyKeysIgnored},
+    {"firmware-protocols", ApplyFirmwareProtocols},
     {"nvram.", ApplyNvramText},
     {"nvram-hex.", ApplyNvramHex},
     {"nvram-volatile.", ApplyNvramVolatileText},
@@ -490,7 +500,9 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->waitKey = false;
   config->timePxeDownload = false;
   config->keys = {};
+  config->keysGiven = false;
   config->keysIgnored = false;
+  config->replaceFirmwareProtocols = false;
   config->nvram.count = 0;
   config->dataHub.count = 0;
   config->deviceProperties = {};

@@ -32,9 +32,18 @@
 //                          0 to 9, or a keyboard usage in hexadecimal (0x28).
 //                          At most kMaxHeldKeys keys, each once; the order is
 //                          the order of the report. Names are lower-case.
-//                          Empty or absent: nothing held
+//                          Given (even empty): these keys, the keyboard is
+//                          not read. Absent: the keys held on the keyboard
+//                          while the platform starts
 //   keys-ignored=0|1       the boot policy's answer: 1 tells the loader not
 //                          to read the held keys; 0
+//   firmware-protocols=keep|replace  what becomes of a protocol that the
+//                          platform serves (console control, key state, boot
+//                          policy, Data Hub, UGA Draw, frame buffer info,
+//                          device properties, network boot information) when
+//                          the firmware has its own: keep the firmware's and
+//                          serve none, or put the platform's in its place on
+//                          the same handle. Either way the log says so; keep
 //   nvram.<name>=<text>    the NVRAM variable <name> under the loader's vendor
 //                          GUID, set for good to the text's UTF-8 bytes
 //                          without a terminator: non-volatile, boot and
@@ -158,7 +167,11 @@ struct PlatformConfig {
   // before the loader starts (net.time-pxe=1).
   bool timePxeDownload;
   HeldKeys keys;
+  // `keys` came from the file: the keyboard is not read.
+  bool keysGiven;
   bool keysIgnored;
+  // A protocol of the firmware's own gives way to the platform's.
+  bool replaceFirmwareProtocols;
   ConfigEntryList nvram;
   ConfigEntryList dataHub;
   ConfigBytes deviceProperties;

@@ -192,7 +192,8 @@ void ConsoleOfferScreenText(PlatformConsole *console, bool on) {
   }
 }
 
-EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode) {
+EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode,
+                                 ProtocolSlot slot) {
   // The console splitter's handle carries the graphics output of all screens.
   void *graphics = nullptr;
   if (EFI_ERROR(gBS->HandleProtocol(gST->ConsoleOutHandle, &gEfiGraphicsOutputProtocolGuid, &graphics))) {
@@ -205,9 +206,7 @@ EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_S
   if (EFI_ERROR(status)) {
     return status;
   }
-  EFI_HANDLE handle = nullptr;
-  return gBS->InstallProtocolInterface(&handle, &gEfiConsoleControlProtocolGuid, EFI_NATIVE_INTERFACE,
-                                       &console->protocol);
+  return ProtocolPut(slot, gEfiConsoleControlProtocolGuid, &console->protocol);
 }
 
 }  // namespace nimb::platform

@@ -13,6 +13,7 @@
 #pragma once
 
 #include "efi/efi.h"
+#include "firmware.h"
 
 namespace nimb::platform {
 
@@ -43,8 +44,9 @@ EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_P
 // firmware's own again.
 void ConsoleOfferScreenText(PlatformConsole *console, bool on);
 
-// Finds the firmware's console, initialises `console` in `mode` and installs
-// its protocol on a new handle.
-EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode);
+// Finds the firmware's console, initialises `console` in `mode` and puts
+// its protocol into `slot`.
+EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode,
+                                 ProtocolSlot slot);
 
 }  // namespace nimb::platform

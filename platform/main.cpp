@@ -96,6 +96,10 @@ void ScreenToText() {
   if (gEnding.timedDevice != nullptr) {
     FileTimesUninstall(gEnding.timedDevice);
   }
+  const UINTN givenBack = ProtocolsGiveBack();
+  if (givenBack != 0) {
+    SerialPrintf("platform: %u of the firmware's own protocols put back\n", static_cast<UINT64>(givenBack));
+  }
   const UINTN removed = UninstallOwnInterfaces();
   SerialPrintf("platform: %u interfaces removed; back to the firmware with %s\n",
                static_cast<UINT64>(removed), StatusName(status));
@@ -435,6 +439,11 @@ void ReportSetMode(EFI_CONSOLE_CONTROL_SCREEN_MODE mode, EFI_STATUS status) {
   SerialPrintf("\n");
 }
 
+// A protocol that the firmware has of its own, and what became of it.
+void ReportFirmwareProtocol(const char *name, bool replaced) {
+  SerialPrintf("platform: the firmware has its own %s: %s\n", name, replaced ? "replaced" : "kept");
+}
+
 // Every call of the device properties and network boot protocols shows in
 // the log, on a line of its own between the loader's messages: the room the
 // caller gave, the answer and the size given back.
@@ -471,16 +480,22 @@ void InstallAnswerProtocols(const PlatformConfig &config) {
     ReportBytes(", bsdp", config.bsdpResponse);
   }
   SerialPrintf("\n");
-  if (config.deviceProperties.bytes != nullptr) {
-    const EFI_STATUS status = DevicePropertiesInstall(&gDeviceProperties, config.deviceProperties);
+  ProtocolSlot slot;
+  if (config.deviceProperties.bytes != nullptr &&
+      ProtocolClaim(gNimbDevicePropertiesProtocolGuid, "device properties", config.replaceFirmwareProtocols,
+                    &slot)) {
+    const EFI_STATUS status = DevicePropertiesInstall(&gDeviceProperties, config.deviceProperties, slot);
     if (EFI_ERROR(status)) {
       Fail(kExitPlatformFailed, "cannot install the device properties (%s)", StatusName(status));
     }
     gDeviceProperties.onGetProperties = ReportGetProperties;
   }
   if (gNetBoot.pxe == nullptr &&
-      (config.dhcpResponse.bytes != nullptr || config.bsdpResponse.bytes != nullptr)) {
-    const EFI_STATUS status = NetBootInfoInstall(&gNetBootInfo, config.dhcpResponse, config.bsdpResponse);
+      (config.dhcpResponse.bytes != nullptr || config.bsdpResponse.bytes != nullptr) &&
+      ProtocolClaim(gNimbNetBootInfoProtocolGuid, "network boot information", config.replaceFirmwareProtocols,
+                    &slot)) {
+    const EFI_STATUS status =
+        NetBootInfoInstall(&gNetBootInfo, config.dhcpResponse, config.bsdpResponse, slot);
     if (EFI_ERROR(status)) {
       Fail(kExitPlatformFailed, "cannot install the network boot information (%s)", StatusName(status));
     }
@@ -492,8 +507,10 @@ void InstallAnswerProtocols(const PlatformConfig &config) {
 // firmware lacks.
 void InstallProtocols(const PlatformConfig &config) {
   EFI_STATUS status = EFI_SUCCESS;
-  if (config.consoleMode != kConsoleNone) {
-    status = ConsoleControlInstall(&gConsole, config.consoleMode);
+  ProtocolSlot slot;
+  if (config.consoleMode != kConsoleNone && ProtocolClaim(gEfiConsoleControlProtocolGuid, "console control",
+                                                          config.replaceFirmwareProtocols, &slot)) {
+    status = ConsoleControlInstall(&gConsole, config.consoleMode, slot);
     if (EFI_ERROR(status)) {
       Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
     }
@@ -505,22 +522,32 @@ void InstallProtocols(const PlatformConfig &config) {
   }
   // Drawing for the loader's boot screen; a firmware without graphics output
   // boots without pictures.
-  status = InstallGraphicsProtocols(gST);
+  status = InstallGraphicsProtocols(gST, config.replaceFirmwareProtocols);
   if (EFI_ERROR(status)) {
     SerialPrintf("platform: no graphics for the boot screen (%s)\n", StatusName(status));
   }
-  status = KeyProtocolsInstall(&gKeyState, &gBootPolicy, config);
+  KeySample sample;
+  status = KeyProtocolsInstall(&gKeyState, &gBootPolicy, config, &sample);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot install the key protocols (%s)", StatusName(status));
   }
-  SerialPrintf("platform: keys: modifiers 0x%x, %u keys, ignored %u\n",
-               static_cast<UINT64>(config.keys.modifiers), static_cast<UINT64>(config.keys.count),
-               static_cast<UINT64>(config.keysIgnored ? 1 : 0));
-  status = DataHubInstall(&gDataHub, config.dataHub);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "cannot install the Data Hub (%s)", StatusName(status));
+  if (sample.status != EFI_NOT_STARTED) {
+    SerialPrintf("platform: keyboard: %s, partial keys %s, %u keystrokes\n", StatusName(sample.status),
+                 StatusName(sample.exposeState), static_cast<UINT64>(sample.strokes));
   }
-  SerialPrintf("platform: data hub: %u platform records\n", static_cast<UINT64>(config.dataHub.count));
+  if (gKeyState.protocol.ReadKeyState != nullptr) {  // not when the firmware's own is kept
+    SerialPrintf("platform: keys: modifiers 0x%x, %u keys, ignored %u, from %s\n",
+                 static_cast<UINT64>(gKeyState.held.modifiers), static_cast<UINT64>(gKeyState.held.count),
+                 static_cast<UINT64>(config.keysIgnored ? 1 : 0),
+                 config.keysGiven ? "platform.cfg" : "keyboard");
+  }
+  if (ProtocolClaim(gEfiDataHubProtocolGuid, "Data Hub", config.replaceFirmwareProtocols, &slot)) {
+    status = DataHubInstall(&gDataHub, config.dataHub, slot);
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot install the Data Hub (%s)", StatusName(status));
+    }
+    SerialPrintf("platform: data hub: %u platform records\n", static_cast<UINT64>(config.dataHub.count));
+  }
   InstallAnswerProtocols(config);
 }
 
@@ -748,7 +775,12 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
   SerialPrintf("\nplatform: net boot dhcp answer ");
   SerialHex(dhcp.bytes, dhcp.size);
   SerialPrintf("\n");
-  status = NetBootInfoInstall(&gNetBootInfo, dhcp, discovery);
+  ProtocolSlot slot;
+  if (!ProtocolClaim(gNimbNetBootInfoProtocolGuid, "network boot information",
+                     config->replaceFirmwareProtocols, &slot)) {
+    return launch;
+  }
+  status = NetBootInfoInstall(&gNetBootInfo, dhcp, discovery, slot);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot install the network boot information (%s)", StatusName(status));
   }
@@ -765,6 +797,7 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   gRT = SystemTable->RuntimeServices;
   // The boot manager's watchdog would reset a slow run.
   gBS->SetWatchdogTimer(0, 0, 0, nullptr);
+  gOnFirmwareProtocol = ReportFirmwareProtocol;
   SerialPrintf("\nplatform: started\n");
   // Until a configuration says otherwise.
   gEnding.debugExit = MachineIsQemu();

@@ -898,6 +898,33 @@ def watch(scenario, workdir, served, png=False):
     return on_line, shots, trouble, pending, stopped
 
 
+def hold_keys(scenario):
+    """QEMU's extra arguments and qemuboot's on_tick for the scenario's held
+    keys, and the on_line that follows the platform's start and its reading
+    of the keyboard; all empty or None without held keys."""
+    if not scenario.held:
+        return (), None, None
+    events = [{"type": "key", "data": {"down": True, "key": {"type": "qcode", "data": key}}}
+              for key in scenario.held]  # fmt: skip
+    state = {"resumed": False, "started": False, "read": False}
+
+    def on_tick(qmp):
+        if not state["resumed"]:
+            qmp.execute("cont")  # input events are refused while the machine is paused
+            qmp.execute("input-send-event", events=events)
+            state["resumed"] = True
+        elif state["started"] and not state["read"]:
+            qmp.execute("input-send-event", events=events)
+
+    def on_line(line):
+        # The firmware's boot manager runs once its keyboard drivers have started.
+        state["started"] |= "BdsDxe:" in line or line.startswith("platform: started")
+        state["read"] |= line.startswith("platform: keys:")
+
+    usb = ("-device", "qemu-xhci", "-device", "usb-kbd") if scenario.usb_keyboard else ()
+    return ("-S", *usb), on_tick, on_line
+
+
 def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
     start = time.monotonic()
     workdir = Path(tempfile.mkdtemp(prefix=f"nimb-qemu-{scenario.name}-"))
@@ -916,9 +943,19 @@ def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
         _, earlier, error = boot(first_disk, workdir, limit, echo=echo, extra=scenario.qemu_args, usb=scenario.usb)
     on_line, shots, trouble, pending, stopped = watch(scenario, workdir, disk, png=echo)
     on_tick, seen = watch_screen(scenario, workdir) if scenario.screen_text else (None, [])
+    held_args, keys_tick, keys_on_line = hold_keys(scenario)
+    if keys_on_line is not None:
+        watch_line = on_line
+
+        def on_line(line, qmp):
+            keys_on_line(line)
+            return watch_line(line, qmp)
+
     returncode, log, later_error = boot(disk, workdir, limit, on_line, network=scenario.network,
-                                        reboot=scenario.boots > 1, qmp=bool(screen or scenario.actions or on_tick),
-                                        echo=echo, extra=scenario.qemu_args, bare=scenario.bare, on_tick=on_tick,
+                                        reboot=scenario.boots > 1,
+                                        qmp=bool(screen or scenario.actions or on_tick or keys_tick), echo=echo,
+                                        extra=(*scenario.qemu_args, *held_args), bare=scenario.bare,
+                                        on_tick=keys_tick or on_tick, tick=0.05 if keys_tick else 0.5,  # never both
                                         usb=scenario.usb, same_store=True)
     error = error or later_error
     (workdir / "serial.txt").write_text(earlier + log)

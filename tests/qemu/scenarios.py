@@ -370,6 +370,17 @@ class Scenario:
     # The harness stops the machine once a line of the serial log holds this
     # text: the run ends as "Stopped".
     stop_at: str = ""
+    # Keys held down on the machine's keyboard from power-on (QEMU key
+    # codes: "shift", "meta_l", "v", ...), never let go: QMP sends their
+    # key-down events as the machine starts, and again every 50 ms from the
+    # firmware's boot manager on until the platform has read the keyboard
+    # (not earlier: with key events streaming in while OVMF started, its
+    # PS/2 keyboard driver saw neither of two held keys), as a real keyboard
+    # repeats a held key (the firmware's keyboard driver resets the keyboard
+    # and forgets what was down before). The PS/2 keyboard of the machine,
+    # or with `usb_keyboard` a USB one.
+    held: tuple = ()
+    usb_keyboard: bool = False
 
 
 def fatal(name, *messages, before=(), make=Scenario, **knobs):
@@ -434,10 +445,12 @@ _TABLE = [
     fatal("text_console", "console text", "Error loading kernel 'nimb_test'",
           config={"console": "text", "options": "  Kernel=nimb_test -v"}, forbid=(KERNEL_ERROR,)),
     # Shift held alone: safe mode, which reads no NVRAM (the kernel that
-    # boot-args names would win over the configuration file's).
+    # boot-args names would win over the configuration file's). The Shift of
+    # keys= wins over GUI-V held on the keyboard.
     fatal("safe_mode_keys", "Using Safe Mode", "Error loading kernel 'mach_test'",
-          before=("platform: nvram boot-args set",),
-          config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"},
+          before=("platform: keys: modifiers 0x2, 0 keys, ignored 0, from platform.cfg",
+                  "platform: nvram boot-args set"),
+          config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"}, held=("meta_l", "v"),
           files={BOOT_PLIST: plist({"Kernel": "mach_test"})}, forbid=("nvram_kernel", KERNEL_ERROR)),
     # GUI-V held: a verbose boot switches a graphics console to text before
     # anything else, and back to graphics only on the way out.
@@ -449,6 +462,18 @@ _TABLE = [
           before=("platform: keys: modifiers 0x2, 0 keys, ignored 1", "platform: nvram boot-args set for good, 17 bytes"),
           config={"nvram.boot-args": "Kernel=from_nvram", "keys": "shift", "keys-ignored": "1"},
           forbid=("Using Safe Mode", KERNEL_ERROR)),
+    # Keys held on the machine's own keyboard from power-on, read by the
+    # platform (no keys= in platform.cfg): Shift alone is safe mode, -x for
+    # the kernel; GUI-V a verbose boot, on the PS/2 keyboard and a USB one.
+    Scenario("keys_held_shift", held=("shift",), files=kernel_file(), exit="KernelPass",
+             expect=("platform: keys: modifiers 0x2, 0 keys, ignored 0, from keyboard", "Using Safe Mode",
+                     KERNEL_START),
+             kernel=KernelExpect(bootargs={"commandLine": "-x"})),
+    *(Scenario(name, held=("meta_l", "v"), usb_keyboard=usb, config={"console": "graphics"}, files=kernel_file(),
+               expect=("platform: keys: modifiers 0x8, 1 keys, ignored 0, from keyboard", KERNEL_START),
+               console_modes=("text",), exit="KernelPass",
+               kernel=KernelExpect(bootargs={"commandLine": "-v", "videoDisplayMode": 2}))
+      for name, usb in [("keys_held_gui_v", False), ("keys_held_gui_v_usb", True)]),
     # The platform's own way out: an unknown key is reported and ignored, and
     # a loader that isn't there ends the run before anything starts.
     Scenario(

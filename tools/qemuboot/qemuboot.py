@@ -252,15 +252,17 @@ class Qmp:
 
 
 def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=(),
-         bare=False, on_tick=None, usb=False, same_store=False):
+         bare=False, on_tick=None, tick=0.5, usb=False, same_store=False):
     """Runs QEMU on `disk` (with `network`: the directory served over TFTP)
     until it ends, for at most `timeout` seconds. `on_line(line, qmp)` hears
     each cleaned serial line as it comes, with a Qmp connection when `qmp` is
     set (else None), and stops the machine by returning True; with `echo`,
-    each line is printed. `on_tick(qmp)`, when given, is called about twice
-    a second and stops the machine in the same way (for a `bare` machine,
-    which has no serial port); `usb` and `same_store` as for qemu_command.
-    Returns QEMU's exit status (None: timed out or
+    each line is printed. `on_tick(qmp)`, when given, is called every `tick`
+    seconds, the first time as soon as the machine runs (for a machine
+    started paused with -S in `extra`, that call resumes it), and stops the
+    machine in the same way (for a `bare` machine, which has no serial
+    port); `usb` and `same_store` as for qemu_command. Returns QEMU's exit
+    status (None: timed out or
     stopped), the cleaned serial log and what went wrong over QMP or in
     `on_line` (its OSError, ValueError, RuntimeError), or None."""
     workdir = Path(workdir)
@@ -285,7 +287,7 @@ def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=
                         machine.kill()
                         running = False
                 if on_tick is not None and running and time.monotonic() >= next_tick:
-                    next_tick = time.monotonic() + 0.5
+                    next_tick = time.monotonic() + tick
                     if on_tick(connection):
                         machine.kill()
                         running = False
