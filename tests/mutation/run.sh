@@ -8,7 +8,9 @@
 # mutations by name, or a whole list by its file's name (config, load, ...);
 # none means all. Per mutation: "caught" (a test failed),
 # "MISSED" (all passed), "no build" (the fault does not compile: fix the
-# list). The exit status is 1 when any was missed.
+# list). The exit status is 1 when any was missed. A list whose first line
+# reads "# target: TARGET PATH" is run with that test program (built as
+# TARGET, at BUILD_DIR/PATH) in place of the unit tests.
 set -euo pipefail
 cd "$(dirname "$0")/../.."
 
@@ -55,6 +57,7 @@ picked() {
 }
 
 caught=0 missed=0 broken=0 total=0
+declare -A built=()
 missedNames=()
 while IFS=: read -r path line; do
   group=$(basename "$path" .txt)
@@ -69,6 +72,10 @@ while IFS=: read -r path line; do
     continue
   fi
   total=$((total + 1))
+  target= binary=
+  read -r target binary < <(sed -n '1s/^# target: //p' "$path") || true
+  built[${target:-unit_tests}]=1
+  target=${target:-unit_tests} binary=${binary:-unit_tests}
   cp "$file" "$saved/original"
   current=$file
   if ! apply "$file" "$text" "$replacement"; then
@@ -77,10 +84,10 @@ while IFS=: read -r path line; do
     broken=$((broken + 1))
     continue
   fi
-  if ! nice cmake --build "$build" --target unit_tests >"$saved/build.log" 2>&1; then
+  if ! nice cmake --build "$build" --target "$target" >"$saved/build.log" 2>&1; then
     result="no build"
     broken=$((broken + 1))
-  elif timeout 240 nice "$build/unit_tests" --gtest_brief=1 --gtest_fail_fast >"$saved/test.log" 2>&1; then
+  elif timeout 240 nice "$build/$binary" --gtest_brief=1 --gtest_fail_fast >"$saved/test.log" 2>&1; then
     result="MISSED"
     missed=$((missed + 1))
     missedNames+=("$name")
@@ -93,7 +100,9 @@ while IFS=: read -r path line; do
 done < <(grep -H '' tests/mutation/*.txt)
 
 # The build left as the sources are.
-nice cmake --build "$build" --target unit_tests >/dev/null 2>&1 || true
+for target in "${!built[@]}"; do
+  nice cmake --build "$build" --target "$target" >/dev/null 2>&1 || true
+done
 echo "mutations: $total, caught: $caught, missed: $missed, not built: $broken"
 [ ${#missedNames[@]} -eq 0 ] || echo "missed: ${missedNames[*]}"
 [ "$missed" -eq 0 ]

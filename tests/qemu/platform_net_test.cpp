@@ -173,7 +173,7 @@ TEST(PlatformNetBoot, DhcpMessageLength) {
   std::vector<UINT8> packet(1472, 0);
   const UINT8 magic[] = {99, 130, 83, 99};
   std::memcpy(&packet[236], magic, 4);
-  const std::vector<UINT8> options = {53, 1, 5, 0, 0, 1, 4, 255, 255, 255, 0, 255};
+  const std::vector<UINT8> options = {53, 1, 5, 0, 1, 4, 255, 255, 255, 0, 255};
   std::memcpy(&packet[240], options.data(), options.size());
   EXPECT_EQ(DhcpMessageLength(packet.data(), packet.size()), 240 + options.size());
   packet[240 + options.size() - 1] = 0;  // no end option: the whole packet

@@ -152,7 +152,8 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"hold 3\nconsole=text\n", "console=0 errors=1 noequals@1:hold 3"},
       {"console=vga\n", "errors=1 bad@1:console=vga"},
       {"console=none\n", "console=2 errors=0"},
-      {"\nhold=3s\nhold=-1\nhold=3601\n", "errors=3 bad@2:hold=3s bad@3:hold=-1 bad@4:hold=3601"},
+      {"\nhold=3s\nhold=-1\nhold=3601\nhold=+3",
+       "errors=4 bad@2:hold=3s bad@3:hold=-1 bad@4:hold=3601 bad@5:hold=+3"},
       {"hold=3600\n", "hold=3600 errors=0"},
       // How the run ends.
       {"debug-exit=1\nwait-key=1", "debug-exit=1 wait-key errors=0"},
@@ -286,6 +287,7 @@ TEST(PlatformConfig, ConvertsUtf8ToUcs2) {
       {"\xF0\x9F\x98\x80", 16, false, false, u""},  // beyond U+FFFF
       {"\xC0\xAF", 16, false, false, u""},          // overlong
       {"\xE0\x80\xAF", 16, false, false, u""},
+      {"\xE0\x82\x80", 16, false, false, u""},
       {"\xED\xA0\x80", 16, false, false, u""},  // surrogate
       {"a\x80", 16, false, false, u""},
       {"a\xE2\x82", 16, false, false, u""},
@@ -362,8 +364,9 @@ TEST(PlatformMachine, FindsTheSystemManufacturer) {
       {"a header shorter than 4", "\x01\x03\x00\x00QEMU\0\0"s, false},
   };
   for (const Row &row : rows) {
-    EXPECT_EQ(SmbiosManufacturerIs(reinterpret_cast<const UINT8 *>(row.table.data()), row.table.size(), "QEMU"),
-              row.qemu)
+    EXPECT_EQ(
+        SmbiosManufacturerIs(reinterpret_cast<const UINT8 *>(row.table.data()), row.table.size(), "QEMU"),
+        row.qemu)
         << row.name;
   }
 }
@@ -656,7 +659,7 @@ TEST(PlatformKeys, HeldKeysFromTheFirmwaresKeyboard) {
     return std::make_pair(EFI_SUCCESS, EFI_KEY_DATA{{scan, c}, {shift, toggle}});
   };
   auto now = [](UINT32 shift, UINT8 toggle = 0) {
-    return std::make_pair(EFI_NOT_READY, EFI_KEY_DATA{{0, 0}, {shift, toggle}});
+    return std::make_pair(EFI_NOT_READY, EFI_KEY_DATA{{0, 'q'}, {shift, toggle}});  // no key behind it
   };
   struct Row {
     std::vector<std::pair<EFI_STATUS, EFI_KEY_DATA>> readings;
@@ -730,6 +733,7 @@ TEST(PlatformProtocols, TheFirmwaresOwnIsKeptOrReplacedInPlace) {
     PlatformBootPolicy policy = {};
     KeySample sample;
     ASSERT_EQ(KeyProtocolsInstall(&state, &policy, config, &sample), EFI_SUCCESS);
+    EXPECT_EQ(sample.status, EFI_NOT_STARTED) << "keys given: the keyboard is not read";
     EXPECT_EQ(heard, replace ? "key state+" : "key state-");
     UINTN count = 0;
     EFI_HANDLE *handles = nullptr;
