@@ -32,10 +32,6 @@ struct FakePxe {
     protocol.Mode = &mode;
   }
 
-  void Add(const std::string &name, const std::string &bytes, UINT64 listed) {
-    files[name] = {bytes, listed};
-  }
-
   static EFI_STATUS EFIAPI Mtftp(EFI_PXE_BASE_CODE_PROTOCOL *This, EFI_PXE_BASE_CODE_TFTP_OPCODE Operation,
                                  VOID *BufferPtr, BOOLEAN, UINT64 *BufferSize, UINTN *BlockSize,
                                  EFI_IP_ADDRESS *, UINT8 *Filename, EFI_PXE_BASE_CODE_MTFTP_INFO *, BOOLEAN) {
@@ -86,10 +82,6 @@ std::vector<UINT8> PathOf(const std::u16string &name) {
   return path;
 }
 
-EFI_DEVICE_PATH_PROTOCOL *AsPath(std::vector<UINT8> &bytes) {
-  return reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(bytes.data());
-}
-
 TEST(PlatformNetLoadFile, AnswersAsALoadFile) {
   const std::string kernel(5000, 'k');
   struct Row {
@@ -121,18 +113,19 @@ TEST(PlatformNetLoadFile, AnswersAsALoadFile) {
   for (const Row &row : rows) {
     SCOPED_TRACE(row.name);
     FakePxe pxe;
-    pxe.Add("nimb.tarnix", kernel, kernel.size());
-    pxe.Add("short", std::string(3000, 's'), 5000);
-    pxe.Add("grown", std::string(6000, 'g'), 6000);
-    pxe.Add("empty", "", 0);
+    pxe.files = {{"nimb.tarnix", {kernel, kernel.size()}},
+                 {"short", {std::string(3000, 's'), 5000}},
+                 {"grown", {std::string(6000, 'g'), 6000}},
+                 {"empty", {"", 0}}};
     pxe.failure = row.failure;
     PlatformNetLoadFile loader;
     NetLoadFileInit(&loader, &pxe.protocol, EFI_IP_ADDRESS{});
     std::vector<UINT8> path = PathOf(row.file);
     std::vector<char> buffer(row.room);
     UINTN size = row.room;
-    const EFI_STATUS status = loader.protocol.LoadFile(&loader.protocol, AsPath(path), FALSE, &size,
-                                                       row.room == 0 ? nullptr : buffer.data());
+    const EFI_STATUS status =
+        loader.protocol.LoadFile(&loader.protocol, reinterpret_cast<EFI_DEVICE_PATH_PROTOCOL *>(path.data()),
+                                 FALSE, &size, row.room == 0 ? nullptr : buffer.data());
     EXPECT_EQ(status, row.status);
     EXPECT_EQ(size, row.size);
     EXPECT_EQ(pxe.requests.size(), row.requests);
@@ -147,8 +140,7 @@ TEST(PlatformNetLoadFile, AnswersAsALoadFile) {
 
 TEST(PlatformNetLoadFile, FetchesWholeFilesAndSeesMismatches) {
   FakePxe pxe;
-  pxe.Add("platform.cfg", "console=text\n", 13);
-  pxe.Add("short", "abc", 4);
+  pxe.files = {{"platform.cfg", {"console=text\n", 13}}, {"short", {"abc", 4}}};
   PlatformNetLoadFile loader;
   NetLoadFileInit(&loader, &pxe.protocol, EFI_IP_ADDRESS{});
   static std::vector<std::vector<char>> buffers;

@@ -65,23 +65,23 @@ std::string Hex(const UINT8 *bytes, size_t size) {
   return out.str();
 }
 
-void AddEntries(std::ostringstream &out, const char *what, const ConfigEntryList &list) {
+std::string HexNumber(UINT32 value) {
+  std::ostringstream out;
+  out << std::hex << value;
+  return out.str();
+}
+
+void AddEntries(std::string &out, const char *what, const ConfigEntryList &list) {
   for (UINT32 i = 0; i < list.count; i++) {
     const ConfigEntry &entry = list.entries[i];
     static const char *const kLives[] = {"", "/boot", "/delete"};
-    out << what << entry.name << kLives[entry.life] << '=';
+    out += what + std::string(entry.name) + kLives[entry.life] + '=';
     if (entry.text) {
       EXPECT_EQ(entry.bytes[entry.size], 0) << entry.name << ": text without its NUL";
-      out << '"' << std::string(reinterpret_cast<const char *>(entry.bytes), entry.size) << "\" ";
+      out += '"' + std::string(reinterpret_cast<const char *>(entry.bytes), entry.size) + "\" ";
     } else {
-      out << Hex(entry.bytes, entry.size) << ' ';
+      out += Hex(entry.bytes, entry.size) + ' ';
     }
-  }
-}
-
-void AddBytes(std::ostringstream &out, const char *what, const ConfigBytes &bytes) {
-  if (bytes.bytes != nullptr) {
-    out << what << '=' << Hex(bytes.bytes, bytes.size) << ' ';
   }
 }
 
@@ -90,47 +90,34 @@ void AddBytes(std::ostringstream &out, const char *what, const ConfigBytes &byte
 std::string Summary(const std::string &text) {
   const Parsed parsed(text);
   const PlatformConfig &config = parsed.config;
-  std::ostringstream out;
-  if (strcmp(config.loaderPath, kDefaultLoaderPath) != 0) {
-    out << "loader=" << config.loaderPath << ' ';
-  }
-  if (config.options != nullptr) {
-    out << "options=[" << config.options << "] ";
-  }
-  if (config.consoleMode != kGraphics) {
-    out << "console=" << config.consoleMode << ' ';
-  }
-  if (config.holdSeconds != 0) {
-    out << "hold=" << config.holdSeconds << ' ';
-  }
-  if (config.debugExit != kDebugExitAuto) {
-    out << "debug-exit=" << int{config.debugExit} << ' ';
-  }
-  if (config.waitKey) {
-    out << "wait-key ";
-  }
-  if (config.keys.modifiers != 0) {
-    out << "modifiers=" << std::hex << config.keys.modifiers << std::dec << ' ';
-  }
+  std::string out;
+  auto add = [&out](bool set, const std::string &what) {
+    if (set) {
+      out += what + ' ';
+    }
+  };
+  add(strcmp(config.loaderPath, kDefaultLoaderPath) != 0, "loader="s + config.loaderPath);
+  add(config.options != nullptr, "options=["s + (config.options != nullptr ? config.options : "") + ']');
+  add(config.consoleMode != kGraphics, "console=" + std::to_string(config.consoleMode));
+  add(config.holdSeconds != 0, "hold=" + std::to_string(config.holdSeconds));
+  add(config.debugExit != kDebugExitAuto, "debug-exit=" + std::to_string(int{config.debugExit}));
+  add(config.waitKey, "wait-key");
+  add(config.keys.modifiers != 0, "modifiers=" + HexNumber(config.keys.modifiers));
   for (UINT32 i = 0; i < config.keys.count; i++) {
-    out << "key=" << std::hex << config.keys.keys[i] << std::dec << ' ';
+    add(true, "key=" + HexNumber(config.keys.keys[i]));
   }
-  if (config.keysGiven && config.keys.modifiers == 0 && config.keys.count == 0) {
-    out << "nothing-held ";  // the keyboard is not read
-  }
-  if (config.keysIgnored) {
-    out << "ignored ";
-  }
-  if (config.replaceFirmwareProtocols) {
-    out << "replace ";
-  }
+  // Keys given as nothing held: the keyboard is not read.
+  add(config.keysGiven && config.keys.modifiers == 0 && config.keys.count == 0, "nothing-held");
+  add(config.keysIgnored, "ignored");
+  add(config.replaceFirmwareProtocols, "replace");
   AddEntries(out, "nvram.", config.nvram);
   AddEntries(out, "datahub.", config.dataHub);
-  AddBytes(out, "properties", config.deviceProperties);
-  AddBytes(out, "dhcp", config.dhcpResponse);
-  AddBytes(out, "bsdp", config.bsdpResponse);
-  out << "errors=" << parsed.errors << parsed.issues;
-  return out.str();
+  const std::pair<const char *, const ConfigBytes &> blobs[] = {
+      {"properties", config.deviceProperties}, {"dhcp", config.dhcpResponse}, {"bsdp", config.bsdpResponse}};
+  for (const auto &[what, bytes] : blobs) {
+    add(bytes.bytes != nullptr, what + "="s + Hex(bytes.bytes, bytes.size));
+  }
+  return out + "errors=" + std::to_string(parsed.errors) + parsed.issues;
 }
 
 TEST(PlatformConfig, ParsesEveryKey) {
@@ -396,18 +383,18 @@ TEST(PlatformMemory, CountsConventionalPagesByTheFirmwaresStride) {
 
 // Text output and graphics output that record what is done to the screen.
 struct Screen {
-  std::vector<std::string> calls;
+  std::string calls;  // each ends in '|'
   EFI_STATUS clearStatus = EFI_SUCCESS;
 };
 Screen *gScreen;
 
 EFI_STATUS EFIAPI FakeClearScreen(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *) {
-  gScreen->calls.push_back("clear");
+  gScreen->calls += "clear|";
   return gScreen->clearStatus;
 }
 
 EFI_STATUS EFIAPI FakeEnableCursor(EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *, BOOLEAN visible) {
-  gScreen->calls.push_back(visible ? "cursor on" : "cursor off");
+  gScreen->calls += visible ? "cursor on|" : "cursor off|";
   return EFI_SUCCESS;
 }
 
@@ -415,9 +402,9 @@ EFI_STATUS EFIAPI FakeBlt(EFI_GRAPHICS_OUTPUT_PROTOCOL *, EFI_GRAPHICS_OUTPUT_BL
                           EFI_GRAPHICS_OUTPUT_BLT_OPERATION operation, UINTN, UINTN, UINTN x, UINTN y,
                           UINTN width, UINTN height, UINTN) {
   const bool black = pixel->Red == 0 && pixel->Green == 0 && pixel->Blue == 0;
-  gScreen->calls.push_back("blt " + std::to_string(operation) + (black ? " black " : " colour ") +
-                           std::to_string(x) + "," + std::to_string(y) + " " + std::to_string(width) + "x" +
-                           std::to_string(height));
+  gScreen->calls += "blt " + std::to_string(operation) + (black ? " black " : " colour ") +
+                    std::to_string(x) + "," + std::to_string(y) + " " + std::to_string(width) + "x" +
+                    std::to_string(height) + "|";
   return EFI_SUCCESS;
 }
 
@@ -440,45 +427,30 @@ struct Firmware {
 };
 
 TEST(PlatformConsole, SwitchesModesOnTheRealConsole) {
-  using Calls = std::vector<std::string>;
+  constexpr EFI_STATUS kOk = EFI_SUCCESS;
   struct Row {
-    const char *name;
     EFI_CONSOLE_CONTROL_SCREEN_MODE start;
     UINT32 wanted;
     bool graphics;  // the firmware has graphics output
     EFI_STATUS clear;
     EFI_STATUS status;
     EFI_CONSOLE_CONTROL_SCREEN_MODE after;
-    Calls calls;  // of SetMode only
+    const char *calls;  // of SetMode only
   };
   const std::vector<Row> rows = {
-      {"text to graphics",
-       kText,
-       kGraphics,
-       true,
-       EFI_SUCCESS,
-       EFI_SUCCESS,
-       kGraphics,
-       {"cursor off", "blt 0 black 0,0 1280x800"}},
-      {"graphics to text", kGraphics, kText, true, EFI_SUCCESS, EFI_SUCCESS, kText, {"clear", "cursor on"}},
-      {"text to text", kText, kText, true, EFI_SUCCESS, EFI_SUCCESS, kText, {}},
-      {"graphics to graphics", kGraphics, kGraphics, true, EFI_SUCCESS, EFI_SUCCESS, kGraphics, {}},
-      {"beyond the modes", kText, 2, true, EFI_SUCCESS, EFI_INVALID_PARAMETER, kText, {}},
-      {"far beyond", kGraphics, 0xFFFFFFFF, true, EFI_SUCCESS, EFI_INVALID_PARAMETER, kGraphics, {}},
-      {"no graphics output", kText, kGraphics, false, EFI_SUCCESS, EFI_UNSUPPORTED, kText, {}},
+      {kText, kGraphics, true, kOk, kOk, kGraphics, "cursor off|blt 0 black 0,0 1280x800|"},
+      {kGraphics, kText, true, kOk, kOk, kText, "clear|cursor on|"},
+      {kText, kText, true, kOk, kOk, kText, ""},
+      {kGraphics, kGraphics, true, kOk, kOk, kGraphics, ""},
+      {kText, 2, true, kOk, EFI_INVALID_PARAMETER, kText, ""},  // beyond the modes
+      {kGraphics, 0xFFFFFFFF, true, kOk, EFI_INVALID_PARAMETER, kGraphics, ""},
+      {kText, kGraphics, false, kOk, EFI_UNSUPPORTED, kText, ""},  // no graphics output
       // Graphics asked for at the start without graphics output: text.
-      {"no graphics output at all", kGraphics, kGraphics, false, EFI_SUCCESS, EFI_UNSUPPORTED, kText, {}},
-      {"a clear that fails",
-       kGraphics,
-       kText,
-       true,
-       EFI_DEVICE_ERROR,
-       EFI_DEVICE_ERROR,
-       kGraphics,
-       {"clear"}},
+      {kGraphics, kGraphics, false, kOk, EFI_UNSUPPORTED, kText, ""},
+      {kGraphics, kText, true, EFI_DEVICE_ERROR, EFI_DEVICE_ERROR, kGraphics, "clear|"},  // a failed clear
   };
   for (const Row &row : rows) {
-    SCOPED_TRACE(row.name);
+    SCOPED_TRACE(&row - rows.data());
     Firmware firmware;
     PlatformConsole console;
     ASSERT_EQ(
