@@ -137,22 +137,17 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"hold=1\nhold=2\n", "hold=2 errors=0"},
       {"colour=blue\nHold=1\n", "errors=0 unknown@1:colour=blue unknown@2:Hold=1"},
       {"hold 3\nconsole=text\n", "console=0 errors=1 noequals@1:hold 3"},
-      {"console=vga\n", "errors=1 bad@1:console=vga"},
-      {"console=none\n", "console=2 errors=0"},
-      {"\nhold=3s\nhold=-1\nhold=3601\nhold=+3",
-       "errors=4 bad@2:hold=3s bad@3:hold=-1 bad@4:hold=3601 bad@5:hold=+3"},
-      {"hold=3600\n", "hold=3600 errors=0"},
+      {"console=vga\nconsole=none\n", "console=2 errors=1 bad@1:console=vga"},
+      {"hold=3600\n\nhold=3s\nhold=-1\nhold=3601\nhold=+3",
+       "hold=3600 errors=4 bad@3:hold=3s bad@4:hold=-1 bad@5:hold=3601 bad@6:hold=+3"},
       // How the run ends.
       {"debug-exit=1\nwait-key=1", "debug-exit=1 wait-key errors=0"},
       {"debug-exit=0\ndebug-exit=auto\nwait-key=1\nwait-key=0", "errors=0"},
-      {"debug-exit=0", "debug-exit=0 errors=0"},
-      {"debug-exit=yes\ndebug-exit=Auto\nwait-key=2",
-       "errors=3 bad@1:debug-exit=yes bad@2:debug-exit=Auto bad@3:wait-key=2"},
-      {"loader=\n", "errors=1 bad@1:loader="},
-      {"options=\"-v\n", "errors=1 bad@1:options=\"-v"},
-      {"options=\"a\"b\"\n", "errors=1 bad@1:options=\"a\"b\""},
-      {"options=\"a\\\"\n", "errors=1 bad@1:options=\"a\\\""},
-      {"options=\"\\q\"\n", "errors=1 bad@1:options=\"\\q\""},
+      {"debug-exit=0\ndebug-exit=yes\ndebug-exit=Auto\nwait-key=2",
+       "debug-exit=0 errors=3 bad@2:debug-exit=yes bad@3:debug-exit=Auto bad@4:wait-key=2"},
+      {"loader=\noptions=\"-v\noptions=\"a\"b\"\noptions=\"a\\\"\noptions=\"\\q\"\n",
+       "errors=5 bad@1:loader= bad@2:options=\"-v bad@3:options=\"a\"b\" bad@4:options=\"a\\\" "
+       "bad@5:options=\"\\q\""},
       {"options=\xF0\x9F\x98\x80\n", "errors=1 bad@1:options=\\xf0\\x9f\\x98\\x80"},
       // A byte-order mark is skipped at the start only; echoes are bounded
       // and show control bytes as escapes.
@@ -161,7 +156,6 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"hold=1\n\xEF\xBB\xBFhold=2", "hold=1 errors=0 unknown@2:\\xef\\xbb\\xbfhold=2"},
       {"\xEF\xBBhold=2", "errors=0 unknown@1:\\xef\\xbbhold=2"},
       {"k\x1b[2J\x07=\x7f", "errors=0 unknown@1:k\\x1b[2J\\x07=\\x7f"},
-      {"console=" + std::string(70, 'v'), "errors=1 bad@1:console=" + std::string(60, 'v') + "..."},
       {"console=" + std::string(63, 'v'), "errors=1 bad@1:console=" + std::string(63, 'v')},
       {"console=" + std::string(64, 'v'), "errors=1 bad@1:console=" + std::string(60, 'v') + "..."},
       {"console=" + std::string(14, 'v') + "\x01" + std::string(60, 'v'),
@@ -178,7 +172,6 @@ TEST(PlatformConfig, ParsesEveryKey) {
        "key=7004 key=7005 key=7006 key=7007 key=7008 key=7009 key=700a key=700b errors=0"},
       {"keys=gui+v\nkeys=", "nothing-held errors=0"},
       {"keys=shift+lshift\nkeys-ignored=1", "modifiers=2 ignored errors=0"},
-      {"keys-ignored=1\nkeys-ignored=0", "errors=0"},
       {"keys=shift\nkeys=a+b+c+d+e+f+g+h+i", "modifiers=2 errors=1 bad@2:keys=a+b+c+d+e+f+g+h+i"},
       {"keys=gui+v+v\nkeys=gui+\nkeys=+v\nkeys=GUI+V\nkeys=cmd+v\nkeys=ab\nkeys=leftshift",
        "errors=7 bad@1:keys=gui+v+v bad@2:keys=gui+ bad@3:keys=+v bad@4:keys=GUI+V bad@5:keys=cmd+v "
@@ -186,8 +179,9 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"keys=0x\nkeys=0x00\nkeys=0x100\nkeys=0x2g\nkeys=gui + v",
        "errors=5 bad@1:keys=0x bad@2:keys=0x00 bad@3:keys=0x100 bad@4:keys=0x2g bad@5:keys=gui + v"},
       {"firmware-protocols=replace", "replace errors=0"},
-      {"firmware-protocols=replace\nfirmware-protocols=keep\nfirmware-protocols=Replace",
-       "errors=1 bad@3:firmware-protocols=Replace"},
+      {"keys-ignored=1\nkeys-ignored=0\nfirmware-protocols=replace\nfirmware-protocols=keep\n"
+       "firmware-protocols=Replace",
+       "errors=1 bad@5:firmware-protocols=Replace"},
       {"keys-ignored=2\nkeys-ignored=01\nkeys-ignored=",
        "errors=3 bad@1:keys-ignored=2 bad@2:keys-ignored=01 bad@3:keys-ignored="},
       // Variables and platform records.
@@ -203,7 +197,6 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"datahub.Model=\" Q \"\ndatahub-hex.Bus=00e1F505",
        "datahub.Model=\" Q \" datahub.Bus=00e1f505 errors=0"},
       {"datahub.A=\ndatahub-hex.B=", "datahub.A=\"\" datahub.B= errors=0"},
-      {"nvram.a=1\nnvram.b=2\nnvram-hex.a=ff", "nvram.a=ff nvram.b=\"2\" errors=0"},
       {"nvram.x=1\ndatahub.x=2\ndatahub.X=3", "nvram.x=\"1\" datahub.x=\"2\" datahub.X=\"3\" errors=0"},
       {"nvram.a=\nnvram-hex.a=\"  \"", "errors=2 bad@1:nvram.a= bad@2:nvram-hex.a=  "},
       {"nvram-hex.a=abc\ndatahub-hex.a=0 1\nnvram-hex.a=zz",
@@ -212,7 +205,8 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"nvram.a=\xF0\x9F\x98\x80\ndatahub.\xF0\x9F\x98\x80=x",
        "errors=2 bad@1:nvram.a=\\xf0\\x9f\\x98\\x80 bad@2:datahub.\\xf0\\x9f\\x98\\x80=x"},
       {"nvram.a=1\nnvram-hex.a=1", "nvram.a=\"1\" errors=1 bad@2:nvram-hex.a=1"},
-      {"nvram=1\ndatahub=2", "errors=0 unknown@1:nvram=1 unknown@2:datahub=2"},
+      {"nvram=1\ndatahub=2\nnetboot.dhcp=01\nnetboot.hex=01",
+       "errors=0 unknown@1:nvram=1 unknown@2:datahub=2 unknown@3:netboot.dhcp=01 unknown@4:netboot.hex=01"},
       {"datahub-hex.a=\"ab \tc\"", "errors=1 bad@1:datahub-hex.a=ab \\x09c"},
       // The answers of the device properties and network boot protocols.
       {"device-properties-hex=01\nnetboot.dhcp-hex=0203\nnetboot.bsdp-hex=040506",
@@ -222,7 +216,6 @@ TEST(PlatformConfig, ParsesEveryKey) {
        "dhcp=abcdef bsdp=0203 errors=0"},
       {"device-properties-hex=0a\ndevice-properties-hex=0g\nnetboot.bsdp-hex=123",
        "properties=0a errors=2 bad@2:device-properties-hex=0g bad@3:netboot.bsdp-hex=123"},
-      {"netboot.dhcp=01\nnetboot.hex=01", "errors=0 unknown@1:netboot.dhcp=01 unknown@2:netboot.hex=01"},
   };
   for (const Row &row : rows) {
     EXPECT_EQ(Summary(row.text), row.summary) << row.text;
