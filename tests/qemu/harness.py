@@ -34,23 +34,10 @@ from pathlib import Path
 REPO = Path(__file__).resolve().parents[2]
 sys.path.insert(0, str(Path(__file__).resolve().parent))
 sys.path.insert(0, str(REPO / "tools" / "qemuboot"))
-from qemuboot import NET_BOOT_FILE, NET_ID, Machine, boot, serve_directory  # noqa: E402,F401
-from scenarios import (  # noqa: E402
-    BASE_CONFIG,
-    KernelExpect,
-    RESUME_PARTITION_GUID,
-    EXTENSIONS_DIR,
-    KernelCache,
-    mkdisk,
-    SCENARIOS,
-    GuestFile,
-    NetScenario,
-    Scenario,
-    ScreenExpect,
-    kernel_file,
-    net_kernel_files,
-    quoted,
-)
+from qemuboot import NET_ID, Machine, boot, serve_directory  # noqa: E402
+from scenarios import (BASE_CONFIG, EXTENSIONS_DIR, RESUME_PARTITION_GUID, GuestFile, KernelCache,  # noqa: E402
+                       KernelExpect, NetScenario, SCENARIOS, Scenario, ScreenExpect, kernel_file, mkdisk,
+                       net_kernel_files, quoted)
 
 # The exit codes of the platform layer and of the reference kernel: one
 # table, no code in both.
@@ -84,9 +71,8 @@ STATUS_OF_PREFIX = {"Aborted": "EFI_ABORTED", "Success": "EFI_SUCCESS", "Other":
 
 
 def read_exit_codes(headers=EXIT_CODE_HEADERS):
-    """The kExit... constants of the headers as one table: code -> Outcome.
-    A code or a name given twice, in one header or across them, or a header
-    without codes, is refused."""
+    """The kExit... constants of the headers as one table: code -> Outcome; refuses
+    a code or name given twice (in one header or across them) and a header without codes."""
     codes = {}
     pattern = re.compile(r"constexpr\s+UINT8\s+kExit(\w+)\s*=\s*(0x[0-9A-Fa-f]+|\d+)\s*;")
     for header in headers:
@@ -102,8 +88,7 @@ def read_exit_codes(headers=EXIT_CODE_HEADERS):
 
 
 def decode_exit(returncode, codes):
-    """QEMU's exit status as an Outcome. The debug-exit device makes QEMU exit
-    with (code << 1) | 1; a plain power-off is 0."""
+    """QEMU's exit status as an Outcome: debug-exit's (code << 1) | 1, or 0 for a power-off."""
     if returncode is None:
         return Outcome("Timeout")
     if returncode < 0:
@@ -119,8 +104,7 @@ def decode_exit(returncode, codes):
 
 
 def check_log(log, expect=(), forbid=()):
-    """Problems with `log`: strings of `expect` missing or out of order, any of
-    `forbid` present. An empty list means the log is as wanted."""
+    """Problems with `log`: strings of `expect` missing or out of order, any of `forbid` present."""
     problems = []
     position = 0
     for text in expect:
@@ -134,8 +118,7 @@ def check_log(log, expect=(), forbid=()):
 
 
 def check_console_modes(log, wanted):
-    """Problems with the console mode changes that the loader asked for
-    against all those `wanted`, in order; None checks nothing."""
+    """Problems with the console modes the loader asked for against all those `wanted` (None: any)."""
     if wanted is None:
         return []
     asked = REPORT_CONSOLE_MODE.findall(log)
@@ -143,9 +126,8 @@ def check_console_modes(log, wanted):
 
 
 def check_report(log, outcome, status, memory, exit_name):
-    """Problems with the platform's report and exit code against what the
-    scenario expects. `exit_name` overrides the outcome expected from status
-    and memory (for runs where the platform itself fails)."""
+    """Problems with the platform's report and exit code; `exit_name` overrides the outcome
+    that status and memory give (for runs where the platform itself fails)."""
     if exit_name is not None:
         return [] if outcome.name == exit_name else [f"exit: wanted {exit_name}, got {outcome.name}"]
     problems = []
@@ -212,8 +194,7 @@ QUOTED = re.compile(r'"((?:[^"\\]|\\["\\]|\\x[0-9a-f]{2})*)"')
 
 
 def unquote(value):
-    """The text of a quoted value of the report (the whole value), its
-    escapes of a quote, a backslash and a byte (x and two digits) undone."""
+    """The text of a quoted value of the report, its escapes (\\", \\\\, \\xNN) undone."""
     quoted = QUOTED.fullmatch(value)
     if quoted is None:
         raise ValueError(f"not a quoted text: {value!r}")
@@ -289,8 +270,7 @@ def parse_kernel_report(log):
 
 
 def matches(wanted, value):
-    """Whether `value` is as `wanted`: a compiled pattern matches the whole
-    text, a callable says so, anything else is equal."""
+    """Whether `value` is as `wanted`: a pattern's full match, a callable's answer, or equality."""
     if isinstance(wanted, re.Pattern):
         return isinstance(value, str) and wanted.fullmatch(value) is not None
     if callable(wanted):
@@ -303,8 +283,7 @@ def describe(wanted):
 
 
 def check_drivers(report, expect, guest_dir=GUEST_DIR):
-    """Problems with the kernel's drivers against `expect`: their source,
-    the blocks in order (identifier, sizes, Adler-32) and the package."""
+    """Problems with the drivers' source, blocks (identifier, sizes, Adler-32) and package."""
     problems = []
     if expect.drivers_from is not None and report.drivers_from != expect.drivers_from:
         problems.append(f"kernel: drivers from {report.drivers_from}, wanted {expect.drivers_from}")
@@ -326,9 +305,8 @@ def check_drivers(report, expect, guest_dir=GUEST_DIR):
 
 
 def check_kernel(log, expect, guest_dir=GUEST_DIR):
-    """Problems with the kernel's report against `expect` (KernelExpect) and
-    with what any report must hold: one start, a result line that agrees
-    with the checks, no broken tree, the "boot-uuid" that the loader printed."""
+    """Problems with the kernel's report against `expect` (KernelExpect) and what any report must
+    hold: one start, a result line that agrees with the checks, no broken tree, the printed "boot-uuid"."""
     report = parse_kernel_report(log)
     if report.starts == 0:
         return ["kernel: no report (no 'kernel: start' line)"]
@@ -339,10 +317,8 @@ def check_kernel(log, expect, guest_dir=GUEST_DIR):
     if report.result is None:
         problems.append("kernel: no result line: the report broke off")
     elif report.result[1:] != (len(report.checks), len(failed)) or report.result[0] != (not failed):
-        problems.append(
-            f"kernel: result line says {report.result}, the checks {len(report.checks)} of which "
-            f"{len(failed)} failed"
-        )
+        problems.append(f"kernel: result line says {report.result}, the checks {len(report.checks)} of which "
+                        f"{len(failed)} failed")
     if expect.result == "pass":
         problems += [f"kernel: check {check.name} FAIL {check.detail}" for check in failed]
         if not report.checks:
@@ -410,9 +386,7 @@ def read_pcap(data):
 
 
 def dhcp_messages(frames):
-    """(client MAC, server's DHCP messages) of the captured frames: the
-    Ethernet source of the client's first message and the UDP payloads
-    that left port 67, in order."""
+    """(the Ethernet source of the client's first DHCP message, the UDP payloads from port 67)."""
     client, answers = None, []
     for frame in frames:
         if frame[12:14] != b"\x08\x00" or len(frame) < 34 or frame[23] != 17:
@@ -444,10 +418,8 @@ def dhcp_type(message):
 
 
 def check_capture(log, pcap):
-    """Problems with the kernel's network identity against the packets on
-    the wire: "dhcp-response" the server's DHCP ACK byte for byte (what
-    follows its end option may be left off if it is zeros), "root-matching"
-    the client's MAC."""
+    """Problems with the kernel's network identity against the wire: "dhcp-response" the server's
+    DHCP ACK byte for byte (trailing zeros may be left off), "root-matching" the client's MAC."""
     try:
         client, answers = dhcp_messages(read_pcap(Path(pcap).read_bytes()))
     except (OSError, ValueError) as error:
@@ -467,10 +439,8 @@ def check_capture(log, pcap):
         problems.append("capture: no whole dhcp-response in the kernel's report")
     elif dhcp != ack[: len(dhcp)] or any(ack[len(dhcp) :]) or len(dhcp) > len(ack):
         first = next((i for i, (a, b) in enumerate(zip(dhcp, ack)) if a != b), min(len(dhcp), len(ack)))
-        problems.append(
-            f"capture: dhcp-response of {len(dhcp)} bytes differs from the ACK of {len(ack)} on the wire "
-            f"at byte {first}"
-        )
+        problems.append(f"capture: dhcp-response of {len(dhcp)} bytes differs from the ACK of {len(ack)} on the "
+                        f"wire at byte {first}")
     return problems
 
 
@@ -509,9 +479,8 @@ def read_ppm(data):
 
 
 def read_artwork(source=ARTWORK):
-    """The loader's pictures, as they should appear on the screen: name ->
-    (red, green, blue) tuples, row by row: "logo" and "failure" of 128 x 128,
-    "spinner0" to "spinner17" of 32 x 32."""
+    """The loader's pictures as name -> (red, green, blue) tuples, row by row: "logo" and
+    "failure" of 128 x 128, "spinner0" to "spinner17" of 32 x 32."""
     text = Path(source).read_text()
 
     def array(name):
@@ -531,10 +500,9 @@ def read_artwork(source=ARTWORK):
 
 
 def check_screen(image, expect, artwork=None):
-    """Problems with a screenshot against `expect` (ScreenExpect), in two
-    lists: the background and the picture named (exactly, centred; without
-    `artwork`, anything there), and anything else on the screen (all that
-    isn't background larger than the picture or off the centre)."""
+    """Problems with a screenshot against `expect` (ScreenExpect) in two lists: the background and the picture
+    (exactly, centred; without `artwork`, anything there), and anything else on the screen (what isn't
+    background larger than the picture or off the centre)."""
     if expect.background is None:  # a screen of no fixed background: only taken
         return [], []
     background = bytes(expect.background)
@@ -544,18 +512,12 @@ def check_screen(image, expect, artwork=None):
     x0, y0 = (image.width - PICTURE_SIZE) >> 1, (image.height - PICTURE_SIZE) >> 1
     if artwork is not None and expect.picture is not None:
         wanted = artwork[expect.picture]
-        wrong = [
-            (x, y)
-            for y in range(PICTURE_SIZE)
-            for x in range(PICTURE_SIZE)
-            if image.pixel(x0 + x, y0 + y) != wanted[y * PICTURE_SIZE + x]
-        ]
+        wrong = [(x, y) for y in range(PICTURE_SIZE) for x in range(PICTURE_SIZE)
+                 if image.pixel(x0 + x, y0 + y) != wanted[y * PICTURE_SIZE + x]]
         if wrong:
             x, y = wrong[0]
-            problems.append(
-                f"screen: {len(wrong)} pixels of the {expect.picture} at ({x0}, {y0}) differ; first at "
-                f"({x}, {y}): {image.pixel(x0 + x, y0 + y)}, wanted {wanted[y * PICTURE_SIZE + x]}"
-            )
+            problems.append(f"screen: {len(wrong)} pixels of the {expect.picture} at ({x0}, {y0}) differ; first at "
+                            f"({x}, {y}): {image.pixel(x0 + x, y0 + y)}, wanted {wanted[y * PICTURE_SIZE + x]}")
     elif all(image.rows[y0 + y][3 * x0 : 3 * (x0 + PICTURE_SIZE)] == background * PICTURE_SIZE
              for y in range(PICTURE_SIZE)):  # fmt: skip
         problems.append(f"screen: no picture at ({x0}, {y0})")
@@ -579,8 +541,7 @@ def check_screen(image, expect, artwork=None):
 
 
 def spinner_frame(image, artwork):
-    """The number of the spinner's frame in its square of the screen; None
-    when the square is all background, -1 when it holds anything else."""
+    """The spinner's frame in its square; None when all background, -1 for anything else."""
     x0 = (image.width - SPINNER_SIZE) >> 1
     y0 = ((image.height - SPINNER_SIZE) >> 1) + SPINNER_DROP
     square = [image.pixel(x0 + x, y0 + y) for y in range(SPINNER_SIZE) for x in range(SPINNER_SIZE)]
@@ -593,9 +554,8 @@ def spinner_frame(image, artwork):
 
 
 def check_spinner(paths, expect):
-    """Problems with the spinner in the screenshots of a scenario: "turning"
-    wants a frame of the spinner in each of two, and two different frames;
-    "gone" wants its square all background in the first."""
+    """Problems with the spinner in the screenshots: "turning" wants two different frames of it in
+    two, "gone" its square all background in the first."""
     if expect.spinner is None:
         return []
     try:
@@ -613,8 +573,7 @@ def check_spinner(paths, expect):
 
 
 def check_screenshot(path, expect):
-    """check_screen of a screenshot file; a missing or unreadable file is a problem
-    of the first list."""
+    """check_screen of a screenshot file; a missing or unreadable file is a problem of the first list."""
     if path is None or not Path(path).is_file():
         return [f"screen: no screenshot (nothing matched {expect.when!r} in time)"], []
     try:
@@ -631,20 +590,16 @@ CELL_WIDTH, CELL_HEIGHT = 8, 19
 
 
 def cell(image, x, y):
-    """The pixels of the character cell at (x, y), as a tuple of rows; None
-    when they are all one colour (a blank)."""
+    """The pixels of the character cell at (x, y) as a tuple of rows; None for a blank."""
     rows = tuple(image.rows[y + dy][3 * x : 3 * (x + CELL_WIDTH)] for dy in range(CELL_HEIGHT))
     return None if all(row == rows[0][:3] * CELL_WIDTH for row in rows) else rows
 
 
 def find_text(image, text):
-    """Where a line of the firmware's text console reads `text`: (x, y) of
-    its first cell (or of a window a few rows above it, where the glyphs'
-    blank tops allow), or None. A line reads `text` when its cells are blank
-    exactly where `text` has blanks, and two of them are the same picture
-    exactly where `text` has the same character: a pattern that no other
-    text of the length, and no picture, gives by chance. The cell behind the
-    text must be blank."""
+    """Where a line of the firmware's text console reads `text` (then a blank cell): (x, y) of its first cell
+    (or a few rows above, within the glyphs' blank tops), or None. Its cells are blank exactly where `text`
+    has blanks and alike exactly where `text` has the same character: a pattern that no other text of the
+    length, and no picture, gives by chance."""
     pattern = list(text) + [" "]
     width = CELL_WIDTH * len(pattern)
     for y in range(image.height - CELL_HEIGHT + 1):
@@ -662,10 +617,9 @@ def find_text(image, text):
 
 
 def watch_screen(scenario, workdir):
-    """qemuboot's on_tick for a bare machine: a screenshot each time, until
-    every line of `scenario.screen_text` is on the screen; then Enter is
-    pressed, and the run stops once the first line is gone and the text
-    `after_key` is there. Returns it and the list of what it saw."""
+    """qemuboot's on_tick for a bare machine: screenshots until every line of `screen_text` is on the screen,
+    then Enter, then the run stops once the first line is gone and `after_key` is there. Returns it and the
+    list of what it saw."""
     steps = [scenario.screen_text, (scenario.after_key,)]
     seen = []
 
@@ -689,9 +643,8 @@ def watch_screen(scenario, workdir):
 
 
 def config_value(value):
-    """A value as platform.cfg writes it: quoted with escapes when it has
-    blanks at its ends, quotes, backslash escapes' letters or control
-    characters, else as it stands."""
+    """A value as platform.cfg writes it: quoted with escapes when it has blanks at its ends, a
+    leading quote, a tab or a line break, else as it stands."""
     value = str(value)
     if value == value.strip(" \t") and not value.startswith('"') and not re.search(r"[\r\n\t]", value):
         return value
@@ -706,15 +659,13 @@ def render_config(keys):
 
 
 def scenario_config(scenario, override=None):
-    """The keys of the scenario's platform.cfg: the base configuration unless
-    the scenario opts out, then the scenario's own, then `override`; a later
-    value of a key replaces an earlier one in its place."""
+    """The keys of the scenario's platform.cfg: the base configuration unless the scenario opts out,
+    then its own, then `override`; a later value of a key replaces an earlier one in its place."""
     return {**(BASE_CONFIG if scenario.base_config else {}), **scenario.config, **(override or {})}
 
 
 def content_bytes(content, guest_dir=GUEST_DIR):
-    """The bytes of a file's content as scenarios give it: bytes, text, a
-    host Path or a GuestFile."""
+    """The bytes of a file's content: bytes, text, a host Path or a GuestFile."""
     if isinstance(content, GuestFile):
         path = Path(guest_dir) / content.name
         if not path.is_file():
@@ -727,8 +678,7 @@ def content_bytes(content, guest_dir=GUEST_DIR):
 
 
 def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
-    """Writes the scenario's files and directories into `volume`, with
-    platform.cfg of `config` when it has keys, and sets the exact times."""
+    """Writes the scenario's files, directories, platform.cfg (of `config`) and times into `volume`."""
     files = {**(scenario.extensions or {}), **scenario.files}
     if config:
         files[f"{mkdisk.BOOT_DIR}/{mkdisk.CONFIG_NAME}"] = render_config(config)
@@ -744,9 +694,8 @@ def stage_volume(scenario, volume, config, guest_dir=GUEST_DIR):
 
 
 def make_cache(cache, volume, disk_bytes=mkdisk.DISK_BYTES):
-    """Writes the kernel cache of `cache` (KernelCache) on the staged volume
-    with kcache for the harness's machine, then shifts its time or breaks its
-    checksum as asked. Returns its name, as kcache printed it."""
+    """Writes the kernel cache of `cache` (KernelCache) on the staged volume with kcache, then shifts
+    its time or breaks its checksum as asked. Returns its name, as kcache printed it."""
     kcache = Path(TOOLS_DIR) / "kcache"
     if not kcache.is_file():
         raise FileNotFoundError(f"{kcache} is missing: build the target kcache first")
@@ -765,9 +714,8 @@ def make_cache(cache, volume, disk_bytes=mkdisk.DISK_BYTES):
 
 
 def prepare(scenario, efi_dir, workdir, config_override=None, guest_dir=GUEST_DIR):
-    """Builds the scenario's disk in `workdir` with the disk tool, or its
-    served directory. Returns its path and the name of the kernel cache on
-    it, or None."""
+    """Builds the scenario's disk (or served directory) in `workdir`; returns its path and the name
+    of the kernel cache on it, or None."""
     efi_dir = Path(efi_dir)
     volume = workdir / "volume"
     volume.mkdir()
@@ -796,17 +744,15 @@ def prepare(scenario, efi_dir, workdir, config_override=None, guest_dir=GUEST_DI
 # --- hibernation resume -----------------------------------------------------------------
 
 RESUME_PARTITION = 2  # where make_resume puts the image
-READ_LINE = re.compile(
-    rf"platform: read partition={RESUME_PARTITION} offset=0x([0-9a-f]+) size=0x([0-9a-f]+) to=0x([0-9a-f]+)"
-)
+READ_LINE = re.compile(rf"platform: read partition={RESUME_PARTITION} offset=0x([0-9a-f]+) size=0x([0-9a-f]+) "
+                       r"to=0x([0-9a-f]+)")
 KEY_COPY = re.compile(r"platform: key copy at 0x([0-9a-f]+) type (\d+)")
 KEY_TRACE = re.compile(r'resume trace kind=key address=0x([0-9a-f]+) where="([^"]*)"')
 
 
 def make_resume(resume, workdir, guest_dir, disk_bytes):
-    """Writes the scenario's resume image onto a partition image with
-    mkresume and the restart probe; returns its path and the platform.cfg
-    keys that ask for the restart."""
+    """Writes the resume image onto a partition image with mkresume and the restart probe; returns
+    its path and the platform.cfg keys that ask for the restart."""
     probe = Path(guest_dir) / RESUME_PROBE
     if not probe.is_file():
         raise FileNotFoundError(f"{probe} is missing: build the target guest_kernel first")
@@ -827,9 +773,8 @@ def make_resume(resume, workdir, guest_dir, disk_bytes):
 
 
 def check_key_trace(log):
-    """Problems with the places where the restart probe found the key: any
-    copy "elsewhere" that the platform did not find before the loader
-    started, the loader left behind."""
+    """Problems with the key's copies that the restart probe found "elsewhere": any that the
+    platform did not find before the loader started, the loader left behind."""
     firmware = {int(address, 16) for address, _ in KEY_COPY.findall(log)}
     found = KEY_TRACE.findall(log)
     return [f"key: the key's bytes at {address} are no copy of the firmware's" for address, where in found
@@ -837,9 +782,8 @@ def check_key_trace(log):
 
 
 def check_resume_reads(log, expect):
-    """Problems with the loader's reads of the image's partition before the
-    reset against `expect` (ResumeReads): the header first, then at most
-    `after_header` reads inside the first stage behind a page-aligned header."""
+    """Problems with the loader's reads of the image's partition before the reset (ResumeReads): the
+    header first, then at most `after_header` reads inside the first stage behind a page-aligned header."""
     if expect is None:
         return []
     reads = [tuple(int(v, 16) for v in m) for m in READ_LINE.findall(log)]
@@ -864,13 +808,15 @@ def check_resume_reads(log, expect):
 Result = collections.namedtuple("Result", "passed seconds outcome problems log workdir")
 
 
-def watch(scenario, workdir, served, png=False):
-    """qemuboot's on_line for a scenario: its screenshots (with `png`, one as
-    screen.png too), its actions and its count of starts. Returns it, the
-    shots taken, a list of troubles and the actions not done."""
+def watch(scenario, workdir, served, png=False, keys_on_line=None):
+    """qemuboot's on_line for a scenario: its screenshots (with `png`, one as screen.png too), its actions,
+    its count of starts and `keys_on_line`. Returns it, the shots taken, a list of troubles, the actions not
+    done and the line it stopped at."""
     shots, trouble, pending, starts, stopped = [], [], list(scenario.actions), [0], []
 
     def on_line(line, qmp):
+        if keys_on_line is not None:
+            keys_on_line(line)
         if scenario.screen is not None and not shots and scenario.screen.when in line:
             shots.append(workdir / "screen.ppm")
             qmp.screendump(shots[0])
@@ -899,9 +845,8 @@ def watch(scenario, workdir, served, png=False):
 
 
 def hold_keys(scenario):
-    """QEMU's extra arguments and qemuboot's on_tick for the scenario's held
-    keys, and the on_line that follows the platform's start and its reading
-    of the keyboard; all empty or None without held keys."""
+    """QEMU's extra arguments, qemuboot's on_tick and an on_line (following the platform's start and
+    keyboard reading) for the scenario's held keys; empty or None without them."""
     if not scenario.held:
         return (), None, None
     events = [{"type": "key", "data": {"down": True, "key": {"type": "qcode", "data": key}}}
@@ -941,16 +886,9 @@ def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
         (workdir / "before").mkdir()
         first_disk, _ = prepare(first, efi_dir, workdir / "before", guest_dir=guest_dir)
         _, earlier, error = boot(first_disk, workdir, limit, echo=echo, extra=scenario.qemu_args, usb=scenario.usb)
-    on_line, shots, trouble, pending, stopped = watch(scenario, workdir, disk, png=echo)
-    on_tick, seen = watch_screen(scenario, workdir) if scenario.screen_text else (None, [])
     held_args, keys_tick, keys_on_line = hold_keys(scenario)
-    if keys_on_line is not None:
-        watch_line = on_line
-
-        def on_line(line, qmp):
-            keys_on_line(line)
-            return watch_line(line, qmp)
-
+    on_line, shots, trouble, pending, stopped = watch(scenario, workdir, disk, echo, keys_on_line)
+    on_tick, seen = watch_screen(scenario, workdir) if scenario.screen_text else (None, [])
     returncode, log, later_error = boot(disk, workdir, limit, on_line, network=scenario.network,
                                         reboot=scenario.boots > 1,
                                         qmp=bool(screen or scenario.actions or on_tick or keys_tick), echo=echo,
@@ -995,17 +933,15 @@ def report(scenario, result):
     if result.passed:
         shutil.rmtree(result.workdir, ignore_errors=True)
         return
-    for problem in result.problems:
-        print(f"  {problem}")
+    problems = "".join(f"  {problem}\n" for problem in result.problems)
+    print(problems, end="")
     print(f"--- serial log ({result.workdir / 'serial.log'}, cleaned) ---")
     print(result.log.rstrip())
     qemu_log = (result.workdir / "qemu.log").read_text(errors="replace").strip()
     if qemu_log:
         print(f"--- qemu ---\n{qemu_log}")
     # Once more behind the long log, where a reader of the output looks first.
-    print(f"--- {scenario.name}: {len(result.problems)} expectation(s) failed ---")
-    for problem in result.problems:
-        print(f"  {problem}")
+    print(f"--- {scenario.name}: {len(result.problems)} expectation(s) failed ---\n{problems}", end="")
     print(f"--- files kept in {result.workdir} ---")
 
 
@@ -1024,8 +960,7 @@ NET_DEMO = NetScenario("demo-net", config={"options": "guest.hold=4"}, files=net
 
 
 def demo(efi_dir, guest_dir=GUEST_DIR, network=False):
-    """Runs the demo as a scenario, its serial log printed as it comes, and
-    copies its screenshot to out/ (and docs/). True when it passed."""
+    """Runs the demo, its serial log printed as it comes; its screenshot to out/ (and docs/)."""
     scenario = NET_DEMO if network else DEMO
     result = run_scenario(scenario, efi_dir, guest_dir, echo=True)
     drivers = parse_kernel_report(result.log).drivers

@@ -15,6 +15,7 @@ import mkdisk  # noqa: E402
 from qemuboot import NET_MAC  # noqa: E402
 
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
+MISSING_LOADER = "\\EFI\\BOOT\\missing.efi"
 
 # What every scenario's platform.cfg starts with, unless the scenario says
 # otherwise: the end through the debug-exit device and the platform records
@@ -103,9 +104,8 @@ class AtLeast:
 
 @dataclasses.dataclass(frozen=True)
 class KernelExpect:
-    """What the reference kernel's report must hold. Wanted values are
-    compared with ==, except a compiled pattern (full match of the text as
-    the report prints it) and a callable such as AtLeast (true for the
+    """What the reference kernel's report must hold. Wanted values are compared with ==, except a compiled
+    pattern (full match of the text as the report prints it) and a callable such as AtLeast (true for the
     value)."""
 
     # "pass": every check ok and the result line says so; "fail": at least
@@ -132,9 +132,8 @@ class KernelExpect:
 
 @dataclasses.dataclass(frozen=True)
 class DriverExpect:
-    """A driver block as the kernel must find it: the text of the bundle's
-    Info.plist and the code (its x86 slice), as content (bytes, text, a host
-    Path or a GuestFile)."""
+    """A driver block as the kernel must find it: the text of the bundle's Info.plist and the code (its x86
+    slice), as content (bytes, text, a host Path or a GuestFile)."""
 
     plist: object
     code: object = b""
@@ -142,9 +141,8 @@ class DriverExpect:
 
 @dataclasses.dataclass(frozen=True)
 class ScreenExpect:
-    """A screenshot, taken once a line of the serial log holds `when`, and
-    what it must show: the background colour in the corner and the
-    loader's artwork `picture` ("logo", "failure"; None: any picture) at the
+    """A screenshot, taken once a line of the serial log holds `when`, and what it must show: the background
+    colour in the corner and the loader's artwork `picture` ("logo", "failure"; None: any picture) at the
     place of a centred 128 x 128 picture, and, when `alone`, nothing else."""
 
     when: str
@@ -180,9 +178,8 @@ def test_picture(width, height):
 
 @dataclasses.dataclass(frozen=True)
 class ResumeImage:
-    """A resume image on a raw partition, written by tools/mkresume with the
-    restart probe of tests/guest/ as its restart code; the NVRAM settings
-    that ask for it go into platform.cfg (a scenario's own keys win)."""
+    """A resume image on a raw partition, written by tools/mkresume with the restart probe of tests/guest/ as
+    its restart code; the NVRAM settings that ask for it go into platform.cfg (a scenario's own keys win)."""
 
     # mkresume's options beyond the partition's.
     args: tuple = ()
@@ -193,9 +190,8 @@ class ResumeImage:
 
 @dataclasses.dataclass(frozen=True)
 class ResumeReads:
-    """The loader's DiskIO reads before a reset, as the platform logs them:
-    the header first, then at most `after_header` reads (None: any), each
-    inside the `first_stage` bytes behind a page-aligned header."""
+    """The loader's DiskIO reads before a reset, as the platform logs them: the header first, then at most
+    `after_header` reads (None: any), each inside the `first_stage` bytes behind a page-aligned header."""
 
     after_header: int | None = 0
     first_stage: int = 1 << 20
@@ -226,31 +222,27 @@ def driver_code(seed, length):
 
 
 def standard_extensions():
-    """The extensions directory that every volume carries unless its scenario
-    says otherwise: a flat bundle with code, a full-layout bundle whose code
-    is a fat file (tests/guest's driver.fat, whose x86 slice is the file
-    nimb_kernel) with a nested bundle that has no code, and a "Safe Boot"
-    bundle that the loader leaves out."""
+    """The extensions directory that every volume carries unless its scenario says otherwise: a flat bundle
+    with code, a full-layout bundle whose code is a fat file (tests/guest's driver.fat, whose x86 slice is the
+    file nimb_kernel) with a nested bundle that has no code, and a "Safe Boot" bundle that the loader leaves
+    out."""
     root = EXTENSIONS_DIR
     return {
         f"{root}/Console.drvb/Info.plist": driver_plist("com.quill.driver.Console", "Root", "Console"),
         f"{root}/Console.drvb/Console": driver_code(1, 1001),
-        f"{root}/Storage.drvb/Contents/Info.plist": driver_plist(
-            "com.quill.driver.Storage", "Local-Root", "Storage", libraries=("com.quill.driver.Console",)
-        ),
+        f"{root}/Storage.drvb/Contents/Info.plist": driver_plist("com.quill.driver.Storage", "Local-Root", "Storage",
+                                                                 libraries=("com.quill.driver.Console",)),
         f"{root}/Storage.drvb/Contents/Tarnix/Storage": GuestFile("driver.fat"),
-        f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist": driver_plist(
-            "com.quill.driver.Partition", ""
-        ),
+        f"{root}/Storage.drvb/Contents/PlugIns/Partition.drvb/Info.plist":
+            driver_plist("com.quill.driver.Partition", ""),
         f"{root}/Network.drvb/Info.plist": driver_plist("com.quill.driver.Network", "Safe Boot", "Network"),
         f"{root}/Network.drvb/Network": driver_code(3, 64),
     }
 
 
 def standard_drivers():
-    """The driver blocks that the standard extensions give, in the order of
-    discovery: each kept bundle, its nested ones right behind it; the
-    "Safe Boot" bundle is left out, in safe mode too."""
+    """The driver blocks that the standard extensions give, in the order of discovery: each kept bundle, its
+    nested ones right behind it; the "Safe Boot" bundle is left out, in safe mode too."""
     files = standard_extensions()
     root = EXTENSIONS_DIR
     return {
@@ -272,9 +264,8 @@ PACKAGE_SLICE = GuestFile("nimb_kernel")
 
 @dataclasses.dataclass(frozen=True)
 class KernelCache:
-    """A kernel cache that kcache writes on the volume for the harness's
-    machine, timed one second after the newer of the kernel and the
-    extensions, plus `shift` seconds. "volume:" arguments are volume paths."""
+    """A kernel cache that kcache writes on the volume for the harness's machine, timed one second after the
+    newer of the kernel and the extensions, plus `shift` seconds. "volume:" arguments are volume paths."""
 
     args: tuple = ()
     kernel: str = "nimb_kernel"
@@ -384,10 +375,19 @@ class Scenario:
 
 
 def fatal(name, *messages, before=(), make=Scenario, **knobs):
-    """A boot that the loader gives up: the platform's lines `before`, then
-    `messages`, then the loader back with EFI_ABORTED and the firmware's free
-    memory as it was before the start (the Scenario's defaults)."""
+    """A boot that the loader gives up: the platform's lines `before`, then `messages`, then the loader back
+    with EFI_ABORTED and the firmware's free memory as it was before the start (the Scenario's defaults)."""
     return make(name, expect=(*before, "platform: starting", *messages, "platform: loader returned"), **knobs)
+
+
+def boots(name, expect=(LOADING_KERNEL, KERNEL_START), kernel=None, files=None, **knobs):
+    """A boot of the reference kernel (by default from the volume's root) whose checks all pass."""
+    return Scenario(name, files=kernel_file() if files is None else files, expect=expect, exit="KernelPass",
+                    kernel=kernel or KernelExpect(), **knobs)
+
+
+# A verbose boot: -v for the kernel, which finds a text console.
+VERBOSE = KernelExpect(bootargs={"commandLine": "-v", "videoDisplayMode": 2})
 
 
 # A driver whose code is a fat file that declares an x86 slice of 3.75 GiB:
@@ -398,10 +398,9 @@ HUGE_DRIVER = {
 }
 
 def low_kernel(room):
-    """A kernel object of one page of code that leaves `room` pages below
-    the legacy video hole at 640 KiB, never memory: the boot record (a page),
-    colour table (one), failure picture (five), device tree (one), memory map
-    and runtime area that follow it run into the hole in turn."""
+    """A kernel object of one page of code that leaves `room` pages below the legacy video hole at 640 KiB,
+    never memory: the boot record (a page), colour table (one), failure picture (five), device tree (one),
+    memory map and runtime area that follow it run into the hole in turn."""
     address = 0xA0000 - (room + 1) * 0x1000
 
     def command(kind, length, words):
@@ -465,46 +464,27 @@ _TABLE = [
     # Keys held on the machine's own keyboard from power-on, read by the
     # platform (no keys= in platform.cfg): Shift alone is safe mode, -x for
     # the kernel; GUI-V a verbose boot, on the PS/2 keyboard and a USB one.
-    Scenario("keys_held_shift", held=("shift",), files=kernel_file(), exit="KernelPass",
-             expect=("platform: keys: modifiers 0x2, 0 keys, ignored 0, from keyboard", "Using Safe Mode",
-                     KERNEL_START),
-             kernel=KernelExpect(bootargs={"commandLine": "-x"})),
-    *(Scenario(name, held=("meta_l", "v"), usb_keyboard=usb, config={"console": "graphics"}, files=kernel_file(),
-               expect=("platform: keys: modifiers 0x8, 1 keys, ignored 0, from keyboard", KERNEL_START),
-               console_modes=("text",), exit="KernelPass",
-               kernel=KernelExpect(bootargs={"commandLine": "-v", "videoDisplayMode": 2}))
+    boots("keys_held_shift", ("platform: keys: modifiers 0x2, 0 keys, ignored 0, from keyboard", "Using Safe Mode",
+                              KERNEL_START), KernelExpect(bootargs={"commandLine": "-x"}), held=("shift",)),
+    *(boots(name, ("platform: keys: modifiers 0x8, 1 keys, ignored 0, from keyboard", KERNEL_START), VERBOSE,
+            held=("meta_l", "v"), usb_keyboard=usb, config={"console": "graphics"}, console_modes=("text",))
       for name, usb in [("keys_held_gui_v", False), ("keys_held_gui_v_usb", True)]),
     # The platform's own way out: an unknown key is reported and ignored, and
     # a loader that isn't there ends the run before anything starts.
-    Scenario(
-        "platform_no_loader",
-        base_config=False,
-        config={"colour": "blue", "loader": "\\EFI\\BOOT\\missing.efi"},
-        expect=(
-            "platform: platform.cfg line 1: unknown key 'colour' ignored",
-            "platform: error: loader \\EFI\\BOOT\\missing.efi not found (EFI_NOT_FOUND)",
-            # The same on the firmware's console, which OVMF mirrors to the port.
-            "Platform error: loader \\EFI\\BOOT\\missing.efi not found (EFI_NOT_FOUND)",
-        ),
-        forbid=("platform: starting",),
-        exit="LoaderMissing",
-    ),
+    # The same error on the firmware's console, which OVMF mirrors to the port.
+    Scenario("platform_no_loader", base_config=False, config={"colour": "blue", "loader": MISSING_LOADER},
+             expect=("platform: platform.cfg line 1: unknown key 'colour' ignored",
+                     f"platform: error: loader {MISSING_LOADER} not found (EFI_NOT_FOUND)",
+                     f"Platform error: loader {MISSING_LOADER} not found (EFI_NOT_FOUND)"),
+             forbid=("platform: starting",), exit="LoaderMissing"),
     # A plain graphics boot of the reference kernel from the volume's root,
     # with what every boot hands over. The boot device path that the disk
     # tool computes for kernel caches is the one the firmware gives.
-    Scenario(
+    boots(
         "kernel_plain",
-        config={"console": "graphics", "options": "foo=1"},
-        files=kernel_file(),
-        expect=(
-            f"platform: boot device path {mkdisk.boot_device_path().hex()}\n",
-            LOADING_KERNEL,
-            f"{ROOT_UUID}{PARTITION_GUID}'",
-            KERNEL_START,
-        ),
-        forbid=("platform: loader returned",),
-        exit="KernelPass",
-        kernel=KernelExpect(
+        (f"platform: boot device path {mkdisk.boot_device_path().hex()}\n", LOADING_KERNEL,
+         f"{ROOT_UUID}{PARTITION_GUID}'", KERNEL_START),
+        KernelExpect(
             bootargs={"commandLine": "foo=1", "videoDisplayMode": 1, "videoWidth": AtLeast(640),
                       "runtimePageCount": AtLeast(2)},
             tree={
@@ -519,101 +499,55 @@ _TABLE = [
             },
             ranges={"BootCLUT": 0x300, "Pict-FailedBoot": 0x4020},
         ),
+        config={"console": "graphics", "options": "foo=1"},
+        forbid=("platform: loader returned",),
     ),  # fmt: skip
     # Without debug-exit the platform goes back to the firmware with an
     # error, which the firmware's boot manager reports before its next
     # option, with the file system as it was.
-    Scenario(
-        "platform_back_to_firmware",
-        config={"debug-exit": "0", "loader": "\\EFI\\BOOT\\missing.efi"},
-        expect=("platform: debug-exit not used", "platform: exit code 0x21",
-                "back to the firmware with EFI_LOAD_ERROR", "failed to start Boot0002", ": Load Error", "FS0:"),
-        stop_at="FS0:",
-        exit="Stopped",
-    ),
+    Scenario("platform_back_to_firmware", config={"debug-exit": "0", "loader": MISSING_LOADER},
+             expect=("platform: debug-exit not used", "platform: exit code 0x21",
+                     "back to the firmware with EFI_LOAD_ERROR", "failed to start Boot0002", ": Load Error", "FS0:"),
+             stop_at="FS0:", exit="Stopped"),
     # A firmware without graphics output: the loader finds a text console,
     # is refused the graphics it asks for and boots the kernel in text.
-    Scenario(
-        "kernel_no_graphics",
-        config={"console": "graphics"},
-        files=kernel_file(),
-        qemu_args=("-vga", "none"),
-        expect=("platform: no graphics output: console text", "platform: starting \\EFI\\BOOT\\nimbboot.efi, console text",
-                "platform: console mode graphics refused (EFI_UNSUPPORTED)", LOADING_KERNEL, KERNEL_START),
-        console_modes=("graphics",),
-        exit="KernelPass",
-        kernel=KernelExpect(bootargs={"videoDisplayMode": 2}),
-    ),
+    boots("kernel_no_graphics",
+          ("platform: no graphics output: console text", "platform: starting \\EFI\\BOOT\\nimbboot.efi, console text",
+           "platform: console mode graphics refused (EFI_UNSUPPORTED)", LOADING_KERNEL, KERNEL_START),
+          KernelExpect(bootargs={"videoDisplayMode": 2}), config={"console": "graphics"}, qemu_args=("-vga", "none"),
+          console_modes=("graphics",)),
     # A PC without serial port and debug-exit device: the outcome and the
     # request for a key on the screen, then the firmware's own shell once
     # the platform went back to it.
-    Scenario(
-        "screen_outcome_bare",
-        config={"wait-key": "1"},
-        bare=True,
-        screen_text=("The loader returned EFI_ABORTED (0x8000000000000015).", "Press a key to go on."),
-        after_key="Shell>",
-        exit="Stopped",
-        timeout=150.0,
-    ),
+    Scenario("screen_outcome_bare", config={"wait-key": "1"}, bare=True,
+             screen_text=("The loader returned EFI_ABORTED (0x8000000000000015).", "Press a key to go on."),
+             after_key="Shell>", exit="Stopped", timeout=150.0),
     # -v: the console goes to text and stays there for the kernel.
-    Scenario(
-        "kernel_verbose",
-        config={"console": "graphics", "options": "-v"},
-        files=kernel_file(),
-        expect=(LOADING_KERNEL, KERNEL_START),
-        console_modes=("text",),
-        exit="KernelPass",
-        kernel=KernelExpect(bootargs={"commandLine": "-v", "videoDisplayMode": 2}),
-    ),
+    boots("kernel_verbose", kernel=VERBOSE, config={"console": "graphics", "options": "-v"}, console_modes=("text",)),
     # The command line merged from load options, boot-args and the
     # configuration file's Kernel Flags (the first to name a key wins), and
     # the configuration file's Root UUID in place of the volume's.
-    Scenario(
-        "kernel_config",
-        config={"options": "foo=1", "nvram.boot-args": "foo=2 bar=3"},
-        files={**kernel_file(), BOOT_PLIST: plist({"Kernel Flags": "baz=4 bar=5", "Root UUID": "not-a-uuid"})},
-        expect=(LOADING_KERNEL, f"{ROOT_UUID}not-a-uuid'", KERNEL_START),
-        forbid=(PARTITION_GUID,),
-        exit="KernelPass",
-        kernel=KernelExpect(
-            bootargs={"commandLine": "foo=1 bar=3 baz=4"},
-            tree={"/chosen": {"boot-uuid": text("not-a-uuid"), "boot-args": text("foo=1 bar=3 baz=4")}},
-        ),
-    ),
+    boots("kernel_config", (LOADING_KERNEL, f"{ROOT_UUID}not-a-uuid'", KERNEL_START),
+          KernelExpect(bootargs={"commandLine": "foo=1 bar=3 baz=4"},
+                       tree={"/chosen": {"boot-uuid": text("not-a-uuid"), "boot-args": text("foo=1 bar=3 baz=4")}}),
+          {**kernel_file(), BOOT_PLIST: plist({"Kernel Flags": "baz=4 bar=5", "Root UUID": "not-a-uuid"})},
+          config={"options": "foo=1", "nvram.boot-args": "foo=2 bar=3"}, forbid=(PARTITION_GUID,)),
     # What the platform hands over for the kernel: a device properties blob
     # larger than the loader's first buffer (so it asks twice) and the two
     # network answers, all of which reach the tree.
-    Scenario(
-        "kernel_devices",
-        config={
-            "options": "foo=1",
-            "device-properties-hex": bytes(i * 7 % 256 for i in range(5000)).hex(),
-            "netboot.dhcp-hex": bytes(range(200)).hex(),
-            "netboot.bsdp-hex": "0102030405",
-        },
-        files=kernel_file(),
-        expect=("platform: device properties asked with 4096 bytes: EFI_BUFFER_TOO_SMALL, 5000 bytes",
-                KERNEL_START),
-        exit="KernelPass",
-        kernel=KernelExpect(
-            tree={
-                "/efi": {"device-properties": re.compile(r"<00 07 0e 15 .*\.\.\.> \(5000 bytes\)")},
-                "/chosen": {"dhcp-response": re.compile(r"<00 01 02 03 .*\.\.\.> \(200 bytes\)"),
-                            "svcd-response": "<01 02 03 04 05>"},
-            },
-        ),
-    ),  # fmt: skip
+    boots("kernel_devices", ("platform: device properties asked with 4096 bytes: EFI_BUFFER_TOO_SMALL, 5000 bytes",
+                             KERNEL_START),
+          KernelExpect(tree={
+              "/efi": {"device-properties": re.compile(r"<00 07 0e 15 .*\.\.\.> \(5000 bytes\)")},
+              "/chosen": {"dhcp-response": re.compile(r"<00 01 02 03 .*\.\.\.> \(200 bytes\)"),
+                          "svcd-response": "<01 02 03 04 05>"}}),
+          config={"options": "foo=1", "device-properties-hex": bytes(i * 7 % 256 for i in range(5000)).hex(),
+                  "netboot.dhcp-hex": bytes(range(200)).hex(), "netboot.bsdp-hex": "0102030405"}),  # fmt: skip
     # The boot screen as the kernel finds it: the logo alone in the middle
     # of the grey screen (the platform keeps the loader's text off it).
-    Scenario(
-        "screen_logo",
-        config={"console": "graphics", "options": "guest.hold=3"},
-        files=kernel_file(),
-        exit="KernelPass",
-        kernel=KernelExpect(bootargs={"videoDisplayMode": 1}),
-        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True),
-    ),
+    boots("screen_logo", (), KernelExpect(bootargs={"videoDisplayMode": 1}),
+          config={"console": "graphics", "options": "guest.hold=3"},
+          screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True)),
     # A failed graphics boot ends on the failure picture, taken while the
     # platform holds the machine after the loader came back.
     fatal("screen_failure", KERNEL_ERROR, config={"console": "graphics", "hold": 2},
@@ -621,9 +555,8 @@ _TABLE = [
 ]
 # The kernel as fat files, either byte order, under the default name.
 _TABLE += [
-    Scenario(f"kernel_fat_{order}", files=kernel_file(f"nimb_kernel.fat-{order}"),
-             expect=(LOADING_KERNEL, KERNEL_START), exit="KernelPass",
-             kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}))
+    boots(f"kernel_fat_{order}", kernel=KernelExpect(tree={"/chosen": {"boot-file": text("nimb_kernel")}}),
+          files=kernel_file(f"nimb_kernel.fat-{order}"))
     for order in ("be", "le")
 ]  # fmt: skip
 
@@ -667,58 +600,41 @@ def net_file_path(name):
 
 # A network boot: nothing but the served files (no extensions directory).
 NetScenario = functools.partial(Scenario, network=True, extensions=None, timeout=150.0)
+
+
+def net_boots(name, expect, kernel, files=None, **knobs):
+    """A network boot of the reference kernel, by default the served kernel with its package."""
+    return boots(name, expect, kernel, files or net_kernel_files(), network=True, extensions=None, timeout=150.0,
+                 **knobs)
+
 READING_BIG = f"net read of {NET_KERNEL} into"
 
 _TABLE += [
     # The firmware's PXE starts the platform, which serves the loader's files
     # from the same TFTP server: the reference kernel boots with the network's
     # identity and the server's real answers in its tree.
-    NetScenario(
-        "net_kernel",
-        config={"options": "foo=1 guest.hold=1"},
-        files=net_kernel_files(),
-        expect=(
-            "platform: net boot: station",
-            "platform: net read of nimbboot.efi",
-            f"platform: net read of {NET_PACKAGE} into",
-            KERNEL_START,
-        ),
-        exit="KernelPass",
-        kernel=KernelExpect(
-            bootargs={"commandLine": "foo=1 guest.hold=1"},
-            tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
-            ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)},
-        ),
-        capture=True,
-        # The spinner is wiped before the hand-off: the logo stands alone.
-        screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone"),
-    ),
+    # The spinner is wiped before the hand-off: the logo stands alone.
+    net_boots("net_kernel", ("platform: net boot: station", "platform: net read of nimbboot.efi",
+                             f"platform: net read of {NET_PACKAGE} into", KERNEL_START),
+              KernelExpect(bootargs={"commandLine": "foo=1 guest.hold=1"},
+                           tree={"/": {"net-boot": "<>"}, "/chosen": {"boot-file": text(NET_KERNEL)}},
+                           ranges={PACKAGE_RANGE: len(NET_PACKAGE_BYTES)}),
+              config={"options": "foo=1 guest.hold=1"}, capture=True,
+              screen=ScreenExpect(when="kernel: hold", picture="logo", alone=True, spinner="gone")),
     # The spinner turns below the logo while a large kernel comes over the
     # network.
-    NetScenario(
-        "net_spinner",
-        files=net_kernel_files(pad_to=BIG_KERNEL),
-        expect=(f"platform: {READING_BIG} {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
-        exit="KernelPass",
-        screen=ScreenExpect(when=READING_BIG, picture="logo", alone=False, spinner="turning"),
-        timeout=200.0,
-    ),
+    NetScenario("net_spinner", files=net_kernel_files(pad_to=BIG_KERNEL), exit="KernelPass",
+                expect=(f"platform: {READING_BIG} {BIG_KERNEL} bytes: EFI_SUCCESS", KERNEL_START),
+                screen=ScreenExpect(when=READING_BIG, picture="logo", alone=False, spinner="turning"), timeout=200.0),
     # efi-boot-file-data names another kernel on the server, and the
     # configuration file comes from the server too.
-    NetScenario(
-        "net_other_kernel",
-        config={"nvram-hex.efi-boot-file-data": net_file_path("kernels\\other_kernel").hex()},
-        files={
-            "kernels/other_kernel": GuestFile("nimb_kernel.fat-le"),
-            "kernels/other_kernel.drvpk": NET_PACKAGE_BYTES,
-            "com.quill.Boot.plist": plist({"Kernel Flags": "from_server=1"}),
-        },
-        expect=("platform: net read of com.quill.Boot.plist into", "platform: net read of kernels/other_kernel into",
-                KERNEL_START),
-        forbid=(f"of {NET_KERNEL}",),
-        exit="KernelPass",
-        kernel=KernelExpect(bootargs={"commandLine": "from_server=1"}),
-    ),
+    net_boots("net_other_kernel", ("platform: net read of com.quill.Boot.plist into",
+                                   "platform: net read of kernels/other_kernel into", KERNEL_START),
+              KernelExpect(bootargs={"commandLine": "from_server=1"}),
+              {"kernels/other_kernel": GuestFile("nimb_kernel.fat-le"), "kernels/other_kernel.drvpk": NET_PACKAGE_BYTES,
+               "com.quill.Boot.plist": plist({"Kernel Flags": "from_server=1"})},
+              config={"nvram-hex.efi-boot-file-data": net_file_path("kernels\\other_kernel").hex()},
+              forbid=(f"of {NET_KERNEL}",)),
     # The network's fatal messages. A network boot has no driver bundles to
     # fall back on: without its package the boot ends.
     fatal("net_no_package", f"platform: net size of {NET_PACKAGE}: EFI_NOT_FOUND", "Error loading drivers",
@@ -756,36 +672,17 @@ ACCEPTED_THEN_RESET = nvram_at_start("absent", 42 + 4 + 2 * (len(f"{RESUME_OFFSE
 def resumed(name, args, preview=None, screen=None):
     """The image restarts: the probe's checks all pass, and the machine never
     resets."""
-    return Scenario(
-        name,
-        resume=ResumeImage(args=args, preview=preview),
-        expect=("platform: boot 1", "platform: starting", KERNEL_START, "kernel: result pass"),
-        forbid=(RESET, "platform: boot 2", "platform: loader returned"),
-        exit="KernelPass",
-        kernel=KernelExpect(),
-        screen=screen,
-        timeout=150.0,
-    )
+    return boots(name, ("platform: boot 1", "platform: starting", KERNEL_START, "kernel: result pass"), files={},
+                 resume=ResumeImage(args=args, preview=preview), forbid=(RESET, "platform: boot 2",
+                 "platform: loader returned"), screen=screen, timeout=150.0)  # fmt: skip
 
 
 def reset_then_boot(name, args, after=ACCEPTED_THEN_RESET, reads=ResumeReads(), config=None):
-    """The loader resets the machine without a restart; the second start,
-    on the same variable store, finds NVRAM as `after` says and boots the
-    reference kernel."""
-    return Scenario(
-        name,
-        config=config or {},
-        resume=ResumeImage(args=args),
-        files=kernel_file(),
-        boots=2,
-        expect=("platform: boot 1", "platform: starting", RESET, "platform: boot 2", after, LOADING_KERNEL,
-                KERNEL_START),
-        forbid=("platform: loader returned",),
-        exit="KernelPass",
-        kernel=KernelExpect(),
-        reads=reads,
-        timeout=180.0,
-    )
+    """The loader resets the machine without a restart; the second start, on the same variable store, finds
+    NVRAM as `after` says and boots the reference kernel."""
+    return boots(name, ("platform: boot 1", "platform: starting", RESET, "platform: boot 2", after, LOADING_KERNEL,
+                        KERNEL_START), config=config or {}, resume=ResumeImage(args=args), boots=2,
+                 forbid=("platform: loader returned",), reads=reads, timeout=180.0)
 
 
 _TABLE += [
@@ -854,9 +751,8 @@ _TABLE += [
     # The stick image, with its own platform.cfg for a real PC, boots from
     # a USB controller (its device path: a USB node, then the partition's)
     # to the reference kernel.
-    Scenario("usb_stick", base_config=False, files=kernel_file(), usb=True,
-             expect=("03050600000004012a00", LOADING_KERNEL, KERNEL_START), forbid=("unknown key",),
-             exit="KernelPass", kernel=KernelExpect(), timeout=150.0),
+    boots("usb_stick", ("03050600000004012a00", LOADING_KERNEL, KERNEL_START), base_config=False, usb=True,
+          forbid=("unknown key",), timeout=150.0),
 ]  # fmt: skip
 
 
@@ -871,9 +767,9 @@ EXTENSIONS_TIME = {EXTENSIONS_DIR: "2010-06-30 23:59:59.250000000"}
 WITH_PACKAGE = {**kernel_file(), DRIVER_PACKAGE: PACKAGE_FILE}
 
 
-def drivers(name, kernel=DRIVERS_STAGED, expect=FROM_BUNDLES, files=kernel_file(), **knobs):
+def drivers(name, kernel=DRIVERS_STAGED, expect=FROM_BUNDLES, files=None, **knobs):
     """A boot of the reference kernel with drivers as `kernel` says."""
-    return Scenario(name, files=files, expect=expect, exit="KernelPass", kernel=kernel, **knobs)
+    return boots(name, expect, kernel, files, **knobs)
 
 
 _TABLE += [
