@@ -253,19 +253,14 @@ TEST_F(RuntimeMapTest, TableEntriesAndTheSystemTableFollowTheirRegion) {
 }
 
 TEST_F(RuntimeMapTest, ARefusedMapStopsWithoutBootServices) {
-  struct Row {
-    bool resume;
-    hostfw::RunEnd end;
-  };
-  const Row rows[] = {{false, hostfw::RunEnd::Halted}, {true, hostfw::RunEnd::Reset}};
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.resume ? "resume" : "normal boot");
+  for (bool resume : {false, true}) {
+    SCOPED_TRACE(resume ? "resume" : "normal boot");
     Scene scene({{EfiRuntimeServicesData, 0x200000, 1, kRt, 0, 0x100000}}, 0x100000);
     EFI_SYSTEM_TABLE *table = nimb::gST;
     scene.fw.FailCall("SetVirtualAddressMap", 1, EFI_INVALID_PARAMETER);
-    hostfw::RunResult run = scene.Map(row.resume);
-    EXPECT_EQ(run.end, row.end);
-    if (row.end == hostfw::RunEnd::Reset)
+    hostfw::RunResult run = scene.Map(resume);
+    EXPECT_EQ(run.end, resume ? hostfw::RunEnd::Reset : hostfw::RunEnd::Halted);
+    if (resume)
       EXPECT_EQ(run.resetType, EfiResetCold);
     EXPECT_STREQ(nimb::gStopMessage, "Error in SetVirtualAddressMap\n");
     EXPECT_TRUE(scene.fw.ViolationsAfterExit().empty());
