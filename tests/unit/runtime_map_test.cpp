@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <iterator>
 #include <sstream>
@@ -45,11 +46,7 @@ UINT8 Fill(size_t index) {
   return UINT8(0x31 + index);
 }
 bool Filled(UINT64 address, UINT64 pages, UINT8 byte) {
-  for (UINT64 i = 0; i < pages * EFI_PAGE_SIZE; i++) {
-    if (At(address)[i] != byte)
-      return false;
-  }
-  return true;
+  return std::all_of(At(address), At(address + pages * EFI_PAGE_SIZE), [byte](UINT8 b) { return b == byte; });
 }
 
 std::string Describe(UINT32 type, UINT64 physical, UINT64 virtualStart, UINT64 pages, UINT64 attribute) {
@@ -71,9 +68,7 @@ class Scene {
  public:
   Scene(const std::vector<Region> &regions, UINT64 next, bool declareArea = true)
       : regions(regions), next(next) {
-    nimb::gST = fw.SystemTable();
-    nimb::gBS = fw.BootServices();
-    nimb::gRT = fw.RuntimeServices();
+    nimbtest::AttachTo(fw);
     UINT64 pages = 0;
     map.assign(2 * regions.size() * kStride, 0xA5);
     for (size_t i = 0; i < regions.size(); i++) {
