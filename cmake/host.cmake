@@ -55,6 +55,13 @@ if(NIMB_FUZZ)
     target_compile_options(fuzz_${name} PRIVATE -fsanitize=fuzzer)
     target_link_options(fuzz_${name} PRIVATE -fsanitize=fuzzer)
     target_link_libraries(fuzz_${name} PRIVATE nimbcore_fuzz hostfw)
+    if(name STREQUAL "platform_layer_fuzz")
+      # The platform layer's own readers, built for the host as its tests build them.
+      set(platform_sources config file_times machine firmware format)
+      list(TRANSFORM platform_sources REPLACE "(.+)" "${CMAKE_SOURCE_DIR}/platform/\\1.cpp")
+      target_sources(fuzz_${name} PRIVATE ${platform_sources})
+      target_include_directories(fuzz_${name} PRIVATE ${CMAKE_SOURCE_DIR})
+    endif()
     # A short run in every test pass, from the checked-in seeds; what it
     # finds new goes to the build tree, never to the sources.
     string(REGEX REPLACE "_fuzz$" "" corpus ${name})

@@ -290,14 +290,18 @@ UINT32 FileTimesParse(char *text, UINTN size, FileTimeTable *table) {
   for (char *line = text; line < text + size;) {
     number++;
     char *end = line;
-    while (*end != '\0' && *end != '\n') {
+    while (end < text + size && *end != '\n') {
       end++;
     }
-    char *next = *end == '\0' ? end : end + 1;
+    char *next = end < text + size ? end + 1 : end;
     if (end > line && end[-1] == '\r') {
       end--;
     }
     *end = '\0';
+    // A NUL inside a line would end it early and leave the rest unread.
+    if (strlen(line) != static_cast<UINTN>(end - line)) {
+      return number;
+    }
     if (*line != '\0' && *line != '#') {
       if (table->count == table->capacity || !ParseEntry(line, &table->entries[table->count])) {
         return number;

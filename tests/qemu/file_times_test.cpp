@@ -29,7 +29,7 @@ Parsed Parse(const std::string &source) {
 TEST(FileTimes, TableRows) {
   struct Row {
     const char *name;
-    const char *text;
+    std::string text;
     UINT32 errorLine;
     UINT32 count;
   };
@@ -44,6 +44,7 @@ TEST(FileTimes, TableRows) {
       {"second 60", "2007-01-01 00:00:60 \\a\n", 1, 0},
       {"day 0", "2007-01-00 00:00:00 \\a\n", 1, 0},
       {"second line bad", "2007-01-01 00:00:00 \\a\nx\n", 2, 1},
+      {"NUL inside a line", std::string("2007-01-01 00:00:00 \\a\n\0x\n", 25), 2, 1},
   };
   for (const Row &row : rows) {
     SCOPED_TRACE(row.name);

@@ -333,39 +333,6 @@ TEST_F(BootOptionsTest, OutOfMemoryLeavesNoOptionString) {
   }
 }
 
-TEST(OptionsTest, GetOptionValueFindsTheLastPairWithTheKey) {
-  // "OFFSET:VALUE", the offset where the value starts in `text`; "none": not
-  // found, the outs untouched.
-  const std::array<const char *, 3> rows[] = {
-      {" \t\r\n", "-v", "none"},
-      {"-v", "-v", "2:"},
-      {"-vx", "-v", "none"},
-      {"-x -v", "-x", "2:"},
-      {"a=\"b c\"", "a", "3:b c"},
-      {"a=\"b c\" d=1", "d", "10:1"},
-      {"\"a b\"=c", "a b", "6:c"},
-      {"\"a\"x=1", "a", "4:"},  // the byte behind a quoted key is a separator
-      {"a=\"b", "a", "3:b"},
-      {"a=1 a=2", "a", "6:2"},
-      {"a=b=c", "a", "2:b"},
-      {"a=b=c", "", "4:c"},
-      {"configure=1", "config", "none"},
-      {"[=1", "{", "2:1"},
-      {"a=\"-v b\"", "-v", "none"},
-      {"a\tb\r\nc", "c", "6:"},
-  };
-  for (const auto &[text, key, expected] : rows) {
-    const char *value = nullptr;
-    UINT64 length = 12345;
-    const EFI_STATUS status = nimb::GetOptionValue(text, key, &value, &length);
-    const std::string got = status == EFI_SUCCESS
-                                ? std::to_string(value - text) + ":" + std::string(value, length)
-                            : status == EFI_NOT_FOUND && value == nullptr && length == 12345 ? "none"
-                                                                                             : "?";
-    EXPECT_EQ(got, expected) << "text \"" << text << "\" key \"" << key << "\"";
-  }
-}
-
 // Word and key, as NextOption splits `text` up to the terminator.
 using Words = std::vector<std::pair<std::string, std::string>>;
 Words Split(const char *text) {
@@ -426,8 +393,8 @@ TEST_F(OptionsAppendTest, AppendOptionDropsWordsWhoseKeyIsInTheTextAlready) {
   }
 }
 
-// The configuration dictionary as second source, parsed from a document as
-// the boot options do.
+// The last pair with the key in the option string, else the configuration
+// dictionary's value, parsed from a document as the boot options do.
 class OptionsConfigTest : public nimbtest::LoaderTest {};
 
 TEST_F(OptionsConfigTest, TheOptionStringBeatsTheDictionaryKeyByKey) {
@@ -443,27 +410,47 @@ TEST_F(OptionsConfigTest, TheOptionStringBeatsTheDictionaryKeyByKey) {
       "<key>Sub</key><dict><key>Kernel</key><string>nested</string></dict>"
       "</dict></plist>";
   ASSERT_EQ(nimb::PlistParseDocument(document.data(), &nimb::gConfigDict), EFI_SUCCESS);
-  // "options:VALUE" from the text, "config:VALUE" from the dictionary
-  // (GetConfigValue agreeing), "none" when not found.
+  // "OFFSET:VALUE", the offset where the value starts in the text;
+  // "config:VALUE" from the dictionary (GetConfigValue agreeing); "none":
+  // not found, the outs untouched.
   const std::array<const char *, 3> rows[] = {
+      {" \t\r\n", "-v", "none"},
+      {"-v", "-v", "2:"},
+      {"-vx", "-v", "none"},
+      {"-x -v", "-x", "2:"},
+      {"a=\"b c\"", "a", "3:b c"},
+      {"a=\"b c\" d=1", "d", "10:1"},
+      {"\"a b\"=c", "a b", "6:c"},
+      {"\"a\"x=1", "a", "4:"},  // the byte behind a quoted key is a separator
+      {"a=\"b", "a", "3:b"},
+      {"a=1 a=2", "a", "6:2"},
+      {"a=b=c", "a", "2:b"},
+      {"a=b=c", "", "4:c"},
+      {"configure=1", "config", "none"},
+      {"[=1", "{", "2:1"},
+      {"a=\"-v b\"", "-v", "none"},
+      {"a\tb\r\nc", "c", "6:"},
       {"", "Kernel", "config:nimb_other"},
-      {"Kernel=a", "Kernel", "options:a"},
-      {"kernel=a", "Kernel", "options:a"},
+      {"kernel=a", "Kernel", "7:a"},
       {"Kernels=a", "Kernel", "config:nimb_other"},
       {"", "kernel", "none"},  // the dictionary's keys match exactly
       {nullptr, "Kernel", "config:nimb_other"},
       {"", "Empty", "config:"},
       {"", "Root UUID", "none"},  // not a string
-      {"rd", "rd", "options:"},
   };
   for (const auto &[text, key, expected] : rows) {
+    value = nullptr;
+    length = 12345;
     const EFI_STATUS status = nimb::GetOptionOrConfigValue(text, key, &value, &length);
-    std::string found = status == EFI_NOT_FOUND ? "none" : "?";
+    std::string found = status == EFI_NOT_FOUND && value == nullptr && length == 12345 ? "none" : "?";
     if (status == EFI_SUCCESS) {
       const char *config = nimb::GetConfigValue(key);
       const std::string got(value, length);
       const bool fromText = text != nullptr && value >= text && value <= text + strlen(text);
-      found = (fromText ? "options:" : config != nullptr && got == config ? "config:" : "?:") + got;
+      found = (fromText                             ? std::to_string(value - text)
+               : config != nullptr && got == config ? "config"
+                                                    : "?") +
+              ":" + got;
     }
     EXPECT_EQ(found, expected) << "text \"" << (text != nullptr ? text : "(null)") << "\" key \"" << key
                                << "\"";

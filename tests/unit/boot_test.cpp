@@ -13,23 +13,19 @@
 
 #include "boot/gate.h"
 #include "boot/volume.h"
-#include "hostfw/hostfw.h"
 #include "kernel_images.h"
 #include "loader_fixture.h"
-#include "temp_dir.h"
 
 namespace {
 
 using nimbtest::TempDir;
 
+EFI_STATUS EFIAPI NoFile(EFI_LOAD_FILE_PROTOCOL *, EFI_DEVICE_PATH_PROTOCOL *, BOOLEAN, UINTN *, VOID *) {
+  return EFI_NOT_FOUND;
+}
+
 class BootTest : public nimbtest::LoaderTest {
  protected:
-  // A volume from `dir`, made the boot device.
-  EFI_HANDLE BootFrom(const TempDir &dir) {
-    EFI_HANDLE device = fw.AddDirectoryVolume(dir.path());
-    fw.SetBootDevice(device);
-    return device;
-  }
   // Reads a small file through the loader's view of a directory.
   static std::string ReadThrough(EFI_FILE *directory, const char16_t *name) {
     EFI_FILE *file = nullptr;
@@ -101,6 +97,9 @@ TEST_F(BootTest, TheThreeBootDirectories) {
 
     nimbtest::AttachTo(local);
     EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
+    // A file system is preferred to a LoadFile protocol on the same device.
+    static EFI_LOAD_FILE_PROTOCOL loadFile = {NoFile};
+    local.InstallProtocol(device, gEfiLoadFileProtocolGuid, &loadFile);
     nimb::BootVolume volume = {};
     hostfw::RunResult result = local.Call([&] { volume = nimb::OpenBootVolume(device); });
     ASSERT_EQ(result.end, hostfw::RunEnd::Returned) << name;
@@ -116,24 +115,6 @@ TEST_F(BootTest, TheThreeBootDirectories) {
   }
 }
 
-struct NullLoadFile {
-  static EFI_STATUS EFIAPI Load(EFI_LOAD_FILE_PROTOCOL *, EFI_DEVICE_PATH_PROTOCOL *, BOOLEAN, UINTN *,
-                                VOID *) {
-    return EFI_NOT_FOUND;
-  }
-};
-
-TEST_F(BootTest, FileSystemIsPreferredToLoadFile) {
-  static EFI_LOAD_FILE_PROTOCOL loadFile = {NullLoadFile::Load};
-  TempDir dir;
-  EFI_HANDLE both = BootFrom(dir);
-  fw.InstallProtocol(both, gEfiLoadFileProtocolGuid, &loadFile);
-  nimb::BootVolume volume = {};
-  ASSERT_EQ(fw.Call([&] { volume = nimb::OpenBootVolume(both); }).end, hostfw::RunEnd::Returned);
-  EXPECT_NE(volume.root, nullptr);
-  EXPECT_EQ(volume.loadFile, nullptr);
-}
-
 TEST_F(BootTest, TheCallGateIsCopiedBelow4GiB) {
   EXPECT_EQ(nimb::CallGateSize(), 0x82u);
   ASSERT_EQ(nimb::CopyCallGate(), EFI_SUCCESS);
@@ -147,7 +128,7 @@ TEST_F(BootTest, TheCallGateIsCopiedBelow4GiB) {
 }
 
 TEST_F(BootTest, EveryFatalMessageOfTheBootSequence) {
-  static EFI_LOAD_FILE_PROTOCOL loadFile = {NullLoadFile::Load};
+  static EFI_LOAD_FILE_PROTOCOL loadFile = {NoFile};
   struct Row {
     const char *message;
     std::function<void(hostfw::Firmware &, EFI_HANDLE device)> arrange;
@@ -227,21 +208,6 @@ TEST_F(BootTest, TheKernelIsEnteredAndAReturnStops) {
     EXPECT_TRUE(local.ViolationsAfterExit().empty());
     EXPECT_STREQ(nimb::gStopMessage, returns ? "Kernel entry failed\n" : nullptr);
   }
-}
-
-using hostfw::Firmware;
-
-TEST(HostfwExitBootServices, LaterBootTimeCallsAreViolations) {
-  Firmware fw;
-  EFI_SYSTEM_TABLE *st = fw.SystemTable();
-  EFI_BOOT_SERVICES *bs = st->BootServices;
-  EXPECT_EQ(bs->ExitBootServices(fw.ImageHandle(), fw.MapKey() + 1), EFI_INVALID_PARAMETER);
-  ASSERT_EQ(bs->ExitBootServices(fw.ImageHandle(), fw.MapKey()), EFI_SUCCESS);
-  void *block = nullptr;
-  EXPECT_EQ(bs->AllocatePool(EfiLoaderData, 8, &block), EFI_UNSUPPORTED);
-  EXPECT_EQ(st->ConOut->OutputString(st->ConOut, u"late"), EFI_UNSUPPORTED);
-  EXPECT_EQ(fw.ViolationsAfterExit(), (std::vector<std::string>{"AllocatePool", "OutputString"}));
-  EXPECT_TRUE(fw.ConOutCalls().empty());
 }
 
 }  // namespace

@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "hostfw/network.h"
@@ -64,33 +65,6 @@ TEST_F(BootFileTest, VolumeReadsGoInChunksWithADotEach) {
   EXPECT_EQ(fw.OpenFiles(), 1u);  // only the root
 }
 
-TEST_F(BootFileTest, MemoryRecords) {
-  std::vector<uint8_t> bytes = Pattern(100);
-  BootFile file = {};
-  file.buffer = bytes.data();
-  file.size = bytes.size();
-  uint8_t out[200];
-  uint64_t count = 30;
-  ASSERT_EQ(nimb::BootFileRead(&file, &count, out), EFI_SUCCESS);
-  EXPECT_EQ(nimb::BootFileSetPosition(&file, 101), EFI_INVALID_PARAMETER);
-  ASSERT_EQ(nimb::BootFileSetPosition(&file, 90), EFI_SUCCESS);
-  count = 50;
-  ASSERT_EQ(nimb::BootFileRead(&file, &count, out), EFI_SUCCESS);
-  EXPECT_EQ(count, 10u);
-  EXPECT_EQ(out[0], bytes[90]);
-  ASSERT_EQ(nimb::BootFileSetPosition(&file, 100), EFI_SUCCESS);
-  count = 5;
-  ASSERT_EQ(nimb::BootFileRead(&file, &count, out), EFI_SUCCESS);
-  EXPECT_EQ(count, 0u);
-  nimb::BootFileClose(&file);
-  EXPECT_EQ(file.buffer, bytes.data());  // the creator's, left alone
-  EXPECT_EQ(file.size, 0u);
-
-  BootFile empty = {};
-  EXPECT_EQ(nimb::BootFileGetSize(&empty, nullptr), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(nimb::BootFileRead(&empty, &count, out), EFI_INVALID_PARAMETER);
-}
-
 TEST_F(BootFileTest, ALoadFileRecordFetchesOnce) {
   hostfw::NetworkDevice net(fw);
   std::vector<uint8_t> bytes = Pattern(5000);
@@ -112,8 +86,27 @@ TEST_F(BootFileTest, ALoadFileRecordFetchesOnce) {
   EXPECT_TRUE(net.Calls()[1].withBuffer);
   EXPECT_EQ(net.Calls()[1].bufferSize, 5000u);  // the file's size, not the margin
   EXPECT_EQ(net.Calls()[1].name, u"k");
+  // The fetched file is read from memory from here on, within its size.
+  EXPECT_EQ(nimb::BootFileSetPosition(&file, 5001), EFI_INVALID_PARAMETER);
+  for (UINT64 position : {4990, 5000}) {
+    ASSERT_EQ(nimb::BootFileSetPosition(&file, position), EFI_SUCCESS);
+    count = 50;
+    ASSERT_EQ(nimb::BootFileRead(&file, &count, out.data()), EFI_SUCCESS);
+    EXPECT_EQ(count, 5000 - position);
+    EXPECT_EQ(out[0], bytes[4990]);
+  }
+  EXPECT_EQ(net.Calls().size(), 2u);
   nimb::BootFileClose(&file);
   EXPECT_EQ(fw.LivePoolBlocks(), 1u);  // path and buffer gone; the tag block stays
+  // A record of the caller's memory keeps it at the close.
+  file = {};
+  file.buffer = bytes.data();
+  file.size = bytes.size();
+  nimb::BootFileClose(&file);
+  EXPECT_EQ(std::make_tuple(file.buffer, file.size), std::make_tuple(bytes.data(), UINT64{0}));
+  BootFile empty = {};
+  EXPECT_EQ(nimb::BootFileGetSize(&empty, nullptr), EFI_INVALID_PARAMETER);
+  EXPECT_EQ(nimb::BootFileRead(&empty, &count, out.data()), EFI_INVALID_PARAMETER);
 }
 
 TEST_F(BootFileTest, LoadFileFailures) {

@@ -17,10 +17,6 @@ namespace {
 
 using namespace nimb;
 
-std::string Dict(const std::string &entries) {
-  return "<plist><dict>" + entries + "</dict></plist>";
-}
-
 class BootInfoTest : public nimbtest::VolumeTest {
  protected:
   void SetUp() override {
@@ -33,7 +29,7 @@ class BootInfoTest : public nimbtest::VolumeTest {
   }
   // Parses a configuration dictionary into gConfigDict.
   void Config(const std::string &entries) {
-    text_ = Dict(entries);
+    text_ = "<plist><dict>" + entries + "</dict></plist>";
     ASSERT_EQ(PlistParseDocument(text_.data(), &gConfigDict), EFI_SUCCESS);
   }
   // Runs InitBootInfo; what it prints lands in printed_.

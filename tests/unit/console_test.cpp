@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <string>
 #include <tuple>
@@ -126,16 +127,12 @@ TEST_F(ConsoleTest, InitConsoleFailuresAndModeChanges) {
   nimbtest::AttachTo(fw);
   fw.SetConsoleMode(EfiConsoleControlScreenText);
   ASSERT_EQ(nimb::InitConsole(), EFI_SUCCESS);
-  auto setCalls = [&] {
-    size_t n = 0;
-    for (const hostfw::ConsoleModeCall &call : fw.ConsoleModeCalls())
-      n += call.set;
-    return n;
-  };
   EXPECT_EQ(nimb::SetConsoleMode(nimb::kConsoleGraphics), EFI_SUCCESS);
   EXPECT_EQ(nimb::SetConsoleMode(nimb::kConsoleGraphics), EFI_SUCCESS);
   EXPECT_EQ(nimb::SetConsoleMode(3), EFI_INVALID_PARAMETER);
-  EXPECT_EQ(setCalls(), 1u);
+  EXPECT_EQ(std::count_if(fw.ConsoleModeCalls().begin(), fw.ConsoleModeCalls().end(),
+                          [](const hostfw::ConsoleModeCall &call) { return call.set; }),
+            1);
   EXPECT_EQ(nimb::gConsoleMode, 1u);
   // A refused change leaves the recorded mode telling the truth.
   fw.FailCall("SetMode");

@@ -38,18 +38,14 @@ bool ReadNode(const uint8_t *data, size_t size, size_t *at, const std::string &p
   memcpy(counts, data + *at, 8);
   *at += 8;
   std::multimap<std::string, std::string> props;
-  std::string name;
-  for (uint32_t i = 0; i < counts[0]; i++) {
-    uint32_t length = 0;
+  uint32_t length = 0;
+  for (uint32_t i = 0; i < counts[0]; i++, *at += 36 + ((length + 3) & ~3u)) {
     if (*at + 36 > size || (memcpy(&length, data + *at + 32, 4), *at + 36 + length > size))
       return false;
     const char *key = reinterpret_cast<const char *>(data + *at);
-    std::string value(key + 36, length);
-    if (strncmp(key, "name", 32) == 0)
-      name = value.substr(0, value.size() - 1);
-    props.emplace(std::string(key, strnlen(key, 32)), value);
-    *at += 36 + ((length + 3) & ~3u);
+    props.emplace(std::string(key, strnlen(key, 32)), std::string(key + 36, length));
   }
+  const std::string name = props.count("name") != 0 ? props.find("name")->second.c_str() : "";
   std::string path = parent.empty() ? "/" : (parent == "/" ? "/" + name : parent + "/" + name);
   tree->nodes[path] = props;
   tree->order.push_back(path);
@@ -68,17 +64,20 @@ FlatTree ReadTree(const BootArgs *args) {
   return tree;
 }
 
+// Device properties of `blob`'s size; a firmware that never fills the buffer
+// asks for that much more each time.
 struct FakeDeviceProperties {
   NIMB_DEVICE_PROPERTIES_PROTOCOL protocol;
   std::vector<uint8_t> blob;
+  bool fills;
   int calls;
 };
 
 EFI_STATUS EFIAPI GetDeviceProperties(NIMB_DEVICE_PROPERTIES_PROTOCOL *This, VOID *Buffer, UINT32 *Size) {
   auto *self = reinterpret_cast<FakeDeviceProperties *>(This);
   self->calls++;
-  if (*Size < self->blob.size()) {
-    *Size = static_cast<UINT32>(self->blob.size());
+  if (!self->fills || *Size < self->blob.size()) {
+    *Size = static_cast<UINT32>(self->blob.size()) + (self->fills ? 0 : *Size);
     return EFI_BUFFER_TOO_SMALL;
   }
   memcpy(Buffer, self->blob.data(), self->blob.size());
@@ -220,40 +219,34 @@ INSTANTIATE_TEST_SUITE_P(Types, NetworkIdentityTest,
                          ::testing::Values(std::make_pair(0, 12), std::make_pair(1, 12),
                                            std::make_pair(2, 64), std::make_pair(6, 64)));
 
-TEST_F(HandOffTest, DevicePropertiesLargerThanTheFirstBuffer) {
-  FakeDeviceProperties properties = {{{}, GetDeviceProperties}, std::vector<uint8_t>(6000, 0x5C), 0};
-  for (size_t i = 0; i < properties.blob.size(); i++)
+// Larger than the first buffer: read in a second call. Never filled: left
+// out, after more than one call.
+class DevicePropertiesTest : public HandOffTest,
+                             public ::testing::WithParamInterface<std::pair<size_t, bool>> {};
+
+TEST_P(DevicePropertiesTest, AreReadWhole) {
+  auto [size, fills] = GetParam();
+  FakeDeviceProperties properties = {{{}, GetDeviceProperties}, std::vector<uint8_t>(size), fills, 0};
+  for (size_t i = 0; i < size; i++)
     properties.blob[i] = static_cast<uint8_t>(i);
   fw.InstallProtocol(fw.NewHandle(), gNimbDevicePropertiesProtocolGuid, &properties);
   Prepare();
   ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
-  EXPECT_EQ(properties.calls, 2);
   FlatTree tree = ReadTree(bootArgs);
-  std::string blob = tree.nodes["/efi"].find("device-properties")->second;
-  EXPECT_EQ(blob, std::string(properties.blob.begin(), properties.blob.end()));
+  auto &efi = tree.nodes["/efi"];
+  EXPECT_EQ(efi.count("device-properties"), fills ? 1u : 0u);
+  if (fills) {
+    EXPECT_EQ(properties.calls, 2);
+    EXPECT_EQ(efi.find("device-properties")->second,
+              std::string(properties.blob.begin(), properties.blob.end()));
+  } else {
+    EXPECT_GT(properties.calls, 1);
+  }
 }
 
-// A firmware that never fills the buffer: it asks for the same size again,
-// or for more each time.
-EFI_STATUS EFIAPI NeverFillsDeviceProperties(NIMB_DEVICE_PROPERTIES_PROTOCOL *This, VOID *, UINT32 *Size) {
-  auto *self = reinterpret_cast<FakeDeviceProperties *>(This);
-  self->calls++;
-  *Size += static_cast<UINT32>(self->blob.size());
-  return EFI_BUFFER_TOO_SMALL;
-}
-
-class UnfilledPropertiesTest : public HandOffTest, public ::testing::WithParamInterface<size_t> {};
-
-TEST_P(UnfilledPropertiesTest, AreLeftOut) {
-  FakeDeviceProperties properties = {{{}, NeverFillsDeviceProperties}, std::vector<uint8_t>(GetParam()), 0};
-  fw.InstallProtocol(fw.NewHandle(), gNimbDevicePropertiesProtocolGuid, &properties);
-  Prepare();
-  ASSERT_EQ(Finish().end, hostfw::RunEnd::Returned);
-  EXPECT_GT(properties.calls, 1);
-  EXPECT_EQ(ReadTree(bootArgs).nodes["/efi"].count("device-properties"), 0u);
-}
-
-INSTANTIATE_TEST_SUITE_P(Growth, UnfilledPropertiesTest, ::testing::Values(0u, 100u));
+INSTANTIATE_TEST_SUITE_P(Sizes, DevicePropertiesTest,
+                         ::testing::Values(std::make_pair(6000, true), std::make_pair(0, false),
+                                           std::make_pair(100, false)));
 
 // Whatever the final read finds, the descriptors that the runtime move
 // appends stay inside the map's own pages, which are extended in place: the

@@ -8,6 +8,7 @@
 #include <cstring>
 #include <memory>
 #include <string>
+#include <tuple>
 #include <utility>
 #include <vector>
 
@@ -132,58 +133,50 @@ TEST(PlatformTest, ModelNameFromRecordOrDsdtOrNeither) {
   std::string cut;  // 21 whole characters of three bytes fit in 64
   for (int i = 0; i < 21; i++)
     cut += "\xE4\xB8\xAD";
-  struct Acpi {
-    std::string id;
-    UINT32 revision;
-    UINT8 facpRevision;
-    bool dsdt32, dsdt64;
-    UINT32 facpLength, dsdtLength, rootLength;
-    UINT8 rsdpRevision;
+  // Tables whose FACP of `facpRevision` points at a DSDT of `id` and `revision`.
+  auto acpi = [](std::string id, UINT32 revision, UINT8 facpRevision, bool dsdt32, bool dsdt64,
+                 UINT32 facpLength, UINT32 dsdtLength, UINT32 rootLength, UINT8 rsdpRevision) {
+    hostfw::AcpiOptions o;
+    std::tie(o.oemTableId, o.oemRevision, o.facpRevision, o.dsdt32, o.dsdt64) =
+        std::make_tuple(id, revision, facpRevision, dsdt32, dsdt64);
+    std::tie(o.facpLength, o.dsdtLength, o.rsdpRevision) =
+        std::make_tuple(facpLength, dsdtLength, rsdpRevision);
+    o.otherTables = {};
+    (rsdpRevision == 0 ? o.rsdtLength : o.xsdtLength) = rootLength;
+    return o;
   };
   struct Row {
     Bytes model;  // the "Model" record's value; empty: no record
-    std::vector<Acpi> tables;
+    std::vector<hostfw::AcpiOptions> tables;
     std::string expected;
   };
-  const Acpi one = {"ABCD", 1, 4, true, true, 0, 0, 0, 2};
+  const hostfw::AcpiOptions one = acpi("ABCD", 1, 4, true, true, 0, 0, 0, 2);
   const std::vector<Row> rows = {
       {Ucs2(u"Box4,2"), {one}, "Box4,2"},
       {Ucs2(std::u16string(u"Box4,2") + u'\0'), {}, "Box4,2"},
       {Ucs2(std::u16string(40, u'\u4e2d')), {}, cut},
       {Ucs2(std::u16string(2, u'\0')), {one}, "ACPI"},  // a record converting to nothing
-      {{}, {{"ABCDEFGH", 0xFFFF0010, 4, true, true, 0, 0, 0, 2}}, "ABCDEFGH65535,16"},
-      {{}, {{std::string("XY\0\0\0\0\0\0", 8), 7, 4, true, true, 0, 0, 0, 2}}, "XY0,7"},
-      {{}, {{"ABCD", 0x00010002, 4, false, true, 0, 0, 0, 2}}, "ABCD1,2"},  // blanks end the id
-      {{}, {{"ABCD", 0x00010002, 4, true, false, 0, 0, 0, 2}}, "ACPI"},
-      {{}, {{"ABCD", 0x00010002, 2, false, true, 244, 0, 0, 2}}, "ACPI"},
-      {{}, {{"ABCD", 0x00010002, 2, true, false, 244, 0, 0, 2}}, "ABCD1,2"},
-      {{}, {{"ABCD", 1, 2, true, true, 44, 0, 0, 0}}, "ABCD0,1"},
-      {{}, {{"ABCD", 1, 1, true, true, 43, 0, 0, 0}}, "ACPI"},  // FACP too short for the DSDT
-      {{}, {{"ABCD", 1, 3, true, true, 148, 0, 0, 2}}, "ABCD0,1"},
-      {{}, {{"ABCD", 1, 3, true, true, 147, 0, 0, 2}}, "ACPI"},  // too short for the wide DSDT
-      {{}, {{"ABCD", 1, 4, true, true, 0, 35, 0, 2}}, "ACPI"},   // DSDT shorter than a header
-      {{}, {{"ABCD", 1, 4, true, true, 0, 0, 35, 0}}, "ACPI"},   // RSDT shorter than a header
-      {{}, {{"ABCD", 1, 4, true, true, 0, 0, 43, 2}}, "ACPI"},   // XSDT with a part of an entry
+      {{}, {acpi("ABCDEFGH", 0xFFFF0010, 4, true, true, 0, 0, 0, 2)}, "ABCDEFGH65535,16"},
+      {{}, {acpi(std::string("XY\0\0\0\0\0\0", 8), 7, 4, true, true, 0, 0, 0, 2)}, "XY0,7"},
+      {{}, {acpi("ABCD", 0x00010002, 4, false, true, 0, 0, 0, 2)}, "ABCD1,2"},  // blanks end the id
+      {{}, {acpi("ABCD", 0x00010002, 4, true, false, 0, 0, 0, 2)}, "ACPI"},
+      {{}, {acpi("ABCD", 0x00010002, 2, false, true, 244, 0, 0, 2)}, "ACPI"},
+      {{}, {acpi("ABCD", 0x00010002, 2, true, false, 244, 0, 0, 2)}, "ABCD1,2"},
+      {{}, {acpi("ABCD", 1, 2, true, true, 44, 0, 0, 0)}, "ABCD0,1"},
+      {{}, {acpi("ABCD", 1, 1, true, true, 43, 0, 0, 0)}, "ACPI"},  // FACP too short for the DSDT
+      {{}, {acpi("ABCD", 1, 3, true, true, 148, 0, 0, 2)}, "ABCD0,1"},
+      {{}, {acpi("ABCD", 1, 3, true, true, 147, 0, 0, 2)}, "ACPI"},  // too short for the wide DSDT
+      {{}, {acpi("ABCD", 1, 4, true, true, 0, 35, 0, 2)}, "ACPI"},   // DSDT shorter than a header
+      {{}, {acpi("ABCD", 1, 4, true, true, 0, 0, 35, 0)}, "ACPI"},   // RSDT shorter than a header
+      {{}, {acpi("ABCD", 1, 4, true, true, 0, 0, 43, 2)}, "ACPI"},   // XSDT with a part of an entry
       {{}, {}, "ACPI"},
   };
   for (const Row &row : rows) {
     Local local;
     if (!row.model.empty())
       local.Log({{kVendor, u"Model", row.model}});
-    for (const Acpi &a : row.tables) {
-      hostfw::AcpiOptions o;
-      o.oemTableId = a.id;
-      o.oemRevision = a.revision;
-      o.facpRevision = a.facpRevision;
-      o.dsdt32 = a.dsdt32;
-      o.dsdt64 = a.dsdt64;
-      o.facpLength = a.facpLength;
-      o.dsdtLength = a.dsdtLength;
-      o.rsdpRevision = a.rsdpRevision;
-      o.otherTables = {};
-      (a.rsdpRevision == 0 ? o.rsdtLength : o.xsdtLength) = a.rootLength;
+    for (const hostfw::AcpiOptions &o : row.tables)
       local.fw.InstallAcpi(o);
-    }
     EXPECT_EQ(local.Init(), row.expected) << row.expected;
     // Worked out once: a later record changes nothing.
     static const char16_t kModel[] = u"Box";

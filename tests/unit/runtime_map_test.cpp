@@ -5,6 +5,7 @@
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cstring>
 #include <iterator>
 #include <sstream>
@@ -45,11 +46,7 @@ UINT8 Fill(size_t index) {
   return UINT8(0x31 + index);
 }
 bool Filled(UINT64 address, UINT64 pages, UINT8 byte) {
-  for (UINT64 i = 0; i < pages * EFI_PAGE_SIZE; i++) {
-    if (At(address)[i] != byte)
-      return false;
-  }
-  return true;
+  return std::all_of(At(address), At(address + pages * EFI_PAGE_SIZE), [byte](UINT8 b) { return b == byte; });
 }
 
 std::string Describe(UINT32 type, UINT64 physical, UINT64 virtualStart, UINT64 pages, UINT64 attribute) {
@@ -71,9 +68,7 @@ class Scene {
  public:
   Scene(const std::vector<Region> &regions, UINT64 next, bool declareArea = true)
       : regions(regions), next(next) {
-    nimb::gST = fw.SystemTable();
-    nimb::gBS = fw.BootServices();
-    nimb::gRT = fw.RuntimeServices();
+    nimbtest::AttachTo(fw);
     UINT64 pages = 0;
     map.assign(2 * regions.size() * kStride, 0xA5);
     for (size_t i = 0; i < regions.size(); i++) {
@@ -253,19 +248,14 @@ TEST_F(RuntimeMapTest, TableEntriesAndTheSystemTableFollowTheirRegion) {
 }
 
 TEST_F(RuntimeMapTest, ARefusedMapStopsWithoutBootServices) {
-  struct Row {
-    bool resume;
-    hostfw::RunEnd end;
-  };
-  const Row rows[] = {{false, hostfw::RunEnd::Halted}, {true, hostfw::RunEnd::Reset}};
-  for (const Row &row : rows) {
-    SCOPED_TRACE(row.resume ? "resume" : "normal boot");
+  for (bool resume : {false, true}) {
+    SCOPED_TRACE(resume ? "resume" : "normal boot");
     Scene scene({{EfiRuntimeServicesData, 0x200000, 1, kRt, 0, 0x100000}}, 0x100000);
     EFI_SYSTEM_TABLE *table = nimb::gST;
     scene.fw.FailCall("SetVirtualAddressMap", 1, EFI_INVALID_PARAMETER);
-    hostfw::RunResult run = scene.Map(row.resume);
-    EXPECT_EQ(run.end, row.end);
-    if (row.end == hostfw::RunEnd::Reset)
+    hostfw::RunResult run = scene.Map(resume);
+    EXPECT_EQ(run.end, resume ? hostfw::RunEnd::Reset : hostfw::RunEnd::Halted);
+    if (resume)
       EXPECT_EQ(run.resetType, EfiResetCold);
     EXPECT_STREQ(nimb::gStopMessage, "Error in SetVirtualAddressMap\n");
     EXPECT_TRUE(scene.fw.ViolationsAfterExit().empty());
@@ -329,47 +319,45 @@ TEST_F(RuntimeMapTest, OverlappingPlacesAreCopiedInASafeOrder) {
   }
 }
 
+// Free memory from kFree on, and the row's descriptors.
 TEST_F(RuntimeMapTest, TheRuntimeAreaMustLieInFreeMemoryBelow4GiB) {
-  const UINT64 kFree = 0x100000, kFreePages = 0x40;
+  const UINT64 kFree = 0x100000, n = 0x40, p = EFI_PAGE_SIZE, kLimit = 0x100000000;
+  const UINT32 code = EfiRuntimeServicesCode, free = EfiConventionalMemory;
   struct Row {
     const char *what;
-    std::vector<Region> extra;  // besides free memory from kFree on
-    UINT64 start;
-    UINT64 spare;
+    std::vector<EFI_MEMORY_DESCRIPTOR> extra;
+    UINT64 start, spare;
     bool free;
   };
-  const UINT64 n = kFreePages, p = EFI_PAGE_SIZE;
-  const UINT32 code = EfiRuntimeServicesCode, free = EfiConventionalMemory;
   const Row rows[] = {
-      {"runtime pages and spare fit", {{code, 0x300000, 4, kRt, 0, 0}}, kFree, 0x2000, true},
-      {"across two free descriptors", {{free, kFree + n * p, 8, 0, 0, 0}}, kFree + (n - 2) * p, 0x4000, true},
+      {"runtime pages and spare fit", {{code, 0, 0x300000, 0, 4, kRt}}, kFree, 0x2000, true},
+      {"across two free descriptors", {{free, 0, kFree + n * p, 0, 8, 0}}, kFree + (n - 2) * p, 0x4000, true},
       {"the spare is not written: it may lie in used memory", {}, kFree + (n - 1) * p, 0x2000, true},
-      {"the runtime pages run past it", {{code, 0x300000, n, kRt, 0, 0}}, kFree + p, 0, false},
-      {"reserved and non-runtime pages take no room",
-       {{EfiReservedMemoryType, 0x300000, n, kRt, 0, 0}, {EfiBootServicesData, 0x400000, n, 0, 0, 0}},
+      {"the runtime pages run past it", {{code, 0, 0x300000, 0, n, kRt}}, kFree + p, 0, false},
+      {"reserved and non-runtime pages take no room, up to 4 GiB",
+       {{EfiReservedMemoryType, 0, 0x300000, 0, n, kRt}, {EfiBootServicesData, 0, 0x400000, 0, n, 0}},
        kFree,
-       n * p,
+       kLimit - kFree,
        true},
       {"memory-mapped I/O takes addresses, not memory",
-       {{code, 0x300000, 4, kRt, 0, 0}, {EfiMemoryMappedIO, 0xFEC00000, 4 * n, kRt, 0, 0}},
+       {{code, 0, 0x300000, 0, 4, kRt}, {EfiMemoryMappedIO, 0, 0xFEC00000, 0, 4 * n, kRt}},
        kFree,
        0,
        true},
       {"a region's new place is in used memory",
-       {{EfiLoaderData, 0x80000, 0x80, 0, 0, 0}, {code, 0x300000, 1, kRt, 0, 0}},
+       {{EfiLoaderData, 0, 0x80000, 0, 0x80, 0}, {code, 0, 0x300000, 0, 1, kRt}},
        0x90000,
        0,
        false},
-      {"beyond 4 GiB", {{free, 0xFFFFF000, 0x100, 0, 0, 0}}, 0xFFFFF000, 0x2000, false},
+      {"beyond 4 GiB", {{free, 0, 0xFFFFF000, 0, 0x100, 0}}, 0xFFFFF000, 0x2000, false},
   };
   for (const Row &row : rows) {
-    SCOPED_TRACE(row.what);
-    std::vector<EFI_MEMORY_DESCRIPTOR> map = {{EfiConventionalMemory, 0, kFree, 0, kFreePages, 0xF}};
-    for (const Region &r : row.extra)
-      map.push_back({r.type, 0, r.physical, 0, r.pages, r.attribute});
+    std::vector<EFI_MEMORY_DESCRIPTOR> map = {{free, 0, kFree, 0, n, 0xF}};
+    map.insert(map.end(), row.extra.begin(), row.extra.end());
     EXPECT_EQ(nimb::RuntimeAreaIsFree(map.data(), map.data() + map.size(), sizeof(EFI_MEMORY_DESCRIPTOR),
                                       row.start, row.spare),
-              row.free);
+              row.free)
+        << row.what;
   }
 }
 
