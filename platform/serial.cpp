@@ -21,17 +21,25 @@ constexpr UINT32 kTransmitPolls = 1000000;
 // character.
 bool gSerialGone;
 
+UINT8 ReadLineStatus() {
+  return PortReadByte(kSerialLineStatus);
+}
+
+void WriteData(UINT8 byte) {
+  PortWriteByte(kSerialData, byte);
+}
+
 void SerialWriteByte(UINT8 byte) {
   if (gSerialGone) {
     return;
   }
-  for (UINT32 i = 0; (PortReadByte(kSerialLineStatus) & kTransmitEmpty) == 0; i++) {
+  for (UINT32 i = 0; (gSerialPortIo.readLineStatus() & kTransmitEmpty) == 0; i++) {
     if (i == kTransmitPolls) {
       gSerialGone = true;
       return;
     }
   }
-  PortWriteByte(kSerialData, byte);
+  gSerialPortIo.writeData(byte);
 }
 
 void SerialOutput(char character, void *) {
@@ -42,6 +50,8 @@ void SerialOutput(char character, void *) {
 }
 
 }  // namespace
+
+SerialPortIo gSerialPortIo = {ReadLineStatus, WriteData};
 
 void SerialPrintv(const char *format, va_list arguments) {
   FormatText(SerialOutput, nullptr, format, arguments);

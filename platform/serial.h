@@ -16,6 +16,14 @@ void SerialPrintv(const char *format, va_list arguments);
 // Writes UCS-2 text as it stands, a byte a unit; units beyond ASCII as '?'.
 void SerialWriteText(const CHAR16 *text);
 
+// The port's line status and transmit registers as the reports reach them:
+// the machine's COM1, or a host test's stand-ins.
+struct SerialPortIo {
+  UINT8 (*readLineStatus)();
+  void (*writeData)(UINT8 byte);
+};
+extern SerialPortIo gSerialPortIo;
+
 // Port I/O for the machine's own devices.
 inline void PortWriteByte(UINT16 port, UINT8 value) {
   __asm__ volatile("outb %0, %1" : : "a"(value), "Nd"(port));

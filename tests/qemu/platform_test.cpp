@@ -21,6 +21,7 @@
 #include "../../platform/key_state.h"
 #include "../../platform/machine.h"
 #include "../../platform/memory.h"
+#include "../../platform/serial.h"
 #include "hostfw/hostfw.h"
 
 namespace nimb::platform {
@@ -311,6 +312,27 @@ TEST(PlatformReport, ExitCodesAndBoundedText) {
   char small[8];
   EXPECT_EQ(FormatToBuffer(small, sizeof(small), "%s=%u", "memory", UINT64{123}), 10u);
   EXPECT_STREQ(small, "memory=");
+}
+
+// A port that empties writes every byte, a line feed as CR LF; one whose
+// transmit register stays full is polled through one bound only, and never
+// again for the rest of the run.
+TEST(PlatformReport, SerialPortGivenUpAfterOneTimeout) {
+  static std::string sent;
+  static UINT64 polls;
+  static UINT8 lineStatus;
+  gSerialPortIo = {[] { return polls++, lineStatus; }, [](UINT8 byte) { sent += static_cast<char>(byte); }};
+  lineStatus = 0x20;
+  SerialPrintf("a\n");
+  EXPECT_EQ(sent, "a\r\n");
+  lineStatus = 0x00;
+  polls = 0;
+  SerialPrintf("bc");
+  const UINT64 bound = polls;
+  SerialPrintf("de\n");
+  EXPECT_EQ(sent, "a\r\n");
+  EXPECT_GT(bound, 1000u);
+  EXPECT_EQ(polls, bound) << "the port was polled again after it was given up";
 }
 
 // An SMBIOS structure: header (type, length, handle), the formatted bytes
