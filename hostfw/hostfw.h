@@ -220,8 +220,10 @@ class Firmware {
   // map, as real firmware makes them: the next GetMemoryMap call after this
   // finds `extraDescriptors` more entries than the one before.
   void GrowMemoryMapOnNextCall(unsigned extraDescriptors);
-  // The same, for the n-th GetMemoryMap call from now (1 for the next).
-  void GrowMemoryMapOnCall(unsigned nth, unsigned extraDescriptors);
+  // The same, for the n-th GetMemoryMap call from now (1 for the next);
+  // with `runtime`, each new entry is a page of runtime data or code, as a
+  // runtime driver's allocation between the reads would make it.
+  void GrowMemoryMapOnCall(unsigned nth, unsigned extraDescriptors, bool runtime = false);
 
   // --- Handles and protocols ----------------------------------------------
   EFI_HANDLE NewHandle();

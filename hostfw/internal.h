@@ -158,6 +158,7 @@ struct Firmware::State {
   unsigned pendingGrowth = 0;
   unsigned growthCountdown = 0;  // GetMemoryMap calls until growthLater applies
   unsigned growthLater = 0;
+  bool growthRuntime = false;  // the growth's pages are runtime data and code
   std::vector<SavedRange> saved;
   bool guarded = false;  // GuardFreeMemory
 

@@ -160,10 +160,12 @@ void ApplyGrowth(State &s) {
       if (free.end - free.start < 2 * EFI_PAGE_SIZE)
         continue;
       auto above = s.ranges.find(free.end);
-      bool aboveIsData = above != s.ranges.end() && above->second.type == EfiBootServicesData;
-      EFI_MEMORY_TYPE type = aboveIsData ? EfiBootServicesCode : EfiBootServicesData;
+      const EFI_MEMORY_TYPE data = s.growthRuntime ? EfiRuntimeServicesData : EfiBootServicesData;
+      const EFI_MEMORY_TYPE code = s.growthRuntime ? EfiRuntimeServicesCode : EfiBootServicesCode;
+      bool aboveIsData = above != s.ranges.end() && above->second.type == data;
       UINT64 base = free.end - EFI_PAGE_SIZE;
-      Occupy(s, base, 1, type, kCacheable, Owner::Firmware);
+      Occupy(s, base, 1, aboveIsData ? code : data, kCacheable | (s.growthRuntime ? EFI_MEMORY_RUNTIME : 0),
+             Owner::Firmware);
       std::memset(reinterpret_cast<void *>(base), 0, EFI_PAGE_SIZE);
       placed = true;
       break;
@@ -433,11 +435,12 @@ unsigned Firmware::FreePagesCalls() const {
 UINTN Firmware::MapKey() const {
   return s_->mapKey;
 }
-void Firmware::GrowMemoryMapOnCall(unsigned nth, unsigned extraDescriptors) {
+void Firmware::GrowMemoryMapOnCall(unsigned nth, unsigned extraDescriptors, bool runtime) {
   if (nth == 0)
     Misuse("GrowMemoryMapOnCall counts from 1");
   s_->growthCountdown = nth;
   s_->growthLater = extraDescriptors;
+  s_->growthRuntime = runtime;
 }
 
 void Firmware::GuardFreeMemory() {
