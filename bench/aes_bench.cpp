@@ -4,6 +4,8 @@
 //   loader-tables        the table path, firmware code generation
 //   openssl-tables       OpenSSL with its AES-instruction and SSSE3 paths
 //                        masked off through OPENSSL_ia32cap: its own table code
+//   loader-tables-alternating  the table path again, pass for pass beside
+//                        openssl-tables in the same process
 //   loader-instructions  the AES-instructions path, firmware code generation
 //   openssl              OpenSSL as it comes, with the AES instructions
 //
@@ -11,10 +13,14 @@
 // process. So the masked peer runs in a child: this program started again
 // with the mask and NIMB_BENCH_AES_CHILD in its environment, which decrypts
 // the same data for as many passes as Google Benchmark asks of the
-// benchmark, and reports the CPU time it took and a hash of its plaintext.
-// The benchmark hands that time on as manual time. OpenSSL 3 doesn't export
-// its capability word, so that the mask took is seen from the rate: the
-// suite warns when the masked child isn't far slower than OpenSSL here.
+// benchmark, one pass of masked OpenSSL and one of the loader's table path
+// in turn, and reports the CPU time each side took and the hashes of their
+// plaintexts. The benchmarks hand those times on as manual time, and the
+// table figures set the two sides of the same child against each other:
+// on a busy machine, runs at different moments meet different loads.
+// OpenSSL 3 doesn't export its capability word, so that the mask took is
+// seen from the rate: the suite warns when the masked child isn't far
+// slower than OpenSSL here.
 #include <benchmark/benchmark.h>
 #include <openssl/evp.h>
 #include <time.h>
@@ -110,25 +116,39 @@ uint64_t PlainHash(Decrypt decrypt, int bits) {
 // --- the masked child ---------------------------------------------------------------------
 
 struct ChildReport {
-  uint64_t hash = 0;
-  double seconds = -1;
+  uint64_t hash = 0;        // OpenSSL's plaintext
+  uint64_t loaderHash = 0;  // the loader's table path's plaintext
+  double seconds = -1;      // OpenSSL's passes
+  double loaderSeconds = -1;
 };
 
-// In the child: "BITS PASSES" from the environment; prints the report and
-// leaves before main.
+// In the child: "BITS PASSES" from the environment. The passes alternate
+// between masked OpenSSL and the loader's table path, one of each at a
+// time, so that both meet the same load on the machine; each side's CPU
+// time is summed over its own passes. Prints the report and leaves before
+// main.
 [[maybe_unused]] const bool gChild = [] {
   const char *request = std::getenv(kChildVariable);
   if (request == nullptr)
     return false;
   int bits = 0;
   long long passes = 0;
-  if (std::sscanf(request, "%d %lld", &bits, &passes) != 2)
+  if (std::sscanf(request, "%d %lld", &bits, &passes) != 2 || !gAesFirmwareBuild.usePath(false))
     _exit(2);
+  const uint64_t loaderHash = PlainHash(LoaderDecrypt, bits);
   const uint64_t hash = PlainHash(OpensslDecrypt, bits);
-  const double start = CpuSeconds();
-  for (long long i = 0; i < passes; i++)
-    OpensslDecrypt(bits, TheData().work.data(), kBytes);
-  std::printf("%" PRIx64 " %.9f\n", hash, CpuSeconds() - start);
+  uint8_t *bytes = TheData().work.data();
+  double seconds = 0, loaderSeconds = 0;
+  for (long long i = 0; i < passes; i++) {
+    double start = CpuSeconds();
+    OpensslDecrypt(bits, bytes, kBytes);
+    const double middle = CpuSeconds();
+    LoaderDecrypt(bits, bytes, kBytes);
+    const double end = CpuSeconds();
+    seconds += middle - start;
+    loaderSeconds += end - middle;
+  }
+  std::printf("%" PRIx64 " %" PRIx64 " %.9f %.9f\n", hash, loaderHash, seconds, loaderSeconds);
   std::fflush(stdout);
   _exit(0);
 }();
@@ -141,7 +161,8 @@ ChildReport RunMaskedChild(int bits, long long passes) {
   FILE *child = popen(command, "r");
   if (child == nullptr)
     return report;
-  if (std::fscanf(child, "%" SCNx64 " %lf", &report.hash, &report.seconds) != 2)
+  if (std::fscanf(child, "%" SCNx64 " %" SCNx64 " %lf %lf", &report.hash, &report.loaderHash, &report.seconds,
+                  &report.loaderSeconds) != 4)
     report.seconds = -1;
   if (pclose(child) != 0)
     report.seconds = -1;
@@ -164,15 +185,18 @@ void Register(int bits, const char *contender, Decrypt decrypt) {
   });
 }
 
-void RegisterMasked(int bits) {
-  benchmark::RegisterBenchmark(Name(bits, "openssl-tables").c_str(), [bits](benchmark::State &state) {
+// The two sides of the masked child's alternating passes, each as a
+// benchmark of its own with the child's time for its side.
+void RegisterMasked(int bits, const char *contender, bool loader) {
+  benchmark::RegisterBenchmark(Name(bits, contender).c_str(), [bits, loader](benchmark::State &state) {
     const ChildReport report = RunMaskedChild(bits, static_cast<long long>(state.max_iterations));
     if (report.seconds < 0) {
       state.SkipWithError("the masked child failed");
       return;
     }
+    const double seconds = loader ? report.loaderSeconds : report.seconds;
     for (auto _ : state)
-      state.SetIterationTime(report.seconds / static_cast<double>(state.max_iterations));
+      state.SetIterationTime(seconds / static_cast<double>(state.max_iterations));
     state.SetBytesProcessed(static_cast<int64_t>(state.iterations()) * static_cast<int64_t>(kBytes));
   })->UseManualTime();
 }
@@ -198,7 +222,8 @@ const BenchSuite gAesSuite("aes", [] {
       ok &= Agree(bits, "loader-instructions", PlainHash(LoaderDecrypt, bits), want);
     }
     const ChildReport child = RunMaskedChild(bits, kProbePasses);
-    ok &= child.seconds >= 0 && Agree(bits, "openssl-tables", child.hash, want);
+    ok &= child.seconds >= 0 && Agree(bits, "openssl-tables", child.hash, want) &&
+          Agree(bits, "loader-tables beside it", child.loaderHash, want);
     const double start = CpuSeconds();
     for (int i = 0; i < kProbePasses; i++)
       OpensslDecrypt(bits, TheData().work.data(), kBytes);
@@ -221,15 +246,18 @@ const BenchSuite gAesSuite("aes", [] {
   };
   for (int bits : {128, 256}) {
     Register(bits, "loader-tables", tables);
-    RegisterMasked(bits);
+    RegisterMasked(bits, "loader-tables-alternating", true);
+    RegisterMasked(bits, "openssl-tables", false);
     if (instructions)
       Register(bits, "loader-instructions", withInstructions);
     Register(bits, "openssl", OpensslDecrypt);
   }
   // Google Benchmark names a benchmark with manual time so.
-  AddFigure("aes128-vs-openssl-tables", Name(128, "loader-tables"),
+  // The table figures come from the child's alternating passes: the two
+  // sides met the same load.
+  AddFigure("aes128-vs-openssl-tables", Name(128, "loader-tables-alternating") + "/manual_time",
             Name(128, "openssl-tables") + "/manual_time");
-  AddFigure("aes256-vs-openssl-tables", Name(256, "loader-tables"),
+  AddFigure("aes256-vs-openssl-tables", Name(256, "loader-tables-alternating") + "/manual_time",
             Name(256, "openssl-tables") + "/manual_time");
   AddFigure("aes128-ni-vs-openssl", Name(128, "loader-instructions"), Name(128, "openssl"));
   return true;

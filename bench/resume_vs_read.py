@@ -20,7 +20,13 @@ time between reads (the bar, the loop), from the last read to the
 restart's GetMemoryMap (the decryption), and from there to the probe
 (ExitBootServices, the runtime map, the copy of the restart code).
 
-    bench/resume_vs_read.py [--efi-dir build/efi] [--guest-dir build/tests/guest]
+    bench/resume_vs_read.py [--efi-dir build/efi] [--guest-dir build/tests/guest] [--icount]
+
+With --icount, QEMU counts virtual time by the guest's instructions (as
+bench/cache_boot.py --icount does): the loader's work then weighs what it
+executes, whatever each instruction costs the emulator (under TCG an AES
+instruction is a call into a helper of QEMU's), and the host's load and
+page cache no longer move the counter.
 
 Prints `figure resume-vs-read: loader ... vs DiskIO read ... = R.RRx`, R
 being the loader's time over the read's (the goal is at most 1.5x), and
@@ -37,6 +43,7 @@ from pathlib import Path
 REPO = Path(__file__).resolve().parents[1]
 sys.path.insert(0, str(REPO / "tests" / "qemu"))
 import harness  # noqa: E402
+from cache_boot import ICOUNT  # noqa: E402
 from scenarios import ResumeImage, Scenario  # noqa: E402
 
 FIRST_STAGE = 64 << 20
@@ -59,10 +66,10 @@ BENCH = Scenario(
 )
 
 
-def measure(efi_dir, guest_dir, keep):
+def measure(efi_dir, guest_dir, keep, icount=False):
     workdir = Path(tempfile.mkdtemp(prefix="nimb-bench-resume-"))
     disk, _ = harness.prepare(BENCH, efi_dir, workdir, guest_dir=guest_dir)
-    returncode, log, _ = harness.boot(disk, workdir, BENCH.timeout, extra=("-cpu", "max"))
+    returncode, log, _ = harness.boot(disk, workdir, BENCH.timeout, extra=("-cpu", "max", *(ICOUNT if icount else ())))
     (workdir / "serial.txt").write_text(log)
     read, start, entry = TIMED_READ.search(log), LOADER_START.findall(log), PROBE_ENTRY.findall(log)
     report = harness.parse_kernel_report(log)
@@ -110,8 +117,9 @@ def main(argv=None):
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"))
     parser.add_argument("--guest-dir", default=str(REPO / "build" / "tests" / "guest"))
     parser.add_argument("--keep", action="store_true", help="keep the run's files")
+    parser.add_argument("--icount", action="store_true", help="QEMU's virtual time follows the guest's instructions")
     args = parser.parse_args(argv)
-    measured = measure(args.efi_dir, args.guest_dir, args.keep)
+    measured = measure(args.efi_dir, args.guest_dir, args.keep, args.icount)
     if measured is None:
         return 1
     start, entry, read_ticks, extents, reads, maps = measured

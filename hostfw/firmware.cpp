@@ -66,7 +66,6 @@ EFI_STATUS EFIAPI StartImage(EFI_HANDLE, UINTN *, CHAR16 **) {
   EFI_STATUS EFIAPI Unprovided##Name() { \
     return Unprovided(#Name);            \
   }
-HOSTFW_UNPROVIDED(ReinstallProtocolInterface)
 HOSTFW_UNPROVIDED(RegisterProtocolNotify)
 HOSTFW_UNPROVIDED(LocateHandle)
 HOSTFW_UNPROVIDED(LocateDevicePath)
@@ -107,7 +106,6 @@ void FillBootServices(EFI_BOOT_SERVICES &bs) {
   InstallMemoryServices(bs);
   InstallEventServices(bs);
   InstallHandleServices(bs);
-  bs.ReinstallProtocolInterface = Slot(UnprovidedReinstallProtocolInterface);
   bs.RegisterProtocolNotify = Slot(UnprovidedRegisterProtocolNotify);
   bs.LocateHandle = Slot(UnprovidedLocateHandle);
   bs.LocateDevicePath = Slot(UnprovidedLocateDevicePath);

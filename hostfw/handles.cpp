@@ -104,6 +104,22 @@ EFI_STATUS EFIAPI InstallProtocolInterface(EFI_HANDLE *Handle, const EFI_GUID *P
   return EFI_SUCCESS;
 }
 
+// The interface of a handle's protocol swapped for another, in its place.
+EFI_STATUS EFIAPI ReinstallProtocolInterface(EFI_HANDLE Handle, const EFI_GUID *Protocol, VOID *OldInterface,
+                                             VOID *NewInterface) {
+  State &s = Services::Active();
+  EFI_STATUS failure;
+  if (Refused(s, "ReinstallProtocolInterface", &failure, Protocol))
+    return failure;
+  if (Protocol == nullptr || FindHandle(s, Handle) == nullptr)
+    return EFI_INVALID_PARAMETER;
+  InterfaceRecord *found = FindProtocol(s, Handle, *Protocol);
+  if (found == nullptr || found->interface != OldInterface)
+    return EFI_NOT_FOUND;
+  found->interface = NewInterface;
+  return EFI_SUCCESS;
+}
+
 EFI_STATUS EFIAPI UninstallProtocolInterface(EFI_HANDLE Handle, const EFI_GUID *Protocol, VOID *Interface) {
   State &s = Services::Active();
   EFI_STATUS failure;
@@ -178,6 +194,7 @@ void InstallDevicePath(State &s, EFI_HANDLE handle, std::vector<uint8_t> bytes) 
 
 void InstallHandleServices(EFI_BOOT_SERVICES &bs) {
   bs.InstallProtocolInterface = InstallProtocolInterface;
+  bs.ReinstallProtocolInterface = reinterpret_cast<void *>(ReinstallProtocolInterface);
   bs.UninstallProtocolInterface = reinterpret_cast<void *>(UninstallProtocolInterface);
   bs.HandleProtocol = HandleProtocol;
   bs.LocateHandleBuffer = LocateHandleBuffer;

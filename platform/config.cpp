@@ -184,6 +184,7 @@ bool ApplyKeys(PlatformConfig *config, const char *, char *value) {
     more = *p++ == '+';
   }
   config->keys = held;
+  config->keysGiven = true;
   return true;
 }
 
@@ -199,6 +200,31 @@ bool ApplyFlag(bool *flag, const char *value) {
 
 bool ApplyKeysIgnored(PlatformConfig *config, const char *, char *value) {
   return ApplyFlag(&config->keysIgnored, value);
+}
+
+bool ApplyFirmwareProtocols(PlatformConfig *config, const char *, char *value) {
+  if (strcmp(value, "keep") != 0 && strcmp(value, "replace") != 0) {
+    return false;
+  }
+  config->replaceFirmwareProtocols = value[0] == 'r';
+  return true;
+}
+
+bool ApplyDebugExit(PlatformConfig *config, const char *, char *value) {
+  if (strcmp(value, "auto") == 0) {
+    config->debugExit = kDebugExitAuto;
+    return true;
+  }
+  bool on = false;
+  if (!ApplyFlag(&on, value)) {
+    return false;
+  }
+  config->debugExit = on ? kDebugExitOn : kDebugExitOff;
+  return true;
+}
+
+bool ApplyWaitKey(PlatformConfig *config, const char *, char *value) {
+  return ApplyFlag(&config->waitKey, value);
 }
 
 bool ApplyTimePxe(PlatformConfig *config, const char *, char *value) {
@@ -238,7 +264,8 @@ void DecodeHex(char *value) {
 
 // Stores a value under `name`, in the place of an earlier value of the name.
 // Nothing is changed, the value included, unless the whole line is good.
-bool AddEntry(ConfigEntryList *list, const char *name, char *value, bool hex, bool allowEmpty) {
+bool AddEntry(ConfigEntryList *list, const char *name, char *value, bool hex, bool allowEmpty,
+              ConfigVariableLife life = kVariableForGood) {
   if (*name == '\0' || !Utf8ToUcs2(name, nullptr, 0, nullptr)) {
     return false;
   }
@@ -262,17 +289,30 @@ bool AddEntry(ConfigEntryList *list, const char *name, char *value, bool hex, bo
   if (index == list->count) {
     list->count++;
   }
-  list->entries[index] = {name, reinterpret_cast<const UINT8 *>(value), size, !hex};
+  list->entries[index] = {name, reinterpret_cast<const UINT8 *>(value), size, !hex, life};
   return true;
 }
 
-// An NVRAM variable cannot be empty; a record's value can.
+// An NVRAM variable cannot be empty; a record's value can. A deleted
+// variable has no value.
 bool ApplyNvramText(PlatformConfig *config, const char *name, char *value) {
   return AddEntry(&config->nvram, name, value, false, false);
 }
 
 bool ApplyNvramHex(PlatformConfig *config, const char *name, char *value) {
   return AddEntry(&config->nvram, name, value, true, false);
+}
+
+bool ApplyNvramVolatileText(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->nvram, name, value, false, false, kVariableThisBoot);
+}
+
+bool ApplyNvramVolatileHex(PlatformConfig *config, const char *name, char *value) {
+  return AddEntry(&config->nvram, name, value, true, false, kVariableThisBoot);
+}
+
+bool ApplyNvramDelete(PlatformConfig *config, const char *name, char *value) {
+  return *value == '\0' && AddEntry(&config->nvram, name, value, false, true, kVariableDeleted);
 }
 
 bool ApplyDataHubText(PlatformConfig *config, const char *name, char *value) {
@@ -322,11 +362,17 @@ constexpr ConfigKey kConfigKeys[] = {
     {"options", ApplyOptions},
     {"console", ApplyConsole},
     {"hold", ApplyHold},
+    {"debug-exit", ApplyDebugExit},
+    {"wait-key", ApplyWaitKey},
     {"net.time-pxe", ApplyTimePxe},
     {"keys", ApplyKeys},
     {"keys-ignored", ApplyKeysIgnored},
+    {"firmware-protocols", ApplyFirmwareProtocols},
     {"nvram.", ApplyNvramText},
     {"nvram-hex.", ApplyNvramHex},
+    {"nvram-volatile.", ApplyNvramVolatileText},
+    {"nvram-volatile-hex.", ApplyNvramVolatileHex},
+    {"nvram-delete.", ApplyNvramDelete},
     {"datahub.", ApplyDataHubText},
     {"datahub-hex.", ApplyDataHubHex},
     {"device-properties-hex", ApplyDeviceProperties},
@@ -450,9 +496,13 @@ void ConfigSetDefaults(PlatformConfig *config) {
   config->options = nullptr;
   config->consoleMode = EfiConsoleControlScreenGraphics;
   config->holdSeconds = 0;
+  config->debugExit = kDebugExitAuto;
+  config->waitKey = false;
   config->timePxeDownload = false;
   config->keys = {};
+  config->keysGiven = false;
   config->keysIgnored = false;
+  config->replaceFirmwareProtocols = false;
   config->nvram.count = 0;
   config->dataHub.count = 0;
   config->deviceProperties = {};
@@ -464,6 +514,12 @@ void ConfigSetDefaults(PlatformConfig *config) {
 }
 
 UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport report, void *context) {
+  // Editors that write a byte-order mark put it before the first key.
+  constexpr char kByteOrderMark[] = "\xEF\xBB\xBF";
+  if (size >= 3 && memcmp(text, kByteOrderMark, 3) == 0) {
+    text += 3;
+    size -= 3;
+  }
   UINT32 errors = 0;
   UINT32 line = 1;
   char *start = text;
@@ -475,6 +531,37 @@ UINT32 ConfigParse(char *text, UINTN size, PlatformConfig *config, ConfigReport 
     }
   }
   return errors;
+}
+
+void ConfigEcho(const char *text, char *echo, UINTN capacity) {
+  static const char kDigits[] = "0123456789abcdef";
+  UINTN length = 0;
+  for (const UINT8 *p = reinterpret_cast<const UINT8 *>(text); *p != 0; p++) {
+    length += *p >= 0x20 && *p < 0x7F ? 1 : 4;
+  }
+  // Room for the mark when the whole does not fit.
+  const UINTN room = length < capacity ? capacity - 1 : capacity - 4;
+  UINTN at = 0;
+  for (const UINT8 *p = reinterpret_cast<const UINT8 *>(text); *p != 0; p++) {
+    const bool plain = *p >= 0x20 && *p < 0x7F;
+    if (at + (plain ? 1 : 4) > room) {
+      break;
+    }
+    if (plain) {
+      echo[at++] = static_cast<char>(*p);
+    } else {
+      echo[at++] = '\\';
+      echo[at++] = 'x';
+      echo[at++] = kDigits[*p >> 4];
+      echo[at++] = kDigits[*p & 15];
+    }
+  }
+  if (length >= capacity) {
+    echo[at++] = '.';
+    echo[at++] = '.';
+    echo[at++] = '.';
+  }
+  echo[at] = '\0';
 }
 
 EFI_STATUS ConfigBytesAnswer(const ConfigBytes &answer, void *buffer, UINTN *size) {

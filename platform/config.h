@@ -12,8 +12,15 @@
 //   loader=<path>          the loader on this volume; \EFI\BOOT\nimbboot.efi
 //   options=<text>         the loader's load options; none when absent
 //   console=text|graphics  the console mode the loader finds; graphics
-//   hold=<seconds>         wait between the report and the power-off, 0 to
-//                          3600; 0
+//   hold=<seconds>         wait between the report and the end of the run
+//                          (the screen as the loader left it), 0 to 3600; 0
+//   debug-exit=auto|0|1    1: end the run through QEMU's debug-exit device
+//                          (port 0xF4) with a code of exitcodes.h; 0: never
+//                          write the port; auto: on a machine that SMBIOS
+//                          names QEMU. Without the device the run goes on as
+//                          with 0; auto
+//   wait-key=0|1           1: after the outcome is on the screen, wait for a
+//                          key before the end; 0
 //   net.time-pxe=0|1       on a network boot, 1 times the firmware's own
 //                          download of the boot file before the loader
 //                          starts, then fetches it over the network's own
@@ -25,14 +32,30 @@
 //                          0 to 9, or a keyboard usage in hexadecimal (0x28).
 //                          At most kMaxHeldKeys keys, each once; the order is
 //                          the order of the report. Names are lower-case.
-//                          Empty or absent: nothing held
+//                          Given (even empty): these keys, the keyboard is
+//                          not read. Absent: the keys held on the keyboard
+//                          while the platform starts
 //   keys-ignored=0|1       the boot policy's answer: 1 tells the loader not
 //                          to read the held keys; 0
+//   firmware-protocols=keep|replace  what becomes of a protocol that the
+//                          platform serves (console control, key state, boot
+//                          policy, Data Hub, UGA Draw, frame buffer info,
+//                          device properties, network boot information) when
+//                          the firmware has its own: keep the firmware's and
+//                          serve none, or put the platform's in its place on
+//                          the same handle. Either way the log says so; keep
 //   nvram.<name>=<text>    the NVRAM variable <name> under the loader's vendor
-//                          GUID, set to the text's UTF-8 bytes without a
-//                          terminator, non-volatile, boot and runtime access
+//                          GUID, set for good to the text's UTF-8 bytes
+//                          without a terminator: non-volatile, boot and
+//                          runtime access, on the first start of a run only
 //   nvram-hex.<name>=<hex> the same with the bytes in hexadecimal, two digits
 //                          each, blanks allowed between bytes
+//   nvram-volatile.<name>=<text>, nvram-volatile-hex.<name>=<hex>  the same
+//                          for this boot only: volatile (boot and runtime
+//                          access), set at every start, gone after a reset
+//   nvram-delete.<name>=   the variable <name> under the loader's vendor GUID
+//                          is deleted on the first start of a run (the value
+//                          stays empty); one that is not there is reported
 //   datahub.<name>=<text>  a Data Hub record of the vendor's platform producer
 //                          named <name>, whose value is the text in UCS-2 with
 //                          a NUL unit behind it
@@ -63,7 +86,9 @@
 // allowed between bytes, no limit but the file's size.
 // NVRAM values may not be empty (an empty variable cannot exist). Names and
 // text values are UTF-8 within U+FFFF. The text and hexadecimal forms of one
-// name are one variable or one record: the later line wins. Records and
+// name are one variable or one record, and the set, volatile and delete forms
+// of a name are one variable: the later line wins.
+// A UTF-8 byte-order mark at the start of the file is skipped. Records and
 // variables keep the order of their first line.
 // Without any key there is still a key state protocol (nothing held), a boot
 // policy protocol (answering 0) and a Data Hub (no vendor records), but no
@@ -90,6 +115,13 @@ struct HeldKeys {
   UINT16 keys[kMaxHeldKeys];
 };
 
+// What becomes of a configured NVRAM variable.
+enum ConfigVariableLife : UINT8 {
+  kVariableForGood,   // non-volatile; records are all of this kind
+  kVariableThisBoot,  // volatile
+  kVariableDeleted,   // no value
+};
+
 // One variable or record: the name behind the key's prefix and the value,
 // both in the file's buffer.
 struct ConfigEntry {
@@ -99,6 +131,7 @@ struct ConfigEntry {
   // The value is UTF-8 text (ending in a NUL behind `size` bytes), not bytes
   // given in hexadecimal.
   bool text;
+  ConfigVariableLife life;
 };
 
 struct ConfigEntryList {
@@ -124,13 +157,21 @@ struct PlatformConfig {
   // The console mode that the loader finds when it starts; kConsoleNone:
   // no console control at all, as the firmware has none of its own.
   EFI_CONSOLE_CONTROL_SCREEN_MODE consoleMode;
-  // Seconds to wait between the report and the power-off.
+  // Seconds to wait between the report and the end of the run.
   UINT32 holdSeconds;
+  // Whether the run ends through the debug-exit device: kDebugExit...
+  UINT8 debugExit;
+  // Wait for a key once the outcome is on the screen.
+  bool waitKey;
   // On a network boot: time the firmware's own download of the boot file
   // before the loader starts (net.time-pxe=1).
   bool timePxeDownload;
   HeldKeys keys;
+  // `keys` came from the file: the keyboard is not read.
+  bool keysGiven;
   bool keysIgnored;
+  // A protocol of the firmware's own gives way to the platform's.
+  bool replaceFirmwareProtocols;
   ConfigEntryList nvram;
   ConfigEntryList dataHub;
   ConfigBytes deviceProperties;
@@ -147,6 +188,9 @@ constexpr const char *kDefaultLoaderPath = "\\EFI\\BOOT\\nimbboot.efi";
 // On a network boot: the loader's name on the TFTP server.
 constexpr const char *kDefaultNetLoaderName = "nimbboot.efi";
 constexpr UINT32 kMaxHoldSeconds = 3600;
+constexpr UINT8 kDebugExitOff = 0;
+constexpr UINT8 kDebugExitOn = 1;
+constexpr UINT8 kDebugExitAuto = 2;  // when the machine is QEMU
 
 enum ConfigProblem : UINT32 {
   kConfigUnknownKey,  // reported, not an error
@@ -162,6 +206,14 @@ struct ConfigIssue {
 };
 
 typedef void (*ConfigReport)(const ConfigIssue &issue, void *context);
+
+// The room for a key or value as a report echoes it, the NUL counted.
+constexpr UINT32 kConfigEchoCapacity = 64;
+
+// `text` as a report may show it on a serial line: printable ASCII as it
+// stands, every other byte as \xNN; cut with "..." at the end when it needs
+// more than `capacity` - 1 characters. `capacity` is at least 5.
+void ConfigEcho(const char *text, char *echo, UINTN capacity);
 
 void ConfigSetDefaults(PlatformConfig *config);
 

@@ -170,6 +170,11 @@ EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_P
   console->onSetMode = nullptr;
   console->hiddenText = nullptr;
   InitScreenText(console);
+  // Without graphics output the screen can only be text: the loader then
+  // finds text and boots in text.
+  if (graphics == nullptr && mode == EfiConsoleControlScreenGraphics) {
+    mode = EfiConsoleControlScreenText;
+  }
   return Enter(console, mode);
 }
 
@@ -187,7 +192,8 @@ void ConsoleOfferScreenText(PlatformConsole *console, bool on) {
   }
 }
 
-EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode) {
+EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode,
+                                 ProtocolSlot slot) {
   // The console splitter's handle carries the graphics output of all screens.
   void *graphics = nullptr;
   if (EFI_ERROR(gBS->HandleProtocol(gST->ConsoleOutHandle, &gEfiGraphicsOutputProtocolGuid, &graphics))) {
@@ -200,9 +206,7 @@ EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_S
   if (EFI_ERROR(status)) {
     return status;
   }
-  EFI_HANDLE handle = nullptr;
-  return gBS->InstallProtocolInterface(&handle, &gEfiConsoleControlProtocolGuid, EFI_NATIVE_INTERFACE,
-                                       &console->protocol);
+  return ProtocolPut(slot, gEfiConsoleControlProtocolGuid, &console->protocol);
 }
 
 }  // namespace nimb::platform

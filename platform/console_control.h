@@ -13,6 +13,7 @@
 #pragma once
 
 #include "efi/efi.h"
+#include "firmware.h"
 
 namespace nimb::platform {
 
@@ -34,8 +35,8 @@ struct PlatformConsole {
 };
 
 // Fills in the protocol over `text` and `graphics` and puts the screen into
-// `mode`, clearing it even if the mode is already the one set. No one hears
-// of SetMode yet.
+// `mode`, clearing it even if the mode is already the one set; text instead
+// of graphics when there is no graphics output. No one hears of SetMode yet.
 EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *text,
                               EFI_GRAPHICS_OUTPUT_PROTOCOL *graphics, EFI_CONSOLE_CONTROL_SCREEN_MODE mode);
 
@@ -43,8 +44,9 @@ EFI_STATUS ConsoleControlInit(PlatformConsole *console, EFI_SIMPLE_TEXT_OUTPUT_P
 // firmware's own again.
 void ConsoleOfferScreenText(PlatformConsole *console, bool on);
 
-// Finds the firmware's console, initialises `console` in `mode` and installs
-// its protocol on a new handle.
-EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode);
+// Finds the firmware's console, initialises `console` in `mode` and puts
+// its protocol into `slot`.
+EFI_STATUS ConsoleControlInstall(PlatformConsole *console, EFI_CONSOLE_CONTROL_SCREEN_MODE mode,
+                                 ProtocolSlot slot);
 
 }  // namespace nimb::platform

@@ -103,7 +103,7 @@ void DataHubInit(PlatformDataHub *hub, const UINT8 *records, UINTN size) {
   hub->size = size;
 }
 
-EFI_STATUS DataHubInstall(PlatformDataHub *hub, const ConfigEntryList &entries) {
+EFI_STATUS DataHubInstall(PlatformDataHub *hub, const ConfigEntryList &entries, ProtocolSlot slot) {
   const UINTN size = DataHubBuildRecords(entries, nullptr, 0);
   void *buffer = nullptr;
   EFI_STATUS status = gBS->AllocatePool(EfiBootServicesData, size, &buffer);
@@ -112,9 +112,7 @@ EFI_STATUS DataHubInstall(PlatformDataHub *hub, const ConfigEntryList &entries) 
   }
   DataHubBuildRecords(entries, static_cast<UINT8 *>(buffer), size);
   DataHubInit(hub, static_cast<const UINT8 *>(buffer), size);
-  EFI_HANDLE handle = nullptr;
-  return gBS->InstallProtocolInterface(&handle, &gEfiDataHubProtocolGuid, EFI_NATIVE_INTERFACE,
-                                       &hub->protocol);
+  return ProtocolPut(slot, gEfiDataHubProtocolGuid, &hub->protocol);
 }
 
 }  // namespace nimb::platform

@@ -11,6 +11,7 @@
 #include "config.h"
 #include "efi/datahub.h"
 #include "efi/efi.h"
+#include "firmware.h"
 
 namespace nimb::platform {
 
@@ -39,8 +40,8 @@ UINTN DataHubBuildRecords(const ConfigEntryList &entries, UINT8 *buffer, UINTN c
 // so does an empty hub; no filter drivers are known.
 void DataHubInit(PlatformDataHub *hub, const UINT8 *records, UINTN size);
 
-// Builds the records in pool memory, initialises `hub` and installs its
-// protocol on a new handle.
-EFI_STATUS DataHubInstall(PlatformDataHub *hub, const ConfigEntryList &entries);
+// Builds the records in pool memory, initialises `hub` and puts its
+// protocol into `slot`.
+EFI_STATUS DataHubInstall(PlatformDataHub *hub, const ConfigEntryList &entries, ProtocolSlot slot);
 
 }  // namespace nimb::platform

@@ -30,11 +30,10 @@ void DevicePropertiesInit(PlatformDeviceProperties *properties, const ConfigByte
   properties->onGetProperties = nullptr;
 }
 
-EFI_STATUS DevicePropertiesInstall(PlatformDeviceProperties *properties, const ConfigBytes &blob) {
+EFI_STATUS DevicePropertiesInstall(PlatformDeviceProperties *properties, const ConfigBytes &blob,
+                                   ProtocolSlot slot) {
   DevicePropertiesInit(properties, blob);
-  EFI_HANDLE handle = nullptr;
-  return gBS->InstallProtocolInterface(&handle, &gNimbDevicePropertiesProtocolGuid, EFI_NATIVE_INTERFACE,
-                                       &properties->protocol);
+  return ProtocolPut(slot, gNimbDevicePropertiesProtocolGuid, &properties->protocol);
 }
 
 }  // namespace nimb::platform

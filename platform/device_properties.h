@@ -6,6 +6,7 @@
 #include "config.h"
 #include "efi/efi.h"
 #include "efi/vendor.h"
+#include "firmware.h"
 
 namespace nimb::platform {
 
@@ -24,7 +25,8 @@ struct PlatformDeviceProperties {
 // EFI_BUFFER_TOO_SMALL. No one hears of the calls yet.
 void DevicePropertiesInit(PlatformDeviceProperties *properties, const ConfigBytes &blob);
 
-// Initialises `properties` and installs its protocol on a new handle.
-EFI_STATUS DevicePropertiesInstall(PlatformDeviceProperties *properties, const ConfigBytes &blob);
+// Initialises `properties` and puts its protocol into `slot`.
+EFI_STATUS DevicePropertiesInstall(PlatformDeviceProperties *properties, const ConfigBytes &blob,
+                                   ProtocolSlot slot);
 
 }  // namespace nimb::platform

@@ -1,5 +1,6 @@
 // How a run of the platform layer ends: the byte it writes to the debug-exit
-// port, after which the machine's exit status is (code << 1) | 1. The test
+// port when it uses one (QEMU's exit status is then (code << 1) | 1); the
+// firmware gets the loader's status back instead elsewhere. The test
 // harness (tests/qemu/harness.py) reads the kExit... lines of this file, so
 // each constant stays on one line of the form `constexpr UINT8 kExitName = 0x..;`.
 #pragma once

@@ -377,6 +377,14 @@ EFI_STATUS FileTimesInstall(EFI_HANDLE device, const FileTimeTable *table) {
       device, &gEfiSimpleFileSystemProtocolGuid, interface, &gVolume.volume);
 }
 
+void FileTimesUninstall(EFI_HANDLE device) {
+  if (gVolume.inner != nullptr) {
+    reinterpret_cast<ReinstallCall>(gBS->ReinstallProtocolInterface)(
+        device, &gEfiSimpleFileSystemProtocolGuid, &gVolume.volume, gVolume.inner);
+    gVolume.inner = nullptr;
+  }
+}
+
 UINT64 FileTimesServed() {
   return gServed;
 }

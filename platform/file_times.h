@@ -62,4 +62,8 @@ EFI_STATUS FileTimesInstall(EFI_HANDLE device, const FileTimeTable *table);
 // How many EFI_FILE_INFO answers got a time from the table so far.
 UINT64 FileTimesServed();
 
+// Gives `device` the firmware's own file system again, when FileTimesInstall
+// wrapped it.
+void FileTimesUninstall(EFI_HANDLE device);
+
 }  // namespace nimb::platform

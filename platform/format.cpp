@@ -105,16 +105,21 @@ void FormatText(FormatOutput output, void *context, const char *format, va_list 
   }
 }
 
-UINTN FormatToBuffer(char *buffer, UINTN size, const char *format, ...) {
+UINTN FormatToBufferv(char *buffer, UINTN size, const char *format, va_list arguments) {
   BufferSink sink = {buffer, size, 0};
-  va_list arguments;
-  va_start(arguments, format);
   FormatText(BufferOutput, &sink, format, arguments);
-  va_end(arguments);
   if (size != 0) {
     buffer[sink.length < size ? sink.length : size - 1] = '\0';
   }
   return sink.length;
+}
+
+UINTN FormatToBuffer(char *buffer, UINTN size, const char *format, ...) {
+  va_list arguments;
+  va_start(arguments, format);
+  const UINTN length = FormatToBufferv(buffer, size, format, arguments);
+  va_end(arguments);
+  return length;
 }
 
 const char *StatusName(EFI_STATUS status) {

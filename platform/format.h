@@ -19,6 +19,7 @@ void FormatText(FormatOutput output, void *context, const char *format, va_list 
 // Formats into `buffer` of `size` bytes, cutting at its end; always ends in a
 // NUL when `size` is not 0. Returns the length of the text without the cut.
 UINTN FormatToBuffer(char *buffer, UINTN size, const char *format, ...);
+UINTN FormatToBufferv(char *buffer, UINTN size, const char *format, va_list arguments);
 
 // "EFI_SUCCESS", "EFI_ABORTED" and so on; "unknown status" for others.
 const char *StatusName(EFI_STATUS status);

@@ -1,12 +1,14 @@
 #include "graphics.h"
 
+#include "firmware.h"
+
 namespace nimb::platform {
 
 namespace {
 
-constexpr UINT32 kDepth = 32;
 constexpr UINT32 kRefreshRate = 60;
 constexpr UINT32 kBytesPerPixel = 4;
+constexpr UINT64 k4GiB = 0x100000000ULL;
 
 static_assert(sizeof(EFI_UGA_PIXEL) == sizeof(EFI_GRAPHICS_OUTPUT_BLT_PIXEL), "the same pixels");
 static_assert(UINT32(EfiUgaVideoFill) == UINT32(EfiBltVideoFill) &&
@@ -28,7 +30,7 @@ EFI_STATUS EFIAPI UgaGetMode(EFI_UGA_DRAW_PROTOCOL *This, UINT32 *HorizontalReso
   const EFI_GRAPHICS_OUTPUT_MODE_INFORMATION *info = GraphicsOf(This)->Mode->Info;
   *HorizontalResolution = info->HorizontalResolution;
   *VerticalResolution = info->VerticalResolution;
-  *ColorDepth = kDepth;
+  *ColorDepth = GraphicsPixelDepth(*info);
   *RefreshRate = kRefreshRate;
   return EFI_SUCCESS;
 }
@@ -59,8 +61,7 @@ EFI_STATUS EFIAPI FrameBufferGetInfo(NIMB_FRAME_BUFFER_INFO_PROTOCOL *This,
   }
   const EFI_GRAPHICS_OUTPUT_PROTOCOL_MODE *mode =
       reinterpret_cast<PlatformFrameBufferInfo *>(This)->graphics->Mode;
-  // A screen that can only be drawn with Blt has no frame buffer to tell of.
-  if (mode->Info->PixelFormat == PixelBltOnly) {
+  if (!GraphicsFrameBufferUsable(*mode)) {
     return EFI_UNSUPPORTED;
   }
   *FrameBufferBase = mode->FrameBufferBase;
@@ -68,7 +69,7 @@ EFI_STATUS EFIAPI FrameBufferGetInfo(NIMB_FRAME_BUFFER_INFO_PROTOCOL *This,
   *BytesPerRow = mode->Info->PixelsPerScanLine * kBytesPerPixel;
   *Width = mode->Info->HorizontalResolution;
   *Height = mode->Info->VerticalResolution;
-  *Depth = kDepth;
+  *Depth = 32;
   return EFI_SUCCESS;
 }
 
@@ -76,6 +77,38 @@ PlatformUgaDraw gUgaDraw;
 PlatformFrameBufferInfo gFrameBufferInfo;
 
 }  // namespace
+
+UINT32 GraphicsPixelDepth(const EFI_GRAPHICS_OUTPUT_MODE_INFORMATION &info) {
+  switch (info.PixelFormat) {
+    case PixelRedGreenBlueReserved8BitPerColor:
+    case PixelBlueGreenRedReserved8BitPerColor:
+      return 32;
+    case PixelBitMask: {
+      const EFI_PIXEL_BITMASK &masks = info.PixelInformation;
+      UINT32 all = masks.RedMask | masks.GreenMask | masks.BlueMask | masks.ReservedMask;
+      UINT32 bits = 0;
+      for (; all != 0; all >>= 1) {
+        bits++;
+      }
+      return (bits + 7) & ~7U;
+    }
+    default:
+      return 0;
+  }
+}
+
+bool GraphicsFrameBufferUsable(const EFI_GRAPHICS_OUTPUT_PROTOCOL_MODE &mode) {
+  const EFI_GRAPHICS_OUTPUT_MODE_INFORMATION &info = *mode.Info;
+  if (info.PixelFormat != PixelBlueGreenRedReserved8BitPerColor || mode.FrameBufferBase == 0 ||
+      info.PixelsPerScanLine < info.HorizontalResolution) {
+    return false;
+  }
+  // Every row the loader may write lies inside the buffer, and the buffer
+  // below 4 GiB, where the kernel's 32-bit address reaches it.
+  const UINT64 rows = static_cast<UINT64>(info.PixelsPerScanLine) * kBytesPerPixel * info.VerticalResolution;
+  const UINT64 size = mode.FrameBufferSize;
+  return rows <= size && size <= k4GiB && mode.FrameBufferBase <= k4GiB - size;
+}
 
 void GraphicsInit(PlatformUgaDraw *uga, PlatformFrameBufferInfo *frameBuffer,
                   EFI_GRAPHICS_OUTPUT_PROTOCOL *graphics) {
@@ -87,7 +120,7 @@ void GraphicsInit(PlatformUgaDraw *uga, PlatformFrameBufferInfo *frameBuffer,
   frameBuffer->graphics = graphics;
 }
 
-EFI_STATUS InstallGraphicsProtocols(EFI_SYSTEM_TABLE *st) {
+EFI_STATUS InstallGraphicsProtocols(EFI_SYSTEM_TABLE *st, bool replace) {
   EFI_BOOT_SERVICES *bs = st->BootServices;
   // The console splitter's handle carries the graphics output of all screens.
   void *graphics = nullptr;
@@ -102,22 +135,29 @@ EFI_STATUS InstallGraphicsProtocols(EFI_SYSTEM_TABLE *st) {
   }
   GraphicsInit(&gUgaDraw, &gFrameBufferInfo, static_cast<EFI_GRAPHICS_OUTPUT_PROTOCOL *>(graphics));
 
-  // The loader looks for UGA Draw on the console's output handle; without
-  // one it goes on a handle of its own, where the loader won't find it.
-  EFI_HANDLE handle = st->ConsoleOutHandle;
-  void *existing = nullptr;
-  if (handle == nullptr || EFI_ERROR(bs->HandleProtocol(handle, &gEfiUgaDrawProtocolGuid, &existing))) {
-    const EFI_STATUS status = bs->InstallProtocolInterface(&handle, &gEfiUgaDrawProtocolGuid,
-                                                           EFI_NATIVE_INTERFACE, &gUgaDraw.protocol);
+  // The loader looks for UGA Draw on the console's output handle (only
+  // there); without one it goes on a handle of its own, where the loader
+  // won't find it.
+  ProtocolSlot uga = {st->ConsoleOutHandle, nullptr};
+  if (uga.handle != nullptr &&
+      !EFI_ERROR(bs->HandleProtocol(uga.handle, &gEfiUgaDrawProtocolGuid, &uga.firmware)) &&
+      uga.firmware != nullptr && gOnFirmwareProtocol != nullptr) {
+    gOnFirmwareProtocol("UGA Draw", replace);
+  }
+  if (uga.firmware == nullptr || replace) {
+    const EFI_STATUS status = ProtocolPut(uga, gEfiUgaDrawProtocolGuid, &gUgaDraw.protocol);
     if (EFI_ERROR(status)) {
       return status;
     }
   }
-  if (EFI_ERROR(bs->LocateProtocol(&gNimbFrameBufferInfoProtocolGuid, nullptr, &existing))) {
-    return bs->InstallProtocolInterface(&handle, &gNimbFrameBufferInfoProtocolGuid, EFI_NATIVE_INTERFACE,
-                                        &gFrameBufferInfo.protocol);
+  ProtocolSlot info;
+  if (!ProtocolClaim(gNimbFrameBufferInfoProtocolGuid, "frame buffer info", replace, &info)) {
+    return EFI_SUCCESS;
   }
-  return EFI_SUCCESS;
+  if (info.firmware == nullptr) {
+    info.handle = uga.handle;
+  }
+  return ProtocolPut(info, gNimbFrameBufferInfoProtocolGuid, &gFrameBufferInfo.protocol);
 }
 
 }  // namespace nimb::platform

@@ -1,7 +1,9 @@
 // The platform layer: the program that the firmware starts from
 // \EFI\BOOT\BOOTX64.EFI. It gives the firmware what the loader expects of
 // the machines it was made for, starts the loader, reports how the loader
-// came back and powers the machine off with an exit code that tells it.
+// came back, shows the outcome on the screen and ends the run: through
+// QEMU's debug-exit device with an exit code that tells the outcome, or back
+// to the firmware with the loader's status.
 #include <stdarg.h>
 
 #include "config.h"
@@ -9,12 +11,14 @@
 #include "data_hub.h"
 #include "device_properties.h"
 #include "efi/vendor.h"
+#include "ending.h"
 #include "exitcodes.h"
 #include "file_times.h"
 #include "firmware.h"
 #include "format.h"
 #include "graphics.h"
 #include "key_state.h"
+#include "machine.h"
 #include "memory.h"
 #include "net_boot.h"
 #include "net_boot_info.h"
@@ -42,25 +46,79 @@ PlatformNetBoot gNetBoot;
 MemoryMeter gMeter;
 FileTimeTable gTimes;
 
-// The debug-exit device ends the machine with the code; without one the
-// write goes nowhere and the firmware powers off instead.
-[[noreturn]] void PowerOff(UINT8 code) {
+// How the run is to end, as far as it is known: by the machine alone until
+// the configuration is read.
+struct Ending {
+  bool debugExit;
+  bool waitKey;
+  // The device whose file system serves exact times; null: none.
+  EFI_HANDLE timedDevice;
+  // Once the loader came back, its status, which the firmware gets back
+  // whatever fails after it.
+  bool loaderReturned;
+  EFI_STATUS loaderStatus;
+};
+Ending gEnding;
+
+void SetEnding(const PlatformConfig &config) {
+  gEnding.debugExit = config.debugExit == kDebugExitAuto ? MachineIsQemu() : config.debugExit == kDebugExitOn;
+  gEnding.waitKey = config.waitKey;
+  SerialPrintf("platform: debug-exit %s\n", gEnding.debugExit ? "in use" : "not used");
+}
+
+// The outcome goes on a text screen; the loader's own mode changes alone
+// show in the log.
+void ScreenToText() {
+  if (gConsole.protocol.SetMode != nullptr && gConsole.mode != EfiConsoleControlScreenText) {
+    gConsole.onSetMode = nullptr;
+    gConsole.protocol.SetMode(&gConsole.protocol, EfiConsoleControlScreenText);
+  }
+}
+
+// Shows `outcome` on the screen, waits for a key when configured, then ends
+// QEMU through the debug-exit device with `code`, when it is in use. Without
+// one the write goes nowhere, and the platform goes back to the firmware
+// with `status`, having put back and removed all that the firmware would
+// otherwise call in the freed image.
+[[noreturn]] void End(EFI_STATUS status, UINT8 code, const char *outcome) {
+  ScreenToText();
+  ShowOnScreen(outcome);
+  if (gEnding.waitKey) {
+    ShowOnScreen("Press a key to go on.");
+    SerialPrintf("platform: waiting for a key\n");
+    SerialPrintf("platform: %s\n", WaitForKeyPress() ? "key pressed" : "no keyboard to wait for");
+  }
   SerialPrintf("platform: exit code 0x%x\n", static_cast<UINT64>(code));
-  PortWriteByte(kDebugExitPort, code);
-  gRT->ResetSystem(EfiResetShutdown, EFI_SUCCESS, 0, nullptr);
+  if (gEnding.debugExit) {
+    PortWriteByte(kDebugExitPort, code);
+  }
+  UnwatchDiskAndReset();
+  if (gEnding.timedDevice != nullptr) {
+    FileTimesUninstall(gEnding.timedDevice);
+  }
+  const UINTN givenBack = ProtocolsGiveBack();
+  if (givenBack != 0) {
+    SerialPrintf("platform: %u of the firmware's own protocols put back\n", static_cast<UINT64>(givenBack));
+  }
+  const UINTN removed = UninstallOwnInterfaces();
+  SerialPrintf("platform: %u interfaces removed; back to the firmware with %s\n",
+               static_cast<UINT64>(removed), StatusName(status));
+  gBS->Exit(gImageHandle, status, 0, nullptr);
   for (;;) {
     __asm__ volatile("hlt");
   }
 }
 
 [[noreturn]] void Fail(UINT8 code, const char *format, ...) {
-  SerialPrintf("platform: error: ");
+  char message[160];
   va_list arguments;
   va_start(arguments, format);
-  SerialPrintv(format, arguments);
+  FormatToBufferv(message, sizeof(message), format, arguments);
   va_end(arguments);
-  SerialPrintf("\n");
-  PowerOff(code);
+  SerialPrintf("platform: error: %s\n", message);
+  char outcome[192];
+  FormatToBuffer(outcome, sizeof(outcome), "Platform error: %s", message);
+  End(gEnding.loaderReturned ? gEnding.loaderStatus : EFI_LOAD_ERROR, code, outcome);
 }
 
 void *AllocateOrFail(UINTN size, const char *what) {
@@ -79,19 +137,23 @@ CHAR16 *WideCopyOrFail(const char *text, const char *what, UINTN *units) {
   return wide;
 }
 
+// Keys and values are echoed bounded, control bytes and all others beyond
+// ASCII as \xNN, so that a broken file cannot flood or garble the log.
 void ReportConfigIssue(const ConfigIssue &issue, void *) {
+  char key[kConfigEchoCapacity];
+  char value[kConfigEchoCapacity];
+  ConfigEcho(issue.key, key, sizeof(key));
+  ConfigEcho(issue.value != nullptr ? issue.value : "", value, sizeof(value));
+  const UINT64 line = issue.line;
   switch (issue.problem) {
     case kConfigUnknownKey:
-      SerialPrintf("platform: %s line %u: unknown key '%s' ignored\n", kConfigName,
-                   static_cast<UINT64>(issue.line), issue.key);
+      SerialPrintf("platform: %s line %u: unknown key '%s' ignored\n", kConfigName, line, key);
       break;
     case kConfigNoEquals:
-      SerialPrintf("platform: %s line %u: no '=' in '%s'\n", kConfigName, static_cast<UINT64>(issue.line),
-                   issue.key);
+      SerialPrintf("platform: %s line %u: no '=' in '%s'\n", kConfigName, line, key);
       break;
     case kConfigBadValue:
-      SerialPrintf("platform: %s line %u: bad value '%s' for '%s'\n", kConfigName,
-                   static_cast<UINT64>(issue.line), issue.value, issue.key);
+      SerialPrintf("platform: %s line %u: bad value '%s' for '%s'\n", kConfigName, line, value, key);
       break;
   }
 }
@@ -101,6 +163,7 @@ void ParseConfig(char *text, UINTN size, PlatformConfig *config) {
   if (ConfigParse(text, size, config, ReportConfigIssue, nullptr) != 0) {
     Fail(kExitConfigInvalid, "%s has errors", kConfigName);
   }
+  SetEnding(*config);
 }
 
 // The whole of a file of the platform's volume, with room for a NUL behind
@@ -139,6 +202,7 @@ void ReadConfig(EFI_FILE_PROTOCOL *root, PlatformConfig *config) {
   char *text = ReadWholeFile(root, kConfigPath, kConfigName, kExitConfigInvalid, &size);
   if (text == nullptr) {
     SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    SetEnding(*config);
     return;
   }
   ParseConfig(text, size, config);
@@ -165,6 +229,7 @@ void ServeExactTimes(EFI_FILE_PROTOCOL *root, EFI_HANDLE device) {
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot serve exact file times (%s)", StatusName(status));
   }
+  gEnding.timedDevice = device;
   SerialPrintf("platform: exact times of %u paths\n", static_cast<UINT64>(gTimes.count));
 }
 
@@ -374,6 +439,11 @@ void ReportSetMode(EFI_CONSOLE_CONTROL_SCREEN_MODE mode, EFI_STATUS status) {
   SerialPrintf("\n");
 }
 
+// A protocol that the firmware has of its own, and what became of it.
+void ReportFirmwareProtocol(const char *name, bool replaced) {
+  SerialPrintf("platform: the firmware has its own %s: %s\n", name, replaced ? "replaced" : "kept");
+}
+
 // Every call of the device properties and network boot protocols shows in
 // the log, on a line of its own between the loader's messages: the room the
 // caller gave, the answer and the size given back.
@@ -410,16 +480,22 @@ void InstallAnswerProtocols(const PlatformConfig &config) {
     ReportBytes(", bsdp", config.bsdpResponse);
   }
   SerialPrintf("\n");
-  if (config.deviceProperties.bytes != nullptr) {
-    const EFI_STATUS status = DevicePropertiesInstall(&gDeviceProperties, config.deviceProperties);
+  ProtocolSlot slot;
+  if (config.deviceProperties.bytes != nullptr &&
+      ProtocolClaim(gNimbDevicePropertiesProtocolGuid, "device properties", config.replaceFirmwareProtocols,
+                    &slot)) {
+    const EFI_STATUS status = DevicePropertiesInstall(&gDeviceProperties, config.deviceProperties, slot);
     if (EFI_ERROR(status)) {
       Fail(kExitPlatformFailed, "cannot install the device properties (%s)", StatusName(status));
     }
     gDeviceProperties.onGetProperties = ReportGetProperties;
   }
   if (gNetBoot.pxe == nullptr &&
-      (config.dhcpResponse.bytes != nullptr || config.bsdpResponse.bytes != nullptr)) {
-    const EFI_STATUS status = NetBootInfoInstall(&gNetBootInfo, config.dhcpResponse, config.bsdpResponse);
+      (config.dhcpResponse.bytes != nullptr || config.bsdpResponse.bytes != nullptr) &&
+      ProtocolClaim(gNimbNetBootInfoProtocolGuid, "network boot information", config.replaceFirmwareProtocols,
+                    &slot)) {
+    const EFI_STATUS status =
+        NetBootInfoInstall(&gNetBootInfo, config.dhcpResponse, config.bsdpResponse, slot);
     if (EFI_ERROR(status)) {
       Fail(kExitPlatformFailed, "cannot install the network boot information (%s)", StatusName(status));
     }
@@ -431,54 +507,98 @@ void InstallAnswerProtocols(const PlatformConfig &config) {
 // firmware lacks.
 void InstallProtocols(const PlatformConfig &config) {
   EFI_STATUS status = EFI_SUCCESS;
-  if (config.consoleMode != kConsoleNone) {
-    status = ConsoleControlInstall(&gConsole, config.consoleMode);
+  ProtocolSlot slot;
+  if (config.consoleMode != kConsoleNone && ProtocolClaim(gEfiConsoleControlProtocolGuid, "console control",
+                                                          config.replaceFirmwareProtocols, &slot)) {
+    status = ConsoleControlInstall(&gConsole, config.consoleMode, slot);
     if (EFI_ERROR(status)) {
       Fail(kExitPlatformFailed, "cannot install console control (%s)", StatusName(status));
     }
     gConsole.onSetMode = ReportSetMode;
     gConsole.hiddenText = config.timeText ? TimedWriteText : SerialWriteText;
+    if (gConsole.mode != config.consoleMode) {
+      SerialPrintf("platform: no graphics output: console %s\n", ModeName(gConsole.mode));
+    }
   }
   // Drawing for the loader's boot screen; a firmware without graphics output
   // boots without pictures.
-  status = InstallGraphicsProtocols(gST);
+  status = InstallGraphicsProtocols(gST, config.replaceFirmwareProtocols);
   if (EFI_ERROR(status)) {
     SerialPrintf("platform: no graphics for the boot screen (%s)\n", StatusName(status));
   }
-  status = KeyProtocolsInstall(&gKeyState, &gBootPolicy, config);
+  KeySample sample;
+  status = KeyProtocolsInstall(&gKeyState, &gBootPolicy, config, &sample);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot install the key protocols (%s)", StatusName(status));
   }
-  SerialPrintf("platform: keys: modifiers 0x%x, %u keys, ignored %u\n",
-               static_cast<UINT64>(config.keys.modifiers), static_cast<UINT64>(config.keys.count),
-               static_cast<UINT64>(config.keysIgnored ? 1 : 0));
-  status = DataHubInstall(&gDataHub, config.dataHub);
-  if (EFI_ERROR(status)) {
-    Fail(kExitPlatformFailed, "cannot install the Data Hub (%s)", StatusName(status));
+  if (sample.status != EFI_NOT_STARTED) {
+    SerialPrintf("platform: keyboard: %s, partial keys %s, %u keystrokes\n", StatusName(sample.status),
+                 StatusName(sample.exposeState), static_cast<UINT64>(sample.strokes));
   }
-  SerialPrintf("platform: data hub: %u platform records\n", static_cast<UINT64>(config.dataHub.count));
+  if (gKeyState.protocol.ReadKeyState != nullptr) {  // not when the firmware's own is kept
+    SerialPrintf("platform: keys: modifiers 0x%x, %u keys, ignored %u, from %s\n",
+                 static_cast<UINT64>(gKeyState.held.modifiers), static_cast<UINT64>(gKeyState.held.count),
+                 static_cast<UINT64>(config.keysIgnored ? 1 : 0),
+                 config.keysGiven ? "platform.cfg" : "keyboard");
+  }
+  if (ProtocolClaim(gEfiDataHubProtocolGuid, "Data Hub", config.replaceFirmwareProtocols, &slot)) {
+    status = DataHubInstall(&gDataHub, config.dataHub, slot);
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot install the Data Hub (%s)", StatusName(status));
+    }
+    SerialPrintf("platform: data hub: %u platform records\n", static_cast<UINT64>(config.dataHub.count));
+  }
   InstallAnswerProtocols(config);
 }
 
-// The loader's variables that the configuration sets; the others stay as
-// they are. The values are wiped behind them: the variable store keeps the
-// only copy (a key among them is looked for in memory after a resume).
-void SetVariables(const ConfigEntryList &variables) {
-  constexpr UINT32 kAttributes =
-      EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
+// The loader's variables that the configuration names; the others stay as
+// they are. Changes that stay (set for good, deleted) are made on the first
+// start of a run only; a variable for this boot only is set at every start,
+// as a reset has taken it. The values are wiped behind them: the variable
+// store keeps the only copy (a key among them is looked for in memory after
+// a resume).
+void SetVariables(const ConfigEntryList &variables, bool firstStart) {
+  constexpr UINT32 kThisBoot = EFI_VARIABLE_BOOTSERVICE_ACCESS | EFI_VARIABLE_RUNTIME_ACCESS;
   for (UINT32 i = 0; i < variables.count; i++) {
     const ConfigEntry &variable = variables.entries[i];
     UINTN units = 0;
     CHAR16 *name = WideCopyOrFail(variable.name, "a variable's name", &units);
-    const EFI_STATUS status =
-        gRT->SetVariable(name, &gNimbVendorVariableGuid, kAttributes, variable.size, variable.bytes);
-    gBS->FreePool(name);
-    if (EFI_ERROR(status)) {
-      Fail(kExitPlatformFailed, "cannot set NVRAM variable %s (%s)", variable.name, StatusName(status));
+    UINTN found = 0;
+    if (gRT->GetVariable(name, &gNimbVendorVariableGuid, nullptr, &found, nullptr) == EFI_BUFFER_TOO_SMALL) {
+      SerialPrintf("platform: nvram %s at start: %u bytes\n", variable.name, static_cast<UINT64>(found));
+    } else {
+      SerialPrintf("platform: nvram %s at start: absent\n", variable.name);
     }
-    SerialPrintf("platform: nvram %s set, %u bytes\n", variable.name, static_cast<UINT64>(variable.size));
+    if (!firstStart && variable.life != kVariableThisBoot) {
+      SerialPrintf("platform: nvram %s left as the first start made it\n", variable.name);
+      gBS->FreePool(name);
+      continue;
+    }
+    const UINT32 attributes = variable.life == kVariableDeleted    ? 0
+                              : variable.life == kVariableThisBoot ? kThisBoot
+                                                                   : kThisBoot | EFI_VARIABLE_NON_VOLATILE;
+    const EFI_STATUS status =
+        gRT->SetVariable(name, &gNimbVendorVariableGuid, attributes, variable.size, variable.bytes);
+    gBS->FreePool(name);
+    if (variable.life == kVariableDeleted) {
+      if (EFI_ERROR(status) && status != EFI_NOT_FOUND) {
+        Fail(kExitPlatformFailed, "cannot delete NVRAM variable %s (%s)", variable.name, StatusName(status));
+      }
+      SerialPrintf("platform: nvram %s %s\n", variable.name,
+                   status == EFI_NOT_FOUND ? "not there to delete" : "deleted");
+      continue;
+    }
+    const char *life = variable.life == kVariableThisBoot ? "for this boot" : "for good";
+    if (EFI_ERROR(status)) {
+      Fail(kExitPlatformFailed, "cannot set NVRAM variable %s %s (%s)", variable.name, life,
+           StatusName(status));
+    }
+    SerialPrintf("platform: nvram %s set %s, %u bytes\n", variable.name, life,
+                 static_cast<UINT64>(variable.size));
   }
-  ReportKeyCopies(variables);
+  if (firstStart) {
+    ReportKeyCopies(variables);
+  }
   for (UINT32 i = 0; i < variables.count; i++) {
     volatile UINT8 *bytes = const_cast<UINT8 *>(variables.entries[i].bytes);
     for (UINT32 j = 0; j < variables.entries[i].size; j++) {
@@ -621,6 +741,7 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
   status = NetLoadFileFetch(&gNetBoot.loadFile, kConfigName, AllocateForFetch, &bytes, &size);
   if (status == EFI_NOT_FOUND) {
     SerialPrintf("platform: no %s, defaults used\n", kConfigName);
+    SetEnding(*config);
   } else if (EFI_ERROR(status)) {
     Fail(kExitConfigInvalid, "cannot fetch %s (%s)", kConfigName, StatusName(status));
   } else {
@@ -654,7 +775,12 @@ LoaderLaunch PrepareNetworkBoot(EFI_HANDLE device, PlatformConfig *config) {
   SerialPrintf("\nplatform: net boot dhcp answer ");
   SerialHex(dhcp.bytes, dhcp.size);
   SerialPrintf("\n");
-  status = NetBootInfoInstall(&gNetBootInfo, dhcp, discovery);
+  ProtocolSlot slot;
+  if (!ProtocolClaim(gNimbNetBootInfoProtocolGuid, "network boot information",
+                     config->replaceFirmwareProtocols, &slot)) {
+    return launch;
+  }
+  status = NetBootInfoInstall(&gNetBootInfo, dhcp, discovery, slot);
   if (EFI_ERROR(status)) {
     Fail(kExitPlatformFailed, "cannot install the network boot information (%s)", StatusName(status));
   }
@@ -671,7 +797,10 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   gRT = SystemTable->RuntimeServices;
   // The boot manager's watchdog would reset a slow run.
   gBS->SetWatchdogTimer(0, 0, 0, nullptr);
+  gOnFirmwareProtocol = ReportFirmwareProtocol;
   SerialPrintf("\nplatform: started\n");
+  // Until a configuration says otherwise.
+  gEnding.debugExit = MachineIsQemu();
 
   // Everything that allocates comes before the first measurement.
   EFI_HANDLE device = nullptr;
@@ -696,13 +825,11 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
     launch = PrepareNetworkBoot(device, &config);
   }
   InstallProtocols(config);
-  // A machine that resets starts again on the same variable store: the
-  // configured variables are set on the first start only.
+  // A machine that resets starts again on the same variable store: what
+  // stays of the configured variables is done on the first start only.
   const UINT32 boot = CountBoot();
   ReportResumeVariables();
-  if (boot == 1) {
-    SetVariables(config.nvram);
-  }
+  SetVariables(config.nvram, boot == 1);
   if (config.timedExtents.bytes != nullptr) {
     TimedRead(config.timedExtents);
   }
@@ -714,16 +841,18 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
     Fail(kExitPlatformFailed, "cannot size the memory map (%s)", StatusName(status));
   }
   SerialPrintf("platform: starting %s, console %s, %u directories\n", config.loaderPath,
-               ModeName(config.consoleMode), directories);
+               ModeName(config.consoleMode == kConsoleNone ? kConsoleNone : gConsole.mode), directories);
 
   const UINT64 pagesBefore = FreePagesOrFail("before the loader");
   const EFI_STATUS loaderStatus = RunLoader(launch, config);
+  // The status first: whatever fails after it, the log has it.
+  SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));
+  gEnding.loaderReturned = true;
+  gEnding.loaderStatus = loaderStatus;
   if (root != nullptr) {
     MemoryWarmDirectoryCache(root);
   }
   const UINT64 pagesAfter = FreePagesOrFail("after the loader");
-
-  SerialPrintf("\nplatform: loader returned 0x%x (%s)\n", loaderStatus, StatusName(loaderStatus));
   if (gTimes.entries != nullptr) {
     SerialPrintf("platform: exact times served %u times\n", FileTimesServed());
   }
@@ -736,7 +865,10 @@ extern "C" EFI_STATUS EFIAPI PlatformEntry(EFI_HANDLE ImageHandle, EFI_SYSTEM_TA
   for (UINT32 second = 0; second < config.holdSeconds; second++) {
     gBS->Stall(1000000);
   }
-  PowerOff(ExitCodeForOutcome(loaderStatus, changed));
+  char outcome[96];
+  FormatToBuffer(outcome, sizeof(outcome), "The loader returned %s (0x%x).", StatusName(loaderStatus),
+                 loaderStatus);
+  End(loaderStatus, ExitCodeForOutcome(loaderStatus, changed), outcome);
 }
 
 }  // namespace nimb::platform

@@ -40,11 +40,10 @@ void NetBootInfoInit(PlatformNetBootInfo *info, const ConfigBytes &dhcp, const C
   info->onGetResponse = nullptr;
 }
 
-EFI_STATUS NetBootInfoInstall(PlatformNetBootInfo *info, const ConfigBytes &dhcp, const ConfigBytes &bsdp) {
+EFI_STATUS NetBootInfoInstall(PlatformNetBootInfo *info, const ConfigBytes &dhcp, const ConfigBytes &bsdp,
+                              ProtocolSlot slot) {
   NetBootInfoInit(info, dhcp, bsdp);
-  EFI_HANDLE handle = nullptr;
-  return gBS->InstallProtocolInterface(&handle, &gNimbNetBootInfoProtocolGuid, EFI_NATIVE_INTERFACE,
-                                       &info->protocol);
+  return ProtocolPut(slot, gNimbNetBootInfoProtocolGuid, &info->protocol);
 }
 
 }  // namespace nimb::platform

@@ -7,6 +7,7 @@
 #include "config.h"
 #include "efi/efi.h"
 #include "efi/vendor.h"
+#include "firmware.h"
 
 namespace nimb::platform {
 
@@ -28,7 +29,8 @@ struct PlatformNetBootInfo {
 // An answer not given is EFI_NOT_FOUND. No one hears of the calls yet.
 void NetBootInfoInit(PlatformNetBootInfo *info, const ConfigBytes &dhcp, const ConfigBytes &bsdp);
 
-// Initialises `info` and installs its protocol on a new handle.
-EFI_STATUS NetBootInfoInstall(PlatformNetBootInfo *info, const ConfigBytes &dhcp, const ConfigBytes &bsdp);
+// Initialises `info` and puts its protocol into `slot`.
+EFI_STATUS NetBootInfoInstall(PlatformNetBootInfo *info, const ConfigBytes &dhcp, const ConfigBytes &bsdp,
+                              ProtocolSlot slot);
 
 }  // namespace nimb::platform

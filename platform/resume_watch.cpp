@@ -10,7 +10,9 @@ namespace nimb::platform {
 
 namespace {
 
-// The platform's own variable: the number of starts on this store.
+// The platform's own variable: the number of starts of this run, there only
+// from a reset that went through the platform's ResetSystem to the next
+// start, which deletes it: nothing of it stays once a run has ended.
 constexpr EFI_GUID kPlatformVariableGuid = {
     0x5C1A7E02, 0x93D4, 0x4B6F, {0x8E, 0x21, 0x4A, 0x07, 0xC3, 0x9B, 0xD5, 0x60}};
 constexpr const CHAR16 *kBootCountName = u"platform-boots";
@@ -52,6 +54,10 @@ UINT64 gReadBytes;
 UINT32 gReadDepth;
 bool gTimeReads;
 ResetSystemFunction gOriginalReset;
+UINT32 gBootCount;
+// Boot services have ended: a reset now is the kernel's, not the loader's.
+bool gBootServicesEnded;
+EFI_EVENT gBootServicesEndEvent;
 GetMemoryMapFunction gOriginalGetMemoryMap;
 
 EFI_STATUS EFIAPI WatchedReadDisk(EFI_DISK_IO_PROTOCOL *This, UINT32 MediaId, UINT64 Offset, UINTN BufferSize,
@@ -106,7 +112,18 @@ VOID EFIAPI WatchedResetSystem(EFI_RESET_TYPE ResetType, EFI_STATUS ResetStatus,
                  gReads[i].destination, gReads[i].status);
   }
   SerialPrintf("platform: reads %u, bytes 0x%x\n", gReadCount, gReadBytes);
+  // The count of starts is kept over a reset of the loader's, and only
+  // over it.
+  if (!gBootServicesEnded) {
+    EFI_GUID guid = kPlatformVariableGuid;
+    gRT->SetVariable(kBootCountName, &guid, EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS,
+                     sizeof(gBootCount), &gBootCount);
+  }
   gOriginalReset(ResetType, ResetStatus, DataSize, ResetData);
+}
+
+VOID EFIAPI NoteBootServicesEnd(EFI_EVENT, VOID *) {
+  gBootServicesEnded = true;
 }
 
 UINTN NodeLength(const EFI_DEVICE_PATH_PROTOCOL *node) {
@@ -160,10 +177,10 @@ UINT32 CountBoot() {
   EFI_GUID guid = kPlatformVariableGuid;
   if (EFI_ERROR(gRT->GetVariable(kBootCountName, &guid, nullptr, &size, &count)) || size != sizeof(count)) {
     count = 0;
+  } else {
+    gRT->SetVariable(kBootCountName, &guid, 0, 0, nullptr);
   }
-  count++;
-  gRT->SetVariable(kBootCountName, &guid, EFI_VARIABLE_NON_VOLATILE | EFI_VARIABLE_BOOTSERVICE_ACCESS,
-                   sizeof(count), &count);
+  gBootCount = ++count;
   SerialPrintf("platform: boot %u\n", static_cast<UINT64>(count));
   return count;
 }
@@ -204,10 +221,32 @@ void WatchDiskAndReset(bool timeReads) {
     gBS->GetMemoryMap = TimedGetMemoryMap;
     SealTable(&gBS->Hdr);
   }
+  gBS->CreateEvent(EVT_SIGNAL_EXIT_BOOT_SERVICES, TPL_NOTIFY, NoteBootServicesEnd, nullptr,
+                   &gBootServicesEndEvent);
   gOriginalReset = gRT->ResetSystem;
   gRT->ResetSystem = WatchedResetSystem;
   SealTable(&gRT->Hdr);
   SerialPrintf("platform: watching %u disk interfaces and the reset\n", static_cast<UINT64>(gDiskCount));
+}
+
+void UnwatchDiskAndReset() {
+  for (UINT32 i = 0; i < gDiskCount; i++) {
+    gDisks[i].interface->ReadDisk = gDisks[i].original;
+  }
+  gDiskCount = 0;
+  if (gOriginalGetMemoryMap != nullptr) {
+    gBS->GetMemoryMap = gOriginalGetMemoryMap;
+    SealTable(&gBS->Hdr);
+  }
+  if (gOriginalReset != nullptr) {
+    gRT->ResetSystem = gOriginalReset;
+    SealTable(&gRT->Hdr);
+  }
+  // Its function lies in the image that the firmware frees.
+  if (gBootServicesEndEvent != nullptr) {
+    gBS->CloseEvent(gBootServicesEndEvent);
+    gBootServicesEndEvent = nullptr;
+  }
 }
 
 void ReportKeyCopies(const ConfigEntryList &variables) {

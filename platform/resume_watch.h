@@ -9,9 +9,11 @@
 
 namespace nimb::platform {
 
-// Counts this start in a variable of the platform's own and returns the
-// count, from 1; prints "platform: boot N". A store that refuses the
-// variable counts every start as the first.
+// The count of this start in the run, from 1; prints "platform: boot N". A
+// run is the starts on one variable store linked by resets that the loader
+// asked for (before boot services end): the count stays in a variable of the
+// platform's own from such a reset to the next start only. A store that refuses the variable counts
+// every start as the first.
 UINT32 CountBoot();
 
 // Prints "platform: nvram at start: boot-signature=absent boot-image=58
@@ -32,6 +34,8 @@ void ReportKeyCopies(const ConfigEntryList &variables);
 // "platform: tsc read-end=") as it returns, and each GetMemoryMap call
 // the counter as it starts ("platform: tsc memory-map=").
 void WatchDiskAndReset(bool timeReads);
+// Puts back what WatchDiskAndReset wrapped, before the platform leaves.
+void UnwatchDiskAndReset();
 
 // Reads the extents of `request` (u32 partition number, then u64 start and
 // u64 length pairs, little-endian) through the firmware's DiskIO on that

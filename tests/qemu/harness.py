@@ -625,6 +625,66 @@ def check_screenshot(path, expect):
     return check_screen(image, expect, artwork)
 
 
+# The firmware's text console draws each character in a cell of 8 x 19
+# pixels, the same character the same way.
+CELL_WIDTH, CELL_HEIGHT = 8, 19
+
+
+def cell(image, x, y):
+    """The pixels of the character cell at (x, y), as a tuple of rows; None
+    when they are all one colour (a blank)."""
+    rows = tuple(image.rows[y + dy][3 * x : 3 * (x + CELL_WIDTH)] for dy in range(CELL_HEIGHT))
+    return None if all(row == rows[0][:3] * CELL_WIDTH for row in rows) else rows
+
+
+def find_text(image, text):
+    """Where a line of the firmware's text console reads `text`: (x, y) of
+    its first cell (or of a window a few rows above it, where the glyphs'
+    blank tops allow), or None. A line reads `text` when its cells are blank
+    exactly where `text` has blanks, and two of them are the same picture
+    exactly where `text` has the same character: a pattern that no other
+    text of the length, and no picture, gives by chance. The cell behind the
+    text must be blank."""
+    pattern = list(text) + [" "]
+    width = CELL_WIDTH * len(pattern)
+    for y in range(image.height - CELL_HEIGHT + 1):
+        for x in range(min(CELL_WIDTH, image.width - width + 1)):
+            seen = {}  # character -> its cell
+            for i, char in enumerate(pattern):
+                got = cell(image, x + i * CELL_WIDTH, y)
+                if (got is None) != (char == " ") or seen.setdefault(char, got) != got:
+                    break
+                if char != " " and list(seen.values()).count(got) > 1:
+                    break
+            else:
+                return x, y
+    return None
+
+
+def watch_screen(scenario, workdir):
+    """qemuboot's on_tick for a bare machine: a screenshot each time, until
+    every line of `scenario.screen_text` is on the screen; then Enter is
+    pressed, and the run stops once the first line is gone and the text
+    `after_key` is there. Returns it and the list of what it saw."""
+    steps = [scenario.screen_text, (scenario.after_key,)]
+    seen = []
+
+    def on_tick(qmp):
+        shot = workdir / "screen.ppm"
+        qmp.screendump(shot)
+        image = read_ppm(shot.read_bytes())
+        wanted = steps[len(seen)]
+        if all(find_text(image, line) for line in wanted) and (not seen or not find_text(image, seen[0][0])):
+            seen.append(wanted)
+            shot.rename(workdir / f"screen-{len(seen)}.ppm")
+            if len(seen) == len(steps):
+                return True
+            qmp.execute("send-key", keys=[{"type": "qcode", "data": "ret"}])
+        return False
+
+    return on_tick, seen
+
+
 # --- the disk -------------------------------------------------------------------------
 
 
@@ -722,9 +782,12 @@ def prepare(scenario, efi_dir, workdir, config_override=None, guest_dir=GUEST_DI
     if scenario.network:
         return serve_directory(volume, efi_dir / "BOOTX64.efi", loader), cache_name
     disk = workdir / "disk.img"
+    if scenario.usb:
+        disk_bytes = mkdisk.stick_bytes(volume)
     try:
         mkdisk.build_disk(disk, volume, efi_dir / "BOOTX64.efi", loader, disk_bytes=disk_bytes,
-                          raw=raw, raw_guid=RESUME_PARTITION_GUID)
+                          raw=raw, raw_guid=RESUME_PARTITION_GUID,
+                          config=mkdisk.STICK_CONFIG if scenario.usb and not config else None)
     except mkdisk.DiskError as error:
         raise OSError(str(error)) from error
     return disk, cache_name
@@ -805,7 +868,7 @@ def watch(scenario, workdir, served, png=False):
     """qemuboot's on_line for a scenario: its screenshots (with `png`, one as
     screen.png too), its actions and its count of starts. Returns it, the
     shots taken, a list of troubles and the actions not done."""
-    shots, trouble, pending, starts = [], [], list(scenario.actions), [0]
+    shots, trouble, pending, starts, stopped = [], [], list(scenario.actions), [0], []
 
     def on_line(line, qmp):
         if scenario.screen is not None and not shots and scenario.screen.when in line:
@@ -823,13 +886,43 @@ def watch(scenario, workdir, served, png=False):
                 qmp.execute("set_link", name=NET_ID, up=False)
             else:  # ("truncate", path, size)
                 os.truncate(Path(served) / action[1], action[2])
+        if scenario.stop_at and scenario.stop_at in line:
+            stopped.append(line)
+            return True
         starts[0] += line.startswith("platform: started")
         if starts[0] > scenario.boots:
             trouble.append(f"boots: the machine started more than {scenario.boots} times; stopped")
             return True
         return False
 
-    return on_line, shots, trouble, pending
+    return on_line, shots, trouble, pending, stopped
+
+
+def hold_keys(scenario):
+    """QEMU's extra arguments and qemuboot's on_tick for the scenario's held
+    keys, and the on_line that follows the platform's start and its reading
+    of the keyboard; all empty or None without held keys."""
+    if not scenario.held:
+        return (), None, None
+    events = [{"type": "key", "data": {"down": True, "key": {"type": "qcode", "data": key}}}
+              for key in scenario.held]  # fmt: skip
+    state = {"resumed": False, "started": False, "read": False}
+
+    def on_tick(qmp):
+        if not state["resumed"]:
+            qmp.execute("cont")  # input events are refused while the machine is paused
+            qmp.execute("input-send-event", events=events)
+            state["resumed"] = True
+        elif state["started"] and not state["read"]:
+            qmp.execute("input-send-event", events=events)
+
+    def on_line(line):
+        # The firmware's boot manager runs once its keyboard drivers have started.
+        state["started"] |= "BdsDxe:" in line or line.startswith("platform: started")
+        state["read"] |= line.startswith("platform: keys:")
+
+    usb = ("-device", "qemu-xhci", "-device", "usb-kbd") if scenario.usb_keyboard else ()
+    return ("-S", *usb), on_tick, on_line
 
 
 def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
@@ -841,15 +934,41 @@ def run_scenario(scenario, efi_dir, guest_dir=GUEST_DIR, echo=False):
         shutil.rmtree(workdir, ignore_errors=True)
         raise
     limit, screen = scenario.timeout, scenario.screen
-    on_line, shots, trouble, pending = watch(scenario, workdir, disk, png=echo)
-    returncode, log, error = boot(disk, workdir, limit, on_line, network=scenario.network,
-                                  reboot=scenario.boots > 1, qmp=bool(screen or scenario.actions), echo=echo)
-    (workdir / "serial.txt").write_text(log)
-    outcome = decode_exit(returncode, read_exit_codes())
+    earlier, error = "", None
+    if scenario.before_config is not None:
+        # The earlier power-on, from the same volume with its own platform.cfg.
+        first = dataclasses.replace(scenario, config=scenario.before_config, before_config=None)
+        (workdir / "before").mkdir()
+        first_disk, _ = prepare(first, efi_dir, workdir / "before", guest_dir=guest_dir)
+        _, earlier, error = boot(first_disk, workdir, limit, echo=echo, extra=scenario.qemu_args, usb=scenario.usb)
+    on_line, shots, trouble, pending, stopped = watch(scenario, workdir, disk, png=echo)
+    on_tick, seen = watch_screen(scenario, workdir) if scenario.screen_text else (None, [])
+    held_args, keys_tick, keys_on_line = hold_keys(scenario)
+    if keys_on_line is not None:
+        watch_line = on_line
+
+        def on_line(line, qmp):
+            keys_on_line(line)
+            return watch_line(line, qmp)
+
+    returncode, log, later_error = boot(disk, workdir, limit, on_line, network=scenario.network,
+                                        reboot=scenario.boots > 1,
+                                        qmp=bool(screen or scenario.actions or on_tick or keys_tick), echo=echo,
+                                        extra=(*scenario.qemu_args, *held_args), bare=scenario.bare,
+                                        on_tick=keys_tick or on_tick, tick=0.05 if keys_tick else 0.5,  # never both
+                                        usb=scenario.usb, same_store=True)
+    error = error or later_error
+    (workdir / "serial.txt").write_text(earlier + log)
+    done = stopped or (on_tick and len(seen) == 2)
+    outcome = Outcome("Stopped") if done else decode_exit(returncode, read_exit_codes())
     problems = ([f"timed out after {limit} s"] if returncode is None else []) + ([f"qemu: {error}"] if error else [])
     problems += check_report(log, outcome, scenario.status, scenario.memory, scenario.exit) + trouble
-    problems += check_log(log, scenario.expect, scenario.forbid) + check_console_modes(log, scenario.console_modes)
+    problems += check_log(earlier + log, scenario.expect, scenario.forbid)
+    problems += check_console_modes(log, scenario.console_modes)
     problems += [f"action {action!r} not done: {text!r} never came" for text, action in pending]
+    if on_tick and len(seen) < 2:
+        wanted = scenario.screen_text if not seen else (f"{scenario.after_key!r} after Enter",)
+        problems.append(f"screen: never showed {wanted} (last shot: {workdir / 'screen.ppm'})")
     if cache_name is not None and scenario.cache.looked_for:
         # The name that kcache gave the cache, from the boot device path the
         # disk tool computes, is the one the loader looks for.

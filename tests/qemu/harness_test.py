@@ -2,6 +2,7 @@
 report and exit code, the serial log, the kernel's report, the screen and
 the resume reads. No QEMU needed."""
 
+import random
 import re
 import unittest
 
@@ -176,6 +177,32 @@ class Screen(unittest.TestCase):
             with self.subTest(name):
                 picture, stray = harness.check_screen(image, wanted, artwork)
                 self.assertEqual((len(picture), len(stray)), (picture_count, stray_count), (picture, stray))
+
+
+    def test_text_rows(self):
+        line = "Press a key to go on."
+
+        def console(text, x=3, y=5):
+            """A black screen with `text` drawn in cells, a made-up picture a character."""
+            rows = [bytearray(3 * 400) for _ in range(60)]
+            for i, char in enumerate(text):
+                bits = random.Random(char).getrandbits(8 * 19) if char != " " else 0
+                for dy in range(19):
+                    for dx in range(8):
+                        value = 200 * (bits >> (8 * dy + dx) & 1)
+                        rows[y + dy][3 * (x + 8 * i + dx) : 3 * (x + 8 * i + dx + 1)] = bytes([value] * 3)
+            return harness.Image(400, 60, [bytes(row) for row in rows])
+
+        rows = [
+            ("the line", console(line), line, True),
+            ("a character other", console(line), "Press a key to go in.", False),
+            ("cut short", console(line), line[:-1], False),
+            ("a blank screen", console(""), line, False),
+            ("at the screen's edge", console(line, x=0, y=41), line, True),
+        ]
+        for name, image, text, wanted in rows:
+            with self.subTest(name):
+                self.assertEqual(harness.find_text(image, text) is not None, wanted)
 
 
 class Resume(unittest.TestCase):

@@ -1,11 +1,13 @@
 // Host tests of the platform layer's logic: its configuration file, text
-// conversion, exit codes, memory count, console modes and Data Hub. The
-// protocols that only pass the configuration on (held keys, device
-// properties, network boot answers) are checked end to end by the QEMU
-// scenarios, whose kernel reports what it got.
+// conversion, exit codes, memory count, console modes, screen facts, held
+// keys from the keyboard, the firmware's own protocols and the Data Hub.
+// The protocols that only pass the configuration on (device properties,
+// network boot answers) are checked end to end by the QEMU scenarios, whose
+// kernel reports what it got.
 #include <gtest/gtest.h>
 
 #include <cstring>
+#include <iomanip>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -15,7 +17,11 @@
 #include "../../platform/data_hub.h"
 #include "../../platform/exitcodes.h"
 #include "../../platform/format.h"
+#include "../../platform/graphics.h"
+#include "../../platform/key_state.h"
+#include "../../platform/machine.h"
 #include "../../platform/memory.h"
+#include "hostfw/hostfw.h"
 
 namespace nimb::platform {
 namespace {
@@ -38,9 +44,14 @@ struct Parsed {
         buffer.data(), text.size(), &config,
         [](const ConfigIssue &issue, void *context) {
           static const char *const kNames[] = {"unknown", "noequals", "bad"};
+          // As the log echoes them.
+          char key[kConfigEchoCapacity];
+          char value[kConfigEchoCapacity];
+          ConfigEcho(issue.key, key, sizeof(key));
+          ConfigEcho(issue.value != nullptr ? issue.value : "", value, sizeof(value));
           *static_cast<std::string *>(context) += " "s + kNames[issue.problem] + "@" +
-                                                  std::to_string(issue.line) + ":" + issue.key +
-                                                  (issue.value != nullptr ? "="s + issue.value : "");
+                                                  std::to_string(issue.line) + ":" + key +
+                                                  (issue.value != nullptr ? "="s + value : "");
         },
         &issues);
   }
@@ -57,7 +68,8 @@ std::string Hex(const UINT8 *bytes, size_t size) {
 void AddEntries(std::ostringstream &out, const char *what, const ConfigEntryList &list) {
   for (UINT32 i = 0; i < list.count; i++) {
     const ConfigEntry &entry = list.entries[i];
-    out << what << entry.name << '=';
+    static const char *const kLives[] = {"", "/boot", "/delete"};
+    out << what << entry.name << kLives[entry.life] << '=';
     if (entry.text) {
       EXPECT_EQ(entry.bytes[entry.size], 0) << entry.name << ": text without its NUL";
       out << '"' << std::string(reinterpret_cast<const char *>(entry.bytes), entry.size) << "\" ";
@@ -91,14 +103,26 @@ std::string Summary(const std::string &text) {
   if (config.holdSeconds != 0) {
     out << "hold=" << config.holdSeconds << ' ';
   }
+  if (config.debugExit != kDebugExitAuto) {
+    out << "debug-exit=" << int{config.debugExit} << ' ';
+  }
+  if (config.waitKey) {
+    out << "wait-key ";
+  }
   if (config.keys.modifiers != 0) {
     out << "modifiers=" << std::hex << config.keys.modifiers << std::dec << ' ';
   }
   for (UINT32 i = 0; i < config.keys.count; i++) {
     out << "key=" << std::hex << config.keys.keys[i] << std::dec << ' ';
   }
+  if (config.keysGiven && config.keys.modifiers == 0 && config.keys.count == 0) {
+    out << "nothing-held ";  // the keyboard is not read
+  }
   if (config.keysIgnored) {
     out << "ignored ";
+  }
+  if (config.replaceFirmwareProtocols) {
+    out << "replace ";
   }
   AddEntries(out, "nvram.", config.nvram);
   AddEntries(out, "datahub.", config.dataHub);
@@ -112,7 +136,7 @@ std::string Summary(const std::string &text) {
 TEST(PlatformConfig, ParsesEveryKey) {
   struct Row {
     std::string text;
-    const char *summary;
+    std::string summary;
   };
   const std::vector<Row> rows = {
       // Lines, keys and values.
@@ -130,12 +154,32 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"console=none\n", "console=2 errors=0"},
       {"\nhold=3s\nhold=-1\nhold=3601\n", "errors=3 bad@2:hold=3s bad@3:hold=-1 bad@4:hold=3601"},
       {"hold=3600\n", "hold=3600 errors=0"},
+      // How the run ends.
+      {"debug-exit=1\nwait-key=1", "debug-exit=1 wait-key errors=0"},
+      {"debug-exit=0\ndebug-exit=auto\nwait-key=1\nwait-key=0", "errors=0"},
+      {"debug-exit=0", "debug-exit=0 errors=0"},
+      {"debug-exit=yes\ndebug-exit=Auto\nwait-key=2",
+       "errors=3 bad@1:debug-exit=yes bad@2:debug-exit=Auto bad@3:wait-key=2"},
       {"loader=\n", "errors=1 bad@1:loader="},
       {"options=\"-v\n", "errors=1 bad@1:options=\"-v"},
       {"options=\"a\"b\"\n", "errors=1 bad@1:options=\"a\"b\""},
       {"options=\"a\\\"\n", "errors=1 bad@1:options=\"a\\\""},
       {"options=\"\\q\"\n", "errors=1 bad@1:options=\"\\q\""},
-      {"options=\xF0\x9F\x98\x80\n", "errors=1 bad@1:options=\xF0\x9F\x98\x80"},
+      {"options=\xF0\x9F\x98\x80\n", "errors=1 bad@1:options=\\xf0\\x9f\\x98\\x80"},
+      // A byte-order mark is skipped at the start only; echoes are bounded
+      // and show control bytes as escapes.
+      {"\xEF\xBB\xBFhold=3\n", "hold=3 errors=0"},
+      {"\xEF\xBB\xBF", "errors=0"},
+      {"hold=1\n\xEF\xBB\xBFhold=2", "hold=1 errors=0 unknown@2:\\xef\\xbb\\xbfhold=2"},
+      {"\xEF\xBBhold=2", "errors=0 unknown@1:\\xef\\xbbhold=2"},
+      {"k\x1b[2J\x07=\x7f", "errors=0 unknown@1:k\\x1b[2J\\x07=\\x7f"},
+      {"console=" + std::string(70, 'v'), "errors=1 bad@1:console=" + std::string(60, 'v') + "..."},
+      {"console=" + std::string(63, 'v'), "errors=1 bad@1:console=" + std::string(63, 'v')},
+      {"console=" + std::string(64, 'v'), "errors=1 bad@1:console=" + std::string(60, 'v') + "..."},
+      {"console=" + std::string(14, 'v') + "\x01" + std::string(60, 'v'),
+       "errors=1 bad@1:console=" + std::string(14, 'v') + "\\x01" + std::string(42, 'v') + "..."},
+      {"console=" + std::string(59, 'v') + "\x01\x01",
+       "errors=1 bad@1:console=" + std::string(59, 'v') + "..."},
       {std::string("hold=1\0junk\nconsole=text", 24), "console=0 hold=1 errors=1 noequals@2:junk"},
       // Held keys and the boot policy.
       {"keys=gui+v+s", "modifiers=8 key=7019 key=7016 errors=0"},
@@ -144,7 +188,7 @@ TEST(PlatformConfig, ParsesEveryKey) {
       {"keys=a+z+1+9+0+0x28+0xE0", "key=7004 key=701d key=701e key=7026 key=7027 key=7028 key=70e0 errors=0"},
       {"keys=a+b+c+d+e+f+g+h",
        "key=7004 key=7005 key=7006 key=7007 key=7008 key=7009 key=700a key=700b errors=0"},
-      {"keys=gui+v\nkeys=", "errors=0"},
+      {"keys=gui+v\nkeys=", "nothing-held errors=0"},
       {"keys=shift+lshift\nkeys-ignored=1", "modifiers=2 ignored errors=0"},
       {"keys-ignored=1\nkeys-ignored=0", "errors=0"},
       {"keys=shift\nkeys=a+b+c+d+e+f+g+h+i", "modifiers=2 errors=1 bad@2:keys=a+b+c+d+e+f+g+h+i"},
@@ -153,11 +197,21 @@ TEST(PlatformConfig, ParsesEveryKey) {
        "bad@6:keys=ab bad@7:keys=leftshift"},
       {"keys=0x\nkeys=0x00\nkeys=0x100\nkeys=0x2g\nkeys=gui + v",
        "errors=5 bad@1:keys=0x bad@2:keys=0x00 bad@3:keys=0x100 bad@4:keys=0x2g bad@5:keys=gui + v"},
+      {"firmware-protocols=replace", "replace errors=0"},
+      {"firmware-protocols=replace\nfirmware-protocols=keep\nfirmware-protocols=Replace",
+       "errors=1 bad@3:firmware-protocols=Replace"},
       {"keys-ignored=2\nkeys-ignored=01\nkeys-ignored=",
        "errors=3 bad@1:keys-ignored=2 bad@2:keys-ignored=01 bad@3:keys-ignored="},
       // Variables and platform records.
       {"nvram.boot-args=-v  foo=1", "nvram.boot-args=\"-v  foo=1\" errors=0"},
       {"nvram-hex.p=02 01 0C00\t7fff0400", "nvram.p=02010c007fff0400 errors=0"},
+      {"nvram-volatile.a=x\nnvram-volatile-hex.b=0a\nnvram-delete.c=",
+       "nvram.a/boot=\"x\" nvram.b/boot=0a nvram.c/delete=\"\" errors=0"},
+      {"nvram.a=1\nnvram-delete.b=\nnvram-volatile.a=2\nnvram-hex.b=03",
+       "nvram.a/boot=\"2\" nvram.b=03 errors=0"},
+      {"nvram-delete.a=1\nnvram-delete.=\nnvram-volatile.a=\nnvram-volatile-hex.a=0",
+       "errors=4 bad@1:nvram-delete.a=1 bad@2:nvram-delete.= bad@3:nvram-volatile.a= "
+       "bad@4:nvram-volatile-hex.a=0"},
       {"datahub.Model=\" Q \"\ndatahub-hex.Bus=00e1F505",
        "datahub.Model=\" Q \" datahub.Bus=00e1f505 errors=0"},
       {"datahub.A=\ndatahub-hex.B=", "datahub.A=\"\" datahub.B= errors=0"},
@@ -168,10 +222,10 @@ TEST(PlatformConfig, ParsesEveryKey) {
        "errors=3 bad@1:nvram-hex.a=abc bad@2:datahub-hex.a=0 1 bad@3:nvram-hex.a=zz"},
       {"nvram.=x\ndatahub.=y", "errors=2 bad@1:nvram.=x bad@2:datahub.=y"},
       {"nvram.a=\xF0\x9F\x98\x80\ndatahub.\xF0\x9F\x98\x80=x",
-       "errors=2 bad@1:nvram.a=\xF0\x9F\x98\x80 bad@2:datahub.\xF0\x9F\x98\x80=x"},
+       "errors=2 bad@1:nvram.a=\\xf0\\x9f\\x98\\x80 bad@2:datahub.\\xf0\\x9f\\x98\\x80=x"},
       {"nvram.a=1\nnvram-hex.a=1", "nvram.a=\"1\" errors=1 bad@2:nvram-hex.a=1"},
       {"nvram=1\ndatahub=2", "errors=0 unknown@1:nvram=1 unknown@2:datahub=2"},
-      {"datahub-hex.a=\"ab \tc\"", "errors=1 bad@1:datahub-hex.a=ab \tc"},
+      {"datahub-hex.a=\"ab \tc\"", "errors=1 bad@1:datahub-hex.a=ab \\x09c"},
       // The answers of the device properties and network boot protocols.
       {"device-properties-hex=01\nnetboot.dhcp-hex=0203\nnetboot.bsdp-hex=040506",
        "properties=01 dhcp=0203 bsdp=040506 errors=0"},
@@ -277,6 +331,43 @@ TEST(PlatformReport, ExitCodesAndBoundedText) {
   EXPECT_STREQ(small, "memory=");
 }
 
+// An SMBIOS structure: header (type, length, handle), the formatted bytes
+// behind it, then the strings and the closing NUL.
+std::string Structure(UINT8 type, const std::string &formatted, const std::vector<std::string> &strings) {
+  std::string out = {static_cast<char>(type), static_cast<char>(4 + formatted.size()), 1, 0};
+  out += formatted;
+  for (const std::string &text : strings) {
+    out += text + '\0';
+  }
+  return out + (strings.empty() ? "\0\0"s : "\0"s);
+}
+
+TEST(PlatformMachine, FindsTheSystemManufacturer) {
+  const std::string bios = Structure(0, "\x01\x02", {"EDK II", "unknown"});
+  const std::string end = Structure(127, "", {});
+  struct Row {
+    const char *name;
+    std::string table;
+    bool qemu;
+  };
+  const std::vector<Row> rows = {
+      {"first string", bios + Structure(1, "\x01\x02", {"QEMU", "Standard PC"}) + end, true},
+      {"second string", bios + Structure(1, "\x02\x01", {"Standard PC", "QEMU"}) + end, true},
+      {"another maker", Structure(1, "\x01", {"QEMU Inc"}) + end, false},
+      {"no string number", Structure(1, "\x00", {"QEMU"}) + end, false},
+      {"a number beyond the strings", Structure(1, "\x03", {"QEMU", "x"}) + end, false},
+      {"no manufacturer field", Structure(1, "", {"QEMU"}) + end, false},
+      {"the end before it", end + Structure(1, "\x01", {"QEMU"}), false},
+      {"cut in the strings", (bios + Structure(1, "\x01", {"QEMU"})).substr(0, bios.size() + 7), false},
+      {"a header shorter than 4", "\x01\x03\x00\x00QEMU\0\0"s, false},
+  };
+  for (const Row &row : rows) {
+    EXPECT_EQ(SmbiosManufacturerIs(reinterpret_cast<const UINT8 *>(row.table.data()), row.table.size(), "QEMU"),
+              row.qemu)
+        << row.name;
+  }
+}
+
 TEST(PlatformMemory, CountsConventionalPagesByTheFirmwaresStride) {
   const std::vector<std::pair<UINT32, UINT64>> regions = {
       {EfiConventionalMemory, 100}, {EfiBootServicesData, 7},   {EfiConventionalMemory, 23},
@@ -372,6 +463,8 @@ TEST(PlatformConsole, SwitchesModesOnTheRealConsole) {
       {"beyond the modes", kText, 2, true, EFI_SUCCESS, EFI_INVALID_PARAMETER, kText, {}},
       {"far beyond", kGraphics, 0xFFFFFFFF, true, EFI_SUCCESS, EFI_INVALID_PARAMETER, kGraphics, {}},
       {"no graphics output", kText, kGraphics, false, EFI_SUCCESS, EFI_UNSUPPORTED, kText, {}},
+      // Graphics asked for at the start without graphics output: text.
+      {"no graphics output at all", kGraphics, kGraphics, false, EFI_SUCCESS, EFI_UNSUPPORTED, kText, {}},
       {"a clear that fails",
        kGraphics,
        kText,
@@ -478,6 +571,181 @@ TEST(PlatformDataHub, HoldsTheConfiguredRecordsThenOneOfItsOwn) {
   DataHubInit(&empty, nullptr, 0);
   count = 0;
   EXPECT_EQ(empty.protocol.GetNextDataRecord(&empty.protocol, &count, nullptr, &record), EFI_NOT_FOUND);
+}
+
+// --- screen facts ------------------------------------------------------------------------
+
+// GetInfo's answer ("-" when refused, having written nothing) and UGA's depth.
+TEST(PlatformGraphics, FrameBufferOnlyForBgrxBelow4GiB) {
+  constexpr UINT64 k4G = 1ULL << 32, kAll = 1024 * 4 * 768;
+  constexpr auto kBgrx = PixelBlueGreenRedReserved8BitPerColor;
+  struct Row {
+    EFI_GRAPHICS_PIXEL_FORMAT format;
+    EFI_PIXEL_BITMASK masks;
+    UINT64 base, size;
+    UINT32 scanLine;
+    const char *facts;
+  };
+  const std::vector<Row> rows = {
+      {kBgrx, {}, 0x80000000, kAll, 1024, "80000000 300000 4096 1024x768x32 uga 32"},
+      {kBgrx, {}, k4G - kAll, kAll, 1024, "ffd00000 300000 4096 1024x768x32 uga 32"},
+      {kBgrx, {}, 0xC0000000, kAll + 0x30000, 1088, "c0000000 330000 4352 1024x768x32 uga 32"},
+      {kBgrx, {}, k4G - kAll + 0x1000, kAll, 1024, "- uga 32"},  // across 4 GiB
+      {kBgrx, {}, 0x800000000, kAll, 1024, "- uga 32"},
+      {kBgrx, {}, 0, kAll, 1024, "- uga 32"},
+      {kBgrx, {}, 0x80000000, kAll - 4, 1024, "- uga 32"},  // rows beyond the buffer
+      {kBgrx, {}, 0x80000000, kAll, 1000, "- uga 32"},      // rows narrower than the screen
+      {PixelRedGreenBlueReserved8BitPerColor, {}, 0x80000000, kAll, 1024, "- uga 32"},
+      {PixelBitMask, {0xF800, 0x07E0, 0x001F, 0}, 0x80000000, kAll, 1024, "- uga 16"},
+      {PixelBitMask, {0x7C00, 0x03E0, 0x001F, 0}, 0x80000000, kAll, 1024, "- uga 16"},
+      {PixelBltOnly, {}, 0, 0, 1024, "- uga 0"},
+  };
+  for (const Row &row : rows) {
+    EFI_GRAPHICS_OUTPUT_MODE_INFORMATION info = {0, 1024, 768, row.format, row.masks, row.scanLine};
+    EFI_GRAPHICS_OUTPUT_PROTOCOL_MODE mode = {1, 0, &info, sizeof(info), row.base, row.size};
+    EFI_GRAPHICS_OUTPUT_PROTOCOL graphics = {};
+    graphics.Mode = &mode;
+    PlatformUgaDraw uga;
+    PlatformFrameBufferInfo buffer;
+    GraphicsInit(&uga, &buffer, &graphics);
+    EFI_PHYSICAL_ADDRESS base = 7;
+    UINT32 f[6] = {7, 7, 7, 7, 7, 7};  // size, row bytes, width, height, depth, refresh
+    std::ostringstream out;
+    out << std::hex;
+    if (buffer.protocol.GetInfo(&buffer.protocol, &base, &f[0], &f[1], &f[2], &f[3], &f[4]) == EFI_SUCCESS) {
+      out << base << ' ' << f[0] << std::dec << ' ' << f[1] << ' ' << f[2] << 'x' << f[3] << 'x' << f[4];
+    } else {
+      out << (base == 7 && f[0] == 7 && f[1] == 7 && f[4] == 7 ? "-" : "written");
+    }
+    uga.protocol.GetMode(&uga.protocol, &f[2], &f[3], &f[4], &f[5]);
+    EXPECT_EQ(out.str() + " uga " + std::to_string(f[4]), row.facts) << "row " << &row - rows.data();
+  }
+}
+
+// --- held keys from the keyboard ---------------------------------------------------------
+
+// A keyboard that gives its readings in turn (the last one over and over
+// with `endless`, else EFI_NOT_READY without a shift state) and records the
+// toggle states set.
+struct Keyboard {
+  EFI_SIMPLE_TEXT_INPUT_EX_PROTOCOL protocol = {};
+  std::vector<std::pair<EFI_STATUS, EFI_KEY_DATA>> readings;
+  bool endless;
+  EFI_STATUS setState;
+  size_t calls = 0;
+  std::string states;
+};
+Keyboard *gKeyboard;
+
+EFI_STATUS EFIAPI FakeReadKeyStrokeEx(EFI_SIMPLE_TEXT_INPUT_EX_PROTOCOL *, EFI_KEY_DATA *data) {
+  Keyboard &k = *gKeyboard;
+  const size_t at = k.endless ? std::min(k.calls, k.readings.size() - 1) : k.calls;
+  k.calls++;
+  *data = at < k.readings.size() ? k.readings[at].second : EFI_KEY_DATA{};
+  return at < k.readings.size() ? k.readings[at].first : EFI_NOT_READY;
+}
+
+EFI_STATUS EFIAPI FakeSetState(EFI_SIMPLE_TEXT_INPUT_EX_PROTOCOL *, EFI_KEY_TOGGLE_STATE *state) {
+  gKeyboard->states += Hex(state, 1) + " ";
+  return gKeyboard->setState;
+}
+
+TEST(PlatformKeys, HeldKeysFromTheFirmwaresKeyboard) {
+  constexpr UINT32 kValid = EFI_SHIFT_STATE_VALID;
+  auto key = [](UINT16 scan, CHAR16 c, UINT32 shift = 0, UINT8 toggle = 0) {
+    return std::make_pair(EFI_SUCCESS, EFI_KEY_DATA{{scan, c}, {shift, toggle}});
+  };
+  auto now = [](UINT32 shift, UINT8 toggle = 0) {
+    return std::make_pair(EFI_NOT_READY, EFI_KEY_DATA{{0, 0}, {shift, toggle}});
+  };
+  struct Row {
+    std::vector<std::pair<EFI_STATUS, EFI_KEY_DATA>> readings;
+    const char *held;  // modifiers, keys; then the toggle states set
+    bool endless = false;
+    EFI_STATUS setState = EFI_SUCCESS;
+  };
+  const std::vector<Row> rows = {
+      // Shift alone as a partial keystroke, Num Lock kept; or only in the state.
+      {{now(kValid, 0x82), key(0, 0, kValid | EFI_LEFT_SHIFT_PRESSED)}, "02 | c2 82 "},
+      {{now(kValid | EFI_RIGHT_SHIFT_PRESSED)}, "20 | c0 80 "},
+      {{key(0, 'v', kValid | EFI_LEFT_LOGO_PRESSED), key(0, 'v', kValid | EFI_LEFT_LOGO_PRESSED)},
+       "08 7019 | c0 80 "},
+      {{key(0, 0, kValid | EFI_LEFT_SHIFT_PRESSED), now(kValid)},
+       "00 | c0 80 "},  // let go: the latest state wins
+      {{now(kValid | 0xFF), key(0, 'S', EFI_LEFT_LOGO_PRESSED), key(0, 0x13)},
+       "ff 7016 | c0 80 "},  // not valid
+      {{key(0, '!'), key(0, '\r'), key(0, 0x16, kValid | EFI_RIGHT_CONTROL_PRESSED), key(0, 0x7F),
+        key(0x17, 0), key(0x01, 0), key(0x16, 0), key(0x18, 0), key(0, '/')},
+       "10 701e 7028 7019 7029 7052 7045 7038 | c0 80 "},
+      {{key(0, 'a')}, "00 7004 | c0 ", true, EFI_UNSUPPORTED},  // never runs dry; partial keys refused
+  };
+  for (const Row &row : rows) {
+    hostfw::Firmware firmware;
+    gST = firmware.SystemTable();
+    gBS = firmware.BootServices();
+    Keyboard keyboard = {{}, row.readings, row.endless, row.setState};
+    gKeyboard = &keyboard;
+    keyboard.protocol.ReadKeyStrokeEx = FakeReadKeyStrokeEx;
+    keyboard.protocol.SetState = FakeSetState;
+    gST->ConsoleInHandle = firmware.NewHandle();
+    firmware.InstallProtocol(gST->ConsoleInHandle, gEfiSimpleTextInputExProtocolGuid, &keyboard.protocol);
+    HeldKeys held = {};
+    EXPECT_EQ(KeyStateSample(&held, 50000).exposeState, row.setState);
+    std::ostringstream out;
+    out << std::hex << std::setfill('0') << std::setw(2) << held.modifiers;
+    for (UINT32 i = 0; i < held.count; i++) {
+      out << ' ' << held.keys[i];
+    }
+    EXPECT_EQ(out.str() + " | " + keyboard.states, row.held);
+    EXPECT_LE(keyboard.calls, 1 + 6 * 4 * kMaxHeldKeys) << "a bounded number of readings in 50 ms";
+  }
+  hostfw::Firmware none;
+  gST = none.SystemTable();
+  gBS = none.BootServices();
+  HeldKeys held = {};
+  EXPECT_EQ(KeyStateSample(&held, 50000).status, EFI_UNSUPPORTED) << "no keyboard, no wait";
+}
+
+// --- the firmware's own protocols ----------------------------------------------------------
+
+// The firmware has a key state protocol of its own, no boot policy: the
+// platform keeps the firmware's or puts its own in its place, never beside.
+TEST(PlatformProtocols, TheFirmwaresOwnIsKeptOrReplacedInPlace) {
+  static std::string heard;
+  gOnFirmwareProtocol = [](const char *name, bool replaced) {
+    heard += name + std::string(replaced ? "+" : "-");
+  };
+  for (const bool replace : {false, true}) {
+    hostfw::Firmware firmware;
+    gBS = firmware.BootServices();
+    heard.clear();
+    NIMB_KEY_STATE_PROTOCOL theirs = {};
+    const EFI_HANDLE handle = firmware.NewHandle();
+    firmware.InstallProtocol(handle, gNimbKeyStateProtocolGuid, &theirs);
+    PlatformConfig config;
+    ConfigSetDefaults(&config);
+    config.keysGiven = true;
+    config.replaceFirmwareProtocols = replace;
+    PlatformKeyState state = {};
+    PlatformBootPolicy policy = {};
+    KeySample sample;
+    ASSERT_EQ(KeyProtocolsInstall(&state, &policy, config, &sample), EFI_SUCCESS);
+    EXPECT_EQ(heard, replace ? "key state+" : "key state-");
+    UINTN count = 0;
+    EFI_HANDLE *handles = nullptr;
+    ASSERT_EQ(gBS->LocateHandleBuffer(ByProtocol, &gNimbKeyStateProtocolGuid, nullptr, &count, &handles),
+              EFI_SUCCESS);
+    EXPECT_EQ(std::vector<EFI_HANDLE>(handles, handles + count), std::vector<EFI_HANDLE>{handle});
+    void *found[2] = {};
+    gBS->LocateProtocol(&gNimbKeyStateProtocolGuid, nullptr, &found[0]);
+    gBS->LocateProtocol(&gNimbBootPolicyProtocolGuid, nullptr, &found[1]);
+    EXPECT_EQ(found[0], replace ? static_cast<void *>(&state.protocol) : &theirs);
+    EXPECT_EQ(found[1], &policy.protocol);
+    EXPECT_EQ(ProtocolsGiveBack(), replace ? 1u : 0u) << "before going back to the firmware";
+    gBS->LocateProtocol(&gNimbKeyStateProtocolGuid, nullptr, &found[0]);
+    EXPECT_EQ(found[0], &theirs);
+  }
+  gOnFirmwareProtocol = nullptr;
 }
 
 }  // namespace

@@ -17,8 +17,10 @@ from qemuboot import NET_MAC  # noqa: E402
 KERNEL_ERROR = "Error loading kernel 'nimb_kernel'"
 
 # What every scenario's platform.cfg starts with, unless the scenario says
-# otherwise: the platform records of the machine.
+# otherwise: the end through the debug-exit device and the platform records
+# of the machine.
 BASE_CONFIG = {
+    "debug-exit": "1",
     "datahub.Model": "QEMU1,1",
     "datahub-hex.BusFrequency": "00e1f50500000000",  # 100 MHz, 64 bits
 }
@@ -347,6 +349,38 @@ class Scenario:
     boots: int = 1
     # The loader's reads up to a reset.
     reads: ResumeReads | None = None
+    # platform.cfg keys (over BASE_CONFIG) of an earlier power-on of the same
+    # volume on the same variable store: its log comes in front of the
+    # scenario's own for `expect` and `forbid`; the report and exit are the
+    # scenario's run's. None: no earlier power-on.
+    before_config: dict | None = None
+    # The disk is a stick image (mkdisk --stick, its platform.cfg unless the
+    # scenario has one) on a USB controller.
+    usb: bool = False
+    # QEMU's arguments beyond the harness's machine (tools/qemuboot).
+    qemu_args: tuple = ()
+    # A machine without serial port and debug-exit device, as a PC: only
+    # the screen tells the outcome.
+    bare: bool = False
+    # Lines that the firmware's text console must show (found in screenshots
+    # taken twice a second); then Enter is pressed, and `after_key` must
+    # replace them. The run ends as "Stopped".
+    screen_text: tuple = ()
+    after_key: str = ""
+    # The harness stops the machine once a line of the serial log holds this
+    # text: the run ends as "Stopped".
+    stop_at: str = ""
+    # Keys held down on the machine's keyboard from power-on (QEMU key
+    # codes: "shift", "meta_l", "v", ...), never let go: QMP sends their
+    # key-down events as the machine starts, and again every 50 ms from the
+    # firmware's boot manager on until the platform has read the keyboard
+    # (not earlier: with key events streaming in while OVMF started, its
+    # PS/2 keyboard driver saw neither of two held keys), as a real keyboard
+    # repeats a held key (the firmware's keyboard driver resets the keyboard
+    # and forgets what was down before). The PS/2 keyboard of the machine,
+    # or with `usb_keyboard` a USB one.
+    held: tuple = ()
+    usb_keyboard: bool = False
 
 
 def fatal(name, *messages, before=(), make=Scenario, **knobs):
@@ -411,10 +445,12 @@ _TABLE = [
     fatal("text_console", "console text", "Error loading kernel 'nimb_test'",
           config={"console": "text", "options": "  Kernel=nimb_test -v"}, forbid=(KERNEL_ERROR,)),
     # Shift held alone: safe mode, which reads no NVRAM (the kernel that
-    # boot-args names would win over the configuration file's).
+    # boot-args names would win over the configuration file's). The Shift of
+    # keys= wins over GUI-V held on the keyboard.
     fatal("safe_mode_keys", "Using Safe Mode", "Error loading kernel 'mach_test'",
-          before=("platform: nvram boot-args set",),
-          config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"},
+          before=("platform: keys: modifiers 0x2, 0 keys, ignored 0, from platform.cfg",
+                  "platform: nvram boot-args set"),
+          config={"keys": "shift", "nvram.boot-args": "Kernel=nvram_kernel"}, held=("meta_l", "v"),
           files={BOOT_PLIST: plist({"Kernel": "mach_test"})}, forbid=("nvram_kernel", KERNEL_ERROR)),
     # GUI-V held: a verbose boot switches a graphics console to text before
     # anything else, and back to graphics only on the way out.
@@ -423,9 +459,21 @@ _TABLE = [
     # boot-args names the kernel; Shift is held, but the boot policy says
     # that held keys are not to be read: no safe mode to skip NVRAM.
     fatal("nvram_args", "Error loading kernel 'from_nvram'",
-          before=("platform: keys: modifiers 0x2, 0 keys, ignored 1", "platform: nvram boot-args set, 17 bytes"),
+          before=("platform: keys: modifiers 0x2, 0 keys, ignored 1", "platform: nvram boot-args set for good, 17 bytes"),
           config={"nvram.boot-args": "Kernel=from_nvram", "keys": "shift", "keys-ignored": "1"},
           forbid=("Using Safe Mode", KERNEL_ERROR)),
+    # Keys held on the machine's own keyboard from power-on, read by the
+    # platform (no keys= in platform.cfg): Shift alone is safe mode, -x for
+    # the kernel; GUI-V a verbose boot, on the PS/2 keyboard and a USB one.
+    Scenario("keys_held_shift", held=("shift",), files=kernel_file(), exit="KernelPass",
+             expect=("platform: keys: modifiers 0x2, 0 keys, ignored 0, from keyboard", "Using Safe Mode",
+                     KERNEL_START),
+             kernel=KernelExpect(bootargs={"commandLine": "-x"})),
+    *(Scenario(name, held=("meta_l", "v"), usb_keyboard=usb, config={"console": "graphics"}, files=kernel_file(),
+               expect=("platform: keys: modifiers 0x8, 1 keys, ignored 0, from keyboard", KERNEL_START),
+               console_modes=("text",), exit="KernelPass",
+               kernel=KernelExpect(bootargs={"commandLine": "-v", "videoDisplayMode": 2}))
+      for name, usb in [("keys_held_gui_v", False), ("keys_held_gui_v_usb", True)]),
     # The platform's own way out: an unknown key is reported and ignored, and
     # a loader that isn't there ends the run before anything starts.
     Scenario(
@@ -435,6 +483,8 @@ _TABLE = [
         expect=(
             "platform: platform.cfg line 1: unknown key 'colour' ignored",
             "platform: error: loader \\EFI\\BOOT\\missing.efi not found (EFI_NOT_FOUND)",
+            # The same on the firmware's console, which OVMF mirrors to the port.
+            "Platform error: loader \\EFI\\BOOT\\missing.efi not found (EFI_NOT_FOUND)",
         ),
         forbid=("platform: starting",),
         exit="LoaderMissing",
@@ -470,6 +520,42 @@ _TABLE = [
             ranges={"BootCLUT": 0x300, "Pict-FailedBoot": 0x4020},
         ),
     ),  # fmt: skip
+    # Without debug-exit the platform goes back to the firmware with an
+    # error, which the firmware's boot manager reports before its next
+    # option, with the file system as it was.
+    Scenario(
+        "platform_back_to_firmware",
+        config={"debug-exit": "0", "loader": "\\EFI\\BOOT\\missing.efi"},
+        expect=("platform: debug-exit not used", "platform: exit code 0x21",
+                "back to the firmware with EFI_LOAD_ERROR", "failed to start Boot0002", ": Load Error", "FS0:"),
+        stop_at="FS0:",
+        exit="Stopped",
+    ),
+    # A firmware without graphics output: the loader finds a text console,
+    # is refused the graphics it asks for and boots the kernel in text.
+    Scenario(
+        "kernel_no_graphics",
+        config={"console": "graphics"},
+        files=kernel_file(),
+        qemu_args=("-vga", "none"),
+        expect=("platform: no graphics output: console text", "platform: starting \\EFI\\BOOT\\nimbboot.efi, console text",
+                "platform: console mode graphics refused (EFI_UNSUPPORTED)", LOADING_KERNEL, KERNEL_START),
+        console_modes=("graphics",),
+        exit="KernelPass",
+        kernel=KernelExpect(bootargs={"videoDisplayMode": 2}),
+    ),
+    # A PC without serial port and debug-exit device: the outcome and the
+    # request for a key on the screen, then the firmware's own shell once
+    # the platform went back to it.
+    Scenario(
+        "screen_outcome_bare",
+        config={"wait-key": "1"},
+        bare=True,
+        screen_text=("The loader returned EFI_ABORTED (0x8000000000000015).", "Press a key to go on."),
+        after_key="Shell>",
+        exit="Stopped",
+        timeout=150.0,
+    ),
     # -v: the console goes to text and stays there for the kernel.
     Scenario(
         "kernel_verbose",
@@ -737,6 +823,40 @@ _TABLE += [
                     reads=ResumeReads(after_header=None, first_stage=STAGE)),
     reset_then_boot("resume_limit_key_length", ("--key-bytes", "16"),
                     config={"nvram-hex.boot-image-key": "00112233445566778899aabbccddeeff0011223344"}),
+]  # fmt: skip
+
+
+# NVRAM hygiene. Each configured variable is reported as a start finds it.
+def nvram_lines(name, found, action):
+    return f"platform: nvram {name} at start: {found}", f"platform: nvram {name} {action}"
+
+
+_TABLE += [
+    # A variable for this boot only is gone on the next start of the run
+    # (the loader resets the machine on an image it refuses), and set again;
+    # one set for good is there and left alone.
+    dataclasses.replace(
+        reset_then_boot("nvram_volatile", ("--key-bytes", "16", "--set", "magic=0x73696D66"),
+                        config={"nvram-volatile.guest-volatile": "v", "nvram.guest-kept": "k"}),
+        expect=("platform: boot 1", *nvram_lines("guest-volatile", "absent", "set for this boot, 1 bytes"),
+                *nvram_lines("guest-kept", "absent", "set for good, 1 bytes"), "platform: starting", RESET,
+                "platform: boot 2", ACCEPTED_THEN_RESET, *nvram_lines("guest-volatile", "absent", "set for this boot"),
+                *nvram_lines("guest-kept", "1 bytes", "left as the first start made it"), LOADING_KERNEL,
+                KERNEL_START)),
+    # A variable that an earlier power-on set for good is deleted, and the
+    # loader no longer boots the kernel it named; one not there is no error.
+    fatal("nvram_delete", KERNEL_ERROR,
+          before=("platform: nvram boot-args set for good, 17 bytes", "Error loading kernel 'from_nvram'",
+                  "platform: loader returned", "platform: boot 1", *nvram_lines("boot-args", "17 bytes", "deleted"),
+                  *nvram_lines("guest-never", "absent", "not there to delete")),
+          before_config={"nvram.boot-args": "Kernel=from_nvram"},
+          config={"nvram-delete.boot-args": "", "nvram-delete.guest-never": ""}),
+    # The stick image, with its own platform.cfg for a real PC, boots from
+    # a USB controller (its device path: a USB node, then the partition's)
+    # to the reference kernel.
+    Scenario("usb_stick", base_config=False, files=kernel_file(), usb=True,
+             expect=("03050600000004012a00", LOADING_KERNEL, KERNEL_START), forbid=("unknown key",),
+             exit="KernelPass", kernel=KernelExpect(), timeout=150.0),
 ]  # fmt: skip
 
 

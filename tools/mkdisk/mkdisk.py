@@ -13,6 +13,7 @@ found as such, as on a file system that keeps seconds.
     mkdisk.py VOLUME -o disk.img                  the EFI programs of build/efi
     mkdisk.py VOLUME -o disk.img --set options=-v --set keys=shift
     mkdisk.py --boot-path                          the loader's boot device path, in hex
+    mkdisk.py VOLUME -o stick.img --stick          an image for a USB stick (dd) and a real PC
 
 Needs sgdisk (package gdisk) and mtools. Exit status 0 on success, 1 when the
 image cannot be made, 2 for a wrong command line.
@@ -56,6 +57,37 @@ Q35_SATA_PREFIX = bytes.fromhex(
     "01010600021f"  # Pci(0x1f,0x2)
     "03120a000000ffff0000"  # Sata(0x0,0xFFFF,0x0)
 )
+
+
+# platform.cfg of a stick image, for a real PC: nothing that only the test
+# machine needs.
+STICK_CONFIG = """\
+# platform.cfg: read by the platform layer (\\EFI\\BOOT\\BOOTX64.EFI) at start.
+# One key=value a line; a '#' line is a comment. Every key: platform/README.md.
+
+# The console mode the loader finds: graphics shows the boot screen (the
+# loader's messages then go to the serial port only); text shows them.
+console=graphics
+
+# The loader's load options, for example a kernel's name and its arguments:
+# options=Kernel=nimb_kernel -v
+
+# When the loader comes back (no kernel started), its outcome is shown on the
+# screen; 1 waits for a key there before going back to the firmware.
+wait-key=1
+
+# A variable for this boot only, gone when the machine restarts:
+# nvram-volatile.boot-args=-v
+"""
+# Room beyond the contents of a stick image, for FAT32's tables and slack.
+STICK_SLACK_BYTES = 24 << 20
+
+
+def stick_bytes(volume):
+    """The size of a stick image for `volume`: its files and a margin,
+    whole MiB, at least the default disk's size."""
+    contents = sum(path.stat().st_size for path in walk(Path(volume)) if path.is_file())
+    return max(DISK_BYTES, (contents * 9 // 8 + STICK_SLACK_BYTES + (1 << 20) - 1) >> 20 << 20)
 
 
 class DiskError(Exception):
@@ -229,8 +261,11 @@ def main(argv=None):
     parser.add_argument("--config", help="platform.cfg to use (default: the volume's own EFI/BOOT/platform.cfg)")
     parser.add_argument("--set", action="append", default=[], metavar="KEY=VALUE",
                         help="a line of platform.cfg, behind those of --config (repeatable)")
-    parser.add_argument("--size", type=int, default=DISK_BYTES >> 20, metavar="MIB",
-                        help=f"the image's size in MiB (default {DISK_BYTES >> 20})")
+    parser.add_argument("--size", type=int, metavar="MIB",
+                        help=f"the image's size in MiB (default {DISK_BYTES >> 20}; with --stick sized to the volume)")
+    parser.add_argument("--stick", action="store_true",
+                        help="an image for a USB stick and a real PC: a platform.cfg without test keys unless the "
+                             "volume or --config has one")
     parser.add_argument("--partition-guid", default=DEFAULT_PARTITION_GUID, help="the partition's GUID")
     parser.add_argument("--no-times", action="store_true", help="no exact times: the firmware's 2-second ones")
     parser.add_argument("--boot-path", action="store_true",
@@ -240,9 +275,10 @@ def main(argv=None):
         uuid.UUID(args.partition_guid)
     except ValueError:
         parser.error(f"--partition-guid {args.partition_guid!r} is no GUID")
-    if args.size <= 0:
+    if args.size is not None and args.size <= 0:
         parser.error("--size must be positive")
     if args.boot_path:
+        args.size = args.size or DISK_BYTES >> 20
         print(boot_device_path(args.partition_guid, args.size << 20).hex())
         if args.volume is None:
             return 0
@@ -255,14 +291,17 @@ def main(argv=None):
     try:
         if args.config is not None:
             config = Path(args.config).read_text()
-        elif args.set and (Path(args.volume) / BOOT_DIR / CONFIG_NAME).is_file():
+        elif (args.set or args.stick) and (Path(args.volume) / BOOT_DIR / CONFIG_NAME).is_file():
             config = (Path(args.volume) / BOOT_DIR / CONFIG_NAME).read_text()
+        elif args.stick:
+            config = STICK_CONFIG
         if args.set:
             config = (config or "") + ("" if not config or config.endswith("\n") else "\n")
             config += "".join(f"{line}\n" for line in args.set)
         efi_dir = Path(args.efi_dir)
+        size = args.size << 20 if args.size else stick_bytes(args.volume) if args.stick else DISK_BYTES
         build_disk(args.output, args.volume, args.platform or efi_dir / "BOOTX64.efi",
-                   args.loader or efi_dir / "nimbboot.efi", config, args.size << 20, args.partition_guid,
+                   args.loader or efi_dir / "nimbboot.efi", config, size, args.partition_guid,
                    not args.no_times)
     except (DiskError, OSError) as error:
         print(f"mkdisk: {error}", file=sys.stderr)

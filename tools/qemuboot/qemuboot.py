@@ -93,16 +93,26 @@ def serve_directory(volume, platform, loader, config_name="platform.cfg"):
     return volume
 
 
-def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, reboot=False, extra=()):
-    """QEMU's command line, on a private copy of the variable store. With
+def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, reboot=False, extra=(), bare=False,
+                 usb=False, same_store=False):
+    """QEMU's command line, on a private copy of the variable store in
+    `workdir` (with `same_store`, the copy that an earlier machine there left,
+    if any: the machine powers on with what it left in NVRAM). With `usb`,
+    the disk is a USB stick on an xHCI controller. With
     `tftp_dir` and no `disk`, the machine boots over a virtio NIC without
     option ROM (so that the firmware's own PXE boots) from QEMU's TFTP server
     on that directory, every packet written to workdir/net.pcap; with
     `reboot`, a reset starts the machine again (on the same variable store)
-    instead of ending QEMU; `extra` goes behind the accelerator."""
+    instead of ending QEMU; `extra` goes behind the accelerator; `bare` leaves
+    out the serial port and the debug-exit device, as on a PC."""
     code, variables = find_ovmf()
     private_vars = Path(workdir) / "OVMF_VARS.fd"
-    shutil.copyfile(variables, private_vars)
+    if not (same_store and private_vars.exists()):
+        shutil.copyfile(variables, private_vars)
+    drive = ["-drive", f"format=raw,file={disk}"]
+    if usb:
+        drive = ["-drive", f"if=none,id=stick,format=raw,file={disk}", "-device", "qemu-xhci",
+                 "-device", "usb-storage,drive=stick,removable=on"]  # fmt: skip
     network = ["-nic", "none"]
     if tftp_dir is not None:
         network = [
@@ -115,9 +125,9 @@ def qemu_command(workdir, disk, serial_log, qmp_socket=None, tftp_dir=None, rebo
         "-display", "none", *([] if reboot else ["-no-reboot"]),
         "-drive", f"if=pflash,format=raw,unit=0,readonly=on,file={code}",
         "-drive", f"if=pflash,format=raw,unit=1,file={private_vars}",
-        *(["-drive", f"format=raw,file={disk}"] if disk is not None else []),
-        "-device", "isa-debug-exit,iobase=0xf4,iosize=0x04", *network,
-        "-serial", f"file:{serial_log}", "-monitor", "none",
+        *(drive if disk is not None else []),
+        *([] if bare else ["-device", "isa-debug-exit,iobase=0xf4,iosize=0x04"]), *network,
+        "-serial", "none" if bare else f"file:{serial_log}", "-monitor", "none",
         *(["-qmp", f"unix:{qmp_socket},server=on,wait=off"] if qmp_socket else []),
     ]  # fmt: skip
 
@@ -241,32 +251,44 @@ class Qmp:
         self.sock.close()
 
 
-def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=()):
+def boot(disk, workdir, timeout, on_line=None, network=False, reboot=False, qmp=False, echo=False, extra=(),
+         bare=False, on_tick=None, tick=0.5, usb=False, same_store=False):
     """Runs QEMU on `disk` (with `network`: the directory served over TFTP)
     until it ends, for at most `timeout` seconds. `on_line(line, qmp)` hears
     each cleaned serial line as it comes, with a Qmp connection when `qmp` is
     set (else None), and stops the machine by returning True; with `echo`,
-    each line is printed. Returns QEMU's exit status (None: timed out or
+    each line is printed. `on_tick(qmp)`, when given, is called every `tick`
+    seconds, the first time as soon as the machine runs (for a machine
+    started paused with -S in `extra`, that call resumes it), and stops the
+    machine in the same way (for a `bare` machine, which has no serial
+    port); `usb` and `same_store` as for qemu_command. Returns QEMU's exit
+    status (None: timed out or
     stopped), the cleaned serial log and what went wrong over QMP or in
     `on_line` (its OSError, ValueError, RuntimeError), or None."""
     workdir = Path(workdir)
     serial_log = workdir / "serial.log"
+    serial_log.unlink(missing_ok=True)  # an earlier machine's, in the same workdir
     qmp_socket = workdir / "qmp.sock" if qmp else None
     command = qemu_command(workdir, None if network else disk, serial_log, qmp_socket, disk if network else None,
-                           reboot, extra)
+                           reboot, extra, bare, usb, same_store)
     machine = Machine(command, workdir / "qemu.log")
     deadline = time.monotonic() + timeout
     trouble, connection = None, None
     try:
-        if on_line is not None or echo:
+        if on_line is not None or on_tick is not None or echo:
             connection = Qmp(qmp_socket, deadline, machine) if qmp else None
-            follower = SerialFollower(serial_log)
+            follower, next_tick = SerialFollower(serial_log), 0.0
             while True:
                 running = machine.poll() is None
                 for line in follower.lines(final=not running):
                     if echo and line.strip():
                         print(line, flush=True)
                     if on_line is not None and on_line(line, connection) and running:
+                        machine.kill()
+                        running = False
+                if on_tick is not None and running and time.monotonic() >= next_tick:
+                    next_tick = time.monotonic() + tick
+                    if on_tick(connection):
                         machine.kill()
                         running = False
                 if not running or time.monotonic() > deadline:
@@ -286,6 +308,7 @@ def main(argv=None):
     parser = argparse.ArgumentParser(description=__doc__, formatter_class=argparse.RawDescriptionHelpFormatter)
     parser.add_argument("image", help="the disk image, or with --net the directory to stage and serve")
     parser.add_argument("--net", action="store_true", help="boot over the network from the directory IMAGE")
+    parser.add_argument("--usb", action="store_true", help="attach the image as a USB stick (mkdisk --stick)")
     parser.add_argument("--efi-dir", default=str(REPO / "build" / "efi"), help="with --net: BOOTX64.efi, nimbboot.efi")
     parser.add_argument("--timeout", type=float, default=120.0, help="seconds before QEMU is stopped (120)")
     parser.add_argument("--screenshot", help="where the screenshot goes (.png or .ppm)")
@@ -309,7 +332,7 @@ def main(argv=None):
                 shots.append(args.screenshot)
 
         returncode, log, trouble = boot(image, workdir, args.timeout, on_line, network=args.net,
-                                        qmp=bool(args.screenshot), echo=not args.quiet)
+                                        qmp=bool(args.screenshot), echo=not args.quiet, usb=args.usb)
     if args.log:
         Path(args.log).write_text(log)
     for problem in [trouble] if trouble else []:
