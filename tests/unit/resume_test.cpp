@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <functional>
+#include <numeric>
 #include <vector>
 
 #include "resume/preview_encoder.h"
@@ -218,8 +219,7 @@ TEST(ResumeEncryptedTest, DecryptsInPlaceDrawsThePreviewAndLeavesNoKeyBehind) {
     image.Header().encryptedOffset = encrypted;
     const std::vector<uint8_t> plain = image.bytes;
     std::vector<uint8_t> key(keySize);
-    for (size_t i = 0; i < keySize; i++)
-      key[i] = uint8_t(0xA0 + i);
+    std::iota(key.begin(), key.end(), 0xA0);
     const std::vector<uint8_t> cipher = nimbtest::OpensslCbc(
         true, key, kResumeIv, std::vector<uint8_t>(plain.begin() + encrypted, plain.end()));
     std::copy(cipher.begin(), cipher.end(), image.bytes.begin() + encrypted);
