@@ -4,6 +4,31 @@
 
 namespace nimb::platform {
 
+namespace {
+
+// Boot services slots that efi.h types as `void *`.
+typedef EFI_STATUS(EFIAPI *EFI_WAIT_FOR_EVENT)(UINTN NumberOfEvents, EFI_EVENT *Event, UINTN *Index);
+typedef EFI_STATUS(EFIAPI *EFI_PROTOCOLS_PER_HANDLE)(EFI_HANDLE Handle, EFI_GUID ***ProtocolBuffer,
+                                                     UINTN *ProtocolBufferCount);
+typedef EFI_STATUS(EFIAPI *EFI_UNINSTALL_PROTOCOL_INTERFACE)(EFI_HANDLE Handle, const EFI_GUID *Protocol,
+                                                             VOID *Interface);
+
+// The firmware's keyboard, as the system table's ConIn: a key's scan code
+// and character are all that is read of it here.
+struct ConsoleKey {
+  UINT16 ScanCode;
+  CHAR16 UnicodeChar;
+};
+struct SimpleTextInput {
+  EFI_STATUS(EFIAPI *Reset)(SimpleTextInput *This, BOOLEAN ExtendedVerification);
+  EFI_STATUS(EFIAPI *ReadKeyStroke)(SimpleTextInput *This, ConsoleKey *Key);
+  EFI_EVENT WaitForKey;
+};
+static_assert(sizeof(ConsoleKey) == 4 && offsetof(SimpleTextInput, WaitForKey) == 0x10,
+              "the firmware's layout");
+
+}  // namespace
+
 void ShowOnScreen(const char *text) {
   EFI_SIMPLE_TEXT_OUTPUT_PROTOCOL *screen = gST->ConOut;
   if (screen == nullptr) {
@@ -31,11 +56,11 @@ void ShowOnScreen(const char *text) {
 }
 
 bool WaitForKeyPress() {
-  EFI_SIMPLE_TEXT_INPUT_PROTOCOL *keyboard = static_cast<EFI_SIMPLE_TEXT_INPUT_PROTOCOL *>(gST->ConIn);
+  SimpleTextInput *keyboard = static_cast<SimpleTextInput *>(gST->ConIn);
   if (keyboard == nullptr) {
     return false;
   }
-  EFI_INPUT_KEY key;
+  ConsoleKey key;
   while (keyboard->ReadKeyStroke(keyboard, &key) == EFI_SUCCESS) {
   }
   EFI_EVENT event = keyboard->WaitForKey;
