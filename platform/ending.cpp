@@ -55,7 +55,7 @@ void ShowOnScreen(const char *text) {
   }
 }
 
-bool WaitForKeyPress() {
+bool WaitForKeyPress(const char *prompt) {
   SimpleTextInput *keyboard = static_cast<SimpleTextInput *>(gST->ConIn);
   if (keyboard == nullptr) {
     return false;
@@ -63,6 +63,8 @@ bool WaitForKeyPress() {
   ConsoleKey key;
   while (keyboard->ReadKeyStroke(keyboard, &key) == EFI_SUCCESS) {
   }
+  // Only now: a key pressed once the prompt shows ends the wait.
+  ShowOnScreen(prompt);
   EFI_EVENT event = keyboard->WaitForKey;
   UINTN index = 0;
   for (;;) {
