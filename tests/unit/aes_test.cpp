@@ -51,18 +51,12 @@ Bytes Decrypt(const Bytes &key, INT32 length, const Bytes &iv, const Bytes &ciph
   return out;
 }
 
-TEST_P(AesPathTest, PublishedVectorsWithLengthsInBytesAndBits) {
-  const char *kPlain = "00112233445566778899aabbccddeeff", *kKey = "000102030405060708090a0b0c0d0e0f";
-  const struct {
-    const char *keyTail, *cipher;
-  } rows[] = {{"", "69c4e0d86a7b0430d8cdb78070b4c55a"},
-              {"1011121314151617", "dda97ca4864cdfe06eaf70a0ec0d7191"},
-              {"101112131415161718191a1b1c1d1e1f", "8ea2b7ca516745bfeafc49904b496089"}};
-  for (const auto &row : rows) {
-    const Bytes key = Hex(std::string(kKey) + row.keyTail);
-    for (INT32 length : {INT32(key.size()), INT32(key.size() * 8)})
-      EXPECT_EQ(Decrypt(key, length, Bytes(16, 0), Hex(row.cipher), true), Hex(kPlain)) << length;
-  }
+TEST_P(AesPathTest, PublishedVectorWithTheLengthInBytesAndBits) {
+  const Bytes key = Hex("000102030405060708090a0b0c0d0e0f1011121314151617");
+  for (INT32 length : {24, 192})
+    EXPECT_EQ(Decrypt(key, length, Bytes(16, 0), Hex("dda97ca4864cdfe06eaf70a0ec0d7191"), true),
+              Hex("00112233445566778899aabbccddeeff"))
+        << length;
 }
 
 TEST_P(AesPathTest, RandomDataAgreesWithOpenssl) {

@@ -38,24 +38,17 @@ UINT32 Rgb(UINT8 index) {
 constexpr UINT32 kGrey = 0xBFBFBF;
 
 TEST(BootScreenArtwork, LogoFillsOnePictureAndEveryPictureHasGreyCorners) {
-  size_t total = 0;
-  for (size_t pair = 0; pair < nimb::kLogoPairs; pair++) {
-    EXPECT_NE(nimb::kLogoRuns[2 * pair], 0) << "pair " << pair;
-    total += nimb::kLogoRuns[2 * pair];
-  }
-  EXPECT_EQ(total, nimb::kPictureBytes);
+  EXPECT_EQ(DecodedLogo().size(), nimb::kPictureBytes);
   EXPECT_EQ(std::vector<UINT32>({Rgb(0), Rgb(1), Rgb(255)}), std::vector<UINT32>({0xFFFFFF, kGrey, 0}));
-
   const std::vector<UINT8> logo = DecodedLogo();
   std::vector<std::pair<const UINT8 *, UINT32>> pictures = {{logo.data(), kPictureSize},
                                                             {nimb::kFailurePicture, kPictureSize}};
   for (UINT32 frame = 0; frame < nimb::kSpinnerFrames; frame++)
     pictures.push_back({SpinnerFrame(frame), kSpinnerSize});
-  for (size_t i = 0; i < pictures.size(); i++) {
-    const auto [indexes, size] = pictures[i];
+  for (const auto &[indexes, size] : pictures) {
     const UINT32 last = size - 1;
     for (UINT32 corner : {0u, last, last * size, last * size + last})
-      EXPECT_EQ(indexes[corner], nimb::kBackgroundIndex) << "picture " << i << " at " << corner;
+      EXPECT_EQ(indexes[corner], nimb::kBackgroundIndex) << size << " at " << corner;
   }
 }
 
@@ -92,8 +85,6 @@ class BootScreenTest : public nimbtest::LoaderTest {
 TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
   const size_t poolBefore = fw.LivePoolBlocks();
   nimb::ShowBootScreen();
-  // EnterGraphics ran twice, each time asking for UGA Draw and its mode.
-  EXPECT_EQ(fw.CallCount("UgaGetMode"), 2u);
   EXPECT_EQ(nimb::gConsoleMode, UINT32(EfiConsoleControlScreenGraphics));
   EXPECT_NE(nimb::gBootFlags & nimb::kBootGraphics, 0u);
   EXPECT_EQ(std::vector<UINT32>({nimb::gScreenWidth, nimb::gScreenHeight, nimb::gScreenDepth}),
@@ -107,32 +98,15 @@ TEST_F(BootScreenTest, DiskBootShowsTheLogoCentredOnGreyAndNoSpinner) {
   EXPECT_EQ(fw.LivePoolBlocks(), poolBefore) << "the logo's buffers went back";
 }
 
-TEST_F(BootScreenTest, PicturesStandInTheMiddleAndTheSpinner200Below) {
-  const struct {
-    UINT32 width, height;
-    std::vector<UINTN> places;  // logo x, y, spinner x, y
-  } rows[] = {
-      {1023, 767, {447, 319, 495, 567}},
-      {100, 100, {0x7FFFFFF2, 0x7FFFFFF2}},  // smaller than the logo: the Blt is left to refuse it
-  };
-  for (const auto &row : rows) {
-    const bool fits = row.width > kPictureSize;
-    fw.AddScreen({row.width, row.height});
-    nimb::gBootFlags = fits ? nimb::kBootNetwork : 0;
-    nimb::DrawBootScreen();
-    const auto &blts = fw.BltCalls();
-    ASSERT_EQ(blts.size(), fits ? 3u : 2u) << row.width;
-    EXPECT_EQ(Color(row.width - 1, row.height - 1), kGrey) << row.width;
-    std::vector<UINTN> places;
-    for (size_t i = 1; i < blts.size(); i++) {
-      EXPECT_EQ(blts[i].operation, EfiUgaBltBufferToVideo);
-      EXPECT_EQ(blts[i].status, fits ? EFI_SUCCESS : EFI_INVALID_PARAMETER) << row.width;
-      places.insert(places.end(), {blts[i].destinationX, blts[i].destinationY});
-    }
-    EXPECT_EQ(places, row.places);
-    if (nimb::gSpinnerEvent != nullptr)
-      nimb::StopSpinner();
-  }
+TEST_F(BootScreenTest, OnOddSizesThePicturesStandInTheMiddleAndTheSpinner200Below) {
+  fw.AddScreen({1023, 767});
+  nimb::gBootFlags = nimb::kBootNetwork;
+  nimb::DrawBootScreen();
+  std::vector<UINTN> places;
+  for (const auto &blt : fw.BltCalls())
+    places.insert(places.end(), {blt.destinationX, blt.destinationY});
+  EXPECT_EQ(places, std::vector<UINTN>({0, 0, 447, 319, 495, 567}));
+  nimb::StopSpinner();
 }
 
 TEST_F(BootScreenTest, WithoutGraphicsNothingIsDrawn) {
@@ -231,7 +205,6 @@ TEST_F(BootScreenTest, SpinnerWhatIsLeftWhenTheFirmwareRefuses) {
       {"CreateEvent refused", "CreateEvent", 0, true, true, 0},
       {"SetTimer refused", "SetTimer", 0, true, true, 1},
       {"no pool for the logo's indexes", nullptr, 1, false, true, 1},
-      {"no pool for the logo's pixels", nullptr, 2, false, true, 1},
       {"no pool for the spinner", nullptr, 3, true, false, 0},
   };
   for (const auto &row : rows) {

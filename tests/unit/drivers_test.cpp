@@ -5,11 +5,11 @@
 
 #include <gtest/gtest.h>
 
-#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <functional>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "hostfw/network.h"
@@ -21,22 +21,13 @@
 namespace {
 
 using nimbtest::Bytes;
+using nimbtest::Memory;
 
 constexpr uint64_t kRegionTop = 0x400000;
 constexpr char kExtensions[] = "System/Library/Extensions";
 constexpr char kPackage[] = "System/Library/Extensions.drvpk";
 
-int64_t Seconds(int year, int month, int day, int hour, int minute, int second) {
-  std::tm tm = {};
-  tm.tm_year = year - 1900;
-  tm.tm_mon = month - 1;
-  tm.tm_mday = day;
-  tm.tm_hour = hour;
-  tm.tm_min = minute;
-  tm.tm_sec = second;
-  return timegm(&tm);
-}
-const int64_t kExtensionsTime = Seconds(2007, 12, 31, 23, 59, 59);
+const int64_t kExtensionsTime = nimbtest::UtcSeconds(2007, 12, 31, 23, 59, 59);
 
 // A property list that asks for its bundle with `required` (an element).
 std::string BundleList(const std::string &required, const std::string &more = "") {
@@ -44,17 +35,8 @@ std::string BundleList(const std::string &required, const std::string &more = ""
          more + "\n</dict>\n</plist>\n";
 }
 
-struct Range {
-  std::string name;
-  uint32_t address, length;
-  bool operator==(const Range &o) const {
-    return name == o.name && address == o.address && length == o.length;
-  }
-};
-
-std::ostream &operator<<(std::ostream &out, const Range &r) {
-  return out << r.name << "@" << std::hex << r.address << "+" << r.length;
-}
+// A range of /chosen/memory-map: name, address, length.
+using Range = std::tuple<std::string, uint32_t, uint32_t>;
 
 std::string Hex(uint64_t value) {
   char text[32];
@@ -71,18 +53,13 @@ class DriversTest : public nimbtest::VolumeTest {
   // The loader's state of a boot that has just placed its kernel.
   void Fresh() {
     nimb::TrackedFreeAll();
-    nimb::gPlistFreeTags = nullptr;
-    nimb::gPlistSymbols = nullptr;
+    nimbtest::ResetConfigurationState();
     nimb::DeviceTreeInit();
     nimb::gMemoryMapNode = nimb::DeviceTreeFindNode("/chosen/memory-map", 1);
     nimb::gKernelRegionTop = kRegionTop;
-    nimb::gDriverRecords = nullptr;
-    nimb::gLastDriverRecord = nullptr;
+    nimb::gDriverRecords = nimb::gLastDriverRecord = nullptr;
     nimb::gKernelName = u"nimb_kernel";
     nimb::gDriverPackageName = nimb::kDefaultDriverPackageName;
-    nimb::gDriverPackagePath = nullptr;
-    nimb::gCustomDriverPackage = 0;
-    nimb::gBootFlags = 0;
   }
   // Empties the volume's directory.
   void Clear() {
@@ -103,10 +80,6 @@ class DriversTest : public nimbtest::VolumeTest {
       ranges.push_back({p->name, nimbtest::GetLe32(value, 0), nimbtest::GetLe32(value, 4)});
     }
     return ranges;
-  }
-  static Bytes Memory(uint64_t address, size_t length) {
-    const auto *p = reinterpret_cast<const uint8_t *>(address);
-    return Bytes(p, p + length);
   }
   // The console's text since `mark`, without dots: those of reading come
   // one by one, and cannot be told from those of the messages.
@@ -194,7 +167,7 @@ TEST_F(DriversTest, ThePackageDecisionRowByRow) {
     const std::vector<Range> ranges = Ranges();
     if (row.outcome == kBundles) {
       ASSERT_EQ(ranges.size(), 1u);
-      EXPECT_EQ(ranges[0].name.substr(0, 7), "Driver-");
+      EXPECT_EQ(std::get<0>(ranges[0]).substr(0, 7), "Driver-");
       EXPECT_EQ(status, EFI_SUCCESS);
       continue;
     }
@@ -272,7 +245,7 @@ TEST_F(DriversTest, BundlesAreFoundKeptAndStaged) {
     Bytes text((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
     text.push_back(0);
     const uint64_t total = 16 + text.size() + expected[i].code.size();
-    EXPECT_EQ(ranges[i], (Range{"Driver-" + Hex(address), uint32_t(address), uint32_t(total)}));
+    EXPECT_EQ(ranges[i], Range("Driver-" + Hex(address), uint32_t(address), uint32_t(total)));
     const Bytes header = Memory(address, 16);
     const bool hasCode = !expected[i].code.empty();
     EXPECT_EQ(nimbtest::GetLe32(header, 0), address + 16);
@@ -284,7 +257,7 @@ TEST_F(DriversTest, BundlesAreFoundKeptAndStaged) {
     EXPECT_EQ(Memory(address + 16 + text.size(), expected[i].code.size()), expected[i].code);
     address += (total + 0xFFF) & ~0xFFFull;
   }
-  EXPECT_EQ(nimbtest::GetLe32(Memory(ranges[3].address + 8, 4), 0), ranges[3].address + 1017);
+  EXPECT_EQ(nimbtest::GetLe32(Memory(std::get<1>(ranges[3]) + 8, 4), 0), std::get<1>(ranges[3]) + 1017);
   EXPECT_EQ(nimb::gKernelRegionTop, address);
 }
 
@@ -329,7 +302,7 @@ TEST_F(DriversTest, TheWalkBringsInTheLibrariesOfSelectedRecords) {
   const std::vector<Range> ranges = Ranges();
   ASSERT_EQ(ranges.size(), 3u);
   for (size_t i = 0; i < 3; i++)
-    EXPECT_EQ(Memory(ranges[i].address + 16, texts[i].size()), Bytes(texts[i].begin(), texts[i].end()));
+    EXPECT_EQ(Memory(std::get<1>(ranges[i]) + 16, texts[i].size()), Bytes(texts[i].begin(), texts[i].end()));
 }
 
 }  // namespace

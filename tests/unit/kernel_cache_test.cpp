@@ -6,11 +6,12 @@
 
 #include <gtest/gtest.h>
 
-#include <ctime>
 #include <functional>
 #include <string>
 #include <vector>
 
+#include "hostfw/network.h"
+#include "kcache/cache_writer.h"
 #include "kernel_images.h"
 #include "load/bootfile.h"
 #include "loader_fixture.h"
@@ -38,27 +39,8 @@ EFI_FILE_INFO InfoAt(const Date &d) {
   return info;
 }
 
-// Seconds since 1970 in UTC, as SetFileTime takes them.
 int64_t Seconds(const Date &d) {
-  std::tm tm = {};
-  tm.tm_year = d.year - 1900;
-  tm.tm_mon = d.month - 1;
-  tm.tm_mday = d.day;
-  tm.tm_hour = d.hour;
-  tm.tm_min = d.minute;
-  tm.tm_sec = d.second;
-  return timegm(&tm);
-}
-
-// The standard checksum, written out here so as not to share the loader's
-// faults.
-uint32_t StandardAdler32(const uint8_t *data, size_t length) {
-  uint32_t a = 1, b = 0;
-  for (size_t i = 0; i < length; i++) {
-    a = (a + data[i]) % 65521;
-    b = (b + a) % 65521;
-  }
-  return b << 16 | a;
+  return nimbtest::UtcSeconds(d.year, d.month, d.day, d.hour, d.minute, d.second);
 }
 
 // A kernel of one page at 0x200000, entered at 0x200010.
@@ -131,21 +113,18 @@ class KernelCacheTest : public nimbtest::VolumeTest {
   static std::string CacheName() {
     nimb::MakeKernelCacheKey();
     char digits[9];
-    snprintf(digits, sizeof(digits), "%08X",
-             __builtin_bswap32(StandardAdler32(nimb::gKernelCacheKey, sizeof(nimb::gKernelCacheKey))));
+    snprintf(
+        digits, sizeof(digits), "%08X",
+        __builtin_bswap32(nimbtest::ReferenceAdler32(nimb::gKernelCacheKey, sizeof(nimb::gKernelCacheKey))));
     return std::string("System/Library/Caches/com.quill.kernelcaches/kernelcache.") + digits;
   }
 };
 
 TEST_F(KernelCacheTest, TheKeyAndTheNameItGives) {
-  // A device path of `size` bytes: one vendor node and the end node.
+  // A device path of `size` bytes: one file-path node and the end node.
   auto pathOf = [](size_t size) {
-    Bytes path(size, 0xA5);
-    path[0] = 1;
-    path[1] = 4;
-    nimbtest::PutLe16(path, 2, static_cast<uint32_t>(size - 4));
-    const uint8_t end[] = {0x7F, 0xFF, 4, 0};
-    std::copy(end, end + 4, path.end() - 4);
+    Bytes path = hostfw::FilePathNode(std::u16string((size - 10) / 2, u'p')), end = hostfw::EndNode();
+    path.insert(path.end(), end.begin(), end.end());
     return path;
   };
   struct Row {
@@ -201,48 +180,17 @@ TEST_F(KernelCacheTest, TheKeyAndTheNameItGives) {
             std::string::npos);
 }
 
-// A cache of the kernel in `kernel` as the header says: "comp", "lzss", the
-// checksum, the sizes, model and path fields, then the stream (literals
-// only, each group a flags byte of 0xFF and eight bytes).
-struct CacheFile {
-  Bytes kernel;
-  std::string signature = "comp";
-  std::string compressType = "lzss";
-  int64_t adlerDelta = 0;
-  int64_t uncompressedDelta = 0;
-  size_t cutStream = 0;  // bytes taken off the end of the stream
-  Bytes model;           // the header's model field; empty: zero
-  Bytes bootPath;        // the header's boot path field; empty: zero
-
-  Bytes Build() const {
-    Bytes stream;
-    for (size_t i = 0; i < kernel.size(); i += 8) {
-      stream.push_back(0xFF);
-      stream.insert(stream.end(), kernel.begin() + i, kernel.begin() + std::min(i + 8, kernel.size()));
-    }
-    Bytes out(384, 0);
-    std::copy(signature.begin(), signature.end(), out.begin());
-    std::copy(compressType.begin(), compressType.end(), out.begin() + 4);
-    nimbtest::PutBe32(out, 8,
-                      static_cast<uint32_t>(StandardAdler32(kernel.data(), kernel.size()) + adlerDelta));
-    nimbtest::PutBe32(out, 12, static_cast<uint32_t>(kernel.size() + uncompressedDelta));
-    nimbtest::PutBe32(out, 16, static_cast<uint32_t>(stream.size()));
-    std::copy(model.begin(), model.end(), out.begin() + 64);
-    std::copy(bootPath.begin(), bootPath.end(), out.begin() + 128);
-    out.insert(out.end(), stream.begin(), stream.end() - cutStream);
-    return out;
-  }
-};
-
+// Caches from the cache writer, spoilt byte by byte: "comp", "lzss", the
+// checksum, the sizes, the model and path fields at 64, then the stream.
 TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
   const Bytes kernel = OnePageKernel();
   const std::string cacheName = CacheName();
-  const Bytes key(nimb::gKernelCacheKey, nimb::gKernelCacheKey + 320);
+  kcache::CacheKey key;
+  std::copy(nimb::gKernelCacheKey, nimb::gKernelCacheKey + key.size(), key.begin());
   const Date kernelTime = {2006, 12, 31, 23, 59, 59};
 
   struct Setup {
-    CacheFile cache;
-    Bytes file;  // when not empty: the cache file's bytes as they stand
+    Bytes file;  // the cache file's bytes
     Date kernel, extensions, cacheTime;
     bool extensionsDirectory = true, noExtensions = false, cacheDirectory = false;
     UINT64 flags = 0;
@@ -250,11 +198,10 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
   };
   // Both fields as in the key, but for one byte flipped (0: none).
   auto keyFields = [&](Setup &s, size_t flip) {
-    Bytes fields = key;
-    fields[flip] ^= flip != 0;
-    s.cache.model.assign(fields.begin(), fields.begin() + 64);
-    s.cache.bootPath.assign(fields.begin() + 64, fields.end());
+    s.file = kcache::WriteCache(kernel, key, true);
+    s.file[64 + flip] ^= flip != 0;
   };
+  auto size = [&](Setup &s, int delta) { nimbtest::PutBe32(s.file, 12, uint32_t(kernel.size() + delta)); };
   struct Row {
     const char *name;
     std::function<void(Setup &)> change;
@@ -279,14 +226,14 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
       {"the cache is a directory", [](Setup &s) { s.cacheDirectory = true; }, EFI_NOT_FOUND},
       {"shorter than the header, though a plain kernel",
        [&](Setup &s) { s.file.assign(kernel.begin(), kernel.begin() + 383); }, EFI_NOT_FOUND},
-      {"another compression", [](Setup &s) { s.cache.compressType = "lzvn"; }, EFI_NOT_FOUND},
+      {"another compression", [](Setup &s) { std::copy_n("lzvn", 4, s.file.begin() + 4); }, EFI_NOT_FOUND},
       {"another model", [&](Setup &s) { keyFields(s, 63); }, EFI_NOT_FOUND},
       {"another boot path", [&](Setup &s) { keyFields(s, 319); }, EFI_NOT_FOUND},
-      {"compressed data cut short", [](Setup &s) { s.cache.cutStream = 1; }, EFI_NOT_FOUND},
-      {"a wrong checksum", [](Setup &s) { s.cache.adlerDelta = 1; }, EFI_DEVICE_ERROR},
-      {"a stream shorter than the size", [](Setup &s) { s.cache.uncompressedDelta = 1; }, EFI_DEVICE_ERROR},
+      {"compressed data cut short", [](Setup &s) { s.file.pop_back(); }, EFI_NOT_FOUND},
+      {"a wrong checksum", [](Setup &s) { s.file[11] ^= 1; }, EFI_DEVICE_ERROR},
+      {"a stream shorter than the size", [&](Setup &s) { size(s, 1); }, EFI_DEVICE_ERROR},
       // The stream stops at the size: what it gives then fails the checksum.
-      {"a stream longer than the size", [](Setup &s) { s.cache.uncompressedDelta = -1; }, EFI_DEVICE_ERROR},
+      {"a stream longer than the size", [&](Setup &s) { size(s, -1); }, EFI_DEVICE_ERROR},
       {"safe mode", [](Setup &s) { s.flags = nimb::kBootSafeMode; }, EFI_ACCESS_DENIED},
       {"network", [](Setup &s) { s.flags = nimb::kBootNetwork; }, EFI_ACCESS_DENIED},
       {"another kernel", [](Setup &s) { s.flags = nimb::kBootOtherKernel; }, EFI_ACCESS_DENIED},
@@ -295,7 +242,7 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
   for (const Row &row : rows) {
     SCOPED_TRACE(row.name);
     nimbtest::TempDir dir;
-    Setup s{CacheFile{kernel}, {}, kernelTime, {2006, 1, 1, 0, 0, 0}, {2007, 1, 1, 0, 0, 0}};
+    Setup s{kcache::WriteCache(kernel, key, false), kernelTime, {2006, 1, 1, 0, 0, 0}, {2007, 1, 1, 0, 0, 0}};
     row.change(s);
     dir.File("nimb_kernel", kernel);
     const std::string extensions = "System/Library/Extensions";
@@ -306,14 +253,13 @@ TEST_F(KernelCacheTest, ACacheIsTakenOnlyWhenEverythingHolds) {
     if (s.cacheDirectory)
       dir.Directory(cacheName);
     else
-      dir.File(cacheName, s.file.empty() ? s.cache.Build() : s.file);
+      dir.File(cacheName, s.file);
     hostfw::Firmware local;
-    nimbtest::ResetLoaderState();
-    nimb::gST = local.SystemTable();
-    nimb::gBS = local.BootServices();
-    local.SetFileTime(dir.path() + "/nimb_kernel", Seconds(s.kernel));
-    local.SetFileTime(dir.path() + "/" + extensions, Seconds(s.extensions));
-    local.SetFileTime(dir.path() + "/" + cacheName, Seconds(s.cacheTime));
+    nimbtest::AttachTo(local);
+    for (const auto &[name, date] : {std::pair<std::string, Date>{"nimb_kernel", s.kernel},
+                                     {extensions, s.extensions},
+                                     {cacheName, s.cacheTime}})
+      local.SetFileTime(dir.path() + "/" + name, Seconds(date));
     EFI_HANDLE device = local.AddDirectoryVolume(dir.path());
     nimb::gBootDevicePath = local.DevicePathOf(device);
     strcpy(nimb::gModelName, "TestBox1,1");

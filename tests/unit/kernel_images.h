@@ -5,6 +5,7 @@
 
 #include <cstdint>
 #include <cstring>
+#include <ctime>
 #include <string>
 #include <vector>
 
@@ -33,11 +34,35 @@ inline uint32_t GetLe32(const Bytes &bytes, size_t at) {
   return bytes[at] | bytes[at + 1] << 8 | bytes[at + 2] << 16 | static_cast<uint32_t>(bytes[at + 3]) << 24;
 }
 
+// Bytes of the host firmware's memory, at their physical address.
+inline Bytes Memory(uint64_t address, uint64_t size) {
+  const auto *at = reinterpret_cast<const uint8_t *>(static_cast<uintptr_t>(address));
+  return Bytes(at, at + size);
+}
+
 inline Bytes Pattern(size_t size, unsigned seed = 1) {
   Bytes bytes(size);
   for (size_t i = 0; i < size; i++)
     bytes[i] = static_cast<uint8_t>(i * 13 + seed * 101 + (i >> 8));
   return bytes;
+}
+
+// Seconds since 1970 in UTC, as the host firmware's SetFileTime takes them.
+inline int64_t UtcSeconds(int year, int month, int day, int hour, int minute, int second) {
+  std::tm tm = {};
+  tm.tm_year = year - 1900, tm.tm_mon = month - 1, tm.tm_mday = day;
+  tm.tm_hour = hour, tm.tm_min = minute, tm.tm_sec = second;
+  return timegm(&tm);
+}
+
+// The standard Adler-32, written out here so as not to share the loader's faults.
+inline uint32_t ReferenceAdler32(const uint8_t *data, size_t length) {
+  uint32_t a = 1, b = 0;
+  for (size_t i = 0; i < length; i++) {
+    a = (a + data[i]) % 65521;
+    b = (b + a) % 65521;
+  }
+  return b << 16 | a;
 }
 
 // --- kernel objects -------------------------------------------------------------

@@ -31,16 +31,12 @@ using nimbtest::TrackedPoolBlocks;
 
 constexpr uint64_t kUntouchedEntry = 0x5EED;
 
-// Where a test file comes from: a memory record, a volume file, or a memory
-// record of a fat file (either order) with the kernel as its x86 slice,
-// another processor's slice in front and one more slice behind.
+// Where a test file comes from (in traces, by number): a memory record, a
+// volume file, or a memory record of a fat file (either order) with the
+// kernel as its x86 slice, another processor's slice in front and one more
+// slice behind.
 enum class Source { kMemory, kVolume, kFatLittle, kFatBig };
 const Source kAllSources[] = {Source::kMemory, Source::kVolume, Source::kFatLittle, Source::kFatBig};
-
-std::string Name(Source source) {
-  const char *const names[] = {"memory", "volume", "little-endian fat", "big-endian fat"};
-  return names[int(source)];
-}
 
 // The kernel as the x86 slice at 0x3000, between two other slices.
 Bytes WrapInFat(const Bytes &kernel, bool bigEndian) {
@@ -48,14 +44,6 @@ Bytes WrapInFat(const Bytes &kernel, bool bigEndian) {
   uint32_t behind = (0x3000 + size + 0xFFF) & ~0xFFFu;
   return Fat(bigEndian, {{18, 0x1000, 0x800}, {7, 0x3000, size}, {12, behind, 0x100}},
              {{0x1000, Pattern(0x800, 5)}, {0x3000, kernel}, {behind, Pattern(0x100, 6)}});
-}
-
-// Memory at `address` holds `bytes`, then zeroes up to `size`.
-void ExpectPlaced(uint64_t address, const Bytes &bytes, uint64_t size) {
-  const auto *memory = reinterpret_cast<const uint8_t *>(address);
-  EXPECT_EQ(Bytes(memory, memory + bytes.size()), bytes) << std::hex << address;
-  EXPECT_EQ(Bytes(memory + bytes.size(), memory + size), Bytes(size - bytes.size(), 0))
-      << std::hex << address;
 }
 
 class KernelTest : public nimbtest::VolumeTest {
@@ -141,7 +129,7 @@ TEST_F(KernelTest, FindSliceInBothOrdersAndFromBothKinds) {
   }
   for (const Row &row : rows) {
     for (Source source : {Source::kMemory, Source::kVolume}) {
-      SCOPED_TRACE(row.name + " from " + Name(source));
+      SCOPED_TRACE(row.name + " from source " + std::to_string(int(source)));
       size_t mark = fw.ConOutText().size();
       BootFile file;
       Open(source, row.file, &file);
@@ -226,7 +214,7 @@ TEST_F(KernelTest, SegmentsArePlacedAndTheirPagesCleared) {
   };
   for (const Row &row : rows) {
     for (Source source : kAllSources) {
-      SCOPED_TRACE(row.name + " from " + Name(source));
+      SCOPED_TRACE(row.name + " from source " + std::to_string(int(source)));
       Forget();
       Bytes contents = Contents(source, Object{0xFEEDFACE, row.commands, data}.Build());
       BootFile file;
@@ -236,7 +224,9 @@ TEST_F(KernelTest, SegmentsArePlacedAndTheirPagesCleared) {
       nimb::BootFileClose(&file);
       uint64_t pages = 0;
       for (const Placed &p : row.placed) {
-        ExpectPlaced(p.address, Bytes(data.begin() + p.from, data.begin() + p.from + p.count), p.size);
+        Bytes placed(data.begin() + p.from, data.begin() + p.from + p.count);
+        placed.resize(p.size);  // zeroes behind the data
+        EXPECT_EQ(nimbtest::Memory(p.address, p.size), placed) << std::hex << p.address;
         pages += p.size / 4096;
       }
       EXPECT_EQ(fw.AllocatedPages(), pages);
@@ -289,7 +279,7 @@ TEST_F(KernelTest, ObjectsThatLieAreRefusedBeforeAnythingIsPlaced) {
   };
   for (const Row &row : rows) {
     for (Source source : {Source::kMemory, Source::kFatBig}) {
-      SCOPED_TRACE(row.name + " from " + Name(source));
+      SCOPED_TRACE(row.name + " from source " + std::to_string(int(source)));
       Forget();
       Bytes contents = Contents(source, row.object.Build());
       BootFile file;

@@ -151,18 +151,6 @@ class ResumeScreenTest : public nimbtest::LoaderTest {
   std::vector<UINT8> table = std::vector<UINT8>(nimb::kProgressSaveTableBytes);
 };
 
-TEST_F(ResumeScreenTest, MaskValue195OverTheScreensGreyBlendsOneLevelApartByDivisor) {
-  nimb::DrawResumeScreen(nullptr, nullptr, table.data());  // the logo on grey 191
-  const UINT32 x = kBarLeft, y = kBarTop + 3;              // mask 195, cell 0
-  EXPECT_EQ(Pixel(x, y), Grey(178, 32));                   // (60 x 191 + 195 x 174 + 255) >> 8
-  EXPECT_EQ(Pixel(x + 10, y), Grey(115, 32));              // at 92
-  EXPECT_EQ(std::vector<UINT8>(table), std::vector<UINT8>(722, 191));
-  nimb::DrawResumeProgress(table.data(), 0, 0);
-  EXPECT_EQ(Pixel(x, y), Grey(179, 32));  // the same inputs divided by 255
-  nimb::DrawResumeProgress(table.data(), 0, 1);
-  EXPECT_EQ(Pixel(x, y), Grey(221, 32));  // at 230: 56565 / 255; the shift would give 220
-}
-
 TEST_F(ResumeScreenTest, PreviewOrLogoAndNothingWithoutAFrameBuffer) {
   std::string error;
   const std::vector<UINT8> good = previewenc::EncodePreview(
@@ -336,28 +324,6 @@ TEST_F(ResumePreviewTest, BrokenOrMismatchedPicturesDrawNothing) {
     std::vector<UINT32> out;
     EXPECT_FALSE(Decode(row.preview, row.width, row.height, row.bytes, &out, row.cut)) << row.name;
   }
-}
-
-TEST(PreviewEncoderTest, RefusesWhatIsNoPictureAndSharesEqualRows) {
-  const struct {
-    std::vector<uint32_t> pixels;
-    UINT32 width, height, bytes;
-    const char *error;
-  } rows[] = {
-      {{1, 2}, 2, 1, 3, "bytes per pixel must be 2 or 4, not 3"},
-      {{}, 0, 5, 4, "a picture needs at least one pixel"},
-      {{1, 2, 3}, 2, 2, 2, "3 pixels for 2 x 2"},
-  };
-  for (const auto &row : rows) {
-    std::string error;
-    EXPECT_TRUE(previewenc::EncodePreview(row.pixels, row.width, row.height, row.bytes, &error).empty());
-    EXPECT_EQ(error, row.error);
-  }
-  // A flat screen: one repeat run, which every row points to.
-  std::string error;
-  const std::vector<UINT8> flat =
-      previewenc::EncodePreview(std::vector<uint32_t>(kWidth * kHeight, 7), kWidth, kHeight, 2, &error);
-  EXPECT_EQ(flat.size(), 12 + 4 * kHeight + 4 + 2);
 }
 
 }  // namespace

@@ -12,6 +12,7 @@
 
 #include "efi/vendor.h"
 #include "hostfw/hostfw.h"
+#include "kernel_images.h"
 #include "resume/resume.h"
 
 namespace nimbtest {
@@ -86,16 +87,6 @@ inline ResumeImage BuildResumeImage(const ResumeImageSpec &spec, uint64_t base =
   return image;
 }
 
-// Writes the extents of `image` into a partition's bytes.
-inline void ScatterResumeImage(const ResumeImage &image, std::vector<uint8_t> &partition) {
-  uint64_t offset = 0;
-  for (const nimb::ResumeExtent &extent : image.extents) {
-    for (uint64_t i = 0; i < extent.length && offset + i < image.bytes.size(); i++)
-      partition.at(extent.start + i) = image.bytes[offset + i];
-    offset += extent.length;
-  }
-}
-
 // The variables: `boot-image` is the partition's hard-drive node (as its
 // handle's path has it) and a file-path node holding `offsetText`.
 inline std::vector<uint8_t> ResumeImageVariable(const EFI_DEVICE_PATH_PROTOCOL *partitionPath,
@@ -127,14 +118,8 @@ inline std::vector<uint8_t> ResumeImageVariable(const EFI_DEVICE_PATH_PROTOCOL *
 // Reference sum: Adler-32 of each page by itself, the sums added.
 inline UINT32 PageSums(const std::vector<uint8_t> &bytes) {
   UINT32 total = 0;
-  for (size_t page = 0; page < bytes.size() / 4096; page++) {
-    UINT32 a = 1, b = 0;
-    for (size_t i = 0; i < 4096; i++) {
-      a = (a + bytes[page * 4096 + i]) % 65521;
-      b = (b + a) % 65521;
-    }
-    total += b << 16 | a;
-  }
+  for (size_t page = 0; page < bytes.size() / 4096; page++)
+    total += ReferenceAdler32(bytes.data() + page * 4096, 4096);
   return total;
 }
 
@@ -152,9 +137,12 @@ struct HibernatedMachine {
 
   void Install(hostfw::Firmware &fw, const ResumeImage &image, const std::vector<uint8_t> &key = {}) {
     disk = std::make_shared<std::vector<uint8_t>>((kPartitionStart + kPartitionBlocks) * 512, 0);
-    std::vector<uint8_t> bytes(kPartitionBlocks * 512, 0);
-    ScatterResumeImage(image, bytes);
-    std::copy(bytes.begin(), bytes.end(), disk->begin() + kPartitionStart * 512);
+    uint64_t offset = 0;  // the extents, each where it lies on the partition
+    for (const nimb::ResumeExtent &extent : image.extents) {
+      for (uint64_t i = 0; i < extent.length && offset + i < image.bytes.size(); i++)
+        disk->at(kPartitionStart * 512 + extent.start + i) = image.bytes[offset + i];
+      offset += extent.length;
+    }
     whole = fw.AddBlockDevice(disk);
     partition = fw.AddBlockDevice(disk, 512, kPartitionStart, kPartitionBlocks);
     char hex[32];

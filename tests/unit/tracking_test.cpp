@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <numeric>
 #include <random>
 #include <set>
 #include <tuple>
@@ -100,52 +101,66 @@ TEST_F(TrackingTest, ARefusedBufferLeavesNoTagAndNoBlockIsFatal) {
   EXPECT_EQ(fw.ConOutText(), "Can't allocate memory tag");
 }
 
-// Many live tags freed in any order (past a long walk through the index,
-// which then follows every allocation and grows): the live ones stay
-// tagged, and everything goes back.
+// Pool addresses below this are the test's own: its firmware takes them back
+// without a look, so that they may lie where the index's slots collide.
+constexpr UINTN kScatteredLimit = 1 << 20;
+EFI_STATUS(EFIAPI *gRealFreePool)(VOID *);
+EFI_STATUS EFIAPI FreeScattered(VOID *buffer) {
+  return reinterpret_cast<UINTN>(buffer) < kScatteredLimit ? EFI_SUCCESS : gRealFreePool(buffer);
+}
+
+// Many live tags, freed oldest first (a long walk, which makes the index),
+// then in any order between allocations (the index follows them and grows),
+// on the firmware's own pool and on addresses whose slots in the index
+// collide: the live ones stay tagged, and everything goes back.
 TEST_F(TrackingTest, ManyFreesInAnyOrder) {
-  for (bool withPages : {false, true}) {
-    std::vector<void *> buffers;
-    std::multiset<void *> live;
-    size_t pages = 0;
-    auto allocate = [&](size_t count) {
-      for (size_t i = 0; i < count; i++) {
-        buffers.push_back(nimb::TrackedAllocatePool(8));
-        live.insert(buffers.back());
-        EFI_PHYSICAL_ADDRESS address = 0;
-        if (withPages && buffers.size() % 400 == 200)
-          pages += nimb::TrackedAllocatePages(AllocateAnyPages, EfiLoaderData, 1, &address) == EFI_SUCCESS;
-      }
+  for (bool scattered : {false, true}) {
+    EFI_BOOT_SERVICES services = *fw.BootServices();
+    gRealFreePool = services.FreePool;
+    services.FreePool = FreeScattered;
+    nimb::gBS = &services;
+    std::mt19937 random(3);
+    std::vector<UINTN> addresses(kScatteredLimit / 8 - 1);
+    std::iota(addresses.begin(), addresses.end(), 1);
+    std::shuffle(addresses.begin(), addresses.end(), random);
+    std::vector<void *> live;
+    size_t allocations = 0, frees = 0, pages = 0;
+    auto allocate = [&] {
+      void *scatteredAddress = reinterpret_cast<void *>(8 * addresses[allocations++]);
+      live.push_back(scattered ? nimb::TrackPool(scatteredAddress)->poolAddress
+                               : nimb::TrackedAllocatePool(8));
+      EFI_PHYSICAL_ADDRESS address = 0;
+      if (scattered && allocations % 400 == 200)
+        pages += nimb::TrackedAllocatePages(AllocateAnyPages, EfiLoaderData, 1, &address) == EFI_SUCCESS;
     };
-    size_t frees = 0;
-    auto free = [&](void *buffer) {
-      ASSERT_EQ(nimb::TrackedFree(buffer), EFI_SUCCESS);
-      live.erase(live.find(buffer));
+    auto free = [&](size_t which) {
+      ASSERT_EQ(nimb::TrackedFree(live[which]), EFI_SUCCESS);
+      live.erase(live.begin() + which);
       if (++frees % 64 != 0)
         return;
       std::multiset<void *> tagged;
-      for (const MemoryTag *tag = gMemoryTags; tag != nullptr; tag = tag->next)
+      for (const MemoryTag *tag = gMemoryTags; tag != nullptr && tagged.size() <= live.size();
+           tag = tag->next)
         if (tag->poolAddress != nullptr)
           tagged.insert(tag->poolAddress);
-      ASSERT_EQ(tagged, live) << withPages << " after " << frees;
+      ASSERT_EQ(tagged, std::multiset<void *>(live.begin(), live.end())) << scattered << " after " << frees;
     };
-    allocate(1600);
+    while (allocations < 1600)
+      allocate();
     for (size_t i = 0; i < 300; i++)
-      free(buffers[i]);
+      free(0);
     EXPECT_EQ(nimb::TrackedFree(nimb::AllocatePool(8)), EFI_SUCCESS) << "untracked";
-    allocate(3000);
-    // Every other from the newest, then the rest shuffled.
-    std::vector<void *> rest;
-    for (size_t i = buffers.size() - 1; i >= 300; i--)
-      i % 2 != 0 ? free(buffers[i]) : rest.push_back(buffers[i]);
-    std::shuffle(rest.begin(), rest.end(), std::mt19937(7));
-    for (void *buffer : rest)
-      free(buffer);
+    for (size_t step = 0; step < 8000 && !HasFailure(); step++)
+      random() % 3 != 0 ? allocate() : free(random() % live.size());
+    while (!live.empty() && !HasFailure())
+      free(random() % live.size());
+    ASSERT_FALSE(HasFailure());
     EXPECT_EQ(Length(gMemoryTags), pages);
-    if (!withPages)
+    if (!scattered)
       EXPECT_EQ(fw.LivePoolBlocks(), Length(gMemoryTagBlocks)) << "nothing but the tag blocks";
     nimb::TrackedFreeAll();
     ExpectNothingHeld();
+    Attach();
   }
 }
 
