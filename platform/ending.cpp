@@ -30,7 +30,7 @@ void ShowOnScreen(const char *text) {
   }
 }
 
-bool WaitForKeyPress() {
+bool WaitForKeyPress(const char *prompt) {
   EFI_SIMPLE_TEXT_INPUT_PROTOCOL *keyboard = static_cast<EFI_SIMPLE_TEXT_INPUT_PROTOCOL *>(gST->ConIn);
   if (keyboard == nullptr) {
     return false;
@@ -38,6 +38,8 @@ bool WaitForKeyPress() {
   EFI_INPUT_KEY key;
   while (keyboard->ReadKeyStroke(keyboard, &key) == EFI_SUCCESS) {
   }
+  // Only now: a key pressed once the prompt shows ends the wait.
+  ShowOnScreen(prompt);
   EFI_EVENT event = keyboard->WaitForKey;
   UINTN index = 0;
   for (;;) {

@@ -11,9 +11,10 @@ namespace nimb::platform {
 // (gST->ConOut); nothing without one.
 void ShowOnScreen(const char *text);
 
-// Waits for a key on the firmware's keyboard (gST->ConIn), keys pressed
-// before the call left aside. False at once when there is no keyboard.
-bool WaitForKeyPress();
+// Shows `prompt` on the screen and waits for a key on the firmware's
+// keyboard (gST->ConIn), keys pressed before the prompt left aside. False at
+// once, without the prompt, when there is no keyboard.
+bool WaitForKeyPress(const char *prompt);
 
 // Removes every protocol interface that lies in the platform's own image,
 // which the firmware frees when the platform returns; returns their count.

@@ -84,9 +84,9 @@ void ScreenToText() {
   ScreenToText();
   ShowOnScreen(outcome);
   if (gEnding.waitKey) {
-    ShowOnScreen("Press a key to go on.");
     SerialPrintf("platform: waiting for a key\n");
-    SerialPrintf("platform: %s\n", WaitForKeyPress() ? "key pressed" : "no keyboard to wait for");
+    SerialPrintf("platform: %s\n",
+                 WaitForKeyPress("Press a key to go on.") ? "key pressed" : "no keyboard to wait for");
   }
   SerialPrintf("platform: exit code 0x%x\n", static_cast<UINT64>(code));
   if (gEnding.debugExit) {

@@ -8,7 +8,9 @@ and a kernel cache that kcache writes. The harness stages them, has the disk
 tool (tools/mkdisk) make a GPT disk image of them or serves them over TFTP,
 boots them with tools/qemuboot, and checks the serial log, the exit code
 that the platform layer or the kernel leaves through the debug-exit device,
-the kernel's report and, when the scenario asks, screenshots.
+the kernel's report and, when the scenario asks, screenshots; a machine
+without serial port and debug-exit device is read from the text on its
+screen.
 
     harness.py --efi-dir build/efi --scenario no_kernel    one scenario
     harness.py --efi-dir build/efi                          all scenarios
