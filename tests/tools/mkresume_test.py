@@ -11,7 +11,7 @@ import unittest
 import uuid
 from pathlib import Path
 
-sys.path.insert(0, str(Path(__file__).resolve().parent))
+sys.path.insert(0, str(Path(__file__).resolve().parents[2] / "tools" / "mkresume"))
 import mkresume  # noqa: E402
 
 GUID = "6A1E1F10-2B3C-4D5E-8F90-A1B2C3D4E5F6"

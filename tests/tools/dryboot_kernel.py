@@ -3,7 +3,7 @@
 0x200000 (16 bytes of file), a thread command with the entry point, and
 optionally a segment with no file bytes behind the text.
 
-    test_kernel.py OUTPUT ENTRY [ZERO_FILL_BYTES]
+    dryboot_kernel.py OUTPUT ENTRY [ZERO_FILL_BYTES]
 """
 import struct
 import sys
