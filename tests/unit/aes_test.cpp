@@ -85,46 +85,6 @@ INSTANTIATE_TEST_SUITE_P(BothPaths, AesPathTest,
                            return std::string(info.param == nimb::kAesPathTables ? "Tables" : "Instructions");
                          });
 
-// xmm0 to xmm8, the registers the instructions path uses: read as they
-// stand, or loaded with 0x5A.
-__attribute__((target("sse2"))) void ReadVectorRegisters(UINT8 (*out)[16]) {
-  __asm__ volatile(
-      "movdqu %%xmm0, 0(%0)\n\tmovdqu %%xmm1, 16(%0)\n\tmovdqu %%xmm2, 32(%0)\n\t"
-      "movdqu %%xmm3, 48(%0)\n\tmovdqu %%xmm4, 64(%0)\n\tmovdqu %%xmm5, 80(%0)\n\t"
-      "movdqu %%xmm6, 96(%0)\n\tmovdqu %%xmm7, 112(%0)\n\tmovdqu %%xmm8, 128(%0)"
-      :
-      : "r"(out)
-      : "memory");
-}
-
-__attribute__((target("sse2"))) void FillVectorRegisters() {
-  static const Bytes pattern(16, 0x5A);
-  __asm__ volatile(
-      "movdqu (%0), %%xmm0\n\tmovdqa %%xmm0, %%xmm1\n\tmovdqa %%xmm0, %%xmm2\n\tmovdqa %%xmm0, %%xmm3\n\t"
-      "movdqa %%xmm0, %%xmm4\n\tmovdqa %%xmm0, %%xmm5\n\tmovdqa %%xmm0, %%xmm6\n\tmovdqa %%xmm0, %%xmm7\n\t"
-      "movdqa %%xmm0, %%xmm8"
-      :
-      : "r"(pattern.data())
-      : "xmm0", "xmm1", "xmm2", "xmm3", "xmm4", "xmm5", "xmm6", "xmm7", "xmm8");
-}
-
-TEST(AesTest, TheInstructionsPathAndTheWipeLeaveTheVectorRegistersClear) {
-  if (nimb::AesSetPath(nimb::kAesPathInstructions) != nimb::kAesPathInstructions)
-    GTEST_SKIP() << "this processor has no AES instructions";
-  const Bytes key(32, 0x77), iv(16, 1), zeros(9 * 16, 0);
-  Bytes data(16 * 9, 2);  // a group of eight and one block alone
-  nimb::AesDecryptContext context;
-  nimb::AesExpandDecryptKey(key.data(), 32, &context);
-  UINT8 registers[9][16];
-  nimb::AesCbcDecrypt(data.data(), iv.data(), 9, data.data(), &context);
-  ReadVectorRegisters(registers);
-  EXPECT_EQ(Bytes(&registers[0][0], &registers[0][0] + sizeof registers), zeros) << "after the decryption";
-  FillVectorRegisters();
-  nimb::AesWipe(&context);
-  ReadVectorRegisters(registers);
-  EXPECT_EQ(Bytes(&registers[0][0], &registers[0][0] + sizeof registers), zeros) << "after the wipe";
-}
-
 // Only a known length makes a schedule, which uses only its own words and
 // which the wipe clears; a context no key made decrypts nothing.
 TEST(AesTest, ScheduleLengthsWipeAndContextsNoKeyMade) {
